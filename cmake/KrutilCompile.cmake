@@ -1,0 +1,28 @@
+# How everything in this repository is compiled: language level, warnings, sanitizers.
+#
+# krutil_compile_options is linked privately by every target of our own; generated code takes only the language level and
+# the sanitizers (krutil_generated_options), because its warnings are not ours to mend.
+
+set(CMAKE_CXX_STANDARD 20)
+set(CMAKE_CXX_STANDARD_REQUIRED ON)
+set(CMAKE_CXX_EXTENSIONS OFF)
+set(CMAKE_POSITION_INDEPENDENT_CODE ON)
+set(CMAKE_EXPORT_COMPILE_COMMANDS ON)
+if(NOT CMAKE_BUILD_TYPE AND NOT CMAKE_CONFIGURATION_TYPES)
+    set(CMAKE_BUILD_TYPE Release CACHE STRING "Build type" FORCE)
+endif()
+
+find_package(Threads REQUIRED)
+
+add_library(krutil_generated_options INTERFACE)
+if(KRUTIL_SANITIZE)
+    target_compile_options(krutil_generated_options INTERFACE
+        -fsanitize=${KRUTIL_SANITIZE} -fno-omit-frame-pointer -fno-sanitize-recover=all)
+    target_link_options(krutil_generated_options INTERFACE -fsanitize=${KRUTIL_SANITIZE})
+    target_compile_definitions(krutil_generated_options INTERFACE KRUTIL_SANITIZED=1)
+endif()
+
+add_library(krutil_compile_options INTERFACE)
+target_link_libraries(krutil_compile_options INTERFACE krutil_generated_options)
+target_compile_options(krutil_compile_options INTERFACE -Wall -Wextra -Wconversion -Wshadow
+    $<$<BOOL:${KRUTIL_WERROR}>:-Werror>)
