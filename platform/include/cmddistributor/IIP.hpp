@@ -1,0 +1,31 @@
+// The common core of every request: where its text goes and which plug-in runs it.
+#pragma once
+
+#include <string>
+
+#include "cmddistributor/IqmStreamID.hpp"
+#include "krutil/io/SinkTraits.hpp"
+
+namespace cmddistributor {
+
+/// Interactive input request. Immutable, so it may be shared between threads.
+class IIP {
+  public:
+    IIP(const std::string& pluginType, IqmStreamID streamID, const krutil::io::SinkTraits& outTraits,
+        const krutil::io::SinkTraits& errTraits);
+    virtual ~IIP();
+
+    IqmStreamID getStreamID() const noexcept { return streamID_; }
+    /// Name of the plug-in that runs the request; peers refuse an empty one.
+    const std::string& getPluginType() const noexcept { return pluginType_; }
+    const krutil::io::SinkTraits& getOutTraits() const noexcept { return outTraits_; }
+    const krutil::io::SinkTraits& getErrTraits() const noexcept { return errTraits_; }
+
+  private:
+    std::string pluginType_;
+    IqmStreamID streamID_;
+    krutil::io::SinkTraits outTraits_;
+    krutil::io::SinkTraits errTraits_;
+};
+
+}  // namespace cmddistributor

@@ -1,0 +1,31 @@
+// What every serializer is, whatever family of types it handles.
+#pragma once
+
+#include <string>
+#include <typeinfo>
+#include <utility>
+
+namespace foundation::msg_svc::transport::layers::serialization {
+
+/// Identity of a serializer: the name under which a registry finds it and which tags its frames, the in-process class
+/// that it handles, and its version. Immutable after construction, so any number of threads may use one object.
+class SerializerBase {
+  public:
+    /// `name` is copied; `type` is that of the concrete class whose objects the serializer handles.
+    SerializerBase(const std::string& name, const std::type_info& type,
+                   const std::pair<unsigned int, unsigned int>& version);
+    virtual ~SerializerBase();
+    SerializerBase(const SerializerBase&) = delete;
+    SerializerBase& operator=(const SerializerBase&) = delete;
+
+    const std::string& name() const noexcept { return name_; }
+    const std::type_info& type() const noexcept { return *type_; }
+    const std::pair<unsigned int, unsigned int>& version() const noexcept { return version_; }
+
+  private:
+    std::string name_;
+    const std::type_info* type_;
+    std::pair<unsigned int, unsigned int> version_;
+};
+
+}  // namespace foundation::msg_svc::transport::layers::serialization

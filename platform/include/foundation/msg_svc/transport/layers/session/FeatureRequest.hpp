@@ -1,0 +1,33 @@
+// One value that a protocol asks a session to negotiate.
+#pragma once
+
+#include <string>
+
+namespace foundation::msg_svc::transport::layers::session {
+
+/// What a session does about a feature.
+enum class FeatureHandling : int {
+    Ignore = 0,    ///< listed for the peer's information; never settled
+    Optional = 1,  ///< settled when both peers list a common value, left out otherwise
+    Required = 3,  ///< both peers must settle on a common value, or the session is refused
+};
+
+/// A (name, value) pair that the protocol can work with. Several requests of one name list its acceptable values, best
+/// first.
+class FeatureRequest {
+  public:
+    FeatureRequest(const std::string& name, const std::string& value, FeatureHandling handling);
+
+    const std::string& name() const noexcept { return name_; }
+    const std::string& value() const noexcept { return value_; }
+    FeatureHandling handling() const noexcept { return handling_; }
+
+    bool operator==(const FeatureRequest&) const = default;
+
+  private:
+    std::string name_;
+    std::string value_;
+    FeatureHandling handling_;
+};
+
+}  // namespace foundation::msg_svc::transport::layers::session

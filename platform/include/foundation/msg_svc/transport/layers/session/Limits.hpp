@@ -1,0 +1,20 @@
+// What a session accepts, in bytes and frames.
+#pragma once
+
+#include <cstdint>
+
+namespace foundation::msg_svc::transport::layers::session {
+
+/// Each end states its own limits in the handshake, so that a sender refuses first what the receiver would refuse. A
+/// size is compared with its limit before memory is asked for.
+struct Limits {
+    std::uint64_t tag = 128;                   ///< bytes of a tag; at most 65,535
+    std::uint64_t taggedFrame = 4ULL << 20;    ///< bytes of a tagged frame's content
+    std::uint64_t arrayMessage = 64ULL << 20;  ///< the same for the tagged frame of an array
+    std::uint64_t message = 4ULL << 30;        ///< bytes of all frames of one message, data frames included
+    std::uint64_t frames = 65'536;             ///< frames of one message
+
+    bool operator==(const Limits&) const = default;
+};
+
+}  // namespace foundation::msg_svc::transport::layers::session

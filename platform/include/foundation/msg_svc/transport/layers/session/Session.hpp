@@ -1,0 +1,182 @@
+// One protocol session over one byte stream, between a client and an engine.
+//
+// A session owns a pair of descriptors and one I/O thread, which reads, rebuilds what arrives, hands it to a handler
+// and writes what could not be written at once. The thread never waits for a write: a peer that does not read holds up
+// its own output, never a cancel on its way in. docs/session-wire.md describes the bytes.
+#pragma once
+
+#include <boost/shared_ptr.hpp>
+#include <chrono>
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <string>
+#include <string_view>
+#include <unordered_map>
+
+#include "capabilities/CapabilityList.hpp"
+#include "foundation/msg_svc/eventmgr/BaseEvent.hpp"
+#include "foundation/msg_svc/exchange/Message.hpp"
+#include "foundation/msg_svc/exchange/Reply.hpp"
+#include "foundation/msg_svc/transport/layers/serialization/Registry.hpp"
+#include "foundation/msg_svc/transport/layers/session/Limits.hpp"
+#include "foundation/msg_svc/transport/layers/session/ProtocolRegistry.hpp"
+#include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
+#include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
+
+namespace foundation::msg_svc::transport::layers::session {
+
+namespace framing = ::foundation::vantor::carrier::framing;
+
+/// Which end of the session this is. A client begins exchanges; an engine answers them and raises events.
+enum class Role { Client, Engine };
+
+/// One frame on its way, as a trace sees it. Valid during the call only.
+struct FrameTrace {
+    bool outgoing;
+    bool last;                    ///< the last frame of its message
+    const framing::Frame& frame;  ///< a TaggedFrame or a DataFrame, content included
+};
+
+/// How this end presents itself and what it accepts.
+struct SessionConfig {
+    Role role = Role::Client;
+    std::string protocol = "krutil";  ///< looked up in the ProtocolRegistry
+    ProtocolVersion version{1, 0};
+    std::string build;  ///< free text that names this program and its version to the peer
+    Limits limits;
+    ::capabilities::CapabilityList capabilities;
+    std::chrono::milliseconds handshakeTimeout{10'000};
+
+    /// Bytes of unwritten output above which waitForRoom() waits.
+    std::size_t roomBytes = 1U << 20;
+
+    /// Messages posted with Urgency::Answer that may be waiting to be written; one more closes the session, because the
+    /// peer asks without reading.
+    std::size_t maxPendingAnswers = 1024;
+
+    /// Called with every frame, on the thread that sends or receives it. Empty for no trace.
+    std::function<void(const FrameTrace&)> trace;
+
+    /// Called with each received tagged frame before its serializer; may throw ProtocolViolation to close the session.
+    /// Empty for no check.
+    std::function<void(const framing::TaggedFrame&)> check;
+};
+
+/// What the handshake told about the other end.
+struct Peer {
+    std::string build;
+    Limits limits;
+    ::capabilities::CapabilityList capabilities;
+};
+
+/// Why a session is over.
+struct SessionEnd {
+    enum class Reason {
+        Finished,   ///< both ends were done: the engine's shutdown event was the last message
+        Lost,       ///< the byte stream ended or failed early
+        Violation,  ///< this end refused what the peer sent, or the peer refused what this end sent
+        Closed,     ///< close() was called here
+    };
+    Reason reason;
+    std::string text;  ///< a sentence for a person; empty for Finished and Closed
+};
+
+/// Receives what arrives. All calls come from the session's I/O thread, one at a time; they must not block, and must
+/// not destroy the session. An exception that leaves one closes the session as a violation with its text.
+class SessionHandler {
+  public:
+    virtual ~SessionHandler();
+
+    /// The peer begins an exchange (engines only); the reply is to be sent on the same stream.
+    virtual void onMessage(framing::StreamID stream, const boost::shared_ptr<const exchange::Message>& message);
+
+    /// The answer to an exchange that this end began (clients only).
+    virtual void onReply(framing::StreamID stream, const boost::shared_ptr<const exchange::Reply>& reply);
+
+    /// An event of an open exchange, or of none when `stream` is 0.
+    virtual void onEvent(framing::StreamID stream, const boost::shared_ptr<const eventmgr::BaseEvent>& event);
+
+    /// The client has said goodbye (engines only): it will send nothing more and expects the shutdown event.
+    virtual void onGoodbye();
+
+    /// The session is over; the last call, made exactly once for a session that was started.
+    virtual void onEnd(const SessionEnd& end) = 0;
+};
+
+/// See the head of this file. Members may be called from any thread unless they say otherwise.
+class Session {
+  public:
+    /// Performs the handshake and returns a session that is settled but not yet reading. Takes ownership of both
+    /// descriptors (which may be equal) in every case, sets them non-blocking and close-on-exec. Blocks up to the
+    /// handshake timeout.
+    ///
+    /// Throws HandshakeRefused, ProtocolViolation (the peer does not speak this layout), StreamLost (closed or timed
+    /// out), std::out_of_range (unknown protocol name here).
+    static std::unique_ptr<Session> open(int in, int out, SessionConfig config);
+
+    /// Closes at once what is still open, and joins the I/O thread. Must not run on the I/O thread.
+    ~Session();
+    Session(const Session&) = delete;
+    Session& operator=(const Session&) = delete;
+
+    const Peer& peer() const noexcept;
+
+    /// The settled features, name to value.
+    const std::unordered_map<std::string, std::string>& features() const noexcept;
+
+    const std::shared_ptr<const serialization::Registry>& registry() const noexcept;
+
+    /// Starts the I/O thread. Call once. `handler` must outlive the session.
+    void start(SessionHandler& handler);
+
+    /// A stream ID for a new exchange: not 0 and not in use.
+    framing::StreamID newStreamID();
+
+    /// What a message is to the sender.
+    enum class Urgency {
+        Output,  ///< the sender applies back-pressure with waitForRoom() or waitUntilWritten()
+        Answer,  ///< posted by a thread that must not wait; bounded by SessionConfig::maxPendingAnswers
+    };
+
+    /// Serializes an object and hands it to the stream: written at once as far as the stream takes it, the rest by the
+    /// I/O thread. Never blocks. Order on the wire is the order of the calls. After the session's end these do nothing.
+    ///
+    /// Throws LimitExceeded (the session goes on, nothing was sent), and whatever the serializer throws (nothing was
+    /// sent either). A message of a new exchange needs a stream ID from newStreamID(); an event needs an open
+    /// exchange's ID or 0; a reply closes its exchange.
+    void send(framing::StreamID stream, const boost::shared_ptr<const exchange::Message>& message);
+    void send(framing::StreamID stream, const boost::shared_ptr<const exchange::Reply>& reply,
+              Urgency urgency = Urgency::Output);
+    void send(framing::StreamID stream, const boost::shared_ptr<const eventmgr::BaseEvent>& event,
+              Urgency urgency = Urgency::Output);
+
+    /// Waits until no more than roomBytes are unwritten, the session is over, or `interrupt` (a descriptor, -1 for
+    /// none) becomes readable; returns false in the last case only. Not from the I/O thread.
+    bool waitForRoom(int interrupt = -1);
+
+    /// The same until nothing is unwritten.
+    bool waitUntilWritten(int interrupt = -1);
+
+    /// Tells the engine that nothing more will be sent (clients only). Replies and events still arrive.
+    void sayGoodbye();
+
+    /// Writes what is unwritten, waiting at most `patience` for a peer that does not read, then closes the stream.
+    /// onEnd() has been called when this returns. Not from the I/O thread.
+    void close(std::chrono::milliseconds patience = std::chrono::milliseconds(2'000));
+
+    /// Closes the session with a violation, telling the peer `text`. From any thread.
+    void abort(const std::string& text);
+
+    /// For a forked child: closes this process's copies of the session's descriptors and turns the object inert. Calls
+    /// only close(2), so it may run in a pthread_atfork child handler.
+    void abandonInChild() noexcept;
+
+  private:
+    class Impl;
+    explicit Session(std::unique_ptr<Impl> impl);
+    std::unique_ptr<Impl> impl_;
+};
+
+}  // namespace foundation::msg_svc::transport::layers::session

@@ -1,0 +1,7 @@
+#include "foundation/korveldata/ICustomWorkspace.hpp"
+
+namespace foundation::korveldata {
+
+ICustomWorkspace::~ICustomWorkspace() = default;
+
+}  // namespace foundation::korveldata
