@@ -1,0 +1,30 @@
+#include "IIPReplySerializer.hpp"
+
+#include <boost/make_shared.hpp>
+
+#include "FieldConversions.hpp"
+
+namespace krutil::protobuf_serializer {
+
+IIPReplySerializer::IIPReplySerializer() : TaggedSerializer("krutil:IIPReply") {}
+
+protobuf::IIPReply IIPReplySerializer::toProtobuf(const cmddistributor::IIPReply& reply, NestedWriter& nested) {
+    protobuf::IIPReply proto;
+    *proto.mutable_id() = IDTypeSerializer::toProtobuf(reply.getID());
+    if (reply.getResult()) {
+        proto.set_resultid(nested.writeByDynamicType<ResultFamily>(reply.getResult()));
+    }
+    return proto;
+}
+
+boost::shared_ptr<const foundation::msg_svc::exchange::Reply> IIPReplySerializer::fromProtobuf(
+    const protobuf::IIPReply& proto, const NestedReader& nested) {
+    std::unique_ptr<::cmddistributor::IIPResult> result;
+    if (proto.resultid() != 0) {
+        result = nested.read<ResultFamily>(proto.resultid());
+    }
+    require(proto.has_id(), "Required field is missing: protobuf::IIPReply.id");
+    return boost::make_shared<cmddistributor::IIPReply>(IDTypeSerializer::fromProtobuf(proto.id()), std::move(result));
+}
+
+}  // namespace krutil::protobuf_serializer

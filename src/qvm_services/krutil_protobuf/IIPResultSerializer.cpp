@@ -1,0 +1,29 @@
+#include "IIPResultSerializer.hpp"
+
+#include "FieldConversions.hpp"
+#include "RuntimeExceptionSerialization.hpp"
+
+namespace krutil::protobuf_serializer {
+
+IIPResultSerializer::IIPResultSerializer() : TaggedSerializer("krutil:IIPResult") {}
+
+protobuf::IIPResult IIPResultSerializer::toProtobuf(const ::cmddistributor::IIPResult& result) {
+    protobuf::IIPResult proto;
+    if (result.getException()) {
+        *proto.mutable_exception() = protobuf_serializer::toProtobuf(*result.getException());
+    }
+    *proto.mutable_id() = IDTypeSerializer::toProtobuf(result.id);
+    return proto;
+}
+
+std::unique_ptr<::cmddistributor::IIPResult> IIPResultSerializer::fromProtobuf(const protobuf::IIPResult& proto) {
+    boost::optional<::cmddistributor::RuntimeException> exception;
+    if (proto.has_exception()) {
+        exception = protobuf_serializer::fromProtobuf(proto.exception());
+    }
+    require(proto.has_id(), "Required field is missing: protobuf::IIPResult.id");
+    return std::make_unique<::cmddistributor::IIPResult>(IDTypeSerializer::fromProtobuf(proto.id()),
+                                                         std::move(exception));
+}
+
+}  // namespace krutil::protobuf_serializer

@@ -1,0 +1,18 @@
+#include "QVMShutdownEventSerializer.hpp"
+
+#include <boost/make_shared.hpp>
+
+namespace krutil::protobuf_serializer {
+
+QVMShutdownEventSerializer::QVMShutdownEventSerializer() : TaggedSerializer("krutil:QVMShutdownEvent") {}
+
+protobuf::QVMShutdownEvent QVMShutdownEventSerializer::toProtobuf() {
+    return {};
+}
+
+boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> QVMShutdownEventSerializer::fromProtobuf(
+    const protobuf::QVMShutdownEvent& /*proto*/) {
+    return boost::make_shared<eventmgr::QVMShutdownEvent>();
+}
+
+}  // namespace krutil::protobuf_serializer

@@ -1,0 +1,7 @@
+#include "SinkTextEventSerializer.hpp"
+
+namespace krutil::protobuf_serializer {
+
+SinkTextEventSerializer::SinkTextEventSerializer() : TextEventSerializer("krutil:SinkTextEvent") {}
+
+}  // namespace krutil::protobuf_serializer

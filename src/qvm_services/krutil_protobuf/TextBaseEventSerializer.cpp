@@ -1,0 +1,7 @@
+#include "TextBaseEventSerializer.hpp"
+
+namespace krutil::protobuf_serializer {
+
+TextBaseEventSerializer::TextBaseEventSerializer() : TextEventSerializer("krutil:TextBaseEvent") {}
+
+}  // namespace krutil::protobuf_serializer
