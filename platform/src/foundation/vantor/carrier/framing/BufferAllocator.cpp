@@ -1,0 +1,234 @@
+#include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
+
+#include <sys/mman.h>
+
+#include <array>
+#include <atomic>
+#include <cstdint>
+#include <cstdlib>
+#include <limits>
+#include <map>
+#include <mutex>
+#include <new>
+#include <unordered_map>
+#include <vector>
+
+#include "foundation/core/diag/terminate.hpp"
+
+namespace foundation::vantor::carrier::framing {
+namespace {
+
+constexpr std::size_t alignment = 64;
+constexpr std::size_t pageSize = 4096;
+
+// From this size on a buffer has pages of its own. Returning those to the kernel and faulting in fresh ones costs more
+// than receiving into them, so they are kept for the next buffer of their size class.
+constexpr std::size_t largeSize = 1U << 20;
+
+// Bytes kept for recycling, in whole buffers. In sanitized builds nothing is kept, so that a use after release is seen.
+#ifdef KRUTIL_SANITIZED
+constexpr std::size_t recycleBound = 0;
+#else
+constexpr std::size_t recycleBound = 256U << 20;
+#endif
+
+// One holder of an address: an allocation of our own, or memory of another owner.
+struct Record {
+    std::size_t size = 0;
+    std::size_t capacity = 0;             // bytes mapped; 0 when the memory is from the heap or another owner's
+    void (*drop)(void* owner) = nullptr;  // null for memory of our own
+    void* owner = nullptr;
+};
+
+struct Entry {
+    Record latest;
+    std::vector<Record> earlier;
+};
+
+struct Shard {
+    std::mutex mutex;
+    std::unordered_map<const char*, Entry> entries;
+};
+
+struct Recycled {
+    std::mutex mutex;
+    std::map<std::size_t, std::vector<char*>> byCapacity;
+    std::size_t bytes = 0;
+};
+
+// Buffers may be released by destructors of static objects, so none of this is ever destroyed.
+std::array<Shard, 16>& shards() {
+    static auto* const all = new std::array<Shard, 16>();
+    return *all;
+}
+
+Recycled& recycled() {
+    static auto* const all = new Recycled();
+    return *all;
+}
+
+std::atomic<std::size_t> buffersInUse{0};
+
+Shard& shardOf(const char* address) {
+    // Small buffers differ in the bits above the alignment, large ones in those above the page.
+    const auto bits = reinterpret_cast<std::uintptr_t>(address);
+    return shards()[(bits / alignment ^ bits / pageSize ^ bits / largeSize) % shards().size()];
+}
+
+// Four classes to each power of two: a buffer fits the next one of nearly its size, and what it does not use of its
+// capacity is never touched.
+std::size_t capacityFor(std::size_t size) {
+    std::size_t step = largeSize / 4;
+    while (step <= size / 8) {
+        step *= 2;
+    }
+    return (size + step - 1) / step * step;
+}
+
+char* takeRecycled(std::size_t capacity) {
+    Recycled& kept = recycled();
+    const std::lock_guard lock(kept.mutex);
+    const auto found = kept.byCapacity.find(capacity);
+    if (found == kept.byCapacity.end() || found->second.empty()) {
+        return nullptr;
+    }
+    char* const buffer = found->second.back();
+    found->second.pop_back();
+    kept.bytes -= capacity;
+    return buffer;
+}
+
+bool keep(char* buffer, std::size_t capacity) {
+    Recycled& kept = recycled();
+    const std::lock_guard lock(kept.mutex);
+    if (capacity > recycleBound || kept.bytes > recycleBound - capacity) {
+        return false;
+    }
+    try {
+        kept.byCapacity[capacity].push_back(buffer);
+    } catch (const std::bad_alloc&) {
+        return false;
+    }
+    kept.bytes += capacity;
+    return true;
+}
+
+char* obtain(std::size_t size, std::size_t& capacity) {
+    capacity = 0;
+    if (size > static_cast<std::size_t>(std::numeric_limits<std::ptrdiff_t>::max()) / 2) {
+        throw std::bad_alloc();
+    }
+    if (size < largeSize || recycleBound == 0) {
+        const std::size_t rounded = size == 0 ? alignment : (size + alignment - 1) / alignment * alignment;
+        void* const memory = std::aligned_alloc(alignment, rounded);
+        if (memory == nullptr) {
+            throw std::bad_alloc();
+        }
+        return static_cast<char*>(memory);
+    }
+    capacity = capacityFor(size);
+    if (char* const buffer = takeRecycled(capacity)) {
+        return buffer;
+    }
+    // No swap is reserved: a size is only what a peer claims until the bytes have come.
+    void* const memory =
+        ::mmap(nullptr, capacity, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE, -1, 0);
+    if (memory == MAP_FAILED) {
+        throw std::bad_alloc();
+    }
+    return static_cast<char*>(memory);
+}
+
+void giveBack(char* buffer, std::size_t capacity) {
+    if (capacity == 0) {
+        std::free(buffer);
+    } else if (!keep(buffer, capacity)) {
+        ::munmap(buffer, capacity);
+    }
+}
+
+void enter(const char* address, const Record& record) {
+    Shard& shard = shardOf(address);
+    const std::lock_guard lock(shard.mutex);
+    const auto [found, fresh] = shard.entries.try_emplace(address);
+    if (!fresh) {
+        found->second.earlier.push_back(found->second.latest);
+    }
+    found->second.latest = record;
+    buffersInUse.fetch_add(1, std::memory_order_relaxed);
+}
+
+}  // namespace
+
+char* BufferAllocator::allocate(std::size_t size) {
+    Record record;
+    char* const buffer = obtain(size, record.capacity);
+    record.size = size;
+    try {
+        enter(buffer, record);
+    } catch (...) {
+        giveBack(buffer, record.capacity);
+        throw;
+    }
+    return buffer;
+}
+
+void BufferAllocator::release(char* buffer) {
+    if (buffer == nullptr) {
+        return;
+    }
+    Record record;
+    {
+        Shard& shard = shardOf(buffer);
+        const std::lock_guard lock(shard.mutex);
+        const auto found = shard.entries.find(buffer);
+        if (found == shard.entries.end()) {
+            core::diag::terminate("BufferAllocator::release: the address is not that of a buffer in use", __FILE__,
+                                  __LINE__, __func__);
+        }
+        Entry& entry = found->second;
+        record = entry.latest;
+        if (entry.earlier.empty()) {
+            shard.entries.erase(found);
+        } else {
+            entry.latest = entry.earlier.back();
+            entry.earlier.pop_back();
+        }
+    }
+    buffersInUse.fetch_sub(1, std::memory_order_relaxed);
+    // Without the lock: a drop function may release or adopt other buffers.
+    if (record.drop != nullptr) {
+        record.drop(record.owner);
+    } else {
+        giveBack(buffer, record.capacity);
+    }
+}
+
+std::optional<std::size_t> BufferAllocator::sizeOf(const char* buffer) {
+    Shard& shard = shardOf(buffer);
+    const std::lock_guard lock(shard.mutex);
+    const auto found = shard.entries.find(buffer);
+    return found == shard.entries.end() ? std::nullopt : std::optional(found->second.latest.size);
+}
+
+char* BufferAllocator::adopt(char* address, std::size_t size, void (*drop)(void* owner), void* owner) {
+    enter(address, Record{size, 0, drop, owner});
+    return address;
+}
+
+bool BufferAllocator::isAdopted(const char* buffer) {
+    Shard& shard = shardOf(buffer);
+    const std::lock_guard lock(shard.mutex);
+    const auto found = shard.entries.find(buffer);
+    return found != shard.entries.end() && found->second.latest.drop != nullptr;
+}
+
+FrameBuffer BufferAllocator::makeFrameBuffer(std::size_t size) {
+    return {std::unique_ptr<char[], std::function<void(char*)>>(allocate(size), &BufferAllocator::release), size};
+}
+
+std::size_t BufferAllocator::inUse() {
+    return buffersInUse.load(std::memory_order_relaxed);
+}
+
+}  // namespace foundation::vantor::carrier::framing
