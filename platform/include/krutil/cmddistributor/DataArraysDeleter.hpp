@@ -1,0 +1,15 @@
+// Releases the arrays of a function call.
+#pragma once
+
+#include <vector>
+
+#include "foundation/korveldata/Array.hpp"
+
+namespace krutil::cmddistributor {
+
+/// Deleter of the vector that an EDIDataWrapper owns. Null is ignored.
+struct DataArraysDeleter {
+    void operator()(std::vector<foundation::korveldata::Array>* arrays) const noexcept;
+};
+
+}  // namespace krutil::cmddistributor

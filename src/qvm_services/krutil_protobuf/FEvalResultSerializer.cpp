@@ -1,0 +1,49 @@
+#include "FEvalResultSerializer.hpp"
+
+#include <boost/variant/get.hpp>
+
+#include "ArrayRoutines.hpp"
+#include "FieldConversions.hpp"
+#include "IIPResultSerializer.hpp"
+
+namespace krutil::protobuf_serializer {
+
+using foundation::korveldata::Array;
+
+FEvalResultSerializer::FEvalResultSerializer() : TaggedSerializer("krutil:FEvalResult") {}
+
+protobuf::FEvalResult FEvalResultSerializer::toProtobuf(const ::cmddistributor::FEvalResult& result,
+                                                        const WriteArrays& write) {
+    protobuf::FEvalResult proto;
+    *proto.mutable_iipresult() = IIPResultSerializer::toProtobuf(result);
+    if (write) {
+        for (const DataID dataID : write(boost::get<std::vector<Array>>(result.getResults()))) {
+            proto.add_dataids(dataID);
+        }
+    }
+    return proto;
+}
+
+std::unique_ptr<::cmddistributor::IIPResult> FEvalResultSerializer::fromProtobuf(const protobuf::FEvalResult& proto,
+                                                                                 const ReadArrays& read) {
+    require(proto.has_iipresult(), "Required field is missing: protobuf::FEvalResult.iipResult");
+    const auto result = IIPResultSerializer::fromProtobuf(proto.iipresult());
+    if (!read) {
+        return nullptr;
+    }
+    return std::make_unique<::cmddistributor::FEvalResult>(result->id, read(proto.dataids()));
+}
+
+protobuf::FEvalResult FEvalResultSerializer::toProtobuf(const ::cmddistributor::FEvalResult& result,
+                                                        NestedWriter& nested) {
+    return toProtobuf(result, [&nested](const std::vector<Array>& arrays) { return writeArrays(arrays, nested); });
+}
+
+std::unique_ptr<::cmddistributor::IIPResult> FEvalResultSerializer::fromProtobuf(const protobuf::FEvalResult& proto,
+                                                                                 const NestedReader& nested) {
+    return fromProtobuf(proto, [&nested](const google::protobuf::RepeatedField<std::uint64_t>& dataIDs) {
+        return readArrays(dataIDs, nested);
+    });
+}
+
+}  // namespace krutil::protobuf_serializer
