@@ -3,11 +3,20 @@
 #include <mutex>
 
 #include "CapabilitiesChangedSerializer.hpp"
+#include "DebugLoopEventSerializer.hpp"
 #include "EvalIIPSerializer.hpp"
+#include "FEvalIIPSerializer.hpp"
+#include "FEvalResultSerializer.hpp"
+#include "IIPCancelMessageSerializer.hpp"
+#include "IIPCancelReplySerializer.hpp"
 #include "IIPEnqueueMessageSerializer.hpp"
 #include "IIPReplySerializer.hpp"
 #include "IIPResultSerializer.hpp"
 #include "IIPStateEventSerializer.hpp"
+#include "IssuedEnabledWarningEventSerializer.hpp"
+#include "IssuedWarningEventSerializer.hpp"
+#include "PrintableErrorEventSerializer.hpp"
+#include "QDASerializer.hpp"
 #include "QVMShutdownEventSerializer.hpp"
 #include "SinkTextEventSerializer.hpp"
 #include "TextBaseEventSerializer.hpp"
@@ -39,23 +48,32 @@ std::shared_ptr<const SerializerBase> make(const Features& features) {
 
 // Every type that the protocol carries, in the order in which a registry gets their serializers.
 constexpr MakeSerializer serializers[] = {
-    //   serializer                                                        registered name                                 family     frame type
-    make<QVMShutdownEventSerializer>,                                   // krutil:QVMShutdownEvent                         event          29
-    make<IIPStateEventSerializer<::cmddistributor::IIPStartedEvent>>,      // krutil:IIPStartedEvent                       event          29
-    make<IIPStateEventSerializer<::cmddistributor::IIPSuspendedEvent>>,    // krutil:IIPSuspendedEvent                     event          29
-    make<IIPStateEventSerializer<::cmddistributor::IIPResumedEvent>>,      // krutil:IIPResumedEvent                       event          29
-    make<IIPStateEventSerializer<::cmddistributor::IIPDiscardedEvent>>,    // krutil:IIPDiscardedEvent                     event          29
-    make<IIPStateEventSerializer<::cmddistributor::IIPRequeuedEvent>>,     // krutil:IIPRequeuedEvent                      event          29
-    make<IIPStateEventSerializer<::cmddistributor::IIPReactivatedEvent>>,  // krutil:IIPReactivatedEvent                   event          29
-    make<IIPStateEventSerializer<::cmddistributor::IIPCompletedEvent>>,    // krutil:IIPCompletedEvent                     event          29
-    make<IIPStateEventSerializer<::cmddistributor::detail::LastIIPEvent>>, // krutil:detail::LastIIPEvent                  event          29
-    make<TextBaseEventSerializer>,                                         // krutil:TextBaseEvent                         event          29
-    make<SinkTextEventSerializer>,                                         // krutil:SinkTextEvent                         event          29
-    make<IIPEnqueueMessageSerializer>,                                     // krutil:IIPEnqueueMessage                     message        27
-    make<EvalIIPSerializer>,                                               // krutil:EvalIIP                               request        29
-    make<IIPResultSerializer>,                                             // krutil:IIPResult                             result         29
-    make<IIPReplySerializer>,                                              // krutil:IIPReply                              reply          29
-    make<CapabilitiesChangedSerializer>,                                   // krutil:capabilities_api:CapabilitiesChanged  event          29
+    // serializer                                                          // registered name                                   family   frame type
+    make<QVMShutdownEventSerializer>,                                      // krutil:QVMShutdownEvent                           event    29
+    make<DebugLoopEventSerializer>,                                        // krutil:DebugLoopEvent                             event    29
+    make<IIPStateEventSerializer<::cmddistributor::IIPStartedEvent>>,      // krutil:IIPStartedEvent                            event    29
+    make<IIPStateEventSerializer<::cmddistributor::IIPSuspendedEvent>>,    // krutil:IIPSuspendedEvent                          event    29
+    make<IIPStateEventSerializer<::cmddistributor::IIPResumedEvent>>,      // krutil:IIPResumedEvent                            event    29
+    make<IIPStateEventSerializer<::cmddistributor::IIPDiscardedEvent>>,    // krutil:IIPDiscardedEvent                          event    29
+    make<IIPStateEventSerializer<::cmddistributor::IIPRequeuedEvent>>,     // krutil:IIPRequeuedEvent                           event    29
+    make<IIPStateEventSerializer<::cmddistributor::IIPReactivatedEvent>>,  // krutil:IIPReactivatedEvent                        event    29
+    make<IIPStateEventSerializer<::cmddistributor::IIPCompletedEvent>>,    // krutil:IIPCompletedEvent                          event    29
+    make<IIPStateEventSerializer<::cmddistributor::detail::LastIIPEvent>>, // krutil:detail::LastIIPEvent                       event    29
+    make<TextBaseEventSerializer>,                                         // krutil:TextBaseEvent                              event    29
+    make<SinkTextEventSerializer>,                                         // krutil:SinkTextEvent                              event    29
+    make<IIPCancelMessageSerializer>,                                      // krutil:IIPCancelMessage                           message  27
+    make<IIPCancelReplySerializer>,                                        // krutil:IIPCancelReply                             reply    29
+    make<IIPEnqueueMessageSerializer>,                                     // krutil:IIPEnqueueMessage                          message  27
+    make<EvalIIPSerializer>,                                               // krutil:EvalIIP                                    request  29
+    make<IIPResultSerializer>,                                             // krutil:IIPResult                                  result   29
+    make<IIPReplySerializer>,                                              // krutil:IIPReply                                   reply    29
+    make<FEvalIIPSerializer>,                                              // krutil:FEvalIIP                                   request  29
+    make<FEvalResultSerializer>,                                           // krutil:FEvalResult                                result   29
+    make<QDASerializer>,                                                   // krutil:QDA                                        array    29
+    make<IssuedWarningEventSerializer>,                                    // korvel:lang:diagnostic:IssuedWarningEvent         event    29
+    make<IssuedEnabledWarningEventSerializer>,                             // korvel:lang:diagnostic:IssuedEnabledWarningEvent  event    27
+    make<PrintableErrorEventSerializer>,                                   // krutil:PrintableErrorEvent                        event    29
+    make<CapabilitiesChangedSerializer>,                                   // krutil:capabilities_api:CapabilitiesChanged       event    29
 };
 
 // clang-format on

@@ -1,0 +1,22 @@
+// A warning was issued.
+#pragma once
+
+#include "cmddistributor/RequestIdAdapter.hpp"
+#include "foundation/msg_svc/eventmgr/BaseEvent.hpp"
+#include "korvel/lang/diagnostic/Warning.hpp"
+
+namespace korvel::lang::diagnostic {
+
+/// Raised for every warning, hidden ones included. Immutable.
+class IssuedWarningEvent : public foundation::msg_svc::eventmgr::BaseEvent, public ::cmddistributor::RequestIdAdapter {
+  public:
+    IssuedWarningEvent(foundation::msg_svc::exchange::IDType id, const Warning& warning);
+    ~IssuedWarningEvent() override;
+
+    const Warning& getWarning() const noexcept { return warning_; }
+
+  private:
+    Warning warning_;
+};
+
+}  // namespace korvel::lang::diagnostic

@@ -1,0 +1,26 @@
+#include "IIPCancelMessageSerializer.hpp"
+
+#include <boost/make_shared.hpp>
+
+#include "FieldConversions.hpp"
+
+namespace krutil::protobuf_serializer {
+
+IIPCancelMessageSerializer::IIPCancelMessageSerializer() : TaggedSerializer("krutil:IIPCancelMessage") {}
+
+protobuf::IIPCancelMessage IIPCancelMessageSerializer::toProtobuf(const ::cmddistributor::IIPCancelMessage& message) {
+    protobuf::IIPCancelMessage proto;
+    *proto.mutable_iipid() = IDTypeSerializer::toProtobuf(message.getID());
+    proto.set_evenifrunning(message.getEvenIfRunning());
+    return proto;
+}
+
+boost::shared_ptr<const foundation::msg_svc::exchange::Message> IIPCancelMessageSerializer::fromProtobuf(
+    const protobuf::IIPCancelMessage& proto) {
+    // The misspelling and the capital I are settled: peers and logs match the text.
+    require(proto.has_iipid(), "Requied field is missing: protobuf::IIPCancelMessage.iipId");
+    return boost::make_shared<::cmddistributor::IIPCancelMessage>(IDTypeSerializer::fromProtobuf(proto.iipid()),
+                                                                  proto.evenifrunning());
+}
+
+}  // namespace krutil::protobuf_serializer

@@ -1,0 +1,23 @@
+// Requests to cancel a request.
+#pragma once
+
+#include "TaggedSerializer.hpp"
+#include "cmddistributor/IIPCancelMessage.hpp"
+#include "krutil.protobuf.IIPCancelMessage.pb.h"
+
+namespace krutil::protobuf_serializer {
+
+class IIPCancelMessageSerializer final
+    : public TaggedSerializer<IIPCancelMessageSerializer, MessageFamily, ::cmddistributor::IIPCancelMessage,
+                              protobuf::IIPCancelMessage, FrameType::Control> {
+  public:
+    IIPCancelMessageSerializer();
+
+    static protobuf::IIPCancelMessage toProtobuf(const ::cmddistributor::IIPCancelMessage& message);
+
+    /// Throws std::logic_error for an absent identifier; one that is present and empty is accepted.
+    static boost::shared_ptr<const foundation::msg_svc::exchange::Message> fromProtobuf(
+        const protobuf::IIPCancelMessage& proto);
+};
+
+}  // namespace krutil::protobuf_serializer

@@ -1,0 +1,23 @@
+// Warnings that were issued and enabled.
+#pragma once
+
+#include "TaggedSerializer.hpp"
+#include "WarningConversion.hpp"
+
+namespace krutil::protobuf_serializer {
+
+/// The message wraps a complete issued-warning message; the frame type is not that event's.
+class IssuedEnabledWarningEventSerializer final
+    : public TaggedSerializer<IssuedEnabledWarningEventSerializer, EventFamily,
+                              korvel::lang::diagnostic::IssuedEnabledWarningEvent, protobuf::IssuedEnabledWarningEvent,
+                              FrameType::Control> {
+  public:
+    IssuedEnabledWarningEventSerializer();
+
+    static protobuf::IssuedEnabledWarningEvent toProtobuf(
+        const korvel::lang::diagnostic::IssuedEnabledWarningEvent& event);
+    static boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> fromProtobuf(
+        const protobuf::IssuedEnabledWarningEvent& proto);
+};
+
+}  // namespace krutil::protobuf_serializer

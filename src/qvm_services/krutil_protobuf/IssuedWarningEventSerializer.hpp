@@ -1,0 +1,21 @@
+// Warnings that were issued.
+#pragma once
+
+#include "TaggedSerializer.hpp"
+#include "WarningConversion.hpp"
+
+namespace krutil::protobuf_serializer {
+
+/// The registered name is that of the event's type, not of the protocol.
+class IssuedWarningEventSerializer final
+    : public TaggedSerializer<IssuedWarningEventSerializer, EventFamily, korvel::lang::diagnostic::IssuedWarningEvent,
+                              protobuf::IssuedWarningEvent> {
+  public:
+    IssuedWarningEventSerializer();
+
+    static protobuf::IssuedWarningEvent toProtobuf(const korvel::lang::diagnostic::IssuedWarningEvent& event);
+    static boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> fromProtobuf(
+        const protobuf::IssuedWarningEvent& proto);
+};
+
+}  // namespace krutil::protobuf_serializer

@@ -1,0 +1,28 @@
+#include "PrintableErrorEventSerializer.hpp"
+
+#include <boost/make_shared.hpp>
+
+#include "FieldConversions.hpp"
+#include "RuntimeExceptionSerialization.hpp"
+
+namespace krutil::protobuf_serializer {
+
+PrintableErrorEventSerializer::PrintableErrorEventSerializer() : TaggedSerializer("krutil:PrintableErrorEvent") {}
+
+protobuf::PrintableErrorEvent PrintableErrorEventSerializer::toProtobuf(const io::PrintableErrorEvent& event) {
+    protobuf::PrintableErrorEvent proto;
+    *proto.mutable_id() = IDTypeSerializer::toProtobuf(event.getRequestId());
+    proto.set_text(ustring_to_utf8(event.getText()));
+    *proto.mutable_except() = protobuf_serializer::toProtobuf(event.getException());
+    return proto;
+}
+
+boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> PrintableErrorEventSerializer::fromProtobuf(
+    const protobuf::PrintableErrorEvent& proto) {
+    const auto id = IDTypeSerializer::fromProtobuf(proto.id());
+    std::u16string text = utf8_to_ustring(proto.text());
+    return boost::make_shared<io::PrintableErrorEvent>(id, protobuf_serializer::fromProtobuf(proto.except()),
+                                                       std::move(text));
+}
+
+}  // namespace krutil::protobuf_serializer

@@ -1,0 +1,104 @@
+#include "WarningConversion.hpp"
+
+#include "FieldConversions.hpp"
+
+namespace krutil::protobuf_serializer {
+namespace {
+
+// One overload for each alternative; overload resolution on exact types keeps `long` in i64 and `unsigned int` in u32.
+struct SetValue : boost::static_visitor<> {
+    explicit SetValue(protobuf::PrintfArgument& message) : proto(message) {}
+    void operator()(int value) const { proto.set_i32(value); }
+    void operator()(unsigned int value) const { proto.set_u32(value); }
+    void operator()(long value) const { proto.set_i64(value); }
+    void operator()(unsigned long value) const { proto.set_u64(value); }
+    void operator()(double value) const { proto.set_dbl(value); }
+    void operator()(const std::u16string& value) const { proto.set_str(ustring_to_utf8(value)); }
+    protobuf::PrintfArgument& proto;
+};
+
+}  // namespace
+
+protobuf::PrintfArgument WarningConversion::toProtobuf(const korvel::lang::PrintfArgument& argument) {
+    protobuf::PrintfArgument proto;
+    boost::apply_visitor(SetValue(proto), argument.getValue());
+    return proto;
+}
+
+korvel::lang::PrintfArgument WarningConversion::fromProtobuf(const protobuf::PrintfArgument& proto) {
+    using korvel::lang::PrintfArgument;
+    using Value = PrintfArgument::Value;
+    // The casts name the alternative: the wire's 64-bit types may be long or long long, the variant's are long.
+    switch (proto.Value_case()) {
+        case protobuf::PrintfArgument::kI32:
+            return PrintfArgument(Value(static_cast<int>(proto.i32())));
+        case protobuf::PrintfArgument::kU32:
+            return PrintfArgument(Value(static_cast<unsigned int>(proto.u32())));
+        case protobuf::PrintfArgument::kI64:
+            return PrintfArgument(Value(static_cast<long>(proto.i64())));
+        case protobuf::PrintfArgument::kU64:
+            return PrintfArgument(Value(static_cast<unsigned long>(proto.u64())));
+        case protobuf::PrintfArgument::kDbl:
+            return PrintfArgument(Value(proto.dbl()));
+        case protobuf::PrintfArgument::kStr:
+            return PrintfArgument(Value(utf8_to_ustring(proto.str())));
+        case protobuf::PrintfArgument::VALUE_NOT_SET:
+            break;
+    }
+    return PrintfArgument();
+}
+
+protobuf::WarningStackFrame WarningConversion::toProtobuf(const korvel::lang::StackFrame& frame) {
+    protobuf::WarningStackFrame proto;
+    proto.set_file(ustring_to_utf8(frame.file));
+    proto.set_name(ustring_to_utf8(frame.name));
+    proto.set_line(frame.line);
+    return proto;
+}
+
+korvel::lang::StackFrame WarningConversion::fromProtobuf(const protobuf::WarningStackFrame& proto) {
+    return {utf8_to_ustring(proto.file()), utf8_to_ustring(proto.name()), proto.line()};
+}
+
+protobuf::Warning WarningConversion::toProtobuf(const korvel::lang::diagnostic::Warning& warning) {
+    protobuf::Warning proto;
+    proto.set_identifier(warning.getIdentifier());
+    proto.set_format(ustring_to_utf8(warning.getFormat()));
+    for (const auto& argument : warning.getArguments()) {
+        *proto.add_arguments() = toProtobuf(argument);
+    }
+    proto.set_message(ustring_to_utf8(warning.getMessage()));
+    for (const auto& frame : warning.getStack()) {
+        *proto.add_stack() = toProtobuf(frame);
+    }
+    proto.set_wasdisabled(warning.getWasDisabled());
+    proto.set_datenum(warning.getTime());
+    return proto;
+}
+
+korvel::lang::diagnostic::Warning WarningConversion::fromProtobuf(const protobuf::Warning& proto) {
+    std::vector<korvel::lang::PrintfArgument> arguments;
+    arguments.reserve(static_cast<std::size_t>(proto.arguments_size()));
+    for (const auto& argument : proto.arguments()) {
+        arguments.push_back(fromProtobuf(argument));
+    }
+    std::vector<korvel::lang::StackFrame> stack;
+    stack.reserve(static_cast<std::size_t>(proto.stack_size()));
+    for (const auto& frame : proto.stack()) {
+        stack.push_back(fromProtobuf(frame));
+    }
+    return {proto.identifier(),   utf8_to_ustring(proto.format()),
+            std::move(arguments), utf8_to_ustring(proto.message()),
+            std::move(stack),     proto.wasdisabled(),
+            proto.datenum()};
+}
+
+protobuf::IssuedWarningEvent WarningConversion::toProtobuf(const foundation::msg_svc::exchange::IDType& id,
+                                                           const korvel::lang::diagnostic::Warning& warning) {
+    protobuf::IssuedWarningEvent proto;
+    *proto.mutable_id() = IDTypeSerializer::toProtobuf(id);
+    *proto.mutable_warning() = toProtobuf(warning);
+    return proto;
+}
+
+}  // namespace krutil::protobuf_serializer

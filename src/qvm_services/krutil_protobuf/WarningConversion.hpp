@@ -1,0 +1,39 @@
+// Warnings, which both warning events carry.
+#pragma once
+
+#include "korvel/lang/diagnostic/IssuedEnabledWarningEvent.hpp"
+#include "korvel/lang/diagnostic/IssuedWarningEvent.hpp"
+#include "krutil.protobuf.IssuedEnabledWarningEvent.pb.h"
+#include "krutil.protobuf.IssuedWarningEvent.pb.h"
+#include "krutil.protobuf.PrintfArgument.pb.h"
+#include "krutil.protobuf.Warning.pb.h"
+#include "krutil.protobuf.WarningStackFrame.pb.h"
+
+namespace krutil::protobuf_serializer {
+
+/// Nothing here fails but for memory. Out: every required field is set, empty ones too. In: absent fields read as
+/// defaults. Numbers are copied bit for bit.
+class WarningConversion {
+  public:
+    /// Sets the one field of the argument's type; none read back is the int 0.
+    static protobuf::PrintfArgument toProtobuf(const korvel::lang::PrintfArgument& argument);
+    static korvel::lang::PrintfArgument fromProtobuf(const protobuf::PrintfArgument& proto);
+
+    static protobuf::WarningStackFrame toProtobuf(const korvel::lang::StackFrame& frame);
+    static korvel::lang::StackFrame fromProtobuf(const protobuf::WarningStackFrame& proto);
+
+    static protobuf::Warning toProtobuf(const korvel::lang::diagnostic::Warning& warning);
+    static korvel::lang::diagnostic::Warning fromProtobuf(const protobuf::Warning& proto);
+
+    /// The message that both events have in common; `EventT` is either.
+    template <class EventT>
+    static protobuf::IssuedWarningEvent eventToProtobuf(const EventT& event) {
+        return toProtobuf(event.getRequestId(), event.getWarning());
+    }
+
+  private:
+    static protobuf::IssuedWarningEvent toProtobuf(const foundation::msg_svc::exchange::IDType& id,
+                                                   const korvel::lang::diagnostic::Warning& warning);
+};
+
+}  // namespace krutil::protobuf_serializer
