@@ -80,6 +80,9 @@ class Array final {
     /// The elements, in order(). Never null, 64-byte aligned unless the array is over memory of another owner.
     const char* data() const noexcept;
 
+    /// True when mutableData() would leave the elements where they are: nobody else shares them.
+    bool writableInPlace() const noexcept;
+
     /// The elements, for writing until the array is next copied, lent, assigned to or destroyed. When they are shared,
     /// or another owner's, the array first gets a copy of its own; a sole owner's stay where they are. Throws
     /// std::bad_alloc, the array unchanged.

@@ -150,6 +150,10 @@ const char* Array::data() const noexcept {
     return storage_ ? storage_->data() : noElements;
 }
 
+bool Array::writableInPlace() const noexcept {
+    return !storage_ || storage_->writableInPlace();
+}
+
 char* Array::mutableData() {
     if (!storage_) {
         return noElements;

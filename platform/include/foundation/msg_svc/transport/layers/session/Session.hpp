@@ -71,6 +71,13 @@ struct Peer {
     ::capabilities::CapabilityList capabilities;
 };
 
+/// How far the bytes of a session have come.
+struct Traffic {
+    std::uint64_t written = 0;   ///< bytes that the stream has taken since the handshake
+    std::uint64_t arriving = 0;  ///< content of the frame that is arriving, in bytes; 0 between frames
+    std::uint64_t arrived = 0;   ///< how much of that is there
+};
+
 /// Why a session is over.
 struct SessionEnd {
     enum class Reason {
@@ -158,6 +165,9 @@ class Session {
 
     /// The same until nothing is unwritten.
     bool waitUntilWritten(int interrupt = -1);
+
+    /// How far the bytes have come, for a display. What is written and what arrives are not of exactly one moment.
+    Traffic traffic() const;
 
     /// Tells the engine that nothing more will be sent (clients only). Replies and events still arrive.
     void sayGoodbye();

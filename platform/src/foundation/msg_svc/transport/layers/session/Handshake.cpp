@@ -1,0 +1,481 @@
+#include "foundation/msg_svc/transport/layers/session/Handshake.hpp"
+
+#include <poll.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstdlib>
+#include <map>
+#include <set>
+#include <stdexcept>
+#include <string_view>
+#include <system_error>
+#include <vector>
+
+#include "foundation/msg_svc/transport/layers/session/LittleEndian.hpp"
+#include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
+#include "msg_svc.protobuf.SessionHandshake.pb.h"
+
+namespace foundation::msg_svc::transport::layers::session {
+namespace {
+
+using ::msg_svc::protobuf::SessionFeature;
+using ::msg_svc::protobuf::SessionHello;
+using ::msg_svc::protobuf::SessionVerdict;
+using Clock = std::chrono::steady_clock;
+
+// Everything from here to the end of the verdict stays as it is whatever the layout version: it is how two versions
+// tell each other that they differ.
+constexpr std::string_view magic("\x89KRUTIL\n", 8);
+constexpr std::uint32_t layoutVersion = 1;
+constexpr std::size_t longestBody = 65'536;
+
+// Texts for a person, so that none of them makes a hello or a verdict too long.
+constexpr std::size_t longestBuild = 1024;
+constexpr std::size_t longestRefusal = 16'384;
+
+// How long an end that refuses waits to hear the same from its peer.
+constexpr std::chrono::milliseconds refusalPatience{1'000};
+
+std::string errorText(int error) {
+    return std::generic_category().message(error);
+}
+
+// Both directions at once: each end sends its hello without waiting for the other's, so neither may insist on writing
+// before it reads.
+class HandshakeStream {
+  public:
+    HandshakeStream(int in, int out, std::chrono::milliseconds timeout)
+        : in_(in), out_(out), timeout_(timeout), deadline_(Clock::now() + timeout) {}
+
+    void send(const std::string& bytes) { unsent_ += bytes; }
+
+    void limitTo(std::chrono::milliseconds patience) { deadline_ = std::min(deadline_, Clock::now() + patience); }
+
+    // Reads exactly `size` bytes to `target`; `check` sees the number that have come, each time some have.
+    template <class Check>
+    void receive(char* target, std::size_t size, const std::string& what, Check check) {
+        for (std::size_t have = 0; have < size;) {
+            const std::string progress =
+                std::to_string(have) + " of " + std::to_string(size) + " bytes of " + what + " had arrived";
+            wait(true, progress);
+            const ssize_t count = ::read(in_, target + have, size - have);
+            if (count > 0) {
+                have += static_cast<std::size_t>(count);
+                check(have);
+            } else if (count == 0 || errno == ECONNRESET) {
+                throw StreamLost("the peer closed the stream during the handshake: " + progress);
+            } else if (errno != EINTR && errno != EAGAIN && errno != EWOULDBLOCK) {
+                throw StreamLost("cannot read from the stream during the handshake: " + errorText(errno) + "; " +
+                                 progress);
+            }
+        }
+    }
+
+    // What else has arrived already, for a message that shows it.
+    std::string peek(std::size_t most) const {
+        std::string bytes(most, '\0');
+        const ssize_t count = ::read(in_, bytes.data(), bytes.size());
+        bytes.resize(count > 0 ? static_cast<std::size_t>(count) : 0);
+        return bytes;
+    }
+
+    void flush() {
+        while (!unsent_.empty() && writeError_ == 0) {
+            wait(false, std::to_string(unsent_.size()) + " bytes are unwritten");
+        }
+        if (writeError_ != 0) {
+            throw StreamLost("cannot write to the stream during the handshake: " + errorText(writeError_));
+        }
+    }
+
+  private:
+    // Waits for something to read (or, without `reading`, to write) and writes what can be written meanwhile.
+    void wait(bool reading, const std::string& progress) {
+        for (;;) {
+            const bool writing = !unsent_.empty() && writeError_ == 0;
+            std::array<pollfd, 2> polled{pollfd{reading ? in_ : -1, POLLIN, 0},
+                                         pollfd{writing ? out_ : -1, POLLOUT, 0}};
+            const auto left =
+                std::max<Clock::rep>(0, std::chrono::ceil<std::chrono::milliseconds>(deadline_ - Clock::now()).count());
+            const int ready =
+                ::poll(polled.data(), polled.size(), static_cast<int>(std::min<Clock::rep>(left, 60'000)));
+            if (ready < 0 && errno != EINTR) {
+                throw StreamLost("cannot wait for the stream during the handshake: " + errorText(errno));
+            }
+            if (ready == 0 && Clock::now() >= deadline_) {
+                throw StreamLost("the handshake timed out after " + std::to_string(timeout_.count()) +
+                                 " milliseconds: " + progress);
+            }
+            if (ready > 0 && polled[1].revents != 0) {
+                writeSome();
+            }
+            if (ready > 0 && (!reading || polled[0].revents != 0)) {
+                return;
+            }
+        }
+    }
+
+    void writeSome() {
+        const ssize_t count = ::write(out_, unsent_.data(), unsent_.size());
+        if (count >= 0) {
+            unsent_.erase(0, static_cast<std::size_t>(count));
+        } else if (errno != EINTR && errno != EAGAIN && errno != EWOULDBLOCK) {
+            // The peer may have said why before it closed its end, so reading goes on.
+            writeError_ = errno;
+        }
+    }
+
+    int in_;
+    int out_;
+    std::chrono::milliseconds timeout_;
+    Clock::time_point deadline_;
+    std::string unsent_;
+    int writeError_ = 0;
+};
+
+// One end as both see it.
+struct End {
+    std::string name;
+    std::uint32_t layout;
+    const SessionHello* hello;
+};
+
+constexpr std::string_view zeroCopyFeature = "ZEROCOPY";
+
+// Zero-copy transfer switched off for this process; asked once, as the protocol's own serializer asks once.
+bool zeroCopyDisabled() {
+    static const bool disabled = [] {
+        const char* const value = std::getenv("QX_DISABLE_ZEROCOPY");
+        return value != nullptr && *value != '\0';
+    }();
+    return disabled;
+}
+
+bool isStruck(const FeatureRequest& request) {
+    return request.name() == zeroCopyFeature && request.value() == "enable" && zeroCopyDisabled();
+}
+
+// Whether bulk bytes travel beside their messages is decided for the process, whatever its sessions settle. So a
+// session that settled otherwise could not work, and is refused.
+void checkZeroCopy(const std::map<std::string, std::string>& settled, const std::string& ownName,
+                   std::vector<std::string>& mismatches) {
+    const auto found = settled.find(std::string(zeroCopyFeature));
+    if (found != settled.end() && found->second == "disable" && !zeroCopyDisabled()) {
+        mismatches.push_back("feature \"ZEROCOPY\": \"disable\" is all that both ends accept, but " + ownName +
+                             " has zero copy switched on; set QX_DISABLE_ZEROCOPY for both ends or for neither");
+    }
+}
+
+SessionHello ownHello(const SessionConfig& config, const std::vector<FeatureRequest>& features) {
+    SessionHello hello;
+    hello.set_role(config.role == Role::Client ? SessionHello::CLIENT : SessionHello::ENGINE);
+    hello.set_protocol(config.protocol);
+    hello.set_versionmajor(config.version.first);
+    hello.set_versionminor(config.version.second);
+    for (const FeatureRequest& request : features) {
+        if (!isStruck(request)) {
+            SessionFeature& feature = *hello.add_features();
+            feature.set_name(request.name());
+            feature.set_value(request.value());
+            feature.set_handling(static_cast<int>(request.handling()));
+        }
+    }
+    hello.mutable_limits()->set_tag(config.limits.tag);
+    hello.mutable_limits()->set_taggedframe(config.limits.taggedFrame);
+    hello.mutable_limits()->set_arraymessage(config.limits.arrayMessage);
+    hello.mutable_limits()->set_message(config.limits.message);
+    hello.mutable_limits()->set_frames(config.limits.frames);
+    for (const auto capability : config.capabilities.getEnabledCapabilitySequence()) {
+        hello.add_capabilities(static_cast<std::uint64_t>(capability));
+    }
+    hello.set_build(sentence(config.build, longestBuild));
+    return hello;
+}
+
+std::string packHello(const SessionHello& hello) {
+    const std::string body = hello.SerializeAsString();
+    if (body.size() > longestBody) {
+        throw std::length_error("Session::open: expected a hello of at most 65536 bytes, got " +
+                                std::to_string(body.size()));
+    }
+    std::array<char, 8> numbers{};
+    storeLittleEndian(numbers.data(), layoutVersion);
+    storeLittleEndian(numbers.data() + 4, static_cast<std::uint32_t>(body.size()));
+    return std::string(magic) + std::string(numbers.data(), numbers.size()) + body;
+}
+
+std::string packVerdict(const SessionVerdict& verdict) {
+    const std::string body = verdict.SerializeAsString();
+    std::array<char, 4> length{};
+    storeLittleEndian(length.data(), static_cast<std::uint32_t>(body.size()));
+    return std::string(length.data(), length.size()) + body;
+}
+
+template <class ProtoMessage>
+void receiveBody(HandshakeStream& stream, std::uint32_t size, const std::string& what, ProtoMessage& message) {
+    if (size > longestBody) {
+        throw ProtocolViolation("length of " + what + ": expected at most 65536 bytes, got " + std::to_string(size));
+    }
+    std::string body(size, '\0');
+    stream.receive(body.data(), body.size(), what, [](std::size_t) {});
+    if (!message.ParseFromString(body)) {
+        throw ProtocolViolation(what + ": its " + std::to_string(size) + " bytes are not a message of its type");
+    }
+}
+
+std::uint32_t receiveHello(HandshakeStream& stream, SessionHello& hello) {
+    std::array<char, magic.size() + 8> head{};
+    stream.receive(head.data(), head.size(), "the peer's first message", [&](std::size_t have) {
+        const std::string_view got(head.data(), std::min(have, magic.size()));
+        if (got != magic.substr(0, got.size())) {
+            throw ProtocolViolation(
+                "the peer does not speak this protocol: expected a first message that begins with " + quoted(magic) +
+                ", got " + quoted(std::string(head.data(), have) + stream.peek(256), 200));
+        }
+    });
+    receiveBody(stream, loadLittleEndian<std::uint32_t>(head.data() + magic.size() + 4), "the peer's hello", hello);
+    if (!hello.has_limits()) {
+        throw ProtocolViolation("the peer's hello: expected the limits of the peer, got none");
+    }
+    return loadLittleEndian<std::uint32_t>(head.data() + magic.size());
+}
+
+// Values of one feature at one end, in the order of its hello.
+struct Offer {
+    std::vector<std::string> values;
+    bool required = false;
+};
+
+struct Offers {
+    std::vector<std::string> names;
+    std::map<std::string, Offer> byName;
+};
+
+Offers offersOf(const SessionHello& hello) {
+    Offers offers;
+    for (const SessionFeature& feature : hello.features()) {
+        if (feature.handling() == static_cast<int>(FeatureHandling::Ignore)) {
+            continue;
+        }
+        const auto [found, fresh] = offers.byName.try_emplace(feature.name());
+        if (fresh) {
+            offers.names.push_back(feature.name());
+        }
+        found->second.values.push_back(feature.value());
+        found->second.required |= feature.handling() == static_cast<int>(FeatureHandling::Required);
+    }
+    return offers;
+}
+
+std::string valuesText(const Offer& offer) {
+    constexpr std::size_t most = 8;
+    std::string text;
+    for (std::size_t i = 0; i < std::min(offer.values.size(), most); ++i) {
+        text += (i == 0 ? "" : ", ") + quoted(offer.values[i]);
+    }
+    return offer.values.empty() ? "no value" : offer.values.size() > most ? text + ", ..." : text;
+}
+
+// Both ends run this over the same two hellos and come to the same map. The client's order decides.
+std::map<std::string, std::string> settleFeatures(const End& client, const End& engine,
+                                                  std::vector<std::string>& mismatches) {
+    const Offers clientOffers = offersOf(*client.hello);
+    const Offers engineOffers = offersOf(*engine.hello);
+    std::vector<std::string> names = clientOffers.names;
+    std::copy_if(engineOffers.names.begin(), engineOffers.names.end(), std::back_inserter(names),
+                 [&](const std::string& name) { return !clientOffers.byName.contains(name); });
+    static const Offer nothing;
+    const auto offer = [](const Offers& offers, const std::string& name) -> const Offer& {
+        const auto found = offers.byName.find(name);
+        return found == offers.byName.end() ? nothing : found->second;
+    };
+    std::map<std::string, std::string> settled;
+    for (const std::string& name : names) {
+        const Offer& wanted = offer(clientOffers, name);
+        const Offer& possible = offer(engineOffers, name);
+        const std::set<std::string_view> accepted(possible.values.begin(), possible.values.end());
+        const auto common = std::find_if(wanted.values.begin(), wanted.values.end(),
+                                         [&](const std::string& value) { return accepted.contains(value); });
+        if (common != wanted.values.end()) {
+            settled.emplace(name, *common);
+        } else if (wanted.required || possible.required) {
+            mismatches.push_back("feature " + quoted(name) + ": " + client.name + " accepts " + valuesText(wanted) +
+                                 ", " + engine.name + " " + valuesText(possible));
+        }
+    }
+    return settled;
+}
+
+std::string protocolText(const SessionHello& hello) {
+    return quoted(hello.protocol());
+}
+
+std::string versionText(const SessionHello& hello) {
+    return "(" + std::to_string(hello.versionmajor()) + ", " + std::to_string(hello.versionminor()) + ")";
+}
+
+std::string roleText(const SessionHello& hello) {
+    const int role = hello.role();
+    return role == SessionHello::CLIENT   ? "a client"
+           : role == SessionHello::ENGINE ? "an engine"
+                                          : "unknown (" + std::to_string(role) + ")";
+}
+
+std::map<std::string, std::string> settle(const End& client, const End& engine, std::vector<std::string>& mismatches) {
+    const auto compare = [&](const std::string& what, const std::string& atClient, const std::string& atEngine) {
+        if (atClient != atEngine) {
+            mismatches.push_back(what + ": " + client.name + " has " + atClient + ", " + engine.name + " " + atEngine);
+        }
+    };
+    compare("layout version", std::to_string(client.layout), std::to_string(engine.layout));
+    compare("protocol", protocolText(*client.hello), protocolText(*engine.hello));
+    compare("protocol version", versionText(*client.hello), versionText(*engine.hello));
+    return settleFeatures(client, engine, mismatches);
+}
+
+std::string join(const std::vector<std::string>& mismatches) {
+    std::string text;
+    for (const std::string& mismatch : mismatches) {
+        text += (text.empty() ? "" : "; ") + mismatch;
+    }
+    return sentence(text, longestRefusal);
+}
+
+Peer peerOf(const SessionHello& hello) {
+    Peer peer;
+    peer.build = sentence(hello.build(), longestBuild);
+    peer.limits.tag = std::min<std::uint64_t>(hello.limits().tag(), 65'535);
+    peer.limits.taggedFrame = hello.limits().taggedframe();
+    peer.limits.arrayMessage = hello.limits().arraymessage();
+    peer.limits.message = hello.limits().message();
+    peer.limits.frames = hello.limits().frames();
+    for (const std::uint64_t number : hello.capabilities()) {
+        // Capabilities that this end has no bit for are none that it could use.
+        if (number <= 63) {
+            peer.capabilities |= static_cast<::capabilities::Capability>(number);
+        }
+    }
+    return peer;
+}
+
+std::shared_ptr<const serialization::Registry> setUp(const ProtocolRegistry::Protocol& protocol,
+                                                     const SessionConfig& config, const std::string& ownName,
+                                                     const std::unordered_map<std::string, std::string>& features,
+                                                     std::vector<std::string>& mismatches) {
+    auto registry = std::make_shared<serialization::Registry>();
+    try {
+        if (protocol.initialize(registry, config.version, features) != config.version) {
+            mismatches.push_back("protocol version: " + ownName + " cannot set up version (" +
+                                 std::to_string(config.version.first) + ", " + std::to_string(config.version.second) +
+                                 ") of " + quoted(config.protocol));
+        }
+    } catch (const std::exception& error) {
+        mismatches.push_back("protocol " + quoted(config.protocol) + ": " + ownName +
+                             " cannot set it up: " + error.what());
+    }
+    return registry;
+}
+
+SessionVerdict makeVerdict(const std::map<std::string, std::string>& settled,
+                           const std::vector<std::string>& mismatches) {
+    SessionVerdict verdict;
+    verdict.set_accepted(mismatches.empty());
+    if (!mismatches.empty()) {
+        verdict.set_refusal(join(mismatches));
+        return verdict;
+    }
+    for (const auto& [name, value] : settled) {
+        SessionFeature& feature = *verdict.add_features();
+        feature.set_name(name);
+        feature.set_value(value);
+    }
+    return verdict;
+}
+
+SessionVerdict receiveVerdict(HandshakeStream& stream) {
+    std::array<char, 4> length{};
+    stream.receive(length.data(), length.size(), "the peer's verdict", [](std::size_t) {});
+    SessionVerdict verdict;
+    receiveBody(stream, loadLittleEndian<std::uint32_t>(length.data()), "the peer's verdict", verdict);
+    return verdict;
+}
+
+// Ends the handshake of an end that refuses: the peer is told, and its own list is added where it knows more.
+[[noreturn]] void refuse(HandshakeStream& stream, const std::string& refusal, const std::string& peerName) {
+    std::string text = "the session is refused: " + refusal;
+    try {
+        stream.limitTo(refusalPatience);
+        const SessionVerdict verdict = receiveVerdict(stream);
+        stream.flush();
+        if (!verdict.accepted() && verdict.refusal() != refusal) {
+            text += "; " + peerName + " says: " + sentence(verdict.refusal(), longestRefusal);
+        }
+    } catch (const SessionError&) {
+        // The peer has gone or sends something else; what this end found is reason enough.
+    }
+    throw HandshakeRefused(text);
+}
+
+}  // namespace
+
+Settlement shakeHands(int in, int out, const SessionConfig& config) {
+    const ProtocolRegistry::Protocol protocol = ProtocolRegistry::getRegistry()->find(config.protocol);
+    const std::vector<FeatureRequest> features = protocol.configuration();
+    const SessionHello own = ownHello(config, features);
+
+    HandshakeStream stream(in, out, config.handshakeTimeout);
+    stream.send(packHello(own));
+    SessionHello peer;
+    const std::uint32_t peerLayout = receiveHello(stream, peer);
+
+    std::vector<std::string> mismatches;
+    End ownEnd{"this end", layoutVersion, &own};
+    End peerEnd{"the other end", peerLayout, &peer};
+    const int rolePair = own.role() + peer.role();
+    if (own.role() == peer.role() || rolePair != SessionHello::CLIENT + SessionHello::ENGINE) {
+        mismatches.push_back("role: a session needs a client and an engine, this end is " + roleText(own) +
+                             ", the other end is " + roleText(peer));
+    } else {
+        ownEnd.name = config.role == Role::Client ? "the client" : "the engine";
+        peerEnd.name = config.role == Role::Client ? "the engine" : "the client";
+    }
+    const bool ownIsClient = config.role == Role::Client;
+    const auto settled = settle(ownIsClient ? ownEnd : peerEnd, ownIsClient ? peerEnd : ownEnd, mismatches);
+    checkZeroCopy(settled, ownEnd.name, mismatches);
+    const auto aboutZeroCopy = [](const std::string& mismatch) { return mismatch.starts_with("feature \"ZEROCOPY\""); };
+    if (std::any_of(features.begin(), features.end(), isStruck) &&
+        std::any_of(mismatches.begin(), mismatches.end(), aboutZeroCopy)) {
+        mismatches.push_back("QX_DISABLE_ZEROCOPY is set for " + ownEnd.name +
+                             ", so it does not accept \"enable\" for \"ZEROCOPY\"");
+    }
+    Settlement settlement{peerOf(peer), {settled.begin(), settled.end()}, nullptr};
+    if (mismatches.empty()) {
+        settlement.registry = setUp(protocol, config, ownEnd.name, settlement.features, mismatches);
+    }
+
+    const SessionVerdict verdict = makeVerdict(settled, mismatches);
+    stream.send(packVerdict(verdict));
+    if (!verdict.accepted()) {
+        refuse(stream, verdict.refusal(), peerEnd.name);
+    }
+    const SessionVerdict peerVerdict = receiveVerdict(stream);
+    if (!peerVerdict.accepted()) {
+        throw HandshakeRefused("the session is refused by " + peerEnd.name + ": " +
+                               sentence(peerVerdict.refusal(), longestRefusal));
+    }
+    std::map<std::string, std::string> peerSettled;
+    for (const SessionFeature& feature : peerVerdict.features()) {
+        peerSettled.emplace(feature.name(), feature.value());
+    }
+    if (peerSettled != settled) {
+        throw HandshakeRefused("the session is refused: " + peerEnd.name + " settled on other feature values than " +
+                               ownEnd.name);
+    }
+    stream.flush();
+    return settlement;
+}
+
+}  // namespace foundation::msg_svc::transport::layers::session

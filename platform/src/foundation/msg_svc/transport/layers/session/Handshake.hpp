@@ -1,0 +1,23 @@
+// How two ends of a session get to know each other.
+#pragma once
+
+#include <memory>
+#include <string>
+#include <unordered_map>
+
+#include "foundation/msg_svc/transport/layers/session/Session.hpp"
+
+namespace foundation::msg_svc::transport::layers::session {
+
+/// What both ends agreed upon.
+struct Settlement {
+    Peer peer;
+    std::unordered_map<std::string, std::string> features;
+    std::shared_ptr<const serialization::Registry> registry;
+};
+
+/// Exchanges hellos and verdicts over two non-blocking descriptors, which stay the caller's; reads not one byte more.
+/// Returns when both ends accepted; throws as Session::open does.
+Settlement shakeHands(int in, int out, const SessionConfig& config);
+
+}  // namespace foundation::msg_svc::transport::layers::session

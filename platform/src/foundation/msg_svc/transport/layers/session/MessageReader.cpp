@@ -1,0 +1,248 @@
+#include "foundation/msg_svc/transport/layers/session/MessageReader.hpp"
+
+#include <algorithm>
+#include <new>
+#include <utility>
+
+#include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
+#include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
+#include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
+#include "foundation/vantor/carrier/framing/DataFrame.hpp"
+#include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
+
+namespace foundation::msg_svc::transport::layers::session {
+namespace {
+
+[[noreturn]] void refuse(const std::string& what, const std::string& expected, const std::string& got) {
+    throw ProtocolViolation(what + ": expected " + expected + ", got " + got);
+}
+
+void checkLimit(const char* limit, std::uint64_t accepted, const std::string& unit, const std::string& where,
+                std::uint64_t got) {
+    if (got > accepted) {
+        refuse(where + " exceeds the limit \"" + limit + "\"", "at most " + std::to_string(accepted) + " " + unit,
+               std::to_string(got));
+    }
+}
+
+std::string frameName(framing::FrameIndex index) {
+    return "frame " + std::to_string(index);
+}
+
+}  // namespace
+
+MessageReader::MessageReader(const Limits& limits, std::string arrayTag)
+    : limits_(limits), arrayTag_(std::move(arrayTag)) {}
+
+std::span<const iovec> MessageReader::buffers() noexcept {
+    std::size_t count = 0;
+    const auto add = [this, &count](char* begin, std::size_t have, std::size_t size) {
+        if (have < size) {
+            buffers_[count++] = {begin + have, size - have};
+        }
+    };
+    if (!header_) {
+        add(headerBytes_.data(), headerHave_, headerBytes_.size());
+    } else {
+        add(tag_.data(), tagHave_, tag_.size());
+        if (content_.first) {
+            add(content_.first.get(), contentHave_, content_.second);
+            add(nextHeaderBytes_.data(), nextHeaderHave_, nextHeaderBytes_.size());
+        }
+    }
+    return {buffers_.data(), count};
+}
+
+void MessageReader::commit(std::size_t count) noexcept {
+    const auto fill = [&count](std::size_t& have, std::size_t size) {
+        const std::size_t taken = std::min(count, size - have);
+        have += taken;
+        count -= taken;
+    };
+    if (!header_) {
+        fill(headerHave_, headerBytes_.size());
+    } else {
+        fill(tagHave_, tag_.size());
+        if (content_.first) {
+            fill(contentHave_, content_.second);
+            fill(nextHeaderHave_, nextHeaderBytes_.size());
+        }
+    }
+}
+
+std::optional<MessageReader::Item> MessageReader::next() {
+    for (;;) {
+        if (!header_) {
+            if (headerHave_ < headerBytes_.size()) {
+                return std::nullopt;
+            }
+            acceptHeader();
+        }
+        if (tagHave_ < tag_.size()) {
+            return std::nullopt;
+        }
+        if (!content_.first) {
+            allocateContent();
+        }
+        if (contentHave_ < content_.second) {
+            return std::nullopt;
+        }
+        if (auto item = completeFrame()) {
+            return item;
+        }
+    }
+}
+
+void MessageReader::acceptHeader() {
+    header_ = decode(headerBytes_);
+    const bool message = header_->is(FrameKind::Tagged) || header_->is(FrameKind::Data);
+    if (message) {
+        checkMessageHeader();
+    } else {
+        checkControlHeader();
+    }
+    tag_.resize(header_->tagSize);
+    // The tag decides between two limits; only a content that keeps to both need not wait for it.
+    if (!header_->is(FrameKind::Tagged) ||
+        header_->contentSize <= std::min(limits_.taggedFrame, limits_.arrayMessage)) {
+        allocateContent();
+    }
+}
+
+void MessageReader::checkControlHeader() const {
+    const bool goodbye = header_->is(FrameKind::Goodbye);
+    if (!goodbye && !header_->is(FrameKind::Abort)) {
+        refuse("frame kind", "1 (tagged), 2 (data), 3 (goodbye) or 4 (abort)", std::to_string(header_->kind));
+    }
+    if (header_->last || header_->type != framing::FrameType::Unspecified || header_->tagSize != 0 ||
+        header_->stream != 0 || header_->index != 0) {
+        throw ProtocolViolation(std::string(goodbye ? "goodbye" : "abort") +
+                                " frame: expected last bit, frame type, tag size, stream ID and index 0");
+    }
+    if (goodbye && header_->contentSize != 0) {
+        refuse("goodbye frame", "no content", std::to_string(header_->contentSize) + " bytes");
+    }
+    if (goodbye && !frames_.empty()) {
+        throw ProtocolViolation("goodbye frame in the middle of a message: expected " + frameName(frames_.size() + 1));
+    }
+    if (header_->contentSize > longestReason) {
+        refuse("abort frame", "a reason of at most " + std::to_string(longestReason) + " bytes",
+               std::to_string(header_->contentSize));
+    }
+}
+
+void MessageReader::checkMessageHeader() const {
+    const FrameHeader& header = *header_;
+    const framing::FrameIndex expected = frames_.size() + 1;
+    const std::string name = frameName(expected);
+    if (header.index != expected) {
+        refuse("frame index", std::to_string(expected), std::to_string(header.index));
+    }
+    if (!frames_.empty() && header.stream != frames_.front()->streamID()) {
+        refuse("stream ID of " + name,
+               std::to_string(frames_.front()->streamID()) + " as in the frames before it in its message",
+               std::to_string(header.stream));
+    }
+    checkLimit("frames", limits_.frames, "frames", "number of frames of a message", expected);
+    const std::string frame = name + " on stream " + std::to_string(header.stream);
+    if (header.is(FrameKind::Data)) {
+        if (header.tagSize != 0) {
+            refuse("tag of a data frame (" + frame + ")", "none", std::to_string(header.tagSize) + " bytes");
+        }
+    } else {
+        if (header.tagSize == 0) {
+            refuse("tag of a tagged frame (" + frame + ")", "at least 1 byte", "none");
+        }
+        checkLimit("tag", limits_.tag, "bytes", "tag of " + frame, header.tagSize);
+        if (header.contentSize > std::max(limits_.taggedFrame, limits_.arrayMessage)) {
+            const bool array = limits_.arrayMessage > limits_.taggedFrame;
+            checkLimit(array ? "arrayMessage" : "taggedFrame", std::max(limits_.taggedFrame, limits_.arrayMessage),
+                       "bytes", "content of " + frame, header.contentSize);
+        }
+    }
+    // Written as a difference, so that no claim can make a sum wrap around.
+    const std::uint64_t room = limits_.message - std::min(limits_.message, messageBytes_ + header.tagSize);
+    if (header.contentSize > room || messageBytes_ + header.tagSize > limits_.message) {
+        refuse("message with " + frame + " exceeds the limit \"message\"",
+               "at most " + std::to_string(limits_.message) + " bytes",
+               std::to_string(messageBytes_ + header.tagSize) + " bytes and a content of " +
+                   std::to_string(header.contentSize));
+    }
+}
+
+void MessageReader::allocateContent() {
+    const std::uint64_t size = header_->contentSize;
+    try {
+        if (header_->is(FrameKind::Data)) {
+            content_ = framing::BufferAllocator::makeFrameBuffer(size);
+            return;
+        }
+        if (header_->is(FrameKind::Tagged) && tagHave_ == tag_.size()) {
+            const bool array = tag_ == arrayTag_;
+            checkLimit(array ? "arrayMessage" : "taggedFrame", array ? limits_.arrayMessage : limits_.taggedFrame,
+                       "bytes", "content of " + frameName(header_->index) + " with tag " + quoted(tag_), size);
+        }
+        content_ = {std::unique_ptr<char[], std::function<void(char*)>>(new char[size], std::default_delete<char[]>()),
+                    size};
+    } catch (const std::bad_alloc&) {
+        throw ProtocolViolation("there is no memory for the content of " + frameName(header_->index) + ", " +
+                                std::to_string(size) + " bytes");
+    }
+}
+
+std::unique_ptr<framing::Frame> MessageReader::takeFrame() {
+    if (header_->is(FrameKind::Data)) {
+        return std::make_unique<framing::DataFrame>(header_->type, header_->stream, std::move(content_), true,
+                                                    header_->index);
+    }
+    return std::make_unique<framing::TaggedFrame>(header_->type, header_->stream, tag_, std::move(content_),
+                                                  header_->index);
+}
+
+std::optional<MessageReader::Item> MessageReader::completeFrame() {
+    std::optional<Item> item;
+    if (header_->is(FrameKind::Goodbye)) {
+        item = Goodbye{};
+    } else if (header_->is(FrameKind::Abort)) {
+        item = Abort{std::string(content_.first.get(), content_.second)};
+    } else {
+        messageBytes_ += header_->tagSize + header_->contentSize;
+        frames_.push_back(takeFrame());
+        if (header_->last) {
+            item = Frames{std::exchange(frames_, {})};
+            messageBytes_ = 0;
+        }
+    }
+    header_.reset();
+    headerBytes_ = nextHeaderBytes_;
+    headerHave_ = std::exchange(nextHeaderHave_, 0);
+    tag_.clear();
+    tagHave_ = 0;
+    content_ = {};
+    contentHave_ = 0;
+    return item;
+}
+
+bool MessageReader::atBoundary() const noexcept {
+    return !header_ && headerHave_ == 0 && frames_.empty();
+}
+
+std::string MessageReader::position() const {
+    if (atBoundary()) {
+        return "between two messages";
+    }
+    const std::string frame = frameName(frames_.size() + 1);
+    if (!header_) {
+        return "in the middle of a message: " + std::to_string(headerHave_) + " of " +
+               std::to_string(FrameHeader::size) + " header bytes of " + frame + " had arrived";
+    }
+    if (tagHave_ < tag_.size()) {
+        return "in the middle of a message: " + std::to_string(tagHave_) + " of " + std::to_string(tag_.size()) +
+               " tag bytes of " + frame + " had arrived";
+    }
+    return "in the middle of a message: " + std::to_string(contentHave_) + " of " +
+           std::to_string(header_->contentSize) + " content bytes of " + frame +
+           (tag_.empty() ? std::string() : ", tag " + quoted(tag_) + ",") + " had arrived";
+}
+
+}  // namespace foundation::msg_svc::transport::layers::session

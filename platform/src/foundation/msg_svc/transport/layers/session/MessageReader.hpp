@@ -1,0 +1,102 @@
+// Turns the bytes of a session into messages, without doing any input itself.
+#pragma once
+
+#include <sys/uio.h>
+
+#include <array>
+#include <cstddef>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <span>
+#include <string>
+#include <variant>
+#include <vector>
+
+#include "foundation/msg_svc/transport/layers/session/FrameHeader.hpp"
+#include "foundation/msg_svc/transport/layers/session/Limits.hpp"
+#include "foundation/vantor/carrier/framing/Frame.hpp"
+
+namespace foundation::msg_svc::transport::layers::session {
+
+/// The caller reads from its stream into buffers(), tells commit() how many bytes came, and takes what is complete from
+/// next() until nothing is:
+///
+///     n = readv(descriptor, reader.buffers());  reader.commit(n);
+///     while (auto item = reader.next()) { ... }
+///
+/// The buffers end before the first byte whose place is not known yet, so the content of a frame is read straight to
+/// where it stays: of a data frame into its own buffer from BufferAllocator. A header's claims are checked before
+/// memory is asked for, and pages of a large content are touched only as its bytes arrive.
+///
+/// Not synchronised. After next() has thrown, the reader must not be used again.
+class MessageReader {
+  public:
+    /// All frames of one message, in order: the element at position i has index i + 1. Never empty.
+    struct Frames {
+        std::vector<std::unique_ptr<framing::Frame>> frames;
+    };
+    struct Goodbye {};
+    struct Abort {
+        std::string reason;
+    };
+    using Item = std::variant<Frames, Goodbye, Abort>;
+
+    /// Longest reason of an abort, in bytes.
+    static constexpr std::uint64_t longestReason = 4096;
+
+    /// `arrayTag` is the tag to which Limits::arrayMessage applies instead of Limits::taggedFrame.
+    MessageReader(const Limits& limits, std::string arrayTag);
+
+    /// Where the next bytes of the stream belong, in order; never empty, and at least one byte long together. Valid
+    /// until the next call of next().
+    std::span<const iovec> buffers() noexcept;
+
+    /// `count` bytes, at most the buffers' total, have been put there. Then next() is to be called until it returns
+    /// nothing.
+    void commit(std::size_t count) noexcept;
+
+    /// What is complete, in the order of arrival; empty when more bytes are needed. Throws ProtocolViolation for a
+    /// header that is not allowed, with what was expected and what came.
+    std::optional<Item> next();
+
+    /// Whether the stream may end here: no part of a message has arrived.
+    bool atBoundary() const noexcept;
+
+    /// Bytes of the content of the frame that is arriving, as soon as its size is accepted, and how many are there; 0
+    /// between frames.
+    std::uint64_t contentSize() const noexcept { return content_.first ? content_.second : 0; }
+    std::uint64_t contentArrived() const noexcept { return contentHave_; }
+
+    /// What is there of the message that is arriving, for the report of a lost stream.
+    std::string position() const;
+
+  private:
+    void acceptHeader();
+    void checkControlHeader() const;
+    void checkMessageHeader() const;
+    void allocateContent();
+    std::unique_ptr<framing::Frame> takeFrame();
+    std::optional<Item> completeFrame();
+
+    Limits limits_;
+    std::string arrayTag_;
+
+    // The parts of the frame that is arriving, each with how many of its bytes are there. Bytes of the next header may
+    // come along with the end of the content.
+    FrameHeader::Bytes headerBytes_{};
+    std::size_t headerHave_ = 0;
+    std::optional<FrameHeader> header_;  // once it is complete and accepted
+    std::string tag_;
+    std::size_t tagHave_ = 0;
+    framing::FrameBuffer content_;  // null until its size is accepted
+    std::size_t contentHave_ = 0;
+    FrameHeader::Bytes nextHeaderBytes_{};
+    std::size_t nextHeaderHave_ = 0;
+    std::array<iovec, 3> buffers_{};
+
+    std::vector<std::unique_ptr<framing::Frame>> frames_;
+    std::uint64_t messageBytes_ = 0;
+};
+
+}  // namespace foundation::msg_svc::transport::layers::session

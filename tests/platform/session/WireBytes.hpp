@@ -1,0 +1,51 @@
+// Frames of a session as bytes, as another implementation would write them.
+#pragma once
+
+#include <cstdint>
+#include <string>
+
+namespace wire {
+
+/// `count` bytes of `number`, the least significant first.
+inline std::string little(std::uint64_t number, int count) {
+    std::string bytes;
+    for (int i = 0; i < count; ++i) {
+        bytes += static_cast<char>(static_cast<unsigned char>(number >> (8 * i)));
+    }
+    return bytes;
+}
+
+struct Header {
+    unsigned kind = 1;
+    bool last = true;
+    unsigned type = 29;
+    std::uint64_t tagSize = 0;
+    std::uint64_t stream = 1;
+    std::uint64_t index = 1;
+    std::uint64_t contentSize = 0;
+};
+
+inline std::string header(const Header& h) {
+    return little(h.kind | (h.last ? 0x80U : 0U), 1) + little(h.type, 1) + little(h.tagSize, 2) + little(h.stream, 4) +
+           little(h.index, 8) + little(h.contentSize, 8);
+}
+
+inline std::string tagged(std::uint64_t stream, std::uint64_t index, bool last, const std::string& tag,
+                          const std::string& content, unsigned type = 29) {
+    return header({1, last, type, tag.size(), stream, index, content.size()}) + tag + content;
+}
+
+inline std::string data(std::uint64_t stream, std::uint64_t index, bool last, const std::string& content,
+                        unsigned type = 4) {
+    return header({2, last, type, 0, stream, index, content.size()}) + content;
+}
+
+inline std::string goodbye() {
+    return header({3, false, 0, 0, 0, 0, 0});
+}
+
+inline std::string abort(const std::string& reason) {
+    return header({4, false, 0, 0, 0, 0, reason.size()}) + reason;
+}
+
+}  // namespace wire
