@@ -1,0 +1,98 @@
+// The least transport that serializers need in a test: streams that keep frames, messages made of frames or bytes, and
+// a registry as a session has it. One thread uses an object at a time.
+#pragma once
+
+#include <memory>
+#include <string>
+#include <typeinfo>
+#include <vector>
+
+#include "Samples.hpp"
+#include "foundation/msg_svc/transport/layers/message/Message.hpp"
+#include "foundation/msg_svc/transport/layers/message/MessageStream.hpp"
+#include "foundation/msg_svc/transport/layers/serialization/Registry.hpp"
+#include "foundation/msg_svc/transport/layers/serialization/SerializationContext.hpp"
+#include "foundation/vantor/carrier/framing/DataFrame.hpp"
+#include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
+
+namespace transport {
+
+using foundation::msg_svc::transport::layers::message::Message;
+using foundation::msg_svc::transport::layers::message::MessageStream;
+using foundation::msg_svc::transport::layers::serialization::Registry;
+using foundation::msg_svc::transport::layers::serialization::SerializationContext;
+using foundation::msg_svc::transport::layers::serialization::SerializerBase;
+using foundation::vantor::carrier::framing::DataFrame;
+using foundation::vantor::carrier::framing::Frame;
+using foundation::vantor::carrier::framing::FrameBuffer;
+using foundation::vantor::carrier::framing::FrameIndex;
+using foundation::vantor::carrier::framing::FrameType;
+using foundation::vantor::carrier::framing::StreamID;
+using foundation::vantor::carrier::framing::TaggedFrame;
+
+using Frames = std::vector<std::unique_ptr<Frame>>;
+
+/// Keeps every frame that is appended.
+class RecordingStream : public MessageStream {
+  public:
+    void append(std::unique_ptr<Frame>& frame) override;
+
+    Frames frames;
+};
+
+/// What a frame is and holds, as a value: tests copy it, change it and make frames of it again.
+struct FrameContent {
+    bool tagged = true;
+    FrameType type = FrameType::Object;
+    StreamID streamID = 0;
+    FrameIndex index = 1;
+    std::string tag;
+    std::string bytes;
+
+    bool operator==(const FrameContent&) const = default;
+};
+
+FrameContent contentOf(const Frame& frame);
+std::vector<FrameContent> contentOf(const Frames& frames);
+
+/// A buffer with a copy of `bytes`, from the allocator that a transport receives into.
+FrameBuffer makeBuffer(const std::string& bytes);
+
+std::unique_ptr<Frame> makeFrame(const FrameContent& content);
+
+/// A received message: each frame stands at its own index, null everywhere else.
+std::unique_ptr<Message> makeMessage(const std::vector<FrameContent>& frames);
+
+/// A message of one tagged frame at index 1.
+std::unique_ptr<Message> makeMessage(const std::string& tag, const std::string& bytes,
+                                     FrameType type = FrameType::Object);
+
+/// The registry of a session: filled by the protocol's initializer.
+std::shared_ptr<Registry> sessionRegistry();
+
+/// The frames that a sample becomes, the first at `firstIndex`, on stream 7.
+std::vector<FrameContent> writtenFrames(const SerializerBase& serializer, const samples::Object& object,
+                                        const std::shared_ptr<const Registry>& registry, FrameIndex firstIndex = 1);
+
+/// The serializer of this name as a serializer of `Family`; throws std::bad_cast when it is of another.
+template <class Family>
+const Family& serializer(const Registry& registry, const std::string& name) {
+    return dynamic_cast<const Family&>(*registry.find(name));
+}
+
+/// Text of the exception that `action` throws, if that is of exactly the class `Error`; otherwise a text that says what
+/// happened instead.
+template <class Error, class Action>
+std::string errorText(const Action& action) {
+    try {
+        action();
+    } catch (const std::exception& error) {
+        if (typeid(error) == typeid(Error)) {
+            return error.what();
+        }
+        return std::string("another exception: ") + typeid(error).name() + ": " + error.what();
+    }
+    return "no exception";
+}
+
+}  // namespace transport
