@@ -1,0 +1,57 @@
+# The Debian packages that this project needs, and what scripts share. To be sourced by bash.
+
+# Kept apart although building needs both: a machine that only runs an installed tree needs the first list.
+runtime_packages=(
+    libprotobuf32           # messages
+    libicu72                # text
+    libpython3.11           # the engine
+    libedit2                # lines that are typed into the client
+    python3 python3-numpy libopenblas0-pthread
+)
+build_packages=(
+    g++ cmake ninja-build pkg-config
+    protobuf-compiler libprotobuf-dev
+    libboost-dev libicu-dev
+    python3-dev pybind11-dev
+    libcli11-dev nlohmann-json3-dev libedit-dev
+)
+test_packages=(libgtest-dev libgmock-dev)
+clang_packages=(clang libclang-rt-14-dev)
+tidy_packages=(clang-tidy)
+
+# say TEXT...: a heading.
+say() {
+    if [ -t 1 ]; then
+        printf '\n\033[1m==> %s\033[0m\n' "$*"
+    else
+        printf '\n==> %s\n' "$*"
+    fi
+}
+
+# ensurePackages NAME...: installs those that are missing, as root or with sudo. Without a missing one it only asks dpkg,
+# so it needs neither network nor rights then.
+ensurePackages() {
+    local missing=() package
+    for package in "$@"; do
+        if [ "$(dpkg-query -W -f='${db:Status-Status}' "$package" 2>/dev/null)" != installed ]; then
+            missing+=("$package")
+        fi
+    done
+    if [ ${#missing[@]} -eq 0 ]; then
+        echo "All $# packages are installed already."
+        return
+    fi
+    local as_root=()
+    if [ "$(id -u)" -ne 0 ]; then
+        if ! command -v sudo >/dev/null; then
+            echo "Missing packages: ${missing[*]}" >&2
+            echo "Install them as root, or install sudo and run this again." >&2
+            return 1
+        fi
+        as_root=(sudo)
+    fi
+    echo "Installing: ${missing[*]}"
+    "${as_root[@]}" env DEBIAN_FRONTEND=noninteractive apt-get -qq update
+    "${as_root[@]}" env DEBIAN_FRONTEND=noninteractive apt-get -qq -y --no-install-recommends \
+        -o Dpkg::Use-Pty=0 install "${missing[@]}"
+}

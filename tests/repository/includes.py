@@ -1,0 +1,93 @@
+"""Checks that includes point one way only: apps -> product (its public face) -> platform/include.
+
+    includes.py ROOT
+
+Looks at the #include lines themselves and finds each included file as the compiler would: beside the including file,
+then in the include directories of the rooms.
+"""
+
+import fnmatch
+import os
+import re
+import sys
+
+import checkout
+
+PRODUCT = "src/qvm_services/krutil_protobuf"
+INCLUDE_DIRECTORIES = ["platform/include", "platform/src", PRODUCT, "apps"]
+INCLUDE = re.compile(r'^[ \t]*#[ \t]*include[ \t]*([<"])([^>"]+)[>"]', re.MULTILINE)
+
+# Pseudo rooms for what exists in the build tree only.
+GENERATED = {"krutil.protobuf.*.pb.h": "product/generated", "*.pb.h": "platform/generated"}
+
+# Room of the including file -> rooms it may include from. Rooms that are not named may include anything.
+ALLOWED = {
+    "platform/include": {"platform/include", "platform/generated"},
+    "platform/src": {"platform/include", "platform/src", "platform/generated"},
+    "product": {"product", "product/public", "product/generated", "platform/include", "platform/generated"},
+    "product/public": {"platform/include"},
+    "apps": {"apps", "product/public", "product/generated", "platform/include", "platform/generated"},
+}
+
+# Headers of platform/include that serve the reference host alone: a host with a platform of its own lacks them.
+HOST_ONLY = {
+    "foundation/core/diag/AssertionSwitch.hpp",
+    "foundation/msg_svc/transport/layers/session/Limits.hpp",
+    "foundation/msg_svc/transport/layers/session/Session.hpp",
+    "foundation/msg_svc/transport/layers/session/SessionError.hpp",
+    "foundation/vantor/carrier/framing/BufferAllocator.hpp",
+}
+
+
+def room(path):
+    if path == f"{PRODUCT}/KrutilProtocol.hpp":
+        return "product/public"
+    if path.startswith("src/"):
+        return "product"
+    for name in ("platform/include", "platform/src", "apps"):
+        if path.startswith(name + "/"):
+            return name
+    return path.split("/")[0]
+
+
+def resolve(root, including, bracket, name):
+    """The room of an included file and its path; None for a system header; an unknown room for what is nowhere."""
+    for pattern, generated in GENERATED.items():
+        if "/" not in name and fnmatch.fnmatch(name, pattern):
+            return generated, name
+    directories = list(INCLUDE_DIRECTORIES)
+    if including.startswith("apps/"):
+        directories.append("/".join(including.split("/")[:2]))
+    if bracket == '"':
+        directories.insert(0, os.path.dirname(including))
+    for directory in directories:
+        path = os.path.normpath(os.path.join(directory, name))
+        # A template of the build is as good as the file that the build makes of it.
+        if any(os.path.isfile(os.path.join(root, path + suffix)) for suffix in ("", ".in")):
+            return room(path), path
+    return None if bracket == "<" else ("nowhere", name)
+
+
+def check(root):
+    findings = []
+    for path in checkout.files(root, ".hpp", ".cpp"):
+        allowed = ALLOWED.get(room(path))
+        if allowed is None:
+            continue
+        text = checkout.read(root, path)
+        for match in INCLUDE.finditer(text):
+            target = resolve(root, path, match[1], match[2])
+            if target is None:
+                continue
+            place = f"{path}:{text.count(chr(10), 0, match.start(2)) + 1}"
+            if target[0] == "nowhere":
+                findings.append(f"{place}: {target[1]} is in no room; a library's header is included with <>")
+            elif target[0] not in allowed:
+                findings.append(f"{place}: {room(path)} must not include {target[1]} of {target[0]}")
+            elif room(path).startswith("product") and match[2] in HOST_ONLY:
+                findings.append(f"{place}: {target[1]} is the reference host's own; other platforms do not have it")
+    return findings
+
+
+if __name__ == "__main__":
+    checkout.report(check(sys.argv[1]), "include directions")

@@ -1,0 +1,161 @@
+"""Plants one violation of each rule in a small checkout and expects it to be found, and nothing else."""
+
+import os
+import tempfile
+import unittest
+
+import documents
+import headers
+import includes
+import wording
+
+
+class Planted(unittest.TestCase):
+    def setUp(self):
+        directory = tempfile.TemporaryDirectory()
+        self.addCleanup(directory.cleanup)
+        self.root = directory.name
+        self.write("platform/include/io/Text.hpp", "// Text.\n#pragma once\nnamespace io {\n}\n")
+        self.write("platform/include/foundation/core/diag/AssertionSwitch.hpp", "// Switch.\n")
+        self.write("platform/src/io/Detail.hpp", '#include "io/Text.hpp"\n')
+        self.write(f"{includes.PRODUCT}/KrutilProtocol.hpp", '#include "io/Text.hpp"\n')
+        self.write(f"{includes.PRODUCT}/Framing.hpp", "// Framing.\n")
+        self.write("apps/common/Build.hpp", "// Build.\n")
+
+    def write(self, path, text):
+        file = os.path.join(self.root, path)
+        os.makedirs(os.path.dirname(file), exist_ok=True)
+        with open(file, "w", encoding="utf-8") as stream:
+            stream.write(text)
+
+
+class IncludesTest(Planted):
+    def expect(self, path, line, *parts):
+        self.assertEqual(includes.check(self.root), [])
+        self.write(path, f"// First line.\n{line}\n")
+        findings = includes.check(self.root)
+        self.assertEqual(len(findings), 1, findings)
+        for part in (f"{path}:2:", *parts):
+            self.assertIn(part, findings[0])
+
+    def test_arrows_that_are_allowed_are_not_found(self):
+        self.write(f"{includes.PRODUCT}/A.cpp", '#include "Framing.hpp"\n#include "io/Text.hpp"\n#include <vector>\n')
+        self.write("apps/qvm/B.cpp", '#include "KrutilProtocol.hpp"\n#include "krutil.protobuf.IIP.pb.h"\n')
+        self.write("apps/qvm/C.cpp", '#include "common/Build.hpp"\n#include "msg_svc.protobuf.IDType.pb.h"\n')
+        self.write("tests/D.cpp", '#include "Framing.hpp"\n#include "platform/src/io/Detail.hpp"\n')
+        self.assertEqual(includes.check(self.root), [])
+
+    def test_platform_includes_product(self):
+        self.expect("platform/src/io/Text.cpp", '#include "Framing.hpp"', "platform/src", "Framing.hpp of product")
+
+    def test_platform_includes_product_through_a_relative_path(self):
+        self.expect("platform/src/A.cpp", f'#include "../../{includes.PRODUCT}/Framing.hpp"', "of product")
+
+    def test_platform_includes_generated_messages_of_the_product(self):
+        self.expect("platform/src/A.cpp", '#include "krutil.protobuf.IIP.pb.h"', "of product/generated")
+
+    def test_platform_includes_apps(self):
+        self.expect("platform/include/io/A.hpp", '#include "common/Build.hpp"', "of apps")
+
+    def test_platform_interface_includes_platform_implementation(self):
+        self.expect("platform/include/io/A.hpp", '#include "io/Detail.hpp"', "of platform/src")
+
+    def test_product_includes_platform_implementation(self):
+        self.expect(f"{includes.PRODUCT}/A.cpp", '#  include "io/Detail.hpp"', "of platform/src")
+
+    def test_product_includes_what_only_the_reference_host_has(self):
+        line = '#include "foundation/core/diag/AssertionSwitch.hpp"'
+        self.expect(f"{includes.PRODUCT}/A.cpp", line, "reference host's own")
+
+    def test_product_includes_apps(self):
+        self.expect(f"{includes.PRODUCT}/A.cpp", "#include <common/Build.hpp>", "of apps")
+
+    def test_apps_include_the_inside_of_the_product(self):
+        self.expect("apps/qvm/A.cpp", '#include "Framing.hpp"', "of product")
+
+    def test_apps_include_platform_implementation(self):
+        self.expect("apps/qvm/A.cpp", '#include "io/Detail.hpp"', "of platform/src")
+
+    def test_included_file_that_is_nowhere(self):
+        self.expect("apps/qvm/A.cpp", '#include "io/Missing.hpp"', "in no room")
+
+
+class HeadersTest(unittest.TestCase):
+    GOOD = "// Purpose.\n#pragma once\n\nnamespace krutil::io {\nclass Text;\n}\n"
+
+    def findings(self, text):
+        return headers.check_shape("platform/include/krutil/io/Text.hpp", text)
+
+    def test_a_header_in_order_is_not_found(self):
+        self.assertEqual(self.findings(self.GOOD), [])
+
+    def test_no_opening_comment(self):
+        self.assertIn("opens with a comment", self.findings(self.GOOD.replace("// Purpose.\n", ""))[0])
+
+    def test_no_include_guard(self):
+        self.assertIn("#pragma once", self.findings(self.GOOD.replace("#pragma once", ""))[0])
+
+    def test_another_namespace_than_the_path_names(self):
+        self.assertIn("namespace krutil::io", self.findings(self.GOOD.replace("krutil::io", "krutil::ios"))[0])
+
+
+class HeadersCompileTest(Planted):
+    def test_a_header_that_needs_another_one_before_it(self):
+        self.write("platform/include/io/Alone.hpp", "#pragma once\n#include <string>\nstd::string text();\n")
+        self.write("platform/include/io/Needy.hpp", "#pragma once\nstd::string text();\n")
+        command = ["c++", "-fsyntax-only", "-x", "c++"]
+        self.assertEqual(headers.check_alone(self.root, "platform/include/io/Alone.hpp", command, self.root), [])
+        findings = headers.check_alone(self.root, "platform/include/io/Needy.hpp", command, self.root)
+        self.assertIn("Needy.hpp does not compile on its own", findings[0])
+
+
+class WordingTest(unittest.TestCase):
+    def test_text_that_stands_on_its_own_is_not_found(self):
+        for text in ("a special part of it", "an unspecified order", "the special case", "a spec of an array", "see docs/architecture.md", "#!/usr/bin/python3",
+                     "and/or/not", "https://example.org/a/b", "mkdir -p /tmp/krutil/x", "a / b / c", "part of 2"):
+            self.assertEqual(wording.check_text("file", text), [], text)
+
+    def test_pointers_that_lead_nowhere(self):
+        # Put together here, because this file is checked as well.
+        for text in ("the sp" + "ec says", "Sp" + "ecification", "see Pa" + "rt 7.3", "fixes iss" + "ue 12",
+                     "tick" + "et #4", '"/ow' + 'n/file"', "in /own" + "/file"):
+            self.assertEqual(len(wording.check_text("file", f"a\n{text}")), 1, text)
+
+
+class DocumentsTest(Planted):
+    def test_promises_that_are_kept_are_not_found(self):
+        self.write("docs/other.md", "# Some heading, here\n")
+        self.write("README.md", "# Top\n[a](docs/other.md#some-heading-here) [b](#top) [c](https://example.org/x)\n")
+        self.assertEqual(documents.check(self.root), [])
+
+    def test_link_to_a_file_that_is_not_there(self):
+        self.write("docs/a.md", "[x](b.md)\n")
+        self.assertEqual(documents.check(self.root), ["docs/a.md: link to b.md, which does not exist"])
+
+    def test_link_to_a_heading_that_is_not_there(self):
+        self.write("docs/a.md", "# One\n[x](#two)\n")
+        self.assertEqual(documents.check(self.root), ["docs/a.md: link to #two, but docs/a.md has no such heading"])
+
+    def test_script_that_is_not_there(self):
+        self.write("README.md", "```sh\n./scripts/nothing\n```\n")
+        self.assertEqual(documents.check(self.root), ["README.md: ./scripts/nothing is not there or cannot be run"])
+
+    def test_quotation_that_the_source_has_outgrown(self):
+        self.write(documents.QUOTED_FROM, "int one();\nint two();\n")
+        self.write("README.md", "```cpp\nint two();\n```\n")
+        self.assertEqual(documents.check(self.root), [])
+        self.write("README.md", "```cpp\nint three();\n```\n")
+        self.assertEqual(documents.check(self.root), [f"README.md: its C++ is not what {documents.QUOTED_FROM} says"])
+
+    def test_document_that_only_a_source_knows(self):
+        self.write("apps/common/A.cpp", "// See docs/lost.md.\n")
+        self.assertEqual(documents.check(self.root), ["apps/common/A.cpp: mentions docs/lost.md, which does not exist"])
+
+    def test_subcommand_that_the_client_lacks(self):
+        self.write("README.md", "```sh\nkrutil nothing 1\n```\n")
+        self.assertEqual(documents.check(self.root, "/bin/false"), ["README.md: krutil has no subcommand nothing"])
+        self.assertEqual(documents.check(self.root, "/bin/true"), [])
+
+
+if __name__ == "__main__":
+    unittest.main()
