@@ -1,0 +1,145 @@
+// One session of the engine, in a process of its own.
+//
+// Two threads meet here. The session's I/O thread queues what the client sends and never waits. The thread that calls
+// run() owns Python, takes requests from the queue and answers them. For each request it raises, on the request's
+// stream: started, its output, completed, last, and then the reply; a request that is never run has discarded and last
+// instead. Running code may open prompts, which take further requests while it stands still: the running requests are a
+// stack. docs/protocol.md tells the order of everything.
+#pragma once
+
+#include <condition_variable>
+#include <cstddef>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "cmddistributor/DebugLoopEvent.hpp"
+#include "cmddistributor/IIPCancelMessage.hpp"
+#include "cmddistributor/IIPEnqueueMessage.hpp"
+#include "cmddistributor/IIPResult.hpp"
+#include "foundation/msg_svc/transport/layers/session/Session.hpp"
+#include "qvm/AppendFile.hpp"
+#include "qvm/Cancellation.hpp"
+#include "qvm/Capabilities.hpp"
+#include "qvm/EngineServices.hpp"
+#include "qvm/Interpreter.hpp"
+#include "qvm/Log.hpp"
+#include "qvm/Options.hpp"
+#include "qvm/OutputCapture.hpp"
+#include "qvm/Request.hpp"
+#include "qvm/RequestQueue.hpp"
+#include "qvm/TextOutput.hpp"
+
+namespace qvm {
+
+/// How a session's process ends.
+enum class ExitCode : int {
+    Ok = 0,
+    Usage = 2,
+    Lost = 3,       ///< cannot serve, or the client went away
+    Violation = 4,  ///< the client broke the protocol
+    Refused = 5,    ///< protocol, version or features do not match
+};
+
+/// See the head of this file.
+class Engine : private foundation::msg_svc::transport::layers::session::SessionHandler, private EngineServices {
+  public:
+    /// `options` and `log` must outlive the object. Throws std::system_error when a file of the options cannot be
+    /// opened.
+    Engine(const Options& options, Log& log);
+    ~Engine() override;
+
+    /// Serves one session over the two descriptors, which it takes over, from the handshake to its end. Call once; the
+    /// calling thread becomes Python's main thread. When the client is lost while code runs, the process ends here.
+    ExitCode run(int in, int out);
+
+  private:
+    using Session = foundation::msg_svc::transport::layers::session::Session;
+    using SessionEnd = foundation::msg_svc::transport::layers::session::SessionEnd;
+
+    void onMessage(framing::StreamID stream,
+                   const boost::shared_ptr<const foundation::msg_svc::exchange::Message>& message) override;
+    void onEvent(framing::StreamID stream,
+                 const boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent>& event) override;
+    void onGoodbye() override;
+    void onEnd(const SessionEnd& end) override;
+    void enqueue(framing::StreamID stream, const boost::shared_ptr<const cmddistributor::IIPEnqueueMessage>& message);
+    void cancel(framing::StreamID stream, const cmddistributor::IIPCancelMessage& message);
+
+    bool canUse(::capabilities::Capability capability) override;
+    PromptEnd prompt(krutil::prompt::InputRequester loop, PyObject* frame,
+                     std::optional<std::chrono::steady_clock::time_point> deadline) override;
+    PromptEnd readText(std::u16string& text) override;
+    bool leavePrompt(PromptEnd end) override;
+    void issueWarning(korvel::lang::diagnostic::Warning warning) override;
+    void setDebugging(bool on) override;
+    int interruptDescriptor() override;
+    bool takeInterrupt() override;
+    bool drainDescriptors() override;
+
+    // A prompt that holds up the request on top of the others.
+    struct Prompt {
+        const Request& outer;
+        DequeuePoint point;
+        PyObject* frame = nullptr;
+        std::u16string* text = nullptr;  // of the answer, at an input prompt
+        RequestQueue::Deadline deadline{};
+        std::optional<PromptEnd> end{};
+    };
+
+    void serve();
+    void loop();
+    std::optional<Request> next();
+    bool handle(const Request& request, PyObject* frame);
+    std::unique_ptr<cmddistributor::IIPResult> runCode(const Request& request, PyObject* frame, bool& exit);
+    bool refused(const Request& request);
+    PromptEnd hold(Prompt& prompt, krutil::prompt::InputRequester loop);
+    PromptEnd attend(Prompt& prompt);
+    void answer(Prompt& prompt, const Request& request);
+    bool interrupted();
+    void settle();
+    const Request* current() const noexcept;
+    void echo(const Request& request);
+    void refuse(const Request& request, const std::string& why, Session::Urgency urgency);
+    void discard(const Request& request, cmddistributor::RuntimeException error, Session::Urgency urgency);
+    void reply(const Request& request, std::unique_ptr<cmddistributor::IIPResult> result, Session::Urgency urgency);
+    bool publish(framing::StreamID stream,
+                 const boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent>& event,
+                 Session::Urgency urgency = Session::Urgency::Output) noexcept;
+    void emitText(const TextTarget& target, std::u16string text) noexcept;
+    RecordBounds recordBounds() const noexcept;
+
+    template <class EventT>
+    void raise(const Request& request, Session::Urgency urgency = Session::Urgency::Output) noexcept;
+    template <class EventT>
+    bool raiseWarning(const korvel::lang::diagnostic::Warning& warning);
+
+    const Options& options_;
+    Log& log_;
+    AppendFile diary_;
+    RequestQueue queue_;
+    std::unique_ptr<Session> session_;
+    std::unique_ptr<TextOutput> output_;
+    std::unique_ptr<OutputCapture> capture_;
+    std::unique_ptr<Interpreter> python_;
+
+    const std::thread::id mainThread_ = std::this_thread::get_id();
+    Cancellation cancellation_;
+    Capabilities capabilities_;
+    // Of the main thread. Each prompt holds up a request of the stack; the topmost may run or be held up.
+    std::vector<const Request*> running_;
+    std::vector<Prompt*> prompts_;
+
+    // Guards the members below. While it is held, each request is either in the queue, or among the running ones, or
+    // has ended; so a cancel finds it.
+    std::mutex exchangeMutex_;
+    std::condition_variable leavingChanged_;
+    bool shutdownSent_ = false;  // nothing may follow the shutdown event
+    bool leaving_ = false;       // the thread of run() is done with Python
+    ExitCode exitCode_ = ExitCode::Ok;
+};
+
+}  // namespace qvm

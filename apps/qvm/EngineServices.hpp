@@ -1,0 +1,62 @@
+// What running code asks of the engine, besides writing text.
+#pragma once
+
+#include <Python.h>
+
+#include <chrono>
+#include <optional>
+#include <string>
+
+#include "capabilities/Capability.hpp"
+#include "korvel/lang/diagnostic/Warning.hpp"
+#include "krutil/prompt/InputRequester.hpp"
+
+namespace qvm {
+
+/// How a prompt ended.
+enum class PromptEnd {
+    Continued,   ///< the code goes on: it was answered, or told to
+    Quit,        ///< the code is to be ended
+    Exit,        ///< the session is to be ended
+    EndOfInput,  ///< there will be no answer
+    Raised,      ///< a Python exception is set
+};
+
+/// Calls come from Python code and hold the interpreter lock; they never come in a forked child. prompt(), readText()
+/// and takeInterrupt() are for the main thread, the rest for any.
+class EngineServices {
+  public:
+    virtual ~EngineServices() = default;
+
+    /// Whether the calling code belongs to a request that runs, on the main thread, and the capability is in force.
+    virtual bool canUse(::capabilities::Capability capability) = 0;
+
+    /// Holds the running request up at a prompt for commands, which are evaluated in `frame`, or in the session's
+    /// namespace when it is null. Needs canUse().
+    virtual PromptEnd prompt(krutil::prompt::InputRequester loop, PyObject* frame,
+                             std::optional<std::chrono::steady_clock::time_point> deadline) = 0;
+
+    /// Holds the running request up until the client answers with text, which goes to `text`. Needs canUse().
+    virtual PromptEnd readText(std::u16string& text) = 0;
+
+    /// Closes the innermost prompt for commands when the request that runs there has ended. Returns false when there is
+    /// no such prompt.
+    virtual bool leavePrompt(PromptEnd end) = 0;
+
+    /// Publishes a warning, and once more when it is enabled.
+    virtual void issueWarning(korvel::lang::diagnostic::Warning warning) = 0;
+
+    /// Whether the engine offers a debugger.
+    virtual void setDebugging(bool on) = 0;
+
+    /// Readable when the main thread has an interrupt to take; -1 on other threads.
+    virtual int interruptDescriptor() = 0;
+
+    /// Whether the request that runs is to be interrupted; each interrupt is given once, to the main thread.
+    virtual bool takeInterrupt() = 0;
+
+    /// Hands on what was written to descriptors 1 and 2. Returns whether that was anything.
+    virtual bool drainDescriptors() = 0;
+};
+
+}  // namespace qvm

@@ -1,0 +1,281 @@
+#include "qvm/Listener.hpp"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/file.h>
+#include <sys/signalfd.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <chrono>
+#include <cstring>
+#include <filesystem>
+#include <stdexcept>
+#include <system_error>
+
+#include "qvm/StandardDescriptors.hpp"
+
+namespace qvm {
+namespace {
+
+// How long sessions have to end after they were told to.
+constexpr std::chrono::seconds kSessionPatience{2};
+
+[[noreturn]] void fail(const std::string& what) {
+    throw std::runtime_error(what);
+}
+
+[[noreturn]] void failWithErrno(const std::string& what) {
+    fail(what + ": " + std::generic_category().message(errno));
+}
+
+// Closes a descriptor at the end of a scope.
+class Descriptor {
+  public:
+    explicit Descriptor(int descriptor) : descriptor_(descriptor) {}
+    ~Descriptor() {
+        if (descriptor_ >= 0) {
+            ::close(descriptor_);
+        }
+    }
+    Descriptor(const Descriptor&) = delete;
+    Descriptor& operator=(const Descriptor&) = delete;
+    int get() const noexcept { return descriptor_; }
+
+  private:
+    int descriptor_;
+};
+
+std::string octal(mode_t mode) {
+    std::array<char, 8> text{};
+    std::snprintf(text.data(), text.size(), "%04o", mode & 07777U);
+    return text.data();
+}
+
+// Opens the directory for its lock, after making sure that nobody else can put anything into it.
+int openPrivateDirectory(const std::string& path) {
+    if (::mkdir(path.c_str(), 0700) != 0 && errno != EEXIST) {
+        failWithErrno("Cannot create the directory \"" + path + "\"");
+    }
+    const int directory = ::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
+    if (directory < 0) {
+        failWithErrno("Cannot open the directory \"" + path + "\" (a symbolic link is not accepted)");
+    }
+    struct stat status {};
+    std::string problem;
+    if (::fstat(directory, &status) != 0) {
+        problem = "cannot be examined";
+    } else if (status.st_uid != ::geteuid()) {
+        problem = "belongs to user " + std::to_string(status.st_uid) + ", not to " + std::to_string(::geteuid());
+    } else if ((status.st_mode & 077U) != 0) {
+        problem = "is open to other users (mode " + octal(status.st_mode) + ", expected 0700)";
+    }
+    if (!problem.empty()) {
+        ::close(directory);
+        fail("The directory \"" + path + "\" " + problem + ": put the socket into a directory of your own.");
+    }
+    return directory;
+}
+
+sockaddr_un addressOf(const std::string& path) {
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    if (path.size() >= sizeof(address.sun_path)) {
+        fail("The socket's path \"" + path + "\" has " + std::to_string(path.size()) + " bytes; the system allows " +
+             std::to_string(sizeof(address.sun_path) - 1) + ".");
+    }
+    std::memcpy(address.sun_path, path.data(), path.size());
+    return address;
+}
+
+int newSocket() {
+    const int descriptor = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+    if (descriptor < 0) {
+        failWithErrno("Cannot make a socket");
+    }
+    return descriptor;
+}
+
+bool somebodyAnswers(const sockaddr_un& address) {
+    const Descriptor probe(newSocket());
+    // EAGAIN: a listener whose backlog is full.
+    return ::connect(probe.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)) == 0 || errno == EAGAIN;
+}
+
+sigset_t watchedSignals() {
+    sigset_t signals;
+    ::sigemptyset(&signals);
+    ::sigaddset(&signals, SIGCHLD);
+    ::sigaddset(&signals, SIGTERM);
+    ::sigaddset(&signals, SIGINT);
+    return signals;
+}
+
+}  // namespace
+
+Listener::Listener(const Options& options, Log& log) : options_(options), log_(log), socket_(newSocket()) {
+    try {
+        bindSocket();
+    } catch (...) {
+        ::close(socket_);
+        throw;
+    }
+    const sigset_t watched = watchedSignals();
+    ::sigprocmask(SIG_BLOCK, &watched, nullptr);
+    signals_ = ::signalfd(-1, &watched, SFD_CLOEXEC | SFD_NONBLOCK);
+}
+
+Listener::~Listener() {
+    if (connection_ >= 0) {
+        return;
+    }
+    ::close(socket_);
+    ::close(signals_);
+    // Another engine may have taken the path over after someone removed the file.
+    struct stat status {};
+    if (::lstat(options_.listen.c_str(), &status) == 0 && status.st_ino == inode_) {
+        ::unlink(options_.listen.c_str());
+    }
+}
+
+void Listener::bindSocket() {
+    const std::string& path = options_.listen;
+    const sockaddr_un address = addressOf(path);
+    const std::filesystem::path parent = std::filesystem::path(path).parent_path();
+    const Descriptor directory(openPrivateDirectory(parent.empty() ? "." : parent.string()));
+    // Two engines that start at the same time must not both find a dead socket and remove each other's.
+    if (::flock(directory.get(), LOCK_EX) != 0) {
+        failWithErrno("Cannot lock the directory of \"" + path + "\"");
+    }
+    struct stat status {};
+    if (::lstat(path.c_str(), &status) == 0) {
+        if (!S_ISSOCK(status.st_mode)) {
+            fail("\"" + path + "\" exists and is not a socket.");
+        }
+        if (somebodyAnswers(address)) {
+            fail("Another engine serves \"" + path + "\" already.");
+        }
+        ::unlink(path.c_str());
+    }
+    const mode_t before = ::umask(0177);
+    const int bound = ::bind(socket_, reinterpret_cast<const sockaddr*>(&address), sizeof(address));
+    ::umask(before);
+    if (bound != 0 || ::listen(socket_, SOMAXCONN) != 0) {
+        failWithErrno("Cannot serve \"" + path + "\"");
+    }
+    ::lstat(path.c_str(), &status);
+    inode_ = status.st_ino;
+}
+
+ExitCode Listener::run() {
+    log_.say("serving " + options_.listen);
+    while (true) {
+        std::array<pollfd, 2> watched{{{signals_, POLLIN, 0}, {socket_, POLLIN, 0}}};
+        if (::poll(watched.data(), watched.size(), -1) < 0 && errno != EINTR) {
+            failWithErrno("Cannot wait for clients");
+        }
+        signalfd_siginfo signal{};
+        while (::read(signals_, &signal, sizeof(signal)) == static_cast<ssize_t>(sizeof(signal))) {
+            if (signal.ssi_signo == SIGCHLD) {
+                reap();
+                continue;
+            }
+            endSessions();
+            return ExitCode::Ok;
+        }
+        accept();
+        if (connection_ >= 0) {
+            Engine engine(options_, log_);
+            return engine.run(connection_, connection_);
+        }
+    }
+}
+
+void Listener::accept() {
+    const int connection = ::accept4(socket_, nullptr, nullptr, SOCK_CLOEXEC);
+    if (connection < 0) {
+        return;
+    }
+    ucred peer{};
+    socklen_t length = sizeof(peer);
+    if (::getsockopt(connection, SOL_SOCKET, SO_PEERCRED, &peer, &length) != 0 || peer.uid != ::geteuid()) {
+        log_.say("refused a client of user " + std::to_string(peer.uid) + ", since this engine serves user " +
+                 std::to_string(::geteuid()) + " only");
+        ::close(connection);
+        return;
+    }
+    if (sessions_.size() >= options_.maxSessions) {
+        log_.say("refused a client: " + std::to_string(sessions_.size()) + " sessions are open (--max-sessions)");
+        ::close(connection);
+        return;
+    }
+    const pid_t child = ::fork();
+    if (child < 0) {
+        log_.say("refused a client: no process for its session: " + std::generic_category().message(errno));
+    } else if (child > 0) {
+        sessions_.insert(child);
+    } else {
+        ::close(socket_);
+        ::close(signals_);
+        const sigset_t watched = watchedSignals();
+        ::sigprocmask(SIG_UNBLOCK, &watched, nullptr);
+        connection_ = connection;
+        return;
+    }
+    ::close(connection);
+}
+
+void Listener::reap() {
+    int status = 0;
+    while (true) {
+        const pid_t child = ::waitpid(-1, &status, WNOHANG);
+        if (child <= 0) {
+            return;
+        }
+        sessions_.erase(child);
+        if (WIFSIGNALED(status)) {
+            log_.say("the session of process " + std::to_string(child) + " was ended by signal " +
+                     std::to_string(WTERMSIG(status)) + " (" + ::strsignal(WTERMSIG(status)) + ")");
+        }
+    }
+}
+
+void Listener::endSessions() {
+    for (const pid_t child : sessions_) {
+        ::kill(child, SIGTERM);
+    }
+    const sigset_t childSignal = [] {
+        sigset_t signals;
+        ::sigemptyset(&signals);
+        ::sigaddset(&signals, SIGCHLD);
+        return signals;
+    }();
+    const auto deadline = std::chrono::steady_clock::now() + kSessionPatience;
+    const auto reapQuietly = [this] {
+        while (true) {
+            const pid_t child = ::waitpid(-1, nullptr, WNOHANG);
+            if (child <= 0) {
+                return;
+            }
+            sessions_.erase(child);
+        }
+    };
+    reapQuietly();
+    while (!sessions_.empty() && std::chrono::steady_clock::now() < deadline) {
+        const timespec wait{0, 50'000'000};
+        ::sigtimedwait(&childSignal, nullptr, &wait);
+        reapQuietly();
+    }
+    for (const pid_t child : sessions_) {
+        ::kill(child, SIGKILL);
+        ::waitpid(child, nullptr, 0);
+    }
+}
+
+}  // namespace qvm

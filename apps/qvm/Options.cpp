@@ -1,0 +1,93 @@
+#include "qvm/Options.hpp"
+
+#include <CLI/CLI.hpp>
+#include <cstdlib>
+
+#include "common/Build.hpp"
+#include "common/HelpFormatter.hpp"
+#include "common/LimitOptions.hpp"
+
+namespace qvm {
+namespace {
+
+constexpr int kUsageError = 2;
+
+}  // namespace
+
+Options parseOptions(int argc, const char* const* argv) {
+    Options options;
+    CLI::App app(
+        "The krutil engine: runs Python code that clients send over the krutil protocol.\n"
+        "\n"
+        "An engine runs whatever its clients send, with the rights of the user who started it. It serves\n"
+        "one client on its standard input and output (--stdio), or any number of clients of the same user\n"
+        "on a Unix socket (--listen), each in a process of its own.",
+        "krutil-qvm");
+    app.formatter(std::make_shared<apps::HelpFormatter>());
+    app.set_version_flag("--version", apps::buildString("krutil-qvm"));
+
+    const std::string where = "Where to serve (one of these)";
+    app.add_flag("--stdio", options.stdio, "One session on standard input and output, then end")->group(where);
+    app.add_option("--listen", options.listen,
+                   "Unix socket to serve; its directory is created, or must be private to this user (0700)")
+        ->type_name("PATH")
+        ->group(where);
+
+    double timeoutSeconds = std::chrono::duration<double>(options.handshakeTimeout).count();
+    const std::string sessions = "Sessions";
+    app.add_option("--max-sessions", options.maxSessions, "Sessions at a time of a listening engine")
+        ->check(CLI::Range(1, 10'000))
+        ->type_name("COUNT")
+        ->capture_default_str()
+        ->group(sessions);
+    app.add_option("--handshake-timeout", timeoutSeconds, "Seconds that a client has to say what it speaks")
+        ->check(CLI::Range(0.001, 3600.0))
+        ->type_name("SECONDS")
+        ->capture_default_str()
+        ->group(sessions);
+    app.add_option("--max-queued", options.queue.count, "Requests that may wait; one more is refused with a reply")
+        ->check(CLI::Range(1, 1'000'000))
+        ->type_name("COUNT")
+        ->capture_default_str()
+        ->group(sessions);
+    app.add_option("--max-queued-bytes", options.queue.bytes, "Memory that waiting requests may hold, such as 64MiB")
+        ->transform(CLI::AsSizeValue(false))
+        ->type_name("SIZE")
+        ->default_str(apps::sizeText(options.queue.bytes))
+        ->group(sessions);
+
+    app.add_flag("--no-zero-copy", options.noZeroCopy,
+                 "Copy arrays into their messages, as QX_DISABLE_ZEROCOPY=1 does; clients must do the same")
+        ->group(sessions);
+    app.add_flag("--no-precheck", options.noPrecheck,
+                 "Let numbers that the protocol has no meaning for end the process, instead of closing the session")
+        ->group(sessions);
+
+    const std::string files = "Files";
+    app.add_option("--diary", options.diary, "Append what is shown to sinks with the diary trait to this file")
+        ->type_name("FILE")
+        ->group(files);
+    app.add_option("--log", options.log,
+                   "Append the engine's own messages, and the text of sinks with the logging trait, to this file")
+        ->type_name("FILE")
+        ->group(files);
+
+    apps::addLimitOptions(app, options.limits);
+
+    app.footer(
+        "Exit codes: 0 the session ended as agreed, 2 wrong usage, 3 cannot serve or the client was lost,\n"
+        "4 the client broke the protocol, 5 version or feature refused.");
+    try {
+        app.parse(argc, argv);
+        if (options.stdio != options.listen.empty()) {
+            throw CLI::ValidationError("Exactly one of --stdio and --listen is required");
+        }
+    } catch (const CLI::ParseError& error) {
+        const int status = app.exit(error);
+        std::exit(status == 0 ? EXIT_SUCCESS : kUsageError);
+    }
+    options.handshakeTimeout = std::chrono::milliseconds(static_cast<long>(timeoutSeconds * 1000.0));
+    return options;
+}
+
+}  // namespace qvm

@@ -1,0 +1,30 @@
+// What the command line of krutil-qvm asks for.
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <string>
+
+#include "foundation/msg_svc/transport/layers/session/Limits.hpp"
+#include "qvm/RequestQueue.hpp"
+
+namespace qvm {
+
+struct Options {
+    bool stdio = false;  ///< one session on descriptors 0 and 1
+    std::string listen;  ///< path of the Unix socket to serve; empty with stdio
+    foundation::msg_svc::transport::layers::session::Limits limits;
+    RequestQueue::Bounds queue;
+    bool noZeroCopy = false;       ///< arrays travel inside their messages; the peers must do the same
+    bool noPrecheck = false;       ///< numbers that end the process are not looked for in what arrives
+    std::size_t maxSessions = 64;  ///< sessions at a time of a listening engine
+    std::chrono::milliseconds handshakeTimeout{10'000};
+    std::string diary;  ///< file that text of sinks with the diary trait is appended to; empty for none
+    std::string log;    ///< file of the engine's own messages and of sinks with the logging trait; empty for none
+};
+
+/// Reads the command line. Prints help, the version or what is wrong and ends the process (0, or 2 for wrong usage)
+/// when there is nothing to run.
+Options parseOptions(int argc, const char* const* argv);
+
+}  // namespace qvm

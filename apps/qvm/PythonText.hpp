@@ -1,0 +1,21 @@
+// Text between Python and the host. The caller holds the interpreter lock.
+#pragma once
+
+#include <Python.h>
+
+#include <cstddef>
+#include <string>
+
+namespace qvm {
+
+/// UTF-16 text of the code points [begin, begin + count) of a str, as far as there are so many. A surrogate, which a
+/// str may hold and text may not, becomes U+FFFD.
+std::u16string utf16Of(PyObject* text, std::size_t begin, std::size_t count);
+
+/// The same for the whole str.
+std::u16string utf16Of(PyObject* text);
+
+/// A str of UTF-16 text, an unpaired surrogate as U+FFFD. Null with an exception set when there is no memory.
+PyObject* strOf(const std::u16string& text);
+
+}  // namespace qvm

@@ -1,0 +1,23 @@
+// Descriptors 0, 1 and 2 belong to running code; the protocol keeps away from them.
+#pragma once
+
+namespace qvm {
+
+/// Makes sure that 0, 1 and 2 are open, so that nothing else lands on their numbers. Throws std::system_error.
+void holdStandardDescriptors();
+
+/// The pair of descriptors that a session reads from and writes to.
+struct ProtocolDescriptors {
+    int in;
+    int out;
+};
+
+/// Moves the protocol from 0 and 1 to private close-on-exec descriptors, which the caller owns, and gives 0 and 1 to
+/// running code. Throws std::system_error.
+ProtocolDescriptors moveProtocolAside();
+
+/// Gives descriptor 0 the null device and descriptor 1 a copy of standard error, for running code and its children.
+/// Throws std::system_error.
+void giveToRunningCode();
+
+}  // namespace qvm

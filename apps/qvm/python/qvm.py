@@ -1,0 +1,431 @@
+"""What the engine offers to the code that it runs.
+
+Names without an underscore are for that code; the others are the engine's own.
+"""
+
+import atexit as _atexit
+import builtins as _builtins
+import codecs as _codecs
+import gc as _gc
+import io as _io
+import linecache as _linecache
+import numbers as _numbers
+import pprint as _pprint
+import signal as _signal
+import sys as _sys
+import time as _time
+import traceback as _traceback
+import warnings as _warnings
+import _warnings as _c_warnings
+from _thread import _local as _Local
+from operator import index as _index
+from _ast import Expr as _Expr, Expression as _Expression, PyCF_ONLY_AST as _PyCF_ONLY_AST
+
+import _qvm
+
+
+def link(text, target):
+    """Text that a terminal shows as a hyperlink to target; plain text where the output has no links."""
+    text, target = str(text), str(target)
+    if not _qvm.makes_links():
+        return text
+    # A control character would end the markup early.
+    target = "".join(c if c.isprintable() and c != " " else "".join(f"%{b:02X}" for b in c.encode("utf-8", "replace"))
+                     for c in target)
+    return f"\x1b]8;;{target}\x1b\\{text}\x1b]8;;\x1b\\"
+
+
+class _TextStream(_io.TextIOBase):
+    """sys.stdout or sys.stderr: hands text to the engine, which sends it to the client."""
+
+    encoding = "utf-8"
+    errors = "replace"
+    newlines = None
+    line_buffering = True
+    write_through = False
+    mode = "w"
+
+    def __init__(self, name, descriptor, write):
+        self.name = name
+        self._descriptor = descriptor
+        self.write = write
+        self.flush = _qvm.flush
+        self.buffer = _ByteStream(self)
+
+    def writable(self):
+        return True
+
+    def fileno(self):
+        # Of the plain descriptor, so that child processes can be given it.
+        return self._descriptor
+
+    def reconfigure(self, **options):
+        """Accepted for programs that ask for UTF-8 or line buffering, which this stream has anyway."""
+
+    def close(self):
+        self.flush()
+
+    def __repr__(self):
+        return f"<engine stream {self.name}>"
+
+
+class _ByteStream(_io.BufferedIOBase):
+    """The buffer attribute of a text stream: bytes that are UTF-8 text."""
+
+    mode = "wb"
+
+    def __init__(self, text):
+        self.name = text.name
+        self._text = text
+        self._decoder = _codecs.getincrementaldecoder("utf-8")("replace")
+
+    def writable(self):
+        return True
+
+    def write(self, data):
+        data = bytes(memoryview(data))
+        self._text.write(self._decoder.decode(data))
+        return len(data)
+
+    def flush(self):
+        self._text.flush()
+
+    def fileno(self):
+        return self._text.fileno()
+
+    def close(self):
+        self.flush()
+
+
+def _show(value):
+    """sys.displayhook: shows the value of an expression to the client."""
+    if value is None:
+        return
+    # As Python's own hook does, so that a __repr__ that uses it finds no half-made value.
+    _builtins._ = None
+    text = _pprint.pformat(value) if _qvm.formats_values() else repr(value)
+    _qvm.show(text + "\n")
+    _builtins._ = value
+
+
+class _InputStream(_io.TextIOBase):
+    """sys.stdin: asks the client for lines."""
+
+    encoding = "utf-8"
+    errors = "replace"
+    newlines = None
+    line_buffering = True
+    mode = "r"
+    name = "<stdin>"
+
+    def __init__(self):
+        self._rest = ""
+
+    def readable(self):
+        return True
+
+    def fileno(self):
+        return 0
+
+    def readline(self, size=-1):
+        if size == 0:
+            return ""
+        if not self._rest:
+            self._rest = _qvm.read_line()
+        end = self._rest.find("\n") + 1 or len(self._rest)
+        if size is not None and 0 < size < end:
+            end = size
+        line, self._rest = self._rest[:end], self._rest[end:]
+        return line
+
+    def read(self, size=-1):
+        # Fewer characters than asked for, as from a terminal.
+        return "".join(iter(self.readline, "")) if size is None or size < 0 else self.readline(size)
+
+    def reconfigure(self, **options):
+        """As for the other streams."""
+
+    def close(self):
+        """The client cannot be closed from here."""
+
+    def __repr__(self):
+        return "<engine stream <stdin>>"
+
+
+class DebuggerQuit(BaseException):
+    """Ends a request whose debug or keyboard prompt was left with dbquit()."""
+
+
+def _take_commands(prompt, frame):
+    end = prompt(frame)
+    if end == "quit":
+        raise DebuggerQuit("The debugger was left with quit.")
+    if end == "exit":
+        raise SystemExit
+
+
+def _breakpoint(*arguments, **options):
+    """sys.breakpointhook: opens a debug prompt in the code that called breakpoint()."""
+    frame = _sys._getframe(1)
+    if not _qvm.can_debug():
+        _warn("breakpoint() goes on: the client or the engine has no debugger here", RuntimeWarning, 2)
+        return
+    code = frame.f_code
+    line = _linecache.getline(code.co_filename, frame.f_lineno).strip()
+    _qvm.show(f"Stopped in {code.co_name} ({code.co_filename}:{frame.f_lineno})\n" + (f"    {line}\n" if line else ""))
+    _take_commands(_qvm.debug_prompt, frame)
+
+
+def keyboard():
+    """Holds the running code up and evaluates what the client sends, where keyboard() was called, until dbcont()."""
+    if not _qvm.can_ask():
+        _warn("qvm.keyboard() goes on: the client cannot be asked", RuntimeWarning, 2)
+        return
+    _take_commands(_qvm.keyboard_prompt, _sys._getframe(1))
+
+
+def pause(seconds=None):
+    """Holds the running code up until the client says to go on, or for so many seconds."""
+    if seconds is not None:
+        seconds = float(seconds)
+    if _qvm.can_ask():
+        if _qvm.pause_prompt(seconds) == "exit":
+            raise SystemExit
+    elif seconds is not None:
+        _time.sleep(max(seconds, 0))
+    else:
+        _warn("qvm.pause() goes on: the client cannot be asked", RuntimeWarning, 2)
+
+
+def dbcont():
+    """At a prompt: lets the code that was held up go on, once this request has ended."""
+    _qvm.leave_prompt(False)
+
+
+def dbquit():
+    """At a prompt: ends the code that was held up, once this request has ended."""
+    _qvm.leave_prompt(True)
+
+
+def debugger(on=True):
+    """States whether this engine offers a debugger; without, breakpoint() goes on."""
+    _qvm.set_debugging(bool(on))
+
+
+# Frames of a warning's stack; the innermost are kept.
+_MAX_FRAMES = 200
+
+
+def _stack(frame):
+    """File, function and line of the frames of user code, from the outermost to this one."""
+    prompts = (_take_commands.__code__, pause.__code__, _InputStream.readline.__code__)
+    frames = []
+    while frame is not None and len(frames) < _MAX_FRAMES:
+        code = frame.f_code
+        if code in prompts:
+            break  # what lies beyond belongs to the request that the prompt holds up
+        if code.co_filename != "<qvm>":
+            frames.append((code.co_filename, code.co_name, frame.f_lineno or 0))
+        frame = frame.f_back
+    frames.reverse()
+    return frames
+
+
+def warning(identifier, format, *arguments):
+    """Issues a warning to the client, with the text format % arguments. Without arguments the format is the text."""
+    identifier, format = str(identifier), str(format)
+    message = format % arguments if arguments else format
+    if _qvm.in_forked_child():
+        _sys.stderr.write(f"{identifier}: {message}\n")
+    else:
+        _qvm.issue_warning(identifier, format, [_plain(each) for each in arguments], message,
+                           _stack(_sys._getframe(1)), False)
+
+
+def _plain(value):
+    if isinstance(value, _numbers.Integral):
+        return int(value)
+    if isinstance(value, _numbers.Real):
+        return float(value)
+    return str(value)
+
+
+# The warning that warnings.warn() or warn_explicit() of this thread is about to let through, as a list that gets it.
+_issuing = _Local()
+_show_warning = _warnings._showwarnmsg
+_print_warning = _warnings._showwarnmsg_impl
+
+
+def _issue(message, category, stack, shown):
+    if isinstance(message, Warning):
+        category = type(message)
+    elif category is None:
+        category = UserWarning
+    identifier = type.__getattribute__(category, "__qualname__")
+    module = type.__getattribute__(category, "__module__")
+    if module != "builtins":
+        identifier = f"{module}.{identifier}"
+    text = str(message)
+    _qvm.issue_warning(identifier, text, [], text, stack, not shown)
+
+
+def _on_shown(message):
+    """warnings._showwarnmsg: what a filter lets through comes here."""
+    taken = (_warnings.showwarning is not _warnings._showwarning_orig
+             or _warnings._showwarnmsg_impl is not _print_warning)
+    if taken or _qvm.in_forked_child():
+        _show_warning(message)
+    lets_through = getattr(_issuing, "shown", None)
+    if lets_through is not None:
+        lets_through.append(not taken)
+    elif not _qvm.in_forked_child():
+        # C code has raised it. Its place is that of a frame, or of code that is being compiled.
+        frame = _sys._getframe(1)
+        while frame is not None and (frame.f_code.co_filename != message.filename or frame.f_lineno != message.lineno):
+            frame = frame.f_back
+        stack = _stack(frame or _sys._getframe(1))
+        if frame is None:
+            stack.append((message.filename, "", message.lineno))
+        _issue(message.message, message.category, stack, not taken)
+
+
+def _raise_warning(raise_it):
+    """Whether a filter let the warning through and nobody took it."""
+    before = getattr(_issuing, "shown", None)
+    _issuing.shown = shown = []
+    try:
+        raise_it()
+    finally:
+        _issuing.shown = before
+    return shown == [True]
+
+
+def _warn(message, category=None, stacklevel=1, source=None):
+    """warnings.warn"""
+    level = max(_index(stacklevel), 1)
+    # Three frames of this module lie between the caller and Python's own function.
+    shown = _raise_warning(lambda: _c_warnings.warn(message, category, level + 3, source))
+    if _qvm.in_forked_child():
+        return
+    frame = _sys._getframe(1)
+    while level > 1 and frame is not None:
+        frame = frame.f_back
+        level -= 1
+    _issue(message, category, _stack(frame), shown)
+
+
+def _warn_explicit(message, category, filename, lineno, *arguments, **options):
+    """warnings.warn_explicit"""
+    shown = _raise_warning(lambda: _c_warnings.warn_explicit(message, category, filename, lineno, *arguments,
+                                                             **options))
+    if not _qvm.in_forked_child():
+        _issue(message, category, [*_stack(_sys._getframe(1)), (str(filename), "", min(max(lineno, 0), 0xFFFFFFFF))],
+               shown)
+
+
+def _hide_engine(report):
+    """Takes the engine's frames out of a traceback.TracebackException and all that it refers to."""
+    seen, waiting = set(), [report]
+    while waiting:
+        each = waiting.pop()
+        if each is None or id(each) in seen:
+            continue
+        seen.add(id(each))
+        frames = [frame for frame in each.stack or () if frame.filename != "<qvm>"]
+        each.stack = _traceback.StackSummary.from_list(frames) if frames else None
+        waiting += [each.__cause__, each.__context__, *(each.exceptions or ())]
+
+
+def _format_error(error, limit):
+    """The text that Python prints for an uncaught error, cut after about limit characters."""
+    report = _traceback.TracebackException(type(error), error, error.__traceback__, compact=True)
+    _hide_engine(report)
+    pieces, length = [], 0
+    for piece in report.format():
+        if length + len(piece) > limit:
+            pieces += [piece[:limit - length], "\n... (the rest is left out)\n"]
+            break
+        pieces.append(piece)
+        length += len(piece)
+    return "".join(pieces)
+
+
+# Sources of evaluated code, for tracebacks and inspection: the newest, by number and by length.
+_MAX_SOURCES = 1000
+_MAX_SOURCE_LENGTH = 16 << 20
+_sources = {}
+_source_length = 0
+
+
+def _remember(filename, source):
+    global _source_length
+    _sources[filename] = len(source)
+    _source_length += len(source)
+    while len(_sources) > _MAX_SOURCES or _source_length > _MAX_SOURCE_LENGTH:
+        oldest = next(iter(_sources))
+        _source_length -= _sources.pop(oldest)
+        _linecache.cache.pop(oldest, None)
+    if filename in _sources:
+        # Without a modification time an entry is never looked up in the file system.
+        _linecache.cache[filename] = (len(source), None, source.splitlines(True), filename)
+
+
+def _compile_block(source, filename):
+    """Code of the statements and of a trailing expression; either may be None."""
+    if "\n" not in source.rstrip():
+        try:
+            return None, compile(source, filename, "eval", 0, True)
+        except SyntaxError:
+            pass
+    tree = compile(source, filename, "exec", _PyCF_ONLY_AST, True)
+    if not tree.body or not isinstance(tree.body[-1], _Expr):
+        return compile(tree, filename, "exec", 0, True), None
+    last = compile(_Expression(tree.body.pop().value), filename, "eval", 0, True)
+    return compile(tree, filename, "exec", 0, True) if tree.body else None, last
+
+
+def _compile_program(source, filename):
+    return compile(source, filename, "exec", 0, True), None
+
+
+def _compile_statement(source, filename):
+    tree = compile(source + "\n", filename, "single", _PyCF_ONLY_AST, True)
+    if len(tree.body) != 1:
+        second = tree.body[1]
+        raise SyntaxError("multiple statements found while compiling a single statement",
+                          (filename, second.lineno, second.col_offset + 1, None))
+    return compile(tree, filename, "single", 0, True), None
+
+
+# By code type; one that is not stated is a block.
+_COMPILERS = (_compile_block, _compile_program, _compile_statement, _compile_block)
+
+
+def _compile(source, filename, code_type):
+    _remember(filename, source)
+    return _COMPILERS[code_type](source, filename)
+
+
+def _finish():
+    """What the end of a Python program does for its code: exit functions run, and written files are complete."""
+    _atexit._run_exitfuncs()
+    for thing in _gc.get_objects():
+        if issubclass(type(thing), (_io.TextIOWrapper, _io.BufferedWriter, _io.BufferedRandom)):
+            try:
+                if not thing.closed:
+                    thing.flush()
+            except (OSError, ValueError):
+                pass
+
+
+_sys.stdout = _sys.__stdout__ = _TextStream("<stdout>", 1, _qvm.write_output)
+_sys.stderr = _sys.__stderr__ = _TextStream("<stderr>", 2, _qvm.write_error)
+_sys.displayhook = _sys.__displayhook__ = _show
+_sys.stdin = _sys.__stdin__ = _InputStream()
+_sys.breakpointhook = _sys.__breakpointhook__ = _breakpoint
+_signal.signal(_qvm.interrupt_signal, _qvm.on_interrupt_signal)
+_warnings._showwarnmsg = _on_shown
+for _name, _function in (("warn", _warn), ("warn_explicit", _warn_explicit)):
+    _function.__name__ = _function.__qualname__ = _name
+    _function.__module__ = "warnings"
+    setattr(_warnings, _name, _function)
