@@ -1,0 +1,75 @@
+#include "Interrupt.hpp"
+
+#include <fcntl.h>
+#include <sys/eventfd.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <csignal>
+#include <cstdint>
+#include <system_error>
+
+#include "ExitCode.hpp"
+
+namespace client {
+namespace {
+
+// All that the signal handler knows.
+std::atomic<int> eventOfProcess{-1};
+std::atomic<int> socketToShutDown{-1};
+struct sigaction previousHandling;
+
+void onSignal(int) {
+    const int savedError = errno;
+    const std::uint64_t one = 1;
+    // The counter cannot be full, and a handler could do nothing about it.
+    [[maybe_unused]] const auto written = ::write(eventOfProcess.load(), &one, sizeof one);
+    if (const int socket = socketToShutDown.load(); socket >= 0) {
+        ::shutdown(socket, SHUT_RDWR);
+    }
+    errno = savedError;
+}
+
+}  // namespace
+
+Interrupt::Interrupt() : event_(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)), action_([] { throw Cancelled(); }) {
+    if (!event_) {
+        throw std::system_error(errno, std::generic_category(), "eventfd");
+    }
+    eventOfProcess = event_.get();
+    // A shell that starts the program in the background has Ctrl-C ignored; that stays so.
+    ::sigaction(SIGINT, nullptr, &previousHandling);
+    if (previousHandling.sa_handler == SIG_IGN) {
+        return;
+    }
+    // Without SA_RESTART, so that a write to a terminal that is held up ends too.
+    struct sigaction handling {};
+    handling.sa_handler = &onSignal;
+    ::sigaction(SIGINT, &handling, nullptr);
+}
+
+Interrupt::~Interrupt() {
+    ::sigaction(SIGINT, &previousHandling, nullptr);
+    eventOfProcess = -1;
+}
+
+void Interrupt::dispatch() {
+    std::uint64_t count = 0;
+    if (::read(event_.get(), &count, sizeof count) == sizeof count) {
+        // A copy: the action may replace itself.
+        const auto action = action_;
+        action();
+    }
+}
+
+Interrupt::ShutsDown::ShutsDown(int socket) : socket_(::fcntl(socket, F_DUPFD_CLOEXEC, 0)) {
+    socketToShutDown = socket_.get();
+}
+
+Interrupt::ShutsDown::~ShutsDown() {
+    socketToShutDown = -1;
+}
+
+}  // namespace client

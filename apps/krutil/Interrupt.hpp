@@ -1,0 +1,50 @@
+// Ctrl-C.
+#pragma once
+
+#include <functional>
+#include <utility>
+
+#include "Descriptor.hpp"
+
+namespace client {
+
+/// Turns SIGINT into a readable descriptor and a call on the main thread. Everything that waits there watches fd() and
+/// calls dispatch() when it is readable, so that Ctrl-C is answered at once, whatever the program waits for. One object
+/// a process; it restores the previous handling of the signal when it is destroyed. Main thread only.
+class Interrupt {
+  public:
+    Interrupt();
+    ~Interrupt();
+    Interrupt(const Interrupt&) = delete;
+    Interrupt& operator=(const Interrupt&) = delete;
+
+    /// Readable while a Ctrl-C has not been dispatched.
+    int fd() const noexcept { return event_.get(); }
+
+    /// Calls the action once if there was any Ctrl-C since the last call. Whatever the action throws reaches the
+    /// caller.
+    void dispatch();
+
+    /// Replaces what a Ctrl-C does, and returns what it did before. The first action throws Cancelled.
+    std::function<void()> setAction(std::function<void()> action) { return std::exchange(action_, std::move(action)); }
+
+    /// While an object lives, Ctrl-C also shuts down a socket, at once and from the signal handler: for calls that
+    /// block on the socket and do not know of fd(). dispatch() is due after such a call has failed.
+    class ShutsDown {
+      public:
+        /// Keeps a duplicate of `socket`.
+        explicit ShutsDown(int socket);
+        ~ShutsDown();
+        ShutsDown(const ShutsDown&) = delete;
+        ShutsDown& operator=(const ShutsDown&) = delete;
+
+      private:
+        Descriptor socket_;
+    };
+
+  private:
+    Descriptor event_;
+    std::function<void()> action_;
+};
+
+}  // namespace client

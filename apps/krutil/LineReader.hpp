@@ -1,0 +1,42 @@
+// Lines that a person types while a session goes on.
+#pragma once
+
+#include <functional>
+#include <string>
+
+#include "Conversation.hpp"
+#include "Output.hpp"
+
+namespace client {
+
+/// What came of reading a line.
+struct ReadLine {
+    enum class End {
+        Newline,     ///< `text` is the line, without its newline
+        EndOfInput,  ///< there is no line any more; Ctrl-D on a terminal
+        Done,        ///< the line is not wanted any more
+    };
+    End end;
+    std::string text;
+};
+
+/// Reads lines from a descriptor. What arrives in the session is delivered while it waits, and Ctrl-C is dispatched.
+/// Main thread only.
+class LineReader {
+  public:
+    /// `fd` is not owned. Prompts go to `out`. All must outlive the object.
+    LineReader(int fd, Conversation& conversation, Output& out);
+
+    /// Shows `prompt` and reads a line until `done` returns true. What a terminal holds of a line that is not wanted
+    /// any more is dropped. Throws what Conversation::run() and Output::write() throw.
+    ReadLine read(const std::string& prompt, const std::function<bool()>& done);
+
+  private:
+    int fd_;
+    Conversation& conversation_;
+    Output& out_;
+    bool terminal_;
+    std::string rest_;  ///< read and not yet returned
+};
+
+}  // namespace client

@@ -1,0 +1,66 @@
+#include "Output.hpp"
+
+#include <limits.h>
+#include <poll.h>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <cstring>
+#include <string>
+
+#include "ExitCode.hpp"
+#include "Interrupt.hpp"
+
+namespace client {
+namespace {
+
+bool isFile(int fd) {
+    struct stat status {};
+    return ::fstat(fd, &status) == 0 && S_ISREG(status.st_mode);
+}
+
+}  // namespace
+
+Output::Output(int fd, std::string_view name, Interrupt& interrupt)
+    : fd_(fd), name_(name), interrupt_(interrupt), terminal_(::isatty(fd) == 1), mayBlock_(!isFile(fd)) {}
+
+std::size_t Output::columns() const noexcept {
+    winsize size{};
+    constexpr std::size_t usual = 80;
+    return ::ioctl(fd_, TIOCGWINSZ, &size) == 0 && size.ws_col != 0 ? size.ws_col : usual;
+}
+
+void Output::write(std::string_view text) {
+    while (!text.empty()) {
+        std::size_t piece = text.size();
+        if (mayBlock_) {
+            std::array<pollfd, 2> watched{pollfd{fd_, POLLOUT, 0}, pollfd{interrupt_.fd(), POLLIN, 0}};
+            if (::poll(watched.data(), watched.size(), -1) < 0 && errno != EINTR) {
+                throw Failure(ExitCode::Stream,
+                              std::string("cannot wait for ") + std::string(name_) + ": " + std::strerror(errno));
+            }
+            if (watched[1].revents != 0) {
+                interrupt_.dispatch();
+            }
+            if (watched[0].revents == 0) {
+                continue;
+            }
+            // A pipe that is ready takes this much without blocking.
+            piece = std::min<std::size_t>(piece, PIPE_BUF);
+        }
+        const auto written = ::write(fd_, text.data(), piece);
+        if (written >= 0) {
+            text.remove_prefix(static_cast<std::size_t>(written));
+        } else if (errno == EPIPE) {
+            throw OutputClosed();
+        } else if (errno != EINTR && errno != EAGAIN) {
+            throw Failure(ExitCode::Stream, "cannot write to " + std::string(name_) + ": " + std::strerror(errno));
+        }
+    }
+}
+
+}  // namespace client
