@@ -134,8 +134,9 @@ void addRun(CLI::App& app, Options& options, RunOptions& run) {
         ->required()
         ->type_name("");
     command
-        ->add_option("ARG", run.arguments,
-                     "What the program finds in sys.argv after its name; after -- it may begin with a dash")
+        ->add_option(
+            "ARG", run.arguments,
+            "What the program finds in sys.argv after its name; put -- before the first one if any begins with a dash")
         ->type_name("");
     command
         ->add_flag("--sparingly", run.sparingly, "Let the engine send output in large pieces instead of line by line")

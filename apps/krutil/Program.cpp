@@ -129,9 +129,17 @@ ExitCode runCommand(const Options& options, const CallOptions& call, Printer& pr
                     Interrupt& interrupt) {
     PreparedCall prepared = prepareCall(call);
     AskingClient asking(options, printer, out, err, interrupt, standardInputIsTerminal());
-    const ExitCode result = callFunction(asking.client(), call, std::move(prepared), printer, err);
-    finish(asking.client());
-    return result;
+    try {
+        const ExitCode result = callFunction(asking.client(), call, std::move(prepared), printer, err);
+        finish(asking.client());
+        return result;
+    } catch (const Failure& failure) {
+        // What this end cannot send or store is no fault of the session, which ends in good order.
+        if (failure.code() == ExitCode::Usage) {
+            finish(asking.client());
+        }
+        throw;
+    }
 }
 
 ExitCode runReporting(const Options& options) {

@@ -116,11 +116,11 @@ TEST(CommandLineTest, WithoutACommandLinesAreRead) {
 }
 
 TEST(CommandLineTest, AProgramHasArguments) {
-    const Options options = std::get<Options>(parse({"run", "--no-precheck", "a.py", "b", "--", "-c"}));
+    const Options options = std::get<Options>(parse({"run", "--no-precheck", "a.py", "--", "-b", "c", "-d"}));
     EXPECT_TRUE(options.connection.noPrecheck);
     const RunOptions run = std::get<RunOptions>(options.command);
     EXPECT_EQ(run.file, "a.py");
-    EXPECT_EQ(run.arguments, (std::vector<std::string>{"b", "-c"}));
+    EXPECT_EQ(run.arguments, (std::vector<std::string>{"-b", "c", "-d"}));
     EXPECT_EQ(parseFinished({"run"}).err, "krutil: FILE is required\nRun krutil --help for help.\n");
 }
 

@@ -77,12 +77,12 @@ void Recorder::onGoodbye() {
 }
 
 void Recorder::onEnd(const SessionEnd& end) {
-    {
-        const std::lock_guard lock(mutex_);
-        EXPECT_FALSE(end_) << "onEnd called twice";
-        end_ = end;
-    }
-    keep("end: " + reasonText(end.reason) + (end.text.empty() ? "" : ": ") + end.text);
+    // The line and the end become visible together: whoever has waited for the end looks at the lines.
+    const std::lock_guard lock(mutex_);
+    EXPECT_FALSE(end_) << "onEnd called twice";
+    end_ = end;
+    lines_.push_back("end: " + reasonText(end.reason) + (end.text.empty() ? "" : ": ") + end.text);
+    changed_.notify_all();
 }
 
 std::vector<std::string> Recorder::lines() const {

@@ -609,6 +609,9 @@ void Session::Impl::onRead(const ErrorCode& error, std::size_t count) {
             if (!item) {
                 break;
             }
+            // Whoever is told of the message finds that it has arrived.
+            arriving_ = 0;
+            arrived_ = 0;
             take(std::move(*item));
         }
         arrived_ = reader_.contentArrived();
