@@ -186,10 +186,10 @@ std::string defaultHistoryFile() {
         return std::string(value != nullptr ? value : "");
     };
     if (const std::string state = variable("XDG_STATE_HOME"); !state.empty() && state[0] == '/') {
-        return state + "/krutil/history";
+        return (std::filesystem::path(state) / "krutil" / "history").string();
     }
     const std::string home = variable("HOME");
-    return home.empty() ? std::string() : home + "/.local/state/krutil/history";
+    return home.empty() ? std::string() : (std::filesystem::path(home) / ".local/state/krutil/history").string();
 }
 
 }  // namespace client

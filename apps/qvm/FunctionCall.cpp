@@ -101,7 +101,7 @@ py::object first(const py::str& part, const std::string& name, const py::dict& s
     }
     const std::string partName = part;
     raise(PyExc_NameError, "Unknown function " + quoted(name) + ": " + quoted(partName) +
-                               " is not defined in this session, not a builtin and not a module");
+                               " is not defined in the session, not a builtin and not a module");
 }
 
 py::object further(const py::object& container, const std::string& path, const py::str& part, const std::string& name) {

@@ -117,8 +117,8 @@ class Session {
   public:
     /// Performs the handshake and returns a session that is settled but not yet reading. Takes ownership of both
     /// descriptors (which may be equal) in every case, sets them non-blocking and close-on-exec. Blocks up to the
-    /// handshake timeout. Where SIGPIPE has its default handling it is ignored from now on, in the whole process: a peer
-    /// that is gone must not end it.
+    /// handshake timeout. Where SIGPIPE has its default handling it is ignored from now on, in the whole process: a
+    /// peer that is gone must not end it.
     ///
     /// Throws HandshakeRefused, ProtocolViolation (the peer does not speak this layout), StreamLost (closed or timed
     /// out), std::out_of_range (unknown protocol name here).
