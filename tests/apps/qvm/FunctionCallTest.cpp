@@ -79,10 +79,10 @@ TEST_F(FunctionCallTest, NameOfTheSessionComesFirst) {
 TEST_F(FunctionCallTest, UnknownNameSaysWhereTheSearchStopped) {
     const auto error = [&](const std::string& name) { return errorOf([&] { find(name); }); };
     EXPECT_EQ(error("nosuch"),
-              "NameError: Unknown function 'nosuch': 'nosuch' is not defined in this session, not a builtin and not a "
+              "NameError: Unknown function 'nosuch': 'nosuch' is not defined in the session, not a builtin and not a "
               "module");
     EXPECT_EQ(error("nosuch.deep.name"),
-              "NameError: Unknown function 'nosuch.deep.name': 'nosuch' is not defined in this session, not a builtin "
+              "NameError: Unknown function 'nosuch.deep.name': 'nosuch' is not defined in the session, not a builtin "
               "and not a module");
     EXPECT_EQ(error("numpy.linalg.svdd"),
               "AttributeError: Unknown function 'numpy.linalg.svdd': the module 'numpy.linalg' has no attribute and no "
