@@ -81,6 +81,9 @@ class LineEditor::Impl {
         doneSeen_ = false;
         error_ = nullptr;
         ::el_resize(editor_);
+        // The library shows the prompt before it sets the terminal up; a key that is pressed in between would mean
+        // something else, Ctrl-D nothing.
+        ::el_wset(editor_, EL_PREP_TERM, 1);
         int count = 0;
         const wchar_t* const typed = ::el_wgets(editor_, &count);
         std::fflush(stdout);
