@@ -29,21 +29,26 @@ ExitCode serve(const qvm::Options& options, qvm::Log& log) {
     return listener.run();
 }
 
-// Running code may have left threads behind, which must not meet the destructors of this process.
+// Running code may have left threads behind, which must not meet the destructors of this process. A leak checker looks
+// before, when Python has been finalised.
 [[noreturn]] void leave(ExitCode code) {
-#if defined(KRUTIL_SANITIZED)
-    std::exit(static_cast<int>(code));
-#else
     ::_exit(static_cast<int>(code));
-#endif
 }
 
 }  // namespace
 
 #if defined(KRUTIL_SANITIZED)
-// Memory that Python and NumPy keep until the process ends.
-extern "C" const char* __lsan_default_suppressions() {
-    return "leak:libpython3\nleak:_multiarray_umath\nleak:numpy\n";
+// The sanitizers' run-time library looks these up by name.
+#define SANITIZER_HOOK extern "C" __attribute__((visibility("default"), used))
+
+// A failed allocation is Python's MemoryError, as without a sanitizer.
+SANITIZER_HOOK const char* __asan_default_options() {
+    return "allocator_may_return_null=1";
+}
+
+// Memory that Python, NumPy and the bridge to them keep until the process ends.
+SANITIZER_HOOK const char* __lsan_default_suppressions() {
+    return "leak:libpython3\nleak:_multiarray_umath\nleak:numpy\nleak:pybind11::detail::get_local_internals\n";
 }
 #endif
 

@@ -84,6 +84,9 @@ TEST_F(CaptureTest, ProcessThatOutlivesItsRequestIsHeard) {
 }
 
 TEST_F(CaptureTest, WriterWaitsForAClientThatDoesNotRead) {
+#if defined(KRUTIL_SANITIZED)
+    GTEST_SKIP() << "A sanitizer keeps freed memory, so the process grows in any case.";
+#endif
     // More than any buffer on the way; the engine must not hold it.
     const IDType id = client().enqueue(
         "import subprocess, resource\n"

@@ -367,6 +367,9 @@ TEST(SinkTest, EventsFitWhatTheClientAccepts) {
 }
 
 TEST_F(EvaluationTest, OutputWaitsForAClientThatDoesNotRead) {
+#if defined(KRUTIL_SANITIZED)
+    GTEST_SKIP() << "A sanitizer keeps freed memory, so the process grows in any case.";
+#endif
     // Each event is held up for a moment, so that the code would be far ahead if nothing stopped it.
     client().eval("import resource\nbefore = resource.getrusage(resource.RUSAGE_SELF).ru_maxrss");
     client().slowDown(std::chrono::microseconds(200));

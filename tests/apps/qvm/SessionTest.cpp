@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include "EngineFixture.hpp"
+#include "KrutilProtocol.hpp"
 
 namespace qvm_test {
 namespace {
@@ -170,6 +171,7 @@ TEST(SessionEndTest, SilentClientIsGivenUp) {
 }
 
 TEST(SessionEndTest, WrongVersionIsRefused) {
+    krutil::protobuf::KrutilProtocol::init();
     EngineProcess engine({"--stdio"});
     session::SessionConfig config;
     config.version = {2, 0};
