@@ -111,7 +111,8 @@ class HeadersCompileTest(Planted):
 
 class WordingTest(unittest.TestCase):
     def test_text_that_stands_on_its_own_is_not_found(self):
-        for text in ("a special part of it", "an unspecified order", "the special case", "a spec of an array", "see docs/architecture.md", "#!/usr/bin/python3",
+        for text in ("a special part of it", "an unspecified order",
+                     "the special case", "a spec of an array", "see docs/architecture.md", "#!/usr/bin/python3",
                      "and/or/not", "https://example.org/a/b", "mkdir -p /tmp/krutil/x", "a / b / c", "part of 2"):
             self.assertEqual(wording.check_text("file", text), [], text)
 

@@ -18,9 +18,10 @@ PATTERNS = [
     (re.compile(r"\b(issue|ticket) #?\d", re.IGNORECASE), "say what was wrong; the number leads nowhere"),
 ]
 
-# Directories that every Debian machine has, and names that tests use for what exists nowhere. Any other one at the root
-# is somebody's own.
-ROOT_DIRECTORIES = {"bin", "dev", "etc", "lib", "nonexistent", "nowhere", "proc", "run", "sys", "tmp", "usr", "var"}
+# Directories that every Debian machine has, names that tests use for what exists nowhere, and our own below a user's
+# directory. Any other one is somebody's.
+ROOT_DIRECTORIES = {"bin", "dev", "etc", "lib", "proc", "run", "sys", "tmp", "usr", "var",
+                    "nonexistent", "nowhere", "krutil"}
 ABSOLUTE = re.compile(r"(?<![\w.:/*<>)}\]\\$+@%-])/(\w+)/\w")
 
 

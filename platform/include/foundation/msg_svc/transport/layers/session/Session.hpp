@@ -164,7 +164,7 @@ class Session {
     /// none) becomes readable; returns false in the last case only. Not from the I/O thread.
     bool waitForRoom(int interrupt = -1);
 
-    /// The same until nothing is unwritten.
+    /// The same until everything that was handed over before the call is written, whatever is sent meanwhile.
     bool waitUntilWritten(int interrupt = -1);
 
     /// How far the bytes have come, for a display. What is written and what arrives are not of exactly one moment.

@@ -157,6 +157,7 @@ class Session::Impl {
     void abandonInChild() noexcept;
     framing::StreamID newStreamID();
     Traffic traffic() const;
+    void awaitWritten();
 
     const SessionConfig config;
     const Settlement settlement;
@@ -220,6 +221,7 @@ class Session::Impl {
     mutable std::mutex mutex_;
     OutgoingQueue queue_;
     std::size_t unwritten_ = 0;
+    std::size_t awaited_ = 0;  ///< of these, what was there when somebody began to wait for it
     std::size_t pendingAnswers_ = 0;
     std::unordered_set<framing::StreamID> open_;
     framing::StreamID lastStream_ = 0;
@@ -470,9 +472,16 @@ void Session::Impl::sayGoodbye() {
     submit(OutgoingPieces(FrameKind::Goodbye, {}), [this] { return !std::exchange(goodbyeSent_, true); });
 }
 
+// Other threads may go on sending, which must not prolong the wait.
+void Session::Impl::awaitWritten() {
+    const std::lock_guard lock(mutex_);
+    awaited_ = unwritten_;
+    updateEvents();
+}
+
 void Session::Impl::updateEvents() {
     room.set(over_ || unwritten_ <= config.roomBytes);
-    written.set(over_ || unwritten_ == 0);
+    written.set(over_ || awaited_ == 0);
 }
 
 // Frames end here, outside the lock, because their deleters are the owners' code. Only then do the bytes stop counting:
@@ -490,6 +499,8 @@ void Session::Impl::drop(std::vector<OutgoingPieces>& messages) {
     messages.clear();
     const std::lock_guard lock(mutex_);
     unwritten_ -= bytes;
+    // Messages are written in the order in which they were handed over, so the awaited ones are the first.
+    awaited_ -= std::min(awaited_, bytes);
     pendingAnswers_ -= answers;
     updateEvents();
 }
@@ -972,6 +983,7 @@ bool Session::waitForRoom(int interrupt) {
 }
 
 bool Session::waitUntilWritten(int interrupt) {
+    impl_->awaitWritten();
     return impl_->waitFor(impl_->written, interrupt);
 }
 
