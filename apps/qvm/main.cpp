@@ -46,6 +46,11 @@ SANITIZER_HOOK const char* __asan_default_options() {
     return "allocator_may_return_null=1";
 }
 
+// The engine looks itself, when Python has been finalised. Forked children of running code end without that.
+SANITIZER_HOOK const char* __lsan_default_options() {
+    return "leak_check_at_exit=0";
+}
+
 // Memory that Python, NumPy and the bridge to them keep until the process ends.
 SANITIZER_HOOK const char* __lsan_default_suppressions() {
     return "leak:libpython3\nleak:_multiarray_umath\nleak:numpy\nleak:pybind11::detail::get_local_internals\n";
