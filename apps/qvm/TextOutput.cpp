@@ -76,7 +76,7 @@ bool TextOutput::write(TextSource source, std::u16string_view text) {
             due_ = Clock::now() + (sparing ? settings_.sparingDelay : settings_.delay);
         }
         held_ += text;
-        const bool lineEnds = !sparing && text.find(u'\n') != text.npos;
+        const bool lineEnds = !sparing && text.find(u'\n') != std::u16string_view::npos;
         if (lineEnds || held_.size() >= settings_.flushUnits) {
             handedOn = handOn();
             wake = false;

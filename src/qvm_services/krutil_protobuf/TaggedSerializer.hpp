@@ -14,8 +14,11 @@ namespace krutil::protobuf_serializer {
 /// Base of the serializer class `Derived`, which handles objects of class `Object` of a family as messages of class
 /// `ProtoMessage` in frames of type `Type`. `Derived` has two static conversions:
 ///
-///     ProtoMessage toProtobuf(const Object&)        or (const Object&, NestedWriter&) or () for objects without
-///     content Ret fromProtobuf(const ProtoMessage&)         or (const ProtoMessage&, const NestedReader&)
+///     ProtoMessage toProtobuf(const Object&)
+///     Ret fromProtobuf(const ProtoMessage&)
+///
+/// Objects that refer to others take a `NestedWriter&` or a `const NestedReader&` as second parameter; objects without
+/// content take no parameter on the way out.
 ///
 /// Immutable after construction; any number of threads may use one object.
 template <class Derived, class Family, class Object, class ProtoMessage, FrameType Type = FrameType::Object>
