@@ -50,10 +50,8 @@ Options parseOptions(int argc, const char* const* argv) {
         ->type_name("COUNT")
         ->capture_default_str()
         ->group(sessions);
-    app.add_option("--max-queued-bytes", options.queue.bytes, "Memory that waiting requests may hold, such as 64MiB")
-        ->transform(CLI::AsSizeValue(false))
-        ->type_name("SIZE")
-        ->default_str(apps::sizeText(options.queue.bytes))
+    apps::addSizeOption(app, "--max-queued-bytes", options.queue.bytes,
+                        "Memory that waiting requests may hold, such as 64MiB")
         ->group(sessions);
 
     app.add_flag("--no-zero-copy", options.noZeroCopy,

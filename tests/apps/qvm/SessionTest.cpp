@@ -182,6 +182,15 @@ TEST(SessionEndTest, WrongVersionIsRefused) {
     EXPECT_THAT(engine.stderrText(), HasSubstr("version"));
 }
 
+TEST(UsageTest, SizesAreNeitherNegativeNorTooLargeToHold) {
+    for (const std::string size : {"-1", "0", "99999999999999999999"}) {
+        EngineProcess engine({"--stdio", "--max-queued-bytes", size});
+        EXPECT_EQ(engine.wait(), 2);
+        EXPECT_THAT(engine.stderrText(), HasSubstr("--max-queued-bytes: expected a number from 1 to"));
+        EXPECT_THAT(engine.stderrText(), HasSubstr("got " + size + "\n"));
+    }
+}
+
 TEST(UsageTest, ExactlyOnePlaceToServe) {
     for (const std::vector<std::string>& arguments :
          {std::vector<std::string>{}, {"--stdio", "--listen", "x"}, {"--listen", ""}}) {
