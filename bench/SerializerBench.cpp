@@ -1,24 +1,22 @@
-// What the library costs beside the least that the same work can cost: serializers beside bare Protocol Buffers calls
-// on the same messages, arrays beside a copy of their bytes, text conversion beside a copy of the text. The last lines
-// are ratios; a ratio of 1 means that the library adds nothing.
+#include "SerializerBench.hpp"
 
-#include <benchmark/benchmark.h>
+#include <google/protobuf/descriptor.h>
+#include <google/protobuf/message.h>
 
-#include <cstdio>
+#include <boost/make_shared.hpp>
 #include <cstring>
-#include <map>
+#include <memory>
 #include <string>
 #include <vector>
 
-#include "EvalIIPSerializer.hpp"
-#include "QDASerializer.hpp"
+#include "Comparison.hpp"
 #include "Samples.hpp"
 #include "TestTransport.hpp"
-#include "TextBaseEventSerializer.hpp"
 #include "foundation/korveldata/ArrayFactory.hpp"
-#include "krutil.protobuf.TextBaseEvent.pb.h"
+#include "krutil/io/TextBaseEvent.hpp"
 #include "msg_svc/protobuf/ustring.hpp"
 
+namespace bench {
 namespace {
 
 namespace korveldata = foundation::korveldata;
@@ -28,143 +26,183 @@ const std::shared_ptr<const transport::Registry>& registry() {
     return filled;
 }
 
-boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> textEvent(std::size_t length) {
-    using namespace krutil::io;
-    return boost::make_shared<TextBaseEvent>(foundation::msg_svc::exchange::IDType(1, 2), StreamTypeEnum::ERROR_STREAM,
-                                             std::u16string(length, u'x'));
-}
-
-std::string textBytes(std::size_t length) {
-    const auto event = boost::dynamic_pointer_cast<const krutil::io::TextBaseEvent>(textEvent(length));
-    return krutil::protobuf_serializer::TextBaseEventSerializer::toProtobuf(*event).SerializeAsString();
-}
-
-void writeTextEvent(benchmark::State& state) {
-    const krutil::protobuf_serializer::TextBaseEventSerializer serializer;
-    const auto event = textEvent(static_cast<std::size_t>(state.range(0)));
-    for (auto _ : state) {
-        const auto stream = std::make_shared<transport::RecordingStream>();
-        serializer.serialize(event, 7, 1, stream, registry(), transport::SerializationContext());
-        benchmark::DoNotOptimize(stream->frames.data());
-    }
-}
-
-void writeTextEventBaseline(benchmark::State& state) {
-    const std::string text(static_cast<std::size_t>(state.range(0)), 'x');
-    for (auto _ : state) {
-        krutil::protobuf::TextBaseEvent message;
-        message.mutable_id()->set_hi(1);
-        message.mutable_id()->set_lo(2);
-        message.set_stream(krutil::protobuf::ERROR_STREAM);
-        message.set_text(text);
-        std::string bytes;
-        message.SerializeToString(&bytes);
-        benchmark::DoNotOptimize(bytes.data());
-    }
-}
-
-void readTextEvent(benchmark::State& state) {
-    const krutil::protobuf_serializer::TextBaseEventSerializer serializer;
-    const std::string bytes = textBytes(static_cast<std::size_t>(state.range(0)));
-    for (auto _ : state) {
-        const auto message = transport::makeMessage("krutil:TextBaseEvent", bytes);
-        benchmark::DoNotOptimize(serializer.deserialize(1, message, registry(), transport::SerializationContext()));
-    }
-}
-
-void readTextEventBaseline(benchmark::State& state) {
-    const std::string bytes = textBytes(static_cast<std::size_t>(state.range(0)));
-    for (auto _ : state) {
-        krutil::protobuf::TextBaseEvent message;
-        message.ParseFromString(bytes);
-        benchmark::DoNotOptimize(message);
-    }
-}
-
-korveldata::Array array(std::size_t bytes) {
-    return korveldata::ArrayFactory().createArray(korveldata::ElementType::Double, {bytes / 8});
-}
-
-void writeArray(benchmark::State& state) {
-    const krutil::protobuf_serializer::QDASerializer serializer({});
-    const korveldata::Array elements = array(static_cast<std::size_t>(state.range(0)));
-    for (auto _ : state) {
-        const auto stream = std::make_shared<transport::RecordingStream>();
-        serializer.serialize(elements, 7, 1, stream, registry(), transport::SerializationContext());
-        benchmark::DoNotOptimize(stream->frames.data());
-    }
-}
-
-void writeArrayBaseline(benchmark::State& state) {
-    const korveldata::Array elements = array(static_cast<std::size_t>(state.range(0)));
-    for (auto _ : state) {
-        std::unique_ptr<char[]> copy(new char[elements.sizeInBytes()]);
-        std::memcpy(copy.get(), elements.data(), elements.sizeInBytes());
-        benchmark::DoNotOptimize(copy.get());
-        benchmark::ClobberMemory();
-    }
-}
-
-void textToWire(benchmark::State& state) {
-    const std::u16string text(static_cast<std::size_t>(state.range(0)), u'x');
-    for (auto _ : state) {
-        benchmark::DoNotOptimize(msg_svc::protobuf::ustring_to_utf8(text));
-    }
-}
-
-void textToWireBaseline(benchmark::State& state) {
-    const std::u16string text(static_cast<std::size_t>(state.range(0)), u'x');
-    for (auto _ : state) {
-        std::u16string copy = text;
-        benchmark::DoNotOptimize(copy.data());
-    }
-}
-
-// Prints what the console prints, and remembers the times.
-class Ratios : public benchmark::ConsoleReporter {
-  public:
-    void ReportRuns(const std::vector<Run>& runs) override {
-        ConsoleReporter::ReportRuns(runs);
-        for (const Run& run : runs) {
-            if (run.run_type == Run::RT_Aggregate && run.aggregate_name == "median") {
-                times_[run.run_name.str()] = run.GetAdjustedCPUTime();
+// One object with all that measuring it needs: the frames that it becomes, and their messages with all fields filled.
+struct Subject {
+    Subject(const std::string& serializerName, const samples::Object& theObject)
+        : serializer(*registry()->find(serializerName)),
+          object(theObject),
+          frames(transport::writtenFrames(serializer, object, registry())) {
+        for (const auto& frame : frames) {
+            if (!frame.tagged) {
+                continue;
             }
+            const std::string& name = samples::sampleSet(frame.tag).message;
+            const auto* type = google::protobuf::DescriptorPool::generated_pool()->FindMessageTypeByName(name);
+            messages.emplace_back(google::protobuf::MessageFactory::generated_factory()->GetPrototype(type)->New());
+            messages.back()->ParsePartialFromString(frame.bytes);
         }
     }
 
-    void print() const {
-        std::printf("\n%-28s %8s\n", "median against its baseline", "ratio");
-        for (const auto& [name, time] : times_) {
-            const std::string::size_type slash = name.find('/');
-            const auto baseline = times_.find(name.substr(0, slash) + "Baseline" + name.substr(slash));
-            if (baseline != times_.end()) {
-                std::printf("%-28s %8.2f\n", name.c_str(), time / baseline->second);
-            }
-        }
-    }
-
-  private:
-    std::map<std::string, double> times_;
+    const transport::SerializerBase& serializer;
+    const samples::Object& object;
+    std::vector<transport::FrameContent> frames;
+    std::vector<std::unique_ptr<google::protobuf::Message>> messages;
 };
+
+void compareWrite(const std::string& name, const std::shared_ptr<const Subject>& subject) {
+    compare(
+        name, Clock::Cpu,
+        [subject](benchmark::State& state) {
+            for (auto _ : state) {
+                const auto stream = std::make_shared<transport::RecordingStream>();
+                samples::write(subject->serializer, subject->object, 7, 1, stream, registry(),
+                               transport::SerializationContext());
+                benchmark::DoNotOptimize(stream->frames.data());
+            }
+        },
+        [subject](benchmark::State& state) {
+            for (auto _ : state) {
+                for (const auto& filled : subject->messages) {
+                    const std::unique_ptr<google::protobuf::Message> message(filled->New());
+                    message->CopyFrom(*filled);
+                    std::string bytes;
+                    message->SerializePartialToString(&bytes);
+                    benchmark::DoNotOptimize(bytes.data());
+                }
+            }
+        });
+}
+
+// Reading consumes a message, so some are made ahead, off the clock.
+template <class Read>
+void readBatches(benchmark::State& state, const Subject& subject, const Read& read) {
+    constexpr std::size_t batch = 64;
+    std::vector<std::unique_ptr<transport::Message>> received(batch);
+    while (state.KeepRunningBatch(batch)) {
+        state.PauseTiming();
+        for (auto& message : received) {
+            message = transport::makeMessage(subject.frames);
+        }
+        state.ResumeTiming();
+        for (const auto& message : received) {
+            read(message);
+        }
+    }
+}
+
+void compareRead(const std::string& name, const std::shared_ptr<const Subject>& subject) {
+    compare(
+        name, Clock::Cpu,
+        [subject](benchmark::State& state) {
+            const auto own = static_cast<transport::FrameIndex>(subject->frames.size());
+            readBatches(state, *subject, [&](const std::unique_ptr<transport::Message>& message) {
+                benchmark::DoNotOptimize(
+                    samples::read(subject->serializer, own, message, registry(), transport::SerializationContext()));
+            });
+        },
+        [subject](benchmark::State& state) {
+            readBatches(state, *subject, [&](const std::unique_ptr<transport::Message>& message) {
+                auto filled = subject->messages.begin();
+                for (const auto& frame : subject->frames) {
+                    const std::unique_ptr<transport::Frame> taken = message->release(frame.index);
+                    if (frame.tagged) {
+                        const std::unique_ptr<google::protobuf::Message> parsed((*filled++)->New());
+                        parsed->ParsePartialFromArray(taken->data(), static_cast<int>(taken->size()));
+                        benchmark::DoNotOptimize(parsed.get());
+                    }
+                }
+            });
+        });
+}
+
+void addRows() {
+    for (const auto& set : samples::sampleSets()) {
+        const auto subject = std::make_shared<const Subject>(set.serializer, set.samples.front().object);
+        const std::string name = set.serializer + "/" + set.samples.front().name;
+        compareWrite("write/" + name, subject);
+        compareRead("read/" + name, subject);
+    }
+}
+
+void addLongText() {
+    using namespace krutil::io;
+    static const samples::Object event =
+        boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent>(boost::make_shared<TextBaseEvent>(
+            foundation::msg_svc::exchange::IDType(1, 2), StreamTypeEnum::ERROR_STREAM, std::u16string(4096, u'x')));
+    const auto subject = std::make_shared<const Subject>("krutil:TextBaseEvent", event);
+    compareWrite("write/krutil:TextBaseEvent/4096 characters", subject);
+    compareRead("read/krutil:TextBaseEvent/4096 characters", subject);
+}
+
+void addArrays() {
+    for (const std::size_t bytes : {std::size_t{1} << 10, std::size_t{1} << 20, std::size_t{1} << 26}) {
+        const auto elements = std::make_shared<const samples::Object>(
+            korveldata::ArrayFactory().createArray(korveldata::ElementType::Double, {bytes / 8}));
+        compare(
+            "array to frames/" + std::to_string(bytes) + " bytes", Clock::Cpu,
+            [elements](benchmark::State& state) {
+                const auto& serializer = *registry()->find("krutil:QDA");
+                for (auto _ : state) {
+                    const auto stream = std::make_shared<transport::RecordingStream>();
+                    samples::write(serializer, *elements, 7, 1, stream, registry(), transport::SerializationContext());
+                    benchmark::DoNotOptimize(stream->frames.data());
+                }
+            },
+            [elements](benchmark::State& state) {
+                const auto& array = std::get<korveldata::Array>(*elements);
+                for (auto _ : state) {
+                    const std::unique_ptr<char[]> copy(new char[array.sizeInBytes()]);
+                    std::memcpy(copy.get(), array.data(), array.sizeInBytes());
+                    benchmark::DoNotOptimize(copy.get());
+                    benchmark::ClobberMemory();
+                }
+            });
+    }
+}
+
+void compareText(const std::string& kind, const std::u16string& pattern) {
+    for (const std::size_t length : {std::size_t{16}, std::size_t{4096}}) {
+        std::u16string text;
+        while (text.size() < length) {
+            text += pattern;
+        }
+        const std::string utf8 = msg_svc::protobuf::ustring_to_utf8(text);
+        const std::string suffix = " text/" + std::to_string(length) + " characters";
+        const auto copyOf = [](const auto& source) {
+            return [source](benchmark::State& state) {
+                for (auto _ : state) {
+                    auto copy = source;
+                    benchmark::DoNotOptimize(copy.data());
+                }
+            };
+        };
+        compare(
+            "to UTF-8/" + kind + suffix, Clock::Cpu,
+            [text](benchmark::State& state) {
+                for (auto _ : state) {
+                    benchmark::DoNotOptimize(msg_svc::protobuf::ustring_to_utf8(text));
+                }
+            },
+            copyOf(text));
+        compare(
+            "to UTF-16/" + kind + suffix, Clock::Cpu,
+            [utf8](benchmark::State& state) {
+                for (auto _ : state) {
+                    benchmark::DoNotOptimize(msg_svc::protobuf::utf8_to_ustring(utf8));
+                }
+            },
+            copyOf(utf8));
+    }
+}
 
 }  // namespace
 
-BENCHMARK(writeTextEvent)->Arg(16)->Arg(4096)->Repetitions(5)->ReportAggregatesOnly();
-BENCHMARK(writeTextEventBaseline)->Arg(16)->Arg(4096)->Repetitions(5)->ReportAggregatesOnly();
-BENCHMARK(readTextEvent)->Arg(16)->Arg(4096)->Repetitions(5)->ReportAggregatesOnly();
-BENCHMARK(readTextEventBaseline)->Arg(16)->Arg(4096)->Repetitions(5)->ReportAggregatesOnly();
-BENCHMARK(writeArray)->Arg(1024)->Arg(1 << 20)->Arg(1 << 26)->Repetitions(5)->ReportAggregatesOnly();
-BENCHMARK(writeArrayBaseline)->Arg(1024)->Arg(1 << 20)->Arg(1 << 26)->Repetitions(5)->ReportAggregatesOnly();
-BENCHMARK(textToWire)->Arg(16)->Arg(4096)->Repetitions(5)->ReportAggregatesOnly();
-BENCHMARK(textToWireBaseline)->Arg(16)->Arg(4096)->Repetitions(5)->ReportAggregatesOnly();
-
-int main(int argc, char** argv) {
-    benchmark::Initialize(&argc, argv);
-    if (benchmark::ReportUnrecognizedArguments(argc, argv)) {
-        return 2;
-    }
-    Ratios reporter;
-    benchmark::RunSpecifiedBenchmarks(&reporter);
-    reporter.print();
-    return 0;
+void addSerializerBenches() {
+    addRows();
+    addLongText();
+    addArrays();
+    compareText("ASCII", u"x");
+    compareText("Greek", u"\u03b1\u03b2");
 }
+
+}  // namespace bench

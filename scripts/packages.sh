@@ -15,7 +15,7 @@ build_packages=(
     python3-dev pybind11-dev
     libcli11-dev nlohmann-json3-dev libedit-dev
 )
-test_packages=(libgtest-dev libgmock-dev)
+test_packages=(libgtest-dev libgmock-dev libbenchmark-dev)
 clang_packages=(clang libclang-rt-14-dev)
 tidy_packages=(clang-tidy)
 

@@ -1,0 +1,22 @@
+// Measurements in pairs: what the library does, and beside it, in the same run, the least that the same work can cost.
+#pragma once
+
+#include <benchmark/benchmark.h>
+
+#include <functional>
+#include <string>
+
+namespace bench {
+
+/// Which clock tells how long one iteration took.
+enum class Clock {
+    Cpu,   ///< of the thread that measures
+    Wall,  ///< for work that other threads share
+};
+
+using Measurement = std::function<void(benchmark::State&)>;
+
+/// Registers `ours` as NAME and `baseline` as NAME/baseline. The report ends with the ratio of their medians.
+void compare(const std::string& name, Clock clock, Measurement ours, Measurement baseline);
+
+}  // namespace bench

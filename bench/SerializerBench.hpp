@@ -1,0 +1,15 @@
+// What serializers cost beside bare Protocol Buffers calls on the same messages.
+#pragma once
+
+namespace bench {
+
+/// Registers, for the typical sample of every serializer,
+///
+///     write/NAME   the object to frames             beside  filling the same messages and serializing them
+///     read/NAME    received frames to the object    beside  parsing the same messages from the same frames
+///
+/// and, for sizes that the samples do not have, text events, arrays beside a copy of their bytes, and the conversion of
+/// text beside a copy of it.
+void addSerializerBenches();
+
+}  // namespace bench
