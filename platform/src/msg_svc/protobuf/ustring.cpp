@@ -2,7 +2,7 @@
 
 #include <unicode/ustring.h>
 
-#include <algorithm>
+#include <array>
 #include <cstdint>
 #include <cstring>
 #include <limits>
@@ -21,47 +21,64 @@ std::int32_t checkedLength(std::size_t length, const char* where) {
     return static_cast<std::int32_t>(length);
 }
 
-// Length of the leading run of ASCII, a multiple of the step but for the last units.
-std::size_t asciiPrefix(const char16_t* text, std::size_t length) {
+// ASCII is most of what travels. It is looked for and converted in blocks of constant size, which compilers turn into
+// vector instructions without being asked for more than -O2.
+constexpr std::size_t block = 16;
+
+// Length of the leading run of code units without the bits of `beyondAscii`, which is repeated through a word.
+template <class Unit>
+std::size_t asciiPrefix(const Unit* text, std::size_t length, std::uint64_t beyondAscii) {
+    std::array<std::uint64_t, block * sizeof(Unit) / sizeof(std::uint64_t)> words;
     std::size_t i = 0;
-    for (; i + 16 <= length; i += 16) {
-        char16_t any = 0;
-        for (std::size_t j = 0; j < 16; ++j) {
-            any = static_cast<char16_t>(any | text[i + j]);
+    for (; i + block <= length; i += block) {
+        std::memcpy(words.data(), text + i, sizeof words);
+        std::uint64_t any = 0;
+        for (const std::uint64_t word : words) {
+            any |= word;
         }
-        if (any > 0x7F) {
+        if ((any & beyondAscii) != 0) {
             break;
         }
     }
-    while (i < length && text[i] <= 0x7F) {
+    while (i < length && static_cast<char16_t>(text[i]) <= 0x7F) {
         ++i;
     }
     return i;
 }
 
-std::size_t asciiPrefix(const char* text, std::size_t length) {
+std::size_t asciiPrefix(const std::u16string& text) {
+    return asciiPrefix(text.data(), text.size(), 0xFF80FF80FF80FF80ULL);
+}
+
+std::size_t asciiPrefix(const std::string& text) {
+    return asciiPrefix(text.data(), text.size(), 0x8080808080808080ULL);
+}
+
+// Copies `length` code units that are ASCII.
+template <class From, class To>
+void convertAscii(const From* from, std::size_t length, To* to) {
+    std::array<From, block> in;
+    std::array<To, block> out;
     std::size_t i = 0;
-    for (; i + 8 <= length; i += 8) {
-        std::uint64_t word = 0;
-        std::memcpy(&word, text + i, sizeof word);
-        if ((word & 0x8080808080808080ULL) != 0) {
-            break;
+    for (; i + block <= length; i += block) {
+        std::memcpy(in.data(), from + i, sizeof in);
+        for (std::size_t j = 0; j < block; ++j) {
+            out[j] = static_cast<To>(in[j]);
         }
+        std::memcpy(to + i, out.data(), sizeof out);
     }
-    while (i < length && static_cast<signed char>(text[i]) >= 0) {
-        ++i;
+    for (; i < length; ++i) {
+        to[i] = static_cast<To>(from[i]);
     }
-    return i;
 }
 
 }  // namespace
 
 std::string ustring_to_utf8(const std::basic_string<char16_t>& text) {
     checkedLength(text.size(), "ustring_to_utf8");
-    const std::size_t ascii = asciiPrefix(text.data(), text.size());
+    const std::size_t ascii = asciiPrefix(text);
     std::string utf8(ascii, '\0');
-    std::transform(text.begin(), text.begin() + static_cast<std::ptrdiff_t>(ascii), utf8.begin(),
-                   [](char16_t unit) { return static_cast<char>(unit); });
+    convertAscii(text.data(), ascii, utf8.data());
     if (ascii == text.size()) {
         return utf8;
     }
@@ -81,11 +98,10 @@ std::string ustring_to_utf8(const std::basic_string<char16_t>& text) {
 
 std::basic_string<char16_t> utf8_to_ustring(const std::string& utf8) {
     checkedLength(utf8.size(), "utf8_to_ustring");
-    const std::size_t ascii = asciiPrefix(utf8.data(), utf8.size());
+    const std::size_t ascii = asciiPrefix(utf8);
     // UTF-16 never has more units than UTF-8 has bytes, so one allocation serves both steps.
     std::u16string text(utf8.size(), u'\0');
-    std::transform(utf8.begin(), utf8.begin() + static_cast<std::ptrdiff_t>(ascii), text.begin(),
-                   [](char byte) { return static_cast<char16_t>(byte); });
+    convertAscii(utf8.data(), ascii, text.data());
     if (ascii == utf8.size()) {
         return text;
     }
