@@ -17,12 +17,10 @@ namespace {
     throw ProtocolViolation(what + ": expected " + expected + ", got " + got);
 }
 
-void checkLimit(const char* limit, std::uint64_t accepted, const std::string& unit, const std::string& where,
-                std::uint64_t got) {
-    if (got > accepted) {
-        refuse(where + " exceeds the limit \"" + limit + "\"", "at most " + std::to_string(accepted) + " " + unit,
-               std::to_string(got));
-    }
+[[noreturn]] void refuseSize(const char* limit, std::uint64_t accepted, const char* unit, const std::string& where,
+                             std::uint64_t got) {
+    refuse(where + " exceeds the limit \"" + limit + "\"", "at most " + std::to_string(accepted) + " " + unit,
+           std::to_string(got));
 }
 
 std::string frameName(framing::FrameIndex index) {
@@ -134,36 +132,41 @@ void MessageReader::checkControlHeader() const {
 void MessageReader::checkMessageHeader() const {
     const FrameHeader& header = *header_;
     const framing::FrameIndex expected = frames_.size() + 1;
-    const std::string name = frameName(expected);
     if (header.index != expected) {
         refuse("frame index", std::to_string(expected), std::to_string(header.index));
     }
     if (!frames_.empty() && header.stream != frames_.front()->streamID()) {
-        refuse("stream ID of " + name,
+        refuse("stream ID of " + frameName(expected),
                std::to_string(frames_.front()->streamID()) + " as in the frames before it in its message",
                std::to_string(header.stream));
     }
-    checkLimit("frames", limits_.frames, "frames", "number of frames of a message", expected);
-    const std::string frame = name + " on stream " + std::to_string(header.stream);
+    if (expected > limits_.frames) {
+        refuseSize("frames", limits_.frames, "frames", "number of frames of a message", expected);
+    }
+    // For what is wrong only: well-formed frames cost no text.
+    const auto frame = [&] { return frameName(expected) + " on stream " + std::to_string(header.stream); };
     if (header.is(FrameKind::Data)) {
         if (header.tagSize != 0) {
-            refuse("tag of a data frame (" + frame + ")", "none", std::to_string(header.tagSize) + " bytes");
+            refuse("tag of a data frame (" + frame() + ")", "none", std::to_string(header.tagSize) + " bytes");
         }
     } else {
         if (header.tagSize == 0) {
-            refuse("tag of a tagged frame (" + frame + ")", "at least 1 byte", "none");
+            refuse("tag of a tagged frame (" + frame() + ")", "at least 1 byte", "none");
         }
-        checkLimit("tag", limits_.tag, "bytes", "tag of " + frame, header.tagSize);
-        if (header.contentSize > std::max(limits_.taggedFrame, limits_.arrayMessage)) {
-            const bool array = limits_.arrayMessage > limits_.taggedFrame;
-            checkLimit(array ? "arrayMessage" : "taggedFrame", std::max(limits_.taggedFrame, limits_.arrayMessage),
-                       "bytes", "content of " + frame, header.contentSize);
+        if (header.tagSize > limits_.tag) {
+            refuseSize("tag", limits_.tag, "bytes", "tag of " + frame(), header.tagSize);
+        }
+        const bool array = limits_.arrayMessage > limits_.taggedFrame;
+        const std::uint64_t accepted = array ? limits_.arrayMessage : limits_.taggedFrame;
+        if (header.contentSize > accepted) {
+            refuseSize(array ? "arrayMessage" : "taggedFrame", accepted, "bytes", "content of " + frame(),
+                       header.contentSize);
         }
     }
     // Written as a difference, so that no claim can make a sum wrap around.
     const std::uint64_t room = limits_.message - std::min(limits_.message, messageBytes_ + header.tagSize);
     if (header.contentSize > room || messageBytes_ + header.tagSize > limits_.message) {
-        refuse("message with " + frame + " exceeds the limit \"message\"",
+        refuse("message with " + frame() + " exceeds the limit \"message\"",
                "at most " + std::to_string(limits_.message) + " bytes",
                std::to_string(messageBytes_ + header.tagSize) + " bytes and a content of " +
                    std::to_string(header.contentSize));
@@ -179,8 +182,11 @@ void MessageReader::allocateContent() {
         }
         if (header_->is(FrameKind::Tagged) && tagHave_ == tag_.size()) {
             const bool array = tag_ == arrayTag_;
-            checkLimit(array ? "arrayMessage" : "taggedFrame", array ? limits_.arrayMessage : limits_.taggedFrame,
-                       "bytes", "content of " + frameName(header_->index) + " with tag " + quoted(tag_), size);
+            const std::uint64_t accepted = array ? limits_.arrayMessage : limits_.taggedFrame;
+            if (size > accepted) {
+                refuseSize(array ? "arrayMessage" : "taggedFrame", accepted, "bytes",
+                           "content of " + frameName(header_->index) + " with tag " + quoted(tag_), size);
+            }
         }
         content_ = {std::unique_ptr<char[], std::function<void(char*)>>(new char[size], std::default_delete<char[]>()),
                     size};

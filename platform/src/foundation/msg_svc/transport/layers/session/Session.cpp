@@ -58,6 +58,9 @@ using RootSerializer = serialization::SerializerAPI<T, Shared<T>, Shared<T>>;
 constexpr std::chrono::milliseconds lingerTime{1'000};
 constexpr std::chrono::milliseconds writeFailureGrace{1'000};
 
+// Reads between two turns of the event loop.
+constexpr int readsInATurn = 16;
+
 std::string errorText(int error) {
     return std::generic_category().message(error);
 }
@@ -187,7 +190,9 @@ class Session::Impl {
 
     // I/O thread.
     void read();
-    void onRead(const ErrorCode& error, std::size_t count);
+    std::array<asio::mutable_buffer, 3> wantedPieces();
+    void onRead(ErrorCode error, std::size_t count);
+    bool takeRead(const ErrorCode& error, std::size_t count);
     void onEndOfStream();
     void take(MessageReader::Item item);
     void takeMessage(std::vector<std::unique_ptr<framing::Frame>> frames);
@@ -252,7 +257,7 @@ Session::Impl::Impl(OwnedDescriptor& in, OwnedDescriptor& out, SessionConfig ses
     in.release();
     out_.assign(out.get());
     out.release();
-    in_.native_non_blocking(true);
+    in_.non_blocking(true);
     updateEvents();
 }
 
@@ -332,29 +337,36 @@ void Session::Impl::checkFrames(const std::vector<std::unique_ptr<framing::Frame
 
 void Session::Impl::checkPeerLimits(const std::vector<std::unique_ptr<framing::Frame>>& frames) const {
     const Limits& limits = settlement.peer.limits;
-    const std::string& root = dynamic_cast<const framing::TaggedFrame&>(*frames.back()).tag();
-    const auto check = [&](const char* limit, std::uint64_t accepted, std::uint64_t size, const std::string& what,
-                           const std::string& unit) {
-        if (size > accepted) {
-            throw LimitExceeded(quoted(root) + " is larger than " + peerName(config.role) + " accepts: its limit \"" +
-                                limit + "\" is " + std::to_string(accepted) + " " + unit + ", " + what + " " +
-                                std::to_string(size));
-        }
+    const auto refuse = [&](const char* limit, std::uint64_t accepted, std::uint64_t size, const std::string& what,
+                            const char* unit) {
+        const std::string& root = dynamic_cast<const framing::TaggedFrame&>(*frames.back()).tag();
+        throw LimitExceeded(quoted(root) + " is larger than " + peerName(config.role) + " accepts: its limit \"" +
+                            limit + "\" is " + std::to_string(accepted) + " " + unit + ", " + what + " has " +
+                            std::to_string(size));
     };
-    check("frames", limits.frames, frames.size(), "the message has", "frames");
+    if (frames.size() > limits.frames) {
+        refuse("frames", limits.frames, frames.size(), "the message", "frames");
+    }
     std::uint64_t total = 0;
     for (const auto& frame : frames) {
-        const std::string name = "frame " + std::to_string(frame->index());
         total += frame->size();
         if (const auto* const tagged = dynamic_cast<const framing::TaggedFrame*>(frame.get())) {
+            if (tagged->tag().size() > limits.tag) {
+                refuse("tag", limits.tag, tagged->tag().size(), "the tag of frame " + std::to_string(frame->index()),
+                       "bytes");
+            }
             const bool array = tagged->tag() == arrayTag;
-            check("tag", limits.tag, tagged->tag().size(), "the tag of " + name + " has", "bytes");
-            check(array ? "arrayMessage" : "taggedFrame", array ? limits.arrayMessage : limits.taggedFrame,
-                  frame->size(), "the content of " + name + " has", "bytes");
+            const std::uint64_t accepted = array ? limits.arrayMessage : limits.taggedFrame;
+            if (frame->size() > accepted) {
+                refuse(array ? "arrayMessage" : "taggedFrame", accepted, frame->size(),
+                       "the content of frame " + std::to_string(frame->index()), "bytes");
+            }
             total += tagged->tag().size();
         }
     }
-    check("message", limits.message, total, "the message has", "bytes");
+    if (total > limits.message) {
+        refuse("message", limits.message, total, "the message", "bytes");
+    }
 }
 
 void Session::Impl::admit(framing::StreamID stream, const exchange::Message&) {
@@ -593,25 +605,42 @@ void Session::Impl::read() {
     if (finishing_ || readingStopped_) {
         return;
     }
-    // A fixed number of buffers, unused ones empty: no allocation for each read.
+    in_.async_read_some(wantedPieces(), [this](const ErrorCode& error, std::size_t count) { onRead(error, count); });
+}
+
+// A fixed number of buffers, unused ones empty: no allocation for each read.
+std::array<asio::mutable_buffer, 3> Session::Impl::wantedPieces() {
     std::array<asio::mutable_buffer, 3> buffers;
     const auto wanted = reader_.buffers();
     std::transform(wanted.begin(), wanted.end(), buffers.begin(),
                    [](const iovec& piece) { return asio::mutable_buffer(piece.iov_base, piece.iov_len); });
-    in_.async_read_some(buffers, [this](const ErrorCode& error, std::size_t count) { onRead(error, count); });
+    return buffers;
 }
 
-void Session::Impl::onRead(const ErrorCode& error, std::size_t count) {
+// What has arrived since is read without a turn of the event loop in between, but no more than so many times: writes
+// and timers wait for that.
+void Session::Impl::onRead(ErrorCode error, std::size_t count) {
+    for (int reads = 0; takeRead(error, count) && reads < readsInATurn; ++reads) {
+        count = in_.read_some(wantedPieces(), error);
+        if (error == asio::error::would_block) {
+            break;
+        }
+    }
+    read();
+}
+
+// False when there is nothing more to read.
+bool Session::Impl::takeRead(const ErrorCode& error, std::size_t count) {
     if (finishing_ || error == asio::error::operation_aborted) {
-        return;
+        return false;
     }
     if (error == asio::error::eof || error == asio::error::connection_reset) {
         onEndOfStream();
-        return;
+        return false;
     }
     if (error) {
         finish({SessionEnd::Reason::Lost, "cannot read from the stream: " + error.message()}, {});
-        return;
+        return false;
     }
     try {
         reader_.commit(count);
@@ -629,12 +658,10 @@ void Session::Impl::onRead(const ErrorCode& error, std::size_t count) {
         arriving_ = reader_.contentSize();
     } catch (const std::exception& failure) {
         violation(failure.what());
-        return;
     } catch (...) {
         violation("the program's handler failed with an exception of an unknown type");
-        return;
     }
-    read();
+    return !finishing_ && !abortRequested_;
 }
 
 void Session::Impl::onEndOfStream() {
@@ -695,17 +722,19 @@ Shared<T> Session::Impl::rebuild(const RootSerializer<T>& serializer,
     // Indexes of a message start at 1.
     frames.insert(frames.begin(), nullptr);
     const auto message = std::make_unique<message::Message>(std::move(frames));
-    const std::string what = "cannot read " + quoted(serializer.name()) + ": ";
+    const auto refuse = [&](const std::string& why) {
+        throw ProtocolViolation("cannot read " + quoted(serializer.name()) + ": " + why);
+    };
     Shared<T> object;
     try {
         object = serializer.deserialize(root, message, settlement.registry, serialization::SerializationContext());
     } catch (const std::exception& error) {
-        throw ProtocolViolation(what + error.what());
+        refuse(error.what());
     } catch (...) {
-        throw ProtocolViolation(what + "exception of an unknown type");
+        refuse("exception of an unknown type");
     }
     if (!object) {
-        throw ProtocolViolation(what + "its serializer returned no object");
+        refuse("its serializer returned no object");
     }
     return object;
 }
@@ -717,29 +746,30 @@ void Session::Impl::takeMessage(std::vector<std::unique_ptr<framing::Frame>> fra
         }
     }
     const framing::StreamID stream = frames.back()->streamID();
-    const std::string where = "message on stream " + std::to_string(stream) + ": ";
     const auto* const root = dynamic_cast<const framing::TaggedFrame*>(frames.back().get());
+    const auto refuse = [&](const std::string& before, const std::string& after) {
+        throw ProtocolViolation("message on stream " + std::to_string(stream) + ": " + before +
+                                (root != nullptr ? quoted(root->tag()) : std::string()) + after);
+    };
     if (root == nullptr) {
-        throw ProtocolViolation(where + "expected a tagged frame as its last one, got a data frame");
+        refuse("expected a tagged frame as its last one, got a data frame", {});
     }
-    const std::string tag = quoted(root->tag());
     std::shared_ptr<const serialization::SerializerBase> serializer;
     try {
         serializer = settlement.registry->find(root->tag());
     } catch (const std::out_of_range&) {
-        throw ProtocolViolation(where + "no serializer is registered for its tag " + tag);
+        refuse("no serializer is registered for its tag ", {});
     }
     const bool client = config.role == Role::Client;
     const auto* const messages = dynamic_cast<const RootSerializer<exchange::Message>*>(serializer.get());
     const auto* const replies = dynamic_cast<const RootSerializer<exchange::Reply>*>(serializer.get());
     const auto* const events = dynamic_cast<const RootSerializer<eventmgr::BaseEvent>*>(serializer.get());
     if (messages == nullptr && replies == nullptr && events == nullptr) {
-        throw ProtocolViolation(where + tag + " is only ever referred to and cannot be the last frame");
+        refuse({}, " is only ever referred to and cannot be the last frame");
     }
     const bool capabilities = serializer->type() == typeid(::krutil::capabilities_api::CapabilitiesChanged);
     if (client ? messages != nullptr : replies != nullptr || (events != nullptr && !capabilities)) {
-        throw ProtocolViolation(where + tag + " goes to " + (client ? "an engine" : "a client") + ", not to " +
-                                (client ? "a client" : "an engine"));
+        refuse({}, client ? " goes to an engine, not to a client" : " goes to a client, not to an engine");
     }
     bool known = false;
     {
@@ -747,13 +777,13 @@ void Session::Impl::takeMessage(std::vector<std::unique_ptr<framing::Frame>> fra
         known = open_.contains(stream);
     }
     if (messages != nullptr && (stream == 0 || known)) {
-        throw ProtocolViolation(where + tag + " begins an exchange: expected a stream ID that is not 0 and not in use");
+        refuse({}, " begins an exchange: expected a stream ID that is not 0 and not in use");
     }
     if (replies != nullptr && !known) {
-        throw ProtocolViolation(where + tag + " is a reply: expected the stream ID of an open exchange");
+        refuse({}, " is a reply: expected the stream ID of an open exchange");
     }
     if (events != nullptr && stream != 0 && !known) {
-        throw ProtocolViolation(where + tag + " is an event: expected the stream ID 0 or that of an open exchange");
+        refuse({}, " is an event: expected the stream ID 0 or that of an open exchange");
     }
     if (config.check) {
         for (const auto& frame : frames) {
