@@ -4,8 +4,8 @@
 #include <google/protobuf/descriptor.h>
 #include <gtest/gtest.h>
 
+#include <filesystem>
 #include <map>
-#include <set>
 #include <string>
 #include <vector>
 
@@ -18,6 +18,8 @@ using google::protobuf::Descriptor;
 using google::protobuf::DescriptorPool;
 using google::protobuf::EnumDescriptor;
 using google::protobuf::FieldDescriptor;
+
+const std::string prefix = "krutil.protobuf.";
 
 const std::map<std::string, std::vector<std::string>>& messages() {
     static const std::map<std::string, std::vector<std::string>> expected{
@@ -156,6 +158,49 @@ const std::map<std::string, std::map<std::string, int>>& enums() {
     return expected;
 }
 
+// Syntax and imports of each file: what a component that compiles one of them must have.
+const std::map<std::string, std::vector<std::string>>& files() {
+    static const std::map<std::string, std::vector<std::string>> expected{
+        {"CapabilitiesChanged", {"proto3", "krutil.protobuf.Capability"}},
+        {"Capability", {"proto3"}},
+        {"DebugLoopEvent", {"proto3", "msg_svc.protobuf.BaseEvent", "msg_svc.protobuf.IDType"}},
+        {"EvalIIP", {"proto3", "krutil.protobuf.IIP", "krutil.protobuf.WorkspaceHolder"}},
+        {"ExecutionStatus", {"proto3"}},
+        {"FEvalIIP", {"proto3", "krutil.protobuf.IIP"}},
+        {"FEvalResult", {"proto3", "krutil.protobuf.IIPResult"}},
+        {"IIP", {"proto3", "krutil.protobuf.SinkTraits"}},
+        {"IIPCancelMessage", {"proto3", "msg_svc.protobuf.IDType"}},
+        {"IIPCancelReply", {"proto3"}},
+        {"IIPEnqueueMessage", {"proto3", "msg_svc.protobuf.IDType", "krutil.protobuf.Capability"}},
+        {"IIPReply", {"proto3", "msg_svc.protobuf.IDType"}},
+        {"IIPResult", {"proto3", "msg_svc.protobuf.IDType", "krutil.protobuf.RuntimeException"}},
+        {"IIPStateEvent", {"proto3", "msg_svc.protobuf.IDType"}},
+        {"IssuedEnabledWarningEvent", {"proto2", "krutil.protobuf.IssuedWarningEvent"}},
+        {"IssuedWarningEvent", {"proto2", "msg_svc.protobuf.IDType", "krutil.protobuf.Warning"}},
+        {"OneVariableGetMessage", {"proto3", "msg_svc.protobuf.IDType"}},
+        {"PrintableErrorEvent", {"proto3", "msg_svc.protobuf.IDType", "krutil.protobuf.RuntimeException"}},
+        {"PrintfArgument", {"proto2"}},
+        {"QVMShutdownEvent", {"proto3"}},
+        {"RuntimeException", {"proto3", "krutil.protobuf.ExecutionStatus"}},
+        {"SinkTextEvent",
+         {"proto3", "krutil.protobuf.StreamType", "msg_svc.protobuf.BaseEvent", "msg_svc.protobuf.IDType"}},
+        {"SinkTraits", {"proto3"}},
+        {"StreamType", {"proto3"}},
+        {"TextBaseEvent",
+         {"proto3", "krutil.protobuf.StreamType", "msg_svc.protobuf.BaseEvent", "msg_svc.protobuf.IDType"}},
+        {"VariableDataMessages", {"proto3", "krutil.protobuf.VariableStatusEnum"}},
+        {"VariableStatusEnum", {"proto3"}},
+        {"VariablesGetMessage", {"proto3", "msg_svc.protobuf.IDType"}},
+        {"VariablesGetReply", {"proto3", "krutil.protobuf.VariableDataMessages"}},
+        {"VariablesSetMessage", {"proto3", "msg_svc.protobuf.IDType"}},
+        {"Warning", {"proto2", "krutil.protobuf.PrintfArgument", "krutil.protobuf.WarningStackFrame"}},
+        {"WarningStackFrame", {"proto2"}},
+        {"WorkspaceDeletedMessage", {"proto3", "msg_svc.protobuf.IDType"}},
+        {"WorkspaceHolder", {"proto3", "msg_svc.protobuf.IDType", "krutil.protobuf.VariableDataMessages"}},
+    };
+    return expected;
+}
+
 std::string typeOf(const FieldDescriptor& field) {
     if (field.message_type() != nullptr) {
         return field.message_type()->full_name();
@@ -199,29 +244,58 @@ TEST(DescriptorPoolTest, EveryEnumIsFoundByItsFullNameWithItsValues) {
     }
 }
 
-// Each message group is a file of its own, which other components import by name.
-TEST(DescriptorPoolTest, EverySchemaFileIsLoaded) {
-    // Messages that are not in a file of their own name.
+TEST(DescriptorPoolTest, EveryFileHasItsSyntaxAndItsImports) {
+    for (const auto& [name, expected] : files()) {
+        const auto* file = DescriptorPool::generated_pool()->FindFileByName(prefix + name + ".proto");
+        ASSERT_NE(file, nullptr) << name;
+        EXPECT_EQ(file->package(), "krutil.protobuf");
+        std::vector<std::string> found{google::protobuf::FileDescriptor::SyntaxName(file->syntax())};
+        for (int i = 0; i < file->dependency_count(); ++i) {
+            const std::string& imported = file->dependency(i)->name();
+            found.push_back(imported.substr(0, imported.rfind('.')));
+        }
+        EXPECT_EQ(found, expected) << name;
+    }
+}
+
+// Each message group is a file of its own, which other components import by name. Starts from the files, so that no
+// new one stays out of the lists above.
+TEST(DescriptorPoolTest, EverySchemaFileIsLoadedAndIsListedWithAllThatItHolds) {
+    // What is not in a file of its own name.
     const std::map<std::string, std::string> shared{{"StackFrame", "RuntimeException"},
                                                     {"VariableData", "VariableDataMessages"},
                                                     {"VariableEntry", "VariableDataMessages"},
                                                     {"ReplyData", "VariableDataMessages"},
-                                                    {"ReplyEntry", "VariableDataMessages"}};
-    const auto* pool = DescriptorPool::generated_pool();
-    std::size_t count = 0;
-    std::set<const google::protobuf::FileDescriptor*> files;
-    for (const auto& [message, fields] : messages()) {
-        const Descriptor* found = pool->FindMessageTypeByName("krutil.protobuf." + message);
-        ASSERT_NE(found, nullptr) << message;
-        const std::string& file = shared.contains(message) ? shared.at(message) : message;
-        EXPECT_EQ(found->file()->name(), "krutil.protobuf." + file + ".proto");
-        if (files.insert(found->file()).second) {
-            count += static_cast<std::size_t>(found->file()->message_type_count());
+                                                    {"ReplyEntry", "VariableDataMessages"},
+                                                    {"IIPStateEventType", "IIPStateEvent"},
+                                                    {"WhenToDequeue", "IIPEnqueueMessage"},
+                                                    {"IqmStreamID", "IIP"},
+                                                    {"CodeType", "EvalIIP"},
+                                                    {"DebugLoopEvent.State", "DebugLoopEvent"},
+                                                    {"InputRequester", "DebugLoopEvent"},
+                                                    {"CancelStatus", "IIPCancelReply"},
+                                                    {"VariableStatus", "VariableStatusEnum"},
+                                                    {"VariablesSetMessage.OpCode", "VariablesSetMessage"}};
+    const auto check = [&shared](const auto& type) {
+        const std::string name = type.full_name().substr(prefix.size());
+        EXPECT_TRUE(messages().contains(name) || enums().contains(name))
+            << name << " needs its row of `messages` or `enums` in this file.";
+        EXPECT_EQ(type.file()->name(), prefix + (shared.contains(name) ? shared.at(name) : name) + ".proto");
+    };
+    for (const auto& entry : std::filesystem::directory_iterator(KRUTIL_PROTO_DIR)) {
+        const auto* file = DescriptorPool::generated_pool()->FindFileByName(entry.path().filename());
+        ASSERT_NE(file, nullptr) << entry.path();
+        const std::string name = entry.path().stem().string().substr(prefix.size());
+        EXPECT_TRUE(files().contains(name)) << name << " needs its row of `files` in this file.";
+        for (int i = 0; i < file->enum_type_count(); ++i) {
+            check(*file->enum_type(i));
         }
-    }
-    EXPECT_EQ(count, messages().size()) << "the files define messages that are not listed here";
-    for (const char* file : {"Capability", "ExecutionStatus", "StreamType", "VariableStatusEnum"}) {
-        EXPECT_NE(pool->FindFileByName("krutil.protobuf." + std::string(file) + ".proto"), nullptr) << file;
+        for (int i = 0; i < file->message_type_count(); ++i) {
+            check(*file->message_type(i));
+            for (int k = 0; k < file->message_type(i)->enum_type_count(); ++k) {
+                check(*file->message_type(i)->enum_type(k));
+            }
+        }
     }
 }
 

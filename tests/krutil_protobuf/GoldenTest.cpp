@@ -32,7 +32,9 @@ TEST(GoldenTest, GoldenBytesReadAsTheSamples) {
     const auto registry = transport::sessionRegistry();
     for (const auto& serializer : registry->serializers()) {
         const samples::SampleSet& set = samples::sampleSet(serializer->name());
-        const auto parsed = goldens::parse(contentOf(goldens::fileOf(serializer->name())));
+        const auto file = goldens::fileOf(serializer->name());
+        ASSERT_TRUE(std::filesystem::exists(file)) << file << advice;
+        const auto parsed = goldens::parse(contentOf(file));
         EXPECT_EQ(parsed.size(), set.samples.size()) << serializer->name() << advice;
         for (const samples::Sample& sample : set.samples) {
             ASSERT_TRUE(parsed.contains(sample.name)) << serializer->name() << " " << sample.name << advice;

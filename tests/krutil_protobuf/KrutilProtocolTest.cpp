@@ -45,6 +45,7 @@ using transport::SerializerBase;
 using Version = std::pair<unsigned int, unsigned int>;
 
 const std::unordered_map<std::string, std::string> features{{"ZEROCOPY", "enable"}};
+constexpr Version current{1, 0};
 constexpr Version refused{0xFFFF, 0xFFFF};
 
 std::vector<std::string> names(const Registry& registry) {
@@ -65,7 +66,7 @@ class OccupyingSerializer : public SerializerBase {
 
 TEST(KrutilProtocolTest, NameAndVersion) {
     EXPECT_EQ(KrutilProtocol::protocolName, "krutil");
-    EXPECT_EQ(KrutilProtocol::protocolVersion, Version(1, 0));
+    EXPECT_EQ(KrutilProtocol::protocolVersion, current);
 }
 
 TEST(KrutilProtocolTest, TheConfigurationOffersZeroCopyEnabledThenDisabledWhateverTheVariableHolds) {
@@ -105,11 +106,11 @@ int checkReadsOfTheVariable() {
     if (zeroCopyReads != before) {
         return 1;
     }
-    KrutilProtocol::protocolInitializer(registry, {1, 0}, features);
+    KrutilProtocol::protocolInitializer(registry, current, features);
     if (zeroCopyReads != before + 1) {
         return 2;
     }
-    KrutilProtocol::protocolInitializer(std::make_shared<Registry>(), {1, 0}, features);
+    KrutilProtocol::protocolInitializer(std::make_shared<Registry>(), current, features);
     return zeroCopyReads == before + 1 ? 0 : 3;
 }
 
@@ -118,9 +119,9 @@ TEST(KrutilProtocolDeathTest, TheZeroCopyVariableIsReadOnceAndNotForOtherVersion
     EXPECT_EXIT(std::_Exit(checkReadsOfTheVariable()), testing::ExitedWithCode(0), "");
 }
 
-TEST(KrutilProtocolTest, VersionOneZeroIsReturned) {
+TEST(KrutilProtocolTest, TheVersionIsReturned) {
     const auto registry = std::make_shared<Registry>();
-    EXPECT_EQ(KrutilProtocol::protocolInitializer(registry, {1, 0}, features), Version(1, 0));
+    EXPECT_EQ(KrutilProtocol::protocolInitializer(registry, current, features), current);
     EXPECT_FALSE(registry->serializers().empty());
 }
 
@@ -150,7 +151,7 @@ TEST(KrutilProtocolTest, ARegistryThatRefusesOneKeepsThoseBeforeIt) {
     for (std::size_t k = 0; k < all.size(); ++k) {
         const auto registry = std::make_shared<Registry>();
         registry->insert(std::make_shared<OccupyingSerializer>(all[k]));
-        EXPECT_THROW(KrutilProtocol::protocolInitializer(registry, {1, 0}, features), std::invalid_argument);
+        EXPECT_THROW(KrutilProtocol::protocolInitializer(registry, current, features), std::invalid_argument);
         std::vector<std::string> expected{all[k]};
         expected.insert(expected.end(), all.begin(), all.begin() + static_cast<std::ptrdiff_t>(k));
         EXPECT_EQ(names(*registry), expected);
@@ -164,7 +165,7 @@ TEST(KrutilProtocolTest, ARegistryRefusesADuplicateNameAndADuplicateType) {
     registry->insert(std::make_shared<OccupyingSerializer>("test:One"));
     EXPECT_THROW(registry->insert(std::make_shared<OccupyingSerializer>("test:Two")), std::invalid_argument);
     EXPECT_THROW(registry->find("test:Two"), std::out_of_range);
-    EXPECT_THROW(KrutilProtocol::protocolInitializer(registry, {1, 0}, features), std::invalid_argument);
+    EXPECT_THROW(KrutilProtocol::protocolInitializer(registry, current, features), std::invalid_argument);
     EXPECT_EQ(registry->serializers().size(), count + 1);
 }
 

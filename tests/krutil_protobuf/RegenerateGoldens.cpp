@@ -15,8 +15,9 @@ int main() try {
     std::filesystem::create_directories(goldens::directory());
     for (const auto& serializer : registry->serializers()) {
         const auto file = goldens::fileOf(serializer->name());
+        const std::string content = goldens::render(samples::sampleSet(serializer->name()), registry);
         std::ofstream out(file, std::ios::binary);
-        out << goldens::render(samples::sampleSet(serializer->name()), registry);
+        out << content;
         out.close();
         if (!out) {
             std::cerr << "krutil_regenerate_goldens: cannot write " << file << '\n';

@@ -1,5 +1,6 @@
 """Checks that what the documents promise is there: targets of relative links, scripts, the client's subcommands; that
-C++ in them is quoted from a source that is compiled; and that documents which sources mention exist.
+C++ in them is quoted from a source that is compiled; that documents which sources mention exist; and that the page of
+the messages leaves none out.
 
     documents.py ROOT [KRUTIL]
 
@@ -19,6 +20,9 @@ SUBCOMMAND = re.compile(r"^(?:\$ )?krutil ([a-z]+)\b", re.MULTILINE)
 QUOTED_FROM = "tests/install/projects/host/host.cpp"
 CPP = re.compile(r"^```cpp\n(.*?)^```", re.MULTILINE | re.DOTALL)
 MENTION = re.compile(r"\bdocs/[\w-]+\.md\b")
+SCHEMA = "src/qvm_services/krutil_protobuf/proto/"
+MESSAGES = "docs/protocol.md"
+MESSAGE = re.compile(r"^message (\w+)", re.MULTILINE)
 BLOCK = re.compile(r"^```\w*\n(.*?)^```", re.MULTILINE | re.DOTALL)
 
 
@@ -79,8 +83,18 @@ def check_mentions(root):
     return findings
 
 
+def check_messages(root):
+    findings = []
+    for path in checkout.files(root, ".proto"):
+        if path.startswith(SCHEMA):
+            for name in MESSAGE.findall(checkout.read(root, path)):
+                if not re.search(rf"\b{name}\b", checkout.read(root, MESSAGES)):
+                    findings.append(f"{MESSAGES}: nothing about {name}, which {path} defines")
+    return findings
+
+
 def check(root, krutil=None):
-    findings = check_mentions(root)
+    findings = check_mentions(root) + check_messages(root)
     for path in checkout.files(root, ".md"):
         findings += check_links(root, path) + check_scripts(root, path)
         if path == "README.md":

@@ -152,6 +152,14 @@ class DocumentsTest(Planted):
         self.write("apps/common/A.cpp", "// See docs/lost.md.\n")
         self.assertEqual(documents.check(self.root), ["apps/common/A.cpp: mentions docs/lost.md, which does not exist"])
 
+    def test_message_that_the_page_of_the_messages_leaves_out(self):
+        self.write(documents.SCHEMA + "a.Text.proto", "// message Comment\nmessage Text {\n    message Inner {}\n}\n")
+        self.write(documents.MESSAGES, "### Text\n")
+        self.assertEqual(documents.check(self.root), [])
+        self.write(documents.MESSAGES, "### TextEvent\n")
+        self.assertEqual(documents.check(self.root),
+                         ["docs/protocol.md: nothing about Text, which " + documents.SCHEMA + "a.Text.proto defines"])
+
     def test_subcommand_that_the_client_lacks(self):
         self.write("README.md", "```sh\nkrutil nothing 1\n```\n")
         self.assertEqual(documents.check(self.root, "/bin/false"), ["README.md: krutil has no subcommand nothing"])

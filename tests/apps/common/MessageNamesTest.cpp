@@ -11,12 +11,14 @@ namespace {
 // Arrays are the platform's own kind of message, whose schema may be absent from a host.
 TEST(MessageNamesTest, EveryTagOfTheProtocolHasAMessageInThePool) {
     const auto registry = std::make_shared<foundation::msg_svc::transport::layers::serialization::Registry>();
-    krutil::protobuf::KrutilProtocol::protocolInitializer(registry, {1, 0}, {{"ZEROCOPY", "enable"}});
+    using krutil::protobuf::KrutilProtocol;
+    KrutilProtocol::protocolInitializer(registry, KrutilProtocol::protocolVersion, {{"ZEROCOPY", "enable"}});
     ASSERT_FALSE(registry->serializers().empty());
     for (const auto& serializer : registry->serializers()) {
         const std::string name = messageNameOfTag(serializer->name());
         EXPECT_NE(google::protobuf::DescriptorPool::generated_pool()->FindMessageTypeByName(name), nullptr)
-            << serializer->name() << " -> " << name;
+            << serializer->name() << " -> \"" << name
+            << "\": a tag that is not \"krutil:\" and the message's name needs a row in MessageNames.cpp";
     }
 }
 

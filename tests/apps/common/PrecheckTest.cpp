@@ -12,7 +12,6 @@
 #include "foundation/msg_svc/eventmgr/BaseEvent.hpp"
 #include "foundation/msg_svc/transport/layers/message/Message.hpp"
 #include "foundation/msg_svc/transport/layers/serialization/SerializerAPI.hpp"
-#include "foundation/msg_svc/transport/layers/session/ProtocolRegistry.hpp"
 #include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
 #include "krutil.protobuf.FEvalResult.pb.h"
 #include "krutil.protobuf.IIPResult.pb.h"
@@ -160,8 +159,8 @@ class PrecheckAgainstSerializersTest : public ::testing::Test {
 
     PrecheckAgainstSerializersTest() {
         ::testing::FLAGS_gtest_death_test_style = "threadsafe";
-        krutil::protobuf::KrutilProtocol::init();
-        session::ProtocolRegistry::getRegistry()->find("krutil").initialize(registry, {1, 0}, {{"ZEROCOPY", "enable"}});
+        using krutil::protobuf::KrutilProtocol;
+        KrutilProtocol::protocolInitializer(registry, KrutilProtocol::protocolVersion, {{"ZEROCOPY", "enable"}});
     }
 
     void read(const std::string& tag, const std::string& content) const {
