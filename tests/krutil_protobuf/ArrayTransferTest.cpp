@@ -48,9 +48,11 @@ using transport::FrameIndex;
 using transport::Frames;
 using transport::FrameType;
 using transport::Message;
+using transport::parsed;
 using transport::RecordingStream;
 using transport::SerializationContext;
 using transport::TaggedFrame;
+using transport::ThrowingStream;
 
 using Deleter = std::function<void(char*)>;
 using Buffer = std::unique_ptr<char[], Deleter>;
@@ -63,12 +65,6 @@ Array doubles(std::uint64_t count) {
 
 Array bytes(std::uint64_t count) {
     return ArrayFactory().createArray(ElementType::UInt8, {count});
-}
-
-KORVEL_Array parsed(const Frame& frame) {
-    KORVEL_Array proto;
-    proto.ParseFromArray(frame.data(), static_cast<int>(frame.size()));
-    return proto;
 }
 
 // The frames themselves as a received message, as when both peers are in one process.
@@ -87,22 +83,6 @@ std::unique_ptr<Message> messageWith(std::unique_ptr<Frame> frame) {
     frames.push_back(std::move(frame));
     return handOver(std::move(frames));
 }
-
-// Refuses one frame, with an exception, and takes all others.
-class ThrowingStream final : public RecordingStream {
-  public:
-    explicit ThrowingStream(int refused) : refused_(refused) {}
-
-    void append(std::unique_ptr<Frame>& frame) override {
-        if (refused_-- == 0) {
-            throw std::runtime_error("stream is full");
-        }
-        RecordingStream::append(frame);
-    }
-
-  private:
-    int refused_;
-};
 
 // Looks at each frame and leaves it with its writer.
 class LeavingStream final : public transport::MessageStream {
@@ -425,7 +405,7 @@ TEST_F(QDASerializerTest, AnArrayWithoutAnOutOfLineBufferIsOneFrame) {
         EXPECT_EQ(frame.index(), 5U);
         EXPECT_EQ(frame.tag(), "krutil:QDA");
         EXPECT_EQ(frame.type(), FrameType::Object);
-        EXPECT_EQ(parsed(frame).elements_case(), KORVEL_Array::kInlineElements);
+        EXPECT_EQ(parsed<KORVEL_Array>(frame).elements_case(), KORVEL_Array::kInlineElements);
         EXPECT_EQ(read(handOver(std::move(frames())), 5), array);
     }
 }
@@ -441,7 +421,7 @@ TEST_F(QDASerializerTest, AnOutOfLineBufferStandsBeforeTheTaggedFrame) {
     const auto& tagged = dynamic_cast<const TaggedFrame&>(*frames()[1]);
     EXPECT_EQ(tagged.index(), 6U);
     EXPECT_EQ(tagged.streamID(), 7U);
-    EXPECT_EQ(parsed(tagged).dataid(), 5U);
+    EXPECT_EQ(parsed<KORVEL_Array>(tagged).dataid(), 5U);
 }
 
 TEST_F(QDASerializerTest, OutOfLineBuffersOfEveryElementTypeHaveTheirFrameType) {

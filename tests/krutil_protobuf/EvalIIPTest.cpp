@@ -17,7 +17,6 @@ using cmddistributor::EvalIIP;
 using cmddistributor::IqmStreamID;
 using krutil::io::SinkTraits;
 using krutil::protobuf_serializer::EvalIIPSerializer;
-using krutil::protobuf_serializer::IIPFamily;
 using krutil::protobuf_serializer::IIPSerializer;
 using transport::errorText;
 namespace wire = krutil::protobuf;
@@ -42,12 +41,7 @@ boost::shared_ptr<const EvalIIP> read(const wire::EvalIIP& proto) {
 
 // How reading the message through the registered serializer is refused.
 std::string refusal(const wire::EvalIIP& proto) {
-    const auto registry = transport::sessionRegistry();
-    return errorText<std::logic_error>([&] {
-        transport::serializer<IIPFamily>(*registry, "krutil:EvalIIP")
-            .deserialize(1, transport::makeMessage("krutil:EvalIIP", proto.SerializeAsString()), registry,
-                         transport::SerializationContext());
-    });
+    return errorText<std::logic_error>([&] { transport::readObject("krutil:EvalIIP", proto.SerializeAsString()); });
 }
 
 void expectTransmittedTraits(const SinkTraits& traits, const SinkTraits& expected) {

@@ -23,9 +23,7 @@ using transport::SerializationContext;
 namespace wire = krutil::protobuf;
 
 boost::shared_ptr<const BaseEvent> read(const std::string& tag, const std::string& bytes) {
-    const auto registry = transport::sessionRegistry();
-    return transport::serializer<EventFamily>(*registry, tag)
-        .deserialize(1, transport::makeMessage(tag, bytes), registry, SerializationContext());
+    return std::get<boost::shared_ptr<const BaseEvent>>(transport::readObject(tag, bytes));
 }
 
 // ---- Text events ----------------------------------------------------------------------------------------------------

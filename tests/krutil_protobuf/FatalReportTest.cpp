@@ -1,16 +1,15 @@
 // Values that end the process: what the report says, to the letter. Logs and people match message, file, line and
 // function, so they do not follow the source.
 
-#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <boost/make_shared.hpp>
 
-#include <csignal>
 #include <limits>
 
 #include "DebugLoopEventSerializer.hpp"
 #include "EvalIIPSerializer.hpp"
+#include "FatalReport.hpp"
 #include "IIPCancelReplySerializer.hpp"
 #include "IIPEnqueueMessageSerializer.hpp"
 #include "IIPResultSerializer.hpp"
@@ -18,13 +17,16 @@
 #include "PrintableErrorEventSerializer.hpp"
 #include "RuntimeExceptionSerialization.hpp"
 #include "StreamTypeSerializer.hpp"
-#include "TestTransport.hpp"
 #include "TextBaseEventSerializer.hpp"
 #include "krutil/cmddistributor/IIPReply.hpp"
 #include "krutil/io/TextBaseEvent.hpp"
 
 namespace {
 
+using fatal::statusIn;
+using fatal::statusOut;
+using fatal::streamIDOut;
+using fatal::writeAloud;
 using krutil::protobuf_serializer::DebugLoopEventSerializer;
 using krutil::protobuf_serializer::EvalIIPSerializer;
 using krutil::protobuf_serializer::fromProtobuf;
@@ -33,9 +35,7 @@ using krutil::protobuf_serializer::IIPEnqueueMessageSerializer;
 using krutil::protobuf_serializer::IIPSerializer;
 using krutil::protobuf_serializer::StreamTypeSerializer;
 using krutil::protobuf_serializer::toProtobuf;
-using testing::AllOf;
-using testing::HasSubstr;
-using testing::Not;
+using transport::readObject;
 namespace modes = krutil::cmddistributor::WhenToDequeue;
 namespace wire = krutil::protobuf;
 
@@ -47,9 +47,6 @@ const std::string streamTypeOut =
 const std::string streamTypeIn =
     "fatal: Unsupported krutil::protobuf::StreamType value (StreamTypeSerializer:44, static krutil::io::StreamTypeEnum "
     "krutil::protobuf_serializer::StreamTypeSerializer::fromProtobuf(krutil::protobuf::StreamType))\n";
-const std::string streamIDOut =
-    "fatal: Unsupported cmddistributor::IqmStreamID value (IIPSerializer:38, static krutil::protobuf::IqmStreamID "
-    "krutil::protobuf_serializer::IIPSerializer::toProtobuf(cmddistributor::IqmStreamID))\n";
 const std::string streamIDIn =
     "fatal: Unsupported cmddistributor::IqmStreamID value (IIPSerializer:71, static cmddistributor::IqmStreamID "
     "krutil::protobuf_serializer::IIPSerializer::fromProtobuf(krutil::protobuf::IqmStreamID))\n";
@@ -60,15 +57,6 @@ const std::string dequeueModeOut =
     "fatal: Unsupported cmddistributor::WhenToDequeue::WhenToDequeue value (IIPEnqueueMessageSerializer:120, "
     "static krutil::protobuf::WhenToDequeue krutil::protobuf_serializer::IIPEnqueueMessageSerializer::toProtobuf("
     "krutil::cmddistributor::WhenToDequeue::WhenToDequeue))\n";
-const std::string statusOut =
-    "fatal: Unsupported cmddistributor::inExecutionStatus value (RuntimeExceptionSerialization:28, "
-    "krutil::protobuf::ExecutionStatus "
-    "krutil::protobuf_serializer::toProtobuf(krutil::cmddistributor::inExecutionStatus))\n";
-const std::string statusIn =
-    "fatal: Unsupported protobuf::ExecutionStatus value (RuntimeExceptionSerialization:47, "
-    "krutil::cmddistributor::inExecutionStatus "
-    "krutil::protobuf_serializer::fromProtobuf(krutil::protobuf::ExecutionStatus))\n";
-
 const std::string loopStateOut =
     "fatal: Unsupported cmddistributor::DebugLoopEvent::State value (DebugLoopEventSerializer:73, "
     "static krutil::protobuf::DebugLoopEvent_State "
@@ -86,16 +74,7 @@ const std::string cancelStatusIn =
     "static cmddistributor::IIPCancelReply::CancelStatus "
     "krutil::protobuf_serializer::IIPCancelReplySerializer::fromProtobuf(krutil::protobuf::CancelStatus))\n";
 
-// The report is written to a duplicate of stderr made at load time, so the child must be a process of its own.
-class FatalReportTest : public testing::Test {
-  protected:
-    FatalReportTest() { testing::FLAGS_gtest_death_test_style = "threadsafe"; }
-};
-
-using FatalReportDeathTest = FatalReportTest;
-
-#define EXPECT_FATAL(statement, report) \
-    EXPECT_EXIT(static_cast<void>(statement), testing::KilledBySignal(SIGABRT), HasSubstr(report))
+using FatalReportDeathTest = fatal::FatalTest;
 
 // ---- The conversions ------------------------------------------------------------------------------------------------
 
@@ -155,24 +134,6 @@ TEST_F(FatalReportDeathTest, CheckedCancelStatuses) {
 
 // ---- Through the serializers ----------------------------------------------------------------------------------------
 
-// Says on stderr that it got a frame, where the parent of a death test sees it.
-class TellingStream : public transport::MessageStream {
-  public:
-    void append(std::unique_ptr<transport::Frame>& /*frame*/) override { std::fputs("appended a frame\n", stderr); }
-};
-
-void writeAloud(const std::string& name, const samples::Object& object) {
-    const auto registry = transport::sessionRegistry();
-    samples::write(*registry->find(name), object, 7, 1, std::make_shared<TellingStream>(), registry,
-                   transport::SerializationContext());
-}
-
-samples::Object read(const std::string& name, const std::string& bytes) {
-    const auto registry = transport::sessionRegistry();
-    return samples::read(*registry->find(name), 1, transport::makeMessage(name, bytes), registry,
-                         transport::SerializationContext());
-}
-
 boost::shared_ptr<const cmddistributor::IIP> request(int streamID, int codeType) {
     return boost::make_shared<cmddistributor::EvalIIP>("x", static_cast<cmddistributor::IqmStreamID>(streamID), nullptr,
                                                        krutil::io::SinkTraits(), krutil::io::SinkTraits(), u"",
@@ -183,8 +144,8 @@ TEST_F(FatalReportDeathTest, AReceivedTextOnAnUnknownStream) {
     for (const int number : {3, -1}) {
         wire::TextBaseEvent proto;
         proto.set_stream(static_cast<wire::StreamType>(number));
-        EXPECT_FATAL(read("krutil:TextBaseEvent", proto.SerializeAsString()), streamTypeIn);
-        EXPECT_FATAL(read("krutil:SinkTextEvent", proto.SerializeAsString()), streamTypeIn);
+        EXPECT_FATAL(readObject("krutil:TextBaseEvent", proto.SerializeAsString()), streamTypeIn);
+        EXPECT_FATAL(readObject("krutil:SinkTextEvent", proto.SerializeAsString()), streamTypeIn);
     }
 }
 
@@ -192,8 +153,7 @@ TEST_F(FatalReportDeathTest, ATextToWriteOnAnUnknownStreamBeforeAnyFrame) {
     const samples::Object event =
         boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent>(boost::make_shared<krutil::io::TextBaseEvent>(
             foundation::msg_svc::exchange::IDType(), static_cast<krutil::io::StreamTypeEnum>(3), u""));
-    EXPECT_EXIT(writeAloud("krutil:TextBaseEvent", event), testing::KilledBySignal(SIGABRT),
-                AllOf(HasSubstr(streamTypeOut), Not(HasSubstr("appended"))));
+    EXPECT_FATAL_BEFORE_ANY_FRAME(writeAloud("krutil:TextBaseEvent", event), streamTypeOut);
 }
 
 TEST_F(FatalReportDeathTest, ARequestReceivedWithAnUnknownStreamIsFatalWhenItIsWrittenAgain) {
@@ -202,9 +162,8 @@ TEST_F(FatalReportDeathTest, ARequestReceivedWithAnUnknownStreamIsFatalWhenItIsW
     proto.mutable_iip()->set_plugintype("x");
     proto.mutable_iip()->mutable_outtraits();
     proto.mutable_iip()->mutable_errtraits();
-    const samples::Object received = read("krutil:EvalIIP", proto.SerializeAsString());
-    EXPECT_EXIT(writeAloud("krutil:EvalIIP", received), testing::KilledBySignal(SIGABRT),
-                AllOf(HasSubstr(streamIDOut), Not(HasSubstr("appended"))));
+    const samples::Object received = readObject("krutil:EvalIIP", proto.SerializeAsString());
+    EXPECT_FATAL_BEFORE_ANY_FRAME(writeAloud("krutil:EvalIIP", received), streamIDOut);
 }
 
 TEST_F(FatalReportDeathTest, TheStreamOfARequestIsLookedAtBeforeItsCodeType) {
@@ -219,32 +178,31 @@ TEST_F(FatalReportDeathTest, AnUnknownDequeueModeBeforeTheRequestIsWritten) {
                 iip, foundation::msg_svc::exchange::IDType(), 0, boost::none, nullptr,
                 static_cast<modes::WhenToDequeue>(8), u"", capabilities::CapabilityList(), nullptr, false)));
     };
-    const auto mode = AllOf(HasSubstr(dequeueModeOut), Not(HasSubstr("appended")));
-    EXPECT_EXIT(writeAloud("krutil:IIPEnqueueMessage", message(request(0, 0))), testing::KilledBySignal(SIGABRT), mode);
+    EXPECT_FATAL_BEFORE_ANY_FRAME(writeAloud("krutil:IIPEnqueueMessage", message(request(0, 0))), dequeueModeOut);
     // Also before the request is looked at: neither its bad stream nor its absence is what is reported.
-    EXPECT_EXIT(writeAloud("krutil:IIPEnqueueMessage", message(request(7, 0))), testing::KilledBySignal(SIGABRT), mode);
-    EXPECT_EXIT(writeAloud("krutil:IIPEnqueueMessage", message(nullptr)), testing::KilledBySignal(SIGABRT), mode);
+    EXPECT_FATAL_BEFORE_ANY_FRAME(writeAloud("krutil:IIPEnqueueMessage", message(request(7, 0))), dequeueModeOut);
+    EXPECT_FATAL_BEFORE_ANY_FRAME(writeAloud("krutil:IIPEnqueueMessage", message(nullptr)), dequeueModeOut);
 }
 
 TEST_F(FatalReportDeathTest, AnUnknownStatusInAReceivedResultEvenWithoutAnIdentifier) {
     wire::IIPResult proto;
     proto.mutable_exception()->set_status(static_cast<wire::ExecutionStatus>(6));
-    EXPECT_FATAL(read("krutil:IIPResult", proto.SerializeAsString()), statusIn);
+    EXPECT_FATAL(readObject("krutil:IIPResult", proto.SerializeAsString()), statusIn);
     proto.mutable_id();
-    EXPECT_FATAL(read("krutil:IIPResult", proto.SerializeAsString()), statusIn);
+    EXPECT_FATAL(readObject("krutil:IIPResult", proto.SerializeAsString()), statusIn);
 }
 
 TEST_F(FatalReportDeathTest, AnUnknownStatusInAReceivedErrorToPrint) {
     wire::PrintableErrorEvent proto;
     proto.mutable_except()->set_status(static_cast<wire::ExecutionStatus>(6));
-    EXPECT_FATAL(read("krutil:PrintableErrorEvent", proto.SerializeAsString()), statusIn);
+    EXPECT_FATAL(readObject("krutil:PrintableErrorEvent", proto.SerializeAsString()), statusIn);
 }
 
 TEST_F(FatalReportDeathTest, AnUnknownStatusInACauseOfACause) {
     wire::IIPResult proto;
     proto.mutable_id();
     proto.mutable_exception()->add_causes()->add_causes()->set_status(static_cast<wire::ExecutionStatus>(-1));
-    EXPECT_FATAL(read("krutil:IIPResult", proto.SerializeAsString()), statusIn);
+    EXPECT_FATAL(readObject("krutil:IIPResult", proto.SerializeAsString()), statusIn);
 }
 
 TEST_F(FatalReportDeathTest, AnUnknownStatusInAReplysResultBeforeAnyFrame) {
@@ -260,8 +218,7 @@ TEST_F(FatalReportDeathTest, AnUnknownStatusInAReplysResultBeforeAnyFrame) {
                 std::make_unique<cmddistributor::IIPResult>(foundation::msg_svc::exchange::IDType(), exception))));
     };
     for (const RuntimeException& exception : {bad({}, 6), bad({bad({}, -1)}, 2)}) {
-        EXPECT_EXIT(writeAloud("krutil:IIPReply", reply(exception)), testing::KilledBySignal(SIGABRT),
-                    AllOf(HasSubstr(statusOut), Not(HasSubstr("appended"))));
+        EXPECT_FATAL_BEFORE_ANY_FRAME(writeAloud("krutil:IIPReply", reply(exception)), statusOut);
     }
 }
 

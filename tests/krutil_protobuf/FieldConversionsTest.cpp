@@ -176,12 +176,8 @@ TEST_F(IllFormedTextTest, APlugInTypeThatIsNoUtf8LosesTheTraitsAndSoTheRequest) 
         boost::shared_ptr<const cmddistributor::IIP>(boost::make_shared<cmddistributor::EvalIIP>(
             "\xFF", cmddistributor::IqmStreamID::ekIqmCmdWinStream, nullptr, krutil::io::SinkTraits(),
             krutil::io::SinkTraits(), u"1", cmddistributor::CodeType::CodeBlockType));
-    const auto& serializer = *registry->find("krutil:EvalIIP");
-    const auto frames = transport::writtenFrames(serializer, request, registry);
-    EXPECT_EQ(errorText<std::logic_error>([&] {
-                  samples::read(serializer, 1, transport::makeMessage(frames), registry,
-                                transport::SerializationContext());
-              }),
+    const auto frames = transport::writtenFrames(*registry->find("krutil:EvalIIP"), request, registry);
+    EXPECT_EQ(errorText<std::logic_error>([&] { transport::readObject(frames[0].tag, frames[0].bytes); }),
               "Required field protobuf::IIP.outTraits is missing.");
 }
 

@@ -16,6 +16,7 @@
 #include "ArrayRoutines.hpp"
 #include "FEvalIIPSerializer.hpp"
 #include "FEvalResultSerializer.hpp"
+#include "FatalReport.hpp"
 #include "TestTransport.hpp"
 #include "foundation/core/diag/AssertionSwitch.hpp"
 #include "foundation/korveldata/ArrayFactory.hpp"
@@ -49,16 +50,13 @@ using krutil::protobuf_serializer::readArrays;
 using krutil::protobuf_serializer::ReplyFamily;
 using krutil::protobuf_serializer::ResultFamily;
 using krutil::protobuf_serializer::writeArrays;
-using testing::AllOf;
-using testing::HasSubstr;
-using testing::Not;
 using transport::errorText;
-using transport::Frame;
 using transport::FrameContent;
 using transport::FrameIndex;
 using transport::FrameType;
 using transport::Message;
 using transport::MessageStream;
+using transport::parsed;
 using transport::RecordingStream;
 using transport::Registry;
 using transport::SerializationContext;
@@ -76,13 +74,6 @@ Array large(std::uint64_t size = 4096) {
 }
 
 template <class Proto>
-Proto parsed(const Frame& frame) {
-    Proto proto;
-    proto.ParseFromArray(frame.data(), static_cast<int>(frame.size()));
-    return proto;
-}
-
-template <class Proto>
 std::vector<std::uint64_t> dataIDs(const Proto& proto) {
     return {proto.dataids().begin(), proto.dataids().end()};
 }
@@ -94,24 +85,6 @@ std::vector<FrameIndex> indexes(const transport::Frames& frames) {
     }
     return result;
 }
-
-// A serializer of another family that stands under the type of arrays.
-class MisplacedSerializer final : public ReplyFamily {
-  public:
-    MisplacedSerializer() : ReplyFamily("test:Misplaced", typeid(Array), {1U, 0U}) {}
-
-    FrameIndex serialize(const boost::shared_ptr<const foundation::msg_svc::exchange::Reply>&, transport::StreamID,
-                         FrameIndex frameIndex, const std::shared_ptr<MessageStream>&,
-                         const std::shared_ptr<const Registry>&, const SerializationContext&) const override {
-        return frameIndex;
-    }
-
-    boost::shared_ptr<const foundation::msg_svc::exchange::Reply> deserialize(
-        FrameIndex, const std::unique_ptr<Message>&, const std::shared_ptr<const Registry>&,
-        const SerializationContext&) const override {
-        return nullptr;
-    }
-};
 
 // Everything that a transport gives to serializers, and frames of arrays to refer to.
 class ArraysTest : public testing::Test {
@@ -202,7 +175,7 @@ TEST_F(ArrayRoutinesTest, WithoutASerializerOfArraysWritingIsOutOfRangeEvenWitho
 
 TEST_F(ArrayRoutinesTest, ASerializerOfAnotherFamilyUnderTheTypeOfArraysIsBadCastEvenWithoutArrays) {
     const auto misplaced = std::make_shared<Registry>();
-    misplaced->insert(std::make_shared<MisplacedSerializer>());
+    misplaced->insert(std::make_shared<transport::MisplacedSerializer<ReplyFamily>>(typeid(Array)));
     EXPECT_THROW(writeWith(misplaced, {}), std::bad_cast);
     EXPECT_THROW(writeWith(misplaced, {small(1)}), std::bad_cast);
 }
@@ -470,19 +443,9 @@ TEST_F(FEvalIIPTest, IdentifiersThatAreSetPassTheAssertions) {
 
 // ---- Calls that end the process -------------------------------------------------------------------------------------
 
-// Says on stderr which frame it got, where the parent of a death test sees it.
-class TellingStream final : public MessageStream {
-  public:
-    void append(std::unique_ptr<Frame>& frame) override {
-        std::fprintf(stderr, "appended %lu\n", static_cast<unsigned long>(frame->index()));
-    }
-};
-
 void writeAloud(const boost::shared_ptr<const IIP>& request, bool assertions = false) {
     foundation::core::diag::enableAssertions(assertions);
-    const auto registry = transport::sessionRegistry();
-    transport::serializer<IIPFamily>(*registry, "krutil:FEvalIIP")
-        .serialize(request, 7, 1, std::make_shared<TellingStream>(), registry, SerializationContext());
+    fatal::writeAloud("krutil:FEvalIIP", request);
 }
 
 std::string reportOf(const std::string& message, int line) {
@@ -496,30 +459,19 @@ std::string reportOf(const std::string& message, int line) {
            "const foundation::msg_svc::transport::layers::serialization::SerializationContext&) const)\n";
 }
 
-const std::string streamReport =
-    "fatal: Unsupported cmddistributor::IqmStreamID value (IIPSerializer:38, static krutil::protobuf::IqmStreamID "
-    "krutil::protobuf_serializer::IIPSerializer::toProtobuf(cmddistributor::IqmStreamID))\n";
-
-class FEvalIIPDeathTest : public testing::Test {
-  protected:
-    FEvalIIPDeathTest() { testing::FLAGS_gtest_death_test_style = "threadsafe"; }
-};
-
-#define EXPECT_FATAL(statement, matcher) EXPECT_EXIT(statement, testing::KilledBySignal(SIGABRT), matcher)
+using FEvalIIPDeathTest = fatal::FatalTest;
 
 TEST_F(FEvalIIPDeathTest, ArgumentsInAnotherFormBeforeAnyFrame) {
     const auto text = [] {
         return callWith(FEvalIIP::Data::makeClientSideData(std::vector<std::u16string>{u"1", u"2"}), 0, 0);
     };
-    EXPECT_FATAL(writeAloud(text(), true),
-                 AllOf(HasSubstr(reportOf("FEvalIIPSerializer only supports KORVEL Data Arrays", 63)),
-                       Not(HasSubstr("appended"))));
+    EXPECT_FATAL_BEFORE_ANY_FRAME(writeAloud(text(), true),
+                                  reportOf("FEvalIIPSerializer only supports KORVEL Data Arrays", 63));
 }
 
 TEST_F(FEvalIIPDeathTest, ArgumentsThatCannotBeHad) {
-    EXPECT_FATAL(
-        writeAloud(callWith(nullptr)),
-        AllOf(HasSubstr(reportOf("FEvalIIPSerializer: Unexpected exception", 66)), Not(HasSubstr("appended"))));
+    EXPECT_FATAL_BEFORE_ANY_FRAME(writeAloud(callWith(nullptr)),
+                                  reportOf("FEvalIIPSerializer: Unexpected exception", 66));
 }
 
 const AllocationRecorder* exhausted = nullptr;
@@ -533,7 +485,7 @@ void tellWhetherMemoryRanOut(int /*signal*/) {
 
 void extractWithoutMemory() {
     const auto registry = std::static_pointer_cast<const Registry>(transport::sessionRegistry());
-    const std::shared_ptr<MessageStream> stream = std::make_shared<TellingStream>();
+    const std::shared_ptr<MessageStream> stream = std::make_shared<fatal::TellingStream>();
     const SerializationContext context;
     NestedWriter nested(7, 1, stream, registry, context);
     const auto request = boost::dynamic_pointer_cast<const FEvalIIP>(callWith(nullptr));
@@ -544,22 +496,21 @@ void extractWithoutMemory() {
 }
 
 TEST_F(FEvalIIPDeathTest, ArgumentsThatCannotBeHadForLackOfMemory) {
-    EXPECT_FATAL(extractWithoutMemory(),
-                 HasSubstr(reportOf("FEvalIIPSerializer: Unexpected exception", 66) + "out of memory\n"));
+    EXPECT_FATAL(extractWithoutMemory(), reportOf("FEvalIIPSerializer: Unexpected exception", 66) + "out of memory\n");
 }
 
 TEST_F(FEvalIIPDeathTest, AFailedAssertionOnAnIdentifierComesAfterTheArrays) {
     const std::string arrays = "appended 1\nappended 2\nappended 3\n";
     const std::string client = arrays + reportOf("fevaliip->getClientQvmID()", 80);
     const std::string server = arrays + reportOf("fevaliip->getQvmID()", 82);
-    EXPECT_FATAL(writeAloud(call({large(), small(1)}, 0, 4), true), HasSubstr(client));
-    EXPECT_FATAL(writeAloud(call({large(), small(1)}, 0, 0), true), HasSubstr(client));
-    EXPECT_FATAL(writeAloud(call({large(), small(1)}, 3, 0), true), HasSubstr(server));
+    EXPECT_FATAL(writeAloud(call({large(), small(1)}, 0, 4), true), client);
+    EXPECT_FATAL(writeAloud(call({large(), small(1)}, 0, 0), true), client);
+    EXPECT_FATAL(writeAloud(call({large(), small(1)}, 3, 0), true), server);
 }
 
 TEST_F(FEvalIIPDeathTest, AnUnknownStreamComesAfterTheArraysAndBeforeTheAssertions) {
     EXPECT_FATAL(writeAloud(call({small(1)}, 0, 0, static_cast<IqmStreamID>(7)), true),
-                 HasSubstr("appended 1\n" + streamReport));
+                 "appended 1\n" + fatal::streamIDOut);
 }
 
 // ---- Results --------------------------------------------------------------------------------------------------------
@@ -766,48 +717,32 @@ TEST_F(FEvalResultTest, TheCallablesGetTheArraysAndTheIDsInOrder) {
     EXPECT_EQ(arraysOf(*result), (std::vector<Array>{small(4)}));
 }
 
-const std::string statusOut =
-    "fatal: Unsupported cmddistributor::inExecutionStatus value (RuntimeExceptionSerialization:28, "
-    "krutil::protobuf::ExecutionStatus "
-    "krutil::protobuf_serializer::toProtobuf(krutil::cmddistributor::inExecutionStatus))\n";
-const std::string statusIn =
-    "fatal: Unsupported protobuf::ExecutionStatus value (RuntimeExceptionSerialization:47, "
-    "krutil::cmddistributor::inExecutionStatus "
-    "krutil::protobuf_serializer::fromProtobuf(krutil::protobuf::ExecutionStatus))\n";
-
 using FEvalResultDeathTest = FEvalIIPDeathTest;
 
 void readResult(const wire::FEvalResult& proto) {
-    const auto registry = transport::sessionRegistry();
-    transport::serializer<ResultFamily>(*registry, "krutil:FEvalResult")
-        .deserialize(1, transport::makeMessage("krutil:FEvalResult", proto.SerializeAsString()), registry,
-                     SerializationContext());
+    transport::readObject("krutil:FEvalResult", proto.SerializeAsString());
 }
 
 TEST_F(FEvalResultDeathTest, ABadStatusInAnExceptionThatIsDroppedAnyway) {
     wire::FEvalResult proto = resultProto({});
     proto.mutable_iipresult()->mutable_exception()->set_status(static_cast<wire::ExecutionStatus>(6));
-    EXPECT_FATAL(readResult(proto), HasSubstr(statusIn));
+    EXPECT_FATAL(readResult(proto), fatal::statusIn);
     // Also in a cause, also before the missing identifier is noticed, and also before an array is looked for.
     proto.mutable_iipresult()->clear_id();
     proto.mutable_iipresult()->mutable_exception()->set_status(wire::inRUNTIME_ERROR);
     proto.mutable_iipresult()->mutable_exception()->add_causes()->set_status(static_cast<wire::ExecutionStatus>(-1));
     proto.add_dataids(9);
-    EXPECT_FATAL(readResult(proto), HasSubstr(statusIn));
+    EXPECT_FATAL(readResult(proto), fatal::statusIn);
 }
 
 void writeResultAloud(FEvalResult::Results&& results) {
-    const auto registry = transport::sessionRegistry();
-    const std::unique_ptr<IIPResult> result =
-        std::make_unique<FEvalResult>(requestID, std::move(results), exceptionWith(6));
-    transport::serializer<ResultFamily>(*registry, "krutil:FEvalResult")
-        .serialize(result, 7, 1, std::make_shared<TellingStream>(), registry, SerializationContext());
+    fatal::writeAloud("krutil:FEvalResult", std::unique_ptr<IIPResult>(std::make_unique<FEvalResult>(
+                                                requestID, std::move(results), exceptionWith(6))));
 }
 
 TEST_F(FEvalResultDeathTest, ABadStatusToWriteBeforeAnyFrameAndBeforeTheFormOfTheOutputs) {
-    const auto expected = AllOf(HasSubstr(statusOut), Not(HasSubstr("appended")));
-    EXPECT_FATAL(writeResultAloud(std::vector<Array>{small(1)}), expected);
-    EXPECT_FATAL(writeResultAloud(FEvalResult::Results()), expected);
+    EXPECT_FATAL_BEFORE_ANY_FRAME(writeResultAloud(std::vector<Array>{small(1)}), fatal::statusOut);
+    EXPECT_FATAL_BEFORE_ANY_FRAME(writeResultAloud(FEvalResult::Results()), fatal::statusOut);
 }
 
 }  // namespace

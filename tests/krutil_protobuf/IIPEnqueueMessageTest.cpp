@@ -27,6 +27,7 @@ using transport::errorText;
 using transport::FrameContent;
 using transport::FrameIndex;
 using transport::FrameType;
+using transport::parsed;
 using transport::RecordingStream;
 using transport::Registry;
 using transport::SerializationContext;
@@ -62,24 +63,6 @@ boost::shared_ptr<const IIP> unregisteredRequest() {
                                                SinkTraits(), SinkTraits(), u"1",
                                                cmddistributor::CodeType::CodeBlockType);
 }
-
-// A serializer of another family that claims the unregistered request's type.
-class MisplacedSerializer : public MessageFamily {
-  public:
-    MisplacedSerializer() : MessageFamily("test:Misplaced", typeid(UnregisteredIIP), {1U, 0U}) {}
-
-    FrameIndex serialize(const boost::shared_ptr<const foundation::msg_svc::exchange::Message>&, transport::StreamID,
-                         FrameIndex frameIndex, const std::shared_ptr<transport::MessageStream>&,
-                         const std::shared_ptr<const Registry>&, const SerializationContext&) const override {
-        return frameIndex;
-    }
-
-    boost::shared_ptr<const foundation::msg_svc::exchange::Message> deserialize(
-        FrameIndex, const std::unique_ptr<transport::Message>&, const std::shared_ptr<const Registry>&,
-        const SerializationContext&) const override {
-        return nullptr;
-    }
-};
 
 // Writes a request as three data frames and its tagged frame, as one with bulk bytes would be.
 class BulkySerializer : public IIPFamily {
@@ -128,12 +111,6 @@ class IIPEnqueueMessageTest : public testing::Test {
                 {true, FrameType::Control, 7, 2, enqueueTag, proto.SerializeAsString()}};
     }
 
-    static wire::IIPEnqueueMessage parsed(const transport::Frame& frame) {
-        wire::IIPEnqueueMessage proto;
-        proto.ParseFromArray(frame.data(), static_cast<int>(frame.size()));
-        return proto;
-    }
-
     std::shared_ptr<Registry> registry_ = transport::sessionRegistry();
     std::shared_ptr<RecordingStream> stream_ = std::make_shared<RecordingStream>();
 };
@@ -150,7 +127,7 @@ TEST_F(IIPEnqueueMessageTest, TheRequestIsWrittenFirstAndReferredToByItsIndex) {
     EXPECT_EQ(written[1].tag, enqueueTag);
     EXPECT_EQ(written[1].index, 1U);
     EXPECT_EQ(written[1].type, FrameType::Control);
-    EXPECT_EQ(parsed(*stream_->frames[1]).iiphandle(), 0U);
+    EXPECT_EQ(parsed<wire::IIPEnqueueMessage>(*stream_->frames[1]).iiphandle(), 0U);
 }
 
 TEST_F(IIPEnqueueMessageTest, TheHandleIsTheLastFrameOfARequestThatNeedsSeveral) {
@@ -158,7 +135,7 @@ TEST_F(IIPEnqueueMessageTest, TheHandleIsTheLastFrameOfARequestThatNeedsSeveral)
     EXPECT_EQ(write(enqueue(unregisteredRequest()), 4), 9U);
     ASSERT_EQ(stream_->frames.size(), 5U);
     EXPECT_EQ(stream_->frames.back()->index(), 8U);
-    EXPECT_EQ(parsed(*stream_->frames.back()).iiphandle(), 7U);
+    EXPECT_EQ(parsed<wire::IIPEnqueueMessage>(*stream_->frames.back()).iiphandle(), 7U);
 }
 
 TEST_F(IIPEnqueueMessageTest, AnEmptyRequestIsBadTypeidAndWritesNothing) {
@@ -172,14 +149,21 @@ TEST_F(IIPEnqueueMessageTest, ARequestWithoutASerializerIsOutOfRangeAndWritesNot
 }
 
 TEST_F(IIPEnqueueMessageTest, ASerializerOfAnotherFamilyIsBadCastAndWritesNothing) {
-    registry_->insert(std::make_shared<MisplacedSerializer>());
+    registry_->insert(std::make_shared<transport::MisplacedSerializer<MessageFamily>>(typeid(UnregisteredIIP)));
     EXPECT_THROW(write(enqueue(unregisteredRequest()), 1), std::bad_cast);
     EXPECT_TRUE(stream_->frames.empty());
 }
 
+TEST_F(IIPEnqueueMessageTest, AStreamThatRefusesTheMessageKeepsItsRequest) {
+    stream_ = std::make_shared<transport::ThrowingStream>(1);
+    EXPECT_EQ(errorText<std::runtime_error>([&] { write(enqueue(evalRequest()), 1); }), "stream is full");
+    ASSERT_EQ(stream_->frames.size(), 1U);
+    EXPECT_EQ(transport::contentOf(*stream_->frames[0]).tag, evalTag);
+}
+
 TEST_F(IIPEnqueueMessageTest, AnEmptyEngineIdentifierIsWrittenAsNothingAndReadsBackEmpty) {
     write(enqueue(evalRequest()), 1);
-    EXPECT_EQ(parsed(*stream_->frames[1]).qvmid(), 0U);
+    EXPECT_EQ(parsed<wire::IIPEnqueueMessage>(*stream_->frames[1]).qvmid(), 0U);
     EXPECT_FALSE(read(transport::makeMessage(transport::contentOf(stream_->frames)), 2)->getQvmID().has_value());
 }
 
@@ -193,7 +177,7 @@ TEST_F(IIPEnqueueMessageTest, EveryFieldTravelsInItsOwnPlace) {
         evalRequest(), IDType(1, 2), -3, krutil::contextmgr::QvmID{4}, nullptr, modes::DEQUEUE_AT_DEBUG_PROMPT, u"n",
         capabilities::CapabilityList{capabilities::Capability::ModalDialogs}, nullptr, true);
     write(message, 1);
-    const wire::IIPEnqueueMessage proto = parsed(*stream_->frames[1]);
+    const wire::IIPEnqueueMessage proto = parsed<wire::IIPEnqueueMessage>(*stream_->frames[1]);
     EXPECT_EQ(proto.iiphandle(), 1U);
     EXPECT_EQ(proto.iipid().hi(), 1U);
     EXPECT_EQ(proto.iipid().lo(), 2U);

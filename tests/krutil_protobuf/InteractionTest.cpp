@@ -8,6 +8,7 @@
 #include <limits>
 #include <stdexcept>
 
+#include "AllocationRecorder.hpp"
 #include "DebugLoopEventSerializer.hpp"
 #include "IIPCancelMessageSerializer.hpp"
 #include "IIPCancelReplySerializer.hpp"
@@ -38,16 +39,10 @@ using krutil::protobuf_serializer::IssuedWarningEventSerializer;
 using krutil::protobuf_serializer::PrintableErrorEventSerializer;
 using krutil::protobuf_serializer::WarningConversion;
 using transport::errorText;
+using transport::readObject;
 namespace wire = krutil::protobuf;
 
 constexpr int intMin = std::numeric_limits<int>::min();
-
-samples::Object read(const std::string& tag, const std::string& bytes,
-                     transport::FrameType type = transport::FrameType::Object) {
-    const auto registry = transport::sessionRegistry();
-    return samples::read(*registry->find(tag), 1, transport::makeMessage(tag, bytes, type), registry,
-                         transport::SerializationContext());
-}
 
 template <class Event>
 const Event& asEvent(const samples::Object& object) {
@@ -83,10 +78,24 @@ TEST(IIPCancelReplyTest, AnyStatusPassesUncheckedInBothDirections) {
         const wire::IIPCancelReply proto =
             IIPCancelReplySerializer::toProtobuf(IIPCancelReply(static_cast<IIPCancelReply::CancelStatus>(number)));
         EXPECT_EQ(static_cast<int>(proto.status()), number);
-        const samples::Object back = read("krutil:IIPCancelReply", proto.SerializeAsString());
+        const samples::Object back = readObject("krutil:IIPCancelReply", proto.SerializeAsString());
         const auto& reply = std::get<boost::shared_ptr<const foundation::msg_svc::exchange::Reply>>(back);
         EXPECT_EQ(static_cast<int>(dynamic_cast<const IIPCancelReply&>(*reply).getStatus()), number);
     }
+}
+
+// So the reply's memory goes with its last owner, while a weak reference keeps the message's.
+TEST(IIPCancelReplyTest, IsAllocatedByItselfAndTheMessageTogetherWithItsCount) {
+    wire::IIPCancelMessage message;
+    message.mutable_iipid();
+    {
+        AllocationRecorder recorder;
+        const auto built = IIPCancelMessageSerializer::fromProtobuf(message);
+        EXPECT_EQ(recorder.allocations(), 1U);
+    }
+    AllocationRecorder recorder;
+    const auto built = IIPCancelReplySerializer::fromProtobuf(wire::IIPCancelReply());
+    EXPECT_EQ(recorder.allocations(), 2U);
 }
 
 TEST(IIPCancelReplyTest, TheCheckedConversionsKeepTheFourNumbers) {
@@ -103,12 +112,12 @@ std::string debugLoopRefusal(int state, int whichLoop) {
     wire::DebugLoopEvent proto;
     proto.set_state(static_cast<wire::DebugLoopEvent_State>(state));
     proto.set_whichloop(static_cast<wire::InputRequester>(whichLoop));
-    return errorText<std::logic_error>([&] { read("krutil:DebugLoopEvent", proto.SerializeAsString()); });
+    return errorText<std::logic_error>([&] { readObject("krutil:DebugLoopEvent", proto.SerializeAsString()); });
 }
 
 TEST(DebugLoopEventTest, StateZeroIsRefusedAlthoughItIsTheDefault) {
     const std::string prefix = "Invalid enum krutil::protobuf::DebugLoopEvent_State field value = ";
-    EXPECT_EQ(errorText<std::logic_error>([] { read("krutil:DebugLoopEvent", ""); }), prefix + "0");
+    EXPECT_EQ(errorText<std::logic_error>([] { readObject("krutil:DebugLoopEvent", ""); }), prefix + "0");
     EXPECT_EQ(debugLoopRefusal(3, 0), prefix + "3");
     EXPECT_EQ(debugLoopRefusal(-1, 0), prefix + "-1");
     EXPECT_EQ(debugLoopRefusal(intMin, 0), prefix + "-2147483648");
@@ -127,7 +136,7 @@ TEST(DebugLoopEventTest, TheStateIsReportedBeforeTheLoop) {
 }
 
 TEST(DebugLoopEventTest, AnAbsentIdentifierReadsAsTheDefault) {
-    const samples::Object back = read("krutil:DebugLoopEvent", "\x10\x01");
+    const samples::Object back = readObject("krutil:DebugLoopEvent", "\x10\x01");
     EXPECT_EQ(asEvent<DebugLoopEvent>(back).getRequestId(), IDType());
 }
 
@@ -139,7 +148,7 @@ TEST(DebugLoopEventTest, EveryStateAndEveryLoopRoundTrips) {
                 DebugLoopEventSerializer::toProtobuf(DebugLoopEvent(IDType(1, 2), state, loop));
             EXPECT_EQ(static_cast<int>(proto.state()), static_cast<int>(state));
             EXPECT_EQ(static_cast<int>(proto.whichloop()), number);
-            const samples::Object back = read("krutil:DebugLoopEvent", proto.SerializeAsString());
+            const samples::Object back = readObject("krutil:DebugLoopEvent", proto.SerializeAsString());
             EXPECT_EQ(asEvent<DebugLoopEvent>(back).getLoopState(), state);
             EXPECT_EQ(asEvent<DebugLoopEvent>(back).getWhichDebugLoop(), loop);
             EXPECT_EQ(asEvent<DebugLoopEvent>(back).getRequestId(), IDType(1, 2));
@@ -215,9 +224,9 @@ TEST(WarningTest, RequiredFieldsAreWrittenEvenWhenEmpty) {
 
 TEST(WarningTest, MissingRequiredFieldsReadAsDefaults) {
     const google::protobuf::LogSilencer silencer;
-    const samples::Object issued = read("korvel:lang:diagnostic:IssuedWarningEvent", "");
+    const samples::Object issued = readObject("korvel:lang:diagnostic:IssuedWarningEvent", "");
     const samples::Object enabled =
-        read("korvel:lang:diagnostic:IssuedEnabledWarningEvent", "", transport::FrameType::Control);
+        readObject("korvel:lang:diagnostic:IssuedEnabledWarningEvent", "", transport::FrameType::Control);
     const Warning empty("", u"", {}, u"", {}, false, 0);
     EXPECT_EQ(asEvent<IssuedWarningEvent>(issued).getRequestId(), IDType());
     EXPECT_EQ(asEvent<IssuedWarningEvent>(issued).getWarning(), empty);
@@ -232,9 +241,9 @@ TEST(WarningTest, AnEventIsNotReadByTheOthersSerializer) {
     const std::string enabled =
         IssuedEnabledWarningEventSerializer::toProtobuf(IssuedEnabledWarningEvent(IDType(1, 2), warning))
             .SerializeAsString();
-    EXPECT_THROW(read("korvel:lang:diagnostic:IssuedWarningEvent", enabled, transport::FrameType::Control),
+    EXPECT_THROW(readObject("korvel:lang:diagnostic:IssuedWarningEvent", enabled, transport::FrameType::Control),
                  std::bad_cast);
-    EXPECT_THROW(read("korvel:lang:diagnostic:IssuedEnabledWarningEvent", issued, transport::FrameType::Object),
+    EXPECT_THROW(readObject("korvel:lang:diagnostic:IssuedEnabledWarningEvent", issued, transport::FrameType::Object),
                  std::bad_cast);
 }
 
@@ -257,12 +266,12 @@ TEST(PrintableErrorEventTest, EmptyTextStaysEmpty) {
     const wire::PrintableErrorEvent proto =
         PrintableErrorEventSerializer::toProtobuf(PrintableErrorEvent(IDType(1, 2), exceptionWith({}), u""));
     EXPECT_EQ(proto.text(), "");
-    const samples::Object back = read("krutil:PrintableErrorEvent", proto.SerializeAsString());
+    const samples::Object back = readObject("krutil:PrintableErrorEvent", proto.SerializeAsString());
     EXPECT_EQ(asEvent<PrintableErrorEvent>(back).getText(), u"");
 }
 
 TEST(PrintableErrorEventTest, WithoutAnyFieldItIsTheEmptyErrorOfNoRequest) {
-    const samples::Object back = read("krutil:PrintableErrorEvent", "");
+    const samples::Object back = readObject("krutil:PrintableErrorEvent", "");
     EXPECT_EQ(asEvent<PrintableErrorEvent>(back).getRequestId(), IDType());
     EXPECT_EQ(asEvent<PrintableErrorEvent>(back).getText(), u"");
     EXPECT_EQ(asEvent<PrintableErrorEvent>(back).getException(),
@@ -273,7 +282,7 @@ TEST(PrintableErrorEventTest, CausesAndFramesSurviveTheTrip) {
     const auto exception = exceptionWith({exceptionWith({exceptionWith({})}), exceptionWith({})});
     const wire::PrintableErrorEvent proto =
         PrintableErrorEventSerializer::toProtobuf(PrintableErrorEvent(IDType(1, 2), exception, u"t"));
-    const samples::Object back = read("krutil:PrintableErrorEvent", proto.SerializeAsString());
+    const samples::Object back = readObject("krutil:PrintableErrorEvent", proto.SerializeAsString());
     EXPECT_EQ(asEvent<PrintableErrorEvent>(back).getException(), exception);
     EXPECT_EQ(asEvent<PrintableErrorEvent>(back).getText(), u"t");
     EXPECT_EQ(asEvent<PrintableErrorEvent>(back).getRequestId(), IDType(1, 2));

@@ -24,12 +24,12 @@ using krutil::cmddistributor::IIPReply;
 using krutil::protobuf_serializer::fromProtobuf;
 using krutil::protobuf_serializer::IIPResultSerializer;
 using krutil::protobuf_serializer::ReplyFamily;
-using krutil::protobuf_serializer::ResultFamily;
 using krutil::protobuf_serializer::toProtobuf;
 using transport::errorText;
 using transport::FrameContent;
 using transport::FrameIndex;
 using transport::FrameType;
+using transport::parsed;
 using transport::RecordingStream;
 using transport::Registry;
 using transport::SerializationContext;
@@ -215,9 +215,7 @@ std::string resultBytes(const wire::RuntimeException& exception) {
 }
 
 std::unique_ptr<IIPResult> readResult(const std::string& bytes) {
-    const auto registry = transport::sessionRegistry();
-    return transport::serializer<ResultFamily>(*registry, "krutil:IIPResult")
-        .deserialize(1, transport::makeMessage("krutil:IIPResult", bytes), registry, SerializationContext());
+    return std::get<std::unique_ptr<IIPResult>>(transport::readObject("krutil:IIPResult", bytes));
 }
 
 TEST(NestingTest, ALadderOf64CausesTravels) {
@@ -288,23 +286,6 @@ class UnregisteredResult : public IIPResult {
     using IIPResult::IIPResult;
 };
 
-class MisplacedSerializer : public ReplyFamily {
-  public:
-    MisplacedSerializer() : ReplyFamily("test:Misplaced", typeid(UnregisteredResult), {1U, 0U}) {}
-
-    FrameIndex serialize(const boost::shared_ptr<const foundation::msg_svc::exchange::Reply>&, transport::StreamID,
-                         FrameIndex frameIndex, const std::shared_ptr<transport::MessageStream>&,
-                         const std::shared_ptr<const Registry>&, const SerializationContext&) const override {
-        return frameIndex;
-    }
-
-    boost::shared_ptr<const foundation::msg_svc::exchange::Reply> deserialize(
-        FrameIndex, const std::unique_ptr<transport::Message>&, const std::shared_ptr<const Registry>&,
-        const SerializationContext&) const override {
-        return nullptr;
-    }
-};
-
 class IIPReplyTest : public testing::Test {
   protected:
     const ReplyFamily& serializer() const { return transport::serializer<ReplyFamily>(*registry_, "krutil:IIPReply"); }
@@ -321,12 +302,6 @@ class IIPReplyTest : public testing::Test {
 
     boost::shared_ptr<const IIPReply> readWritten(FrameIndex index) const {
         return read(transport::makeMessage(transport::contentOf(stream_->frames)), index);
-    }
-
-    wire::IIPReply parsed(std::size_t frame) const {
-        wire::IIPReply proto;
-        proto.ParseFromString(transport::contentOf(*stream_->frames.at(frame)).bytes);
-        return proto;
     }
 
     // A result at 1 and, at 2, a reply that refers to `resultID`.
@@ -348,7 +323,7 @@ class IIPReplyTest : public testing::Test {
 TEST_F(IIPReplyTest, WithoutAResultItIsOneFrameWithResultIDZero) {
     EXPECT_EQ(write(nullptr, 4), 5U);
     ASSERT_EQ(stream_->frames.size(), 1U);
-    EXPECT_EQ(parsed(0).resultid(), 0U);
+    EXPECT_EQ(parsed<wire::IIPReply>(*stream_->frames.at(0)).resultid(), 0U);
     const auto back = readWritten(4);
     EXPECT_EQ(back->getID(), IDType(1, 2));
     EXPECT_EQ(back->getResult(), nullptr);
@@ -362,7 +337,7 @@ TEST_F(IIPReplyTest, APlainResultIsWrittenFirstAndReferredToByItsIndex) {
     EXPECT_EQ(written[0].tag, "krutil:IIPResult");
     EXPECT_EQ(written[1].index, 5U);
     EXPECT_EQ(written[1].tag, "krutil:IIPReply");
-    EXPECT_EQ(parsed(1).resultid(), 4U);
+    EXPECT_EQ(parsed<wire::IIPReply>(*stream_->frames.at(1)).resultid(), 4U);
     const auto back = readWritten(5);
     EXPECT_EQ(back->getID(), IDType(1, 2));
     ASSERT_NE(back->getResult(), nullptr);
@@ -371,7 +346,7 @@ TEST_F(IIPReplyTest, APlainResultIsWrittenFirstAndReferredToByItsIndex) {
 
 TEST_F(IIPReplyTest, AResultThatLandsAtIndexZeroReadsBackAsNone) {
     EXPECT_EQ(write(std::make_unique<IIPResult>(IDType(3, 4), boost::none), 0), 2U);
-    EXPECT_EQ(parsed(1).resultid(), 0U);
+    EXPECT_EQ(parsed<wire::IIPReply>(*stream_->frames.at(1)).resultid(), 0U);
     const auto message = transport::makeMessage(transport::contentOf(stream_->frames));
     EXPECT_EQ(read(message, 1)->getResult(), nullptr);
     EXPECT_NE(message->frame(0), nullptr);
@@ -383,9 +358,17 @@ TEST_F(IIPReplyTest, AResultWithoutASerializerIsOutOfRangeAndWritesNothing) {
 }
 
 TEST_F(IIPReplyTest, ASerializerOfAnotherFamilyIsBadCastAndWritesNothing) {
-    registry_->insert(std::make_shared<MisplacedSerializer>());
+    registry_->insert(std::make_shared<transport::MisplacedSerializer<ReplyFamily>>(typeid(UnregisteredResult)));
     EXPECT_THROW(write(std::make_unique<UnregisteredResult>(IDType(3, 4), boost::none), 1), std::bad_cast);
     EXPECT_TRUE(stream_->frames.empty());
+}
+
+TEST_F(IIPReplyTest, AStreamThatRefusesTheReplyKeepsItsResult) {
+    stream_ = std::make_shared<transport::ThrowingStream>(1);
+    EXPECT_EQ(errorText<std::runtime_error>([&] { write(std::make_unique<IIPResult>(IDType(3, 4), boost::none), 1); }),
+              "stream is full");
+    ASSERT_EQ(stream_->frames.size(), 1U);
+    EXPECT_EQ(transport::contentOf(*stream_->frames[0]).tag, "krutil:IIPResult");
 }
 
 TEST_F(IIPReplyTest, AnAbsentIdentifierIsRefusedAfterTheResultWasRead) {

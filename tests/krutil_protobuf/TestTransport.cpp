@@ -58,7 +58,8 @@ std::unique_ptr<Message> makeMessage(const std::string& tag, const std::string& 
 
 std::shared_ptr<Registry> sessionRegistry() {
     auto registry = std::make_shared<Registry>();
-    krutil::protobuf::KrutilProtocol::protocolInitializer(registry, {1, 0}, {{"ZEROCOPY", "enable"}});
+    using krutil::protobuf::KrutilProtocol;
+    KrutilProtocol::protocolInitializer(registry, KrutilProtocol::protocolVersion, {{"ZEROCOPY", "enable"}});
     return registry;
 }
 
@@ -67,6 +68,11 @@ std::vector<FrameContent> writtenFrames(const SerializerBase& serializer, const 
     const auto stream = std::make_shared<RecordingStream>();
     samples::write(serializer, object, 7, firstIndex, stream, registry, SerializationContext());
     return contentOf(stream->frames);
+}
+
+samples::Object readObject(const std::string& tag, const std::string& bytes, FrameType type) {
+    const auto registry = sessionRegistry();
+    return samples::read(*registry->find(tag), 1, makeMessage(tag, bytes, type), registry, SerializationContext());
 }
 
 }  // namespace transport

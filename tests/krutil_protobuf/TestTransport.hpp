@@ -3,6 +3,7 @@
 #pragma once
 
 #include <memory>
+#include <stdexcept>
 #include <string>
 #include <typeinfo>
 #include <vector>
@@ -21,6 +22,7 @@ using foundation::msg_svc::transport::layers::message::Message;
 using foundation::msg_svc::transport::layers::message::MessageStream;
 using foundation::msg_svc::transport::layers::serialization::Registry;
 using foundation::msg_svc::transport::layers::serialization::SerializationContext;
+using foundation::msg_svc::transport::layers::serialization::SerializerAPI;
 using foundation::msg_svc::transport::layers::serialization::SerializerBase;
 using foundation::vantor::carrier::framing::DataFrame;
 using foundation::vantor::carrier::framing::Frame;
@@ -38,6 +40,22 @@ class RecordingStream : public MessageStream {
     void append(std::unique_ptr<Frame>& frame) override;
 
     Frames frames;
+};
+
+/// Refuses one frame, counted from 0, with std::runtime_error "stream is full", and keeps all others.
+class ThrowingStream final : public RecordingStream {
+  public:
+    explicit ThrowingStream(int refused) : refused_(refused) {}
+
+    void append(std::unique_ptr<Frame>& frame) override {
+        if (refused_-- == 0) {
+            throw std::runtime_error("stream is full");
+        }
+        RecordingStream::append(frame);
+    }
+
+  private:
+    int refused_;
 };
 
 /// What a frame is and holds, as a value: tests copy it, change it and make frames of it again.
@@ -74,11 +92,47 @@ std::shared_ptr<Registry> sessionRegistry();
 std::vector<FrameContent> writtenFrames(const SerializerBase& serializer, const samples::Object& object,
                                         const std::shared_ptr<const Registry>& registry, FrameIndex firstIndex = 1);
 
+/// What a fresh session reads from a message of one tagged frame at index 1; throws what the tag's serializer throws.
+samples::Object readObject(const std::string& tag, const std::string& bytes, FrameType type = FrameType::Object);
+
+/// The message in a frame, as far as its bytes parse.
+template <class Proto>
+Proto parsed(const Frame& frame) {
+    Proto proto;
+    proto.ParseFromArray(frame.data(), static_cast<int>(frame.size()));
+    return proto;
+}
+
 /// The serializer of this name as a serializer of `Family`; throws std::bad_cast when it is of another.
 template <class Family>
 const Family& serializer(const Registry& registry, const std::string& name) {
     return dynamic_cast<const Family&>(*registry.find(name));
 }
+
+/// A serializer of `Family` that is registered for a class of another family. Whoever looks for a serializer of that
+/// class finds it and can do nothing with it.
+template <class Family>
+class MisplacedSerializer;
+
+template <class T, class Ptr, class Ret>
+class MisplacedSerializer<SerializerAPI<T, Ptr, Ret>> final : public SerializerAPI<T, Ptr, Ret> {
+  public:
+    explicit MisplacedSerializer(const std::type_info& type)
+        : SerializerAPI<T, Ptr, Ret>("test:Misplaced", type, {1U, 0U}) {}
+
+    FrameIndex serialize(const Ptr& /*object*/, StreamID /*streamID*/, FrameIndex frameIndex,
+                         const std::shared_ptr<MessageStream>& /*stream*/,
+                         const std::shared_ptr<const Registry>& /*registry*/,
+                         const SerializationContext& /*context*/) const override {
+        return frameIndex;
+    }
+
+    Ret deserialize(FrameIndex /*frameIndex*/, const std::unique_ptr<Message>& /*message*/,
+                    const std::shared_ptr<const Registry>& /*registry*/,
+                    const SerializationContext& /*context*/) const override {
+        return Ret();
+    }
+};
 
 /// Text of the exception that `action` throws, if that is of exactly the class `Error`; otherwise a text that says what
 /// happened instead.

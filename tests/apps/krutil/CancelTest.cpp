@@ -6,11 +6,10 @@
 #include <csignal>
 
 #include "Canceller.hpp"
+#include "CaughtOutput.hpp"
 #include "Client.hpp"
 #include "ExitCode.hpp"
-#include "Interrupt.hpp"
 #include "PersonPrinter.hpp"
-#include "Pipe.hpp"
 #include "ScriptedEngine.hpp"
 #include "cmddistributor/IIPCancelMessage.hpp"
 #include "cmddistributor/IIPCancelReply.hpp"
@@ -31,7 +30,7 @@ cmddistributor::RuntimeException interrupted() {
     return {krutil::cmddistributor::inEXECUTION_CTRLC, u"", "KeyboardInterrupt", "", {}, {}, false};
 }
 
-class CancelTest : public ::testing::Test {
+class CancelTest : public ::testing::Test, protected CaughtOutput {
   protected:
     // Remembers the request and the cancels of it, and answers as the test says.
     ScriptedEngine::Action engine(std::function<void(ScriptedEngine&)> onRequest,
@@ -66,11 +65,6 @@ class CancelTest : public ::testing::Test {
         peer.reply(stream, boost::shared_ptr<const ScriptedEngine::Reply>(new IIPCancelReply(status)));
     }
 
-    Interrupt interrupt;
-    Pipe outPipe;
-    Pipe errPipe;
-    Output out{outPipe.write.get(), "standard output", interrupt};
-    Output err{errPipe.write.get(), "standard error", interrupt};
     PersonPrinter printer{out, err, {}};
     ScriptedEngine::StreamID requestStream = 0;
     IDType request;

@@ -2,15 +2,12 @@
 
 #include <gtest/gtest.h>
 
-#include <boost/make_shared.hpp>
 #include <limits>
 #include <nlohmann/json.hpp>
 
-#include "Interrupt.hpp"
+#include "CaughtOutput.hpp"
 #include "JsonPrinter.hpp"
-#include "Output.hpp"
 #include "PersonPrinter.hpp"
-#include "Pipe.hpp"
 #include "cmddistributor/IIPStateEvent.hpp"
 #include "krutil/capabilities_api/CapabilitiesChanged.hpp"
 #include "krutil/eventmgr/QVMShutdownEvent.hpp"
@@ -40,22 +37,7 @@ cmddistributor::RuntimeException error() {
             false};
 }
 
-class PrinterTest : public ::testing::Test {
-  protected:
-    template <class EventT, class... Arguments>
-    void publish(Arguments&&... arguments) {
-        events.publish(boost::make_shared<const EventT>(std::forward<Arguments>(arguments)...));
-    }
-
-    Interrupt interrupt;
-    Pipe outPipe;
-    Pipe errPipe;
-    Output out{outPipe.write.get(), "standard output", interrupt};
-    Output err{errPipe.write.get(), "standard error", interrupt};
-    foundation::msg_svc::eventmgr::EventMgr events;
-};
-
-class PersonPrinterTest : public PrinterTest {
+class PersonPrinterTest : public PrinterFixture {
   protected:
     PersonPrinterTest() { printer.subscribe(events); }
     PersonPrinter printer{out, err, {}};
@@ -99,7 +81,7 @@ TEST_F(PersonPrinterTest, TimingTellsWhatIsKnown) {
     EXPECT_EQ(errPipe.content(), "krutil: engine ready after 12.35 ms, answered after 2.00 ms\n");
 }
 
-class JsonPrinterTest : public PrinterTest {
+class JsonPrinterTest : public PrinterFixture {
   protected:
     JsonPrinterTest() { printer.subscribe(events); }
     JsonPrinter printer{out};

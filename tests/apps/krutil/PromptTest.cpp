@@ -5,11 +5,10 @@
 
 #include <deque>
 
+#include "CaughtOutput.hpp"
 #include "Client.hpp"
 #include "ExitCode.hpp"
-#include "Interrupt.hpp"
 #include "PersonPrinter.hpp"
-#include "Pipe.hpp"
 #include "Prompts.hpp"
 #include "ScriptedEngine.hpp"
 #include "cmddistributor/DebugLoopEvent.hpp"
@@ -25,7 +24,7 @@ using ::testing::ElementsAre;
 
 constexpr auto atPrompt = krutil::cmddistributor::WhenToDequeue::DEQUEUE_AT_PROMPT;
 
-class PromptTest : public ::testing::Test {
+class PromptTest : public ::testing::Test, protected CaughtOutput {
   protected:
     // Opens a prompt for the first request; takes the requests at it until `leaves` says that one of them leaves it.
     ScriptedEngine::Action engine(InputRequester loop, std::function<bool(const std::u16string& command)> leaves) {
@@ -89,11 +88,6 @@ class PromptTest : public ::testing::Test {
         return command == u"__import__('qvm').dbcont()" || command == u"__import__('qvm').dbquit()";
     }
 
-    Interrupt interrupt;
-    Pipe outPipe;
-    Pipe errPipe;
-    Output out{outPipe.write.get(), "standard output", interrupt};
-    Output err{errPipe.write.get(), "standard error", interrupt};
     PersonPrinter printer{out, err, {}};
     std::optional<Client> client;
     IDType outer;

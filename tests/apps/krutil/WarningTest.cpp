@@ -2,14 +2,12 @@
 
 #include <gtest/gtest.h>
 
-#include <boost/make_shared.hpp>
 #include <limits>
 #include <nlohmann/json.hpp>
 
-#include "Interrupt.hpp"
+#include "CaughtOutput.hpp"
 #include "JsonPrinter.hpp"
 #include "PersonPrinter.hpp"
-#include "Pipe.hpp"
 #include "WarningText.hpp"
 #include "cmddistributor/DebugLoopEvent.hpp"
 #include "korvel/lang/diagnostic/IssuedEnabledWarningEvent.hpp"
@@ -56,20 +54,7 @@ TEST(WarningTextTest, WithoutAnIdentifierThereIsNone) {
     EXPECT_EQ(warningText(Warning("", u"", {}, u"x", {}, false, 0), true), "Warning: x\n");
 }
 
-class WarningTest : public ::testing::Test {
-  protected:
-    template <class EventT, class... Arguments>
-    void publish(Arguments&&... arguments) {
-        events.publish(boost::make_shared<const EventT>(std::forward<Arguments>(arguments)...));
-    }
-
-    Interrupt interrupt;
-    Pipe outPipe;
-    Pipe errPipe;
-    Output out{outPipe.write.get(), "standard output", interrupt};
-    Output err{errPipe.write.get(), "standard error", interrupt};
-    foundation::msg_svc::eventmgr::EventMgr events;
-};
+using WarningTest = PrinterFixture;
 
 TEST_F(WarningTest, APersonSeesAWarningOnceAndHiddenOnesNever) {
     PersonPrinter printer(out, err, {});

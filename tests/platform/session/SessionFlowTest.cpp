@@ -149,7 +149,6 @@ TEST_F(SessionFlowTest, AnswersThatAreReadDoNotCount) {
     SessionPair pair(configOf(Role::Client), config);
     pair.engineSaw.answerWith([&](framing::StreamID stream, const Question&) {
         pair.engine->send(stream, answer("a"), Session::Urgency::Answer);
-        EXPECT_TRUE(true);
     });
     for (framing::StreamID stream = 1; stream <= 50; ++stream) {
         pair.client->send(stream, question("q"));
