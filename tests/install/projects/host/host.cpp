@@ -22,10 +22,11 @@ struct LastFrame : layers::message::MessageStream {
 };
 
 int main() {
-    krutil::protobuf::KrutilProtocol::init();
+    using krutil::protobuf::KrutilProtocol;
+    KrutilProtocol::init();
     const auto protocol = layers::session::ProtocolRegistry::getRegistry()->find("krutil");
     const auto registry = std::make_shared<layers::serialization::Registry>();
-    const auto version = protocol.initialize(registry, {1, 0}, {{"ZEROCOPY", "enable"}});
+    const auto version = protocol.initialize(registry, KrutilProtocol::protocolVersion, {{"ZEROCOPY", "enable"}});
 
     const Event event = boost::make_shared<const krutil::io::TextBaseEvent>(
         foundation::msg_svc::exchange::IDType(1, 2), krutil::io::StreamTypeEnum::OUTPUT_STREAM, u"zwölf");
