@@ -79,8 +79,9 @@ TEST_F(CancelTest, TheFirstCtrlCAsksTheEngineToCancelEvenIfRunning) {
                                    self.answer(requestStream, request, interrupted());
                                }));
     EXPECT_EQ(run(peer).exitCode, ExitCode::Cancelled);
-    EXPECT_EQ(cancels, 1);
     EXPECT_EQ(client->finish(), "");
+    peer.waitForEnd();
+    EXPECT_EQ(cancels, 1);
     EXPECT_EQ(outPipe.content(), "");
     EXPECT_EQ(errPipe.content(), "krutil: cancelled\n");
 }
@@ -105,11 +106,13 @@ TEST_F(CancelTest, TheSecondCtrlCWithinTwoSecondsClosesAConnection) {
         EXPECT_EQ(failure.code(), ExitCode::Cancelled);
         EXPECT_STREQ(failure.what(), "cancelled; the connection was closed, which ends the session");
     }
-    EXPECT_EQ(cancels, 1);
     client.reset();
+    peer.waitForEnd();
+    EXPECT_EQ(cancels, 1);
 }
 
 TEST_F(CancelTest, AnEngineThatDoesNotStopIsTalkedAbout) {
+    request = IDType(1, 2);
     ScriptedEngine peer(
         engine([](ScriptedEngine&) { pressCtrlC(); },
                [](ScriptedEngine& self, auto stream) { cancelReply(self, stream, IIPCancelReply::PENDING_CANCEL); }));
@@ -119,7 +122,6 @@ TEST_F(CancelTest, AnEngineThatDoesNotStopIsTalkedAbout) {
         client.emplace(connection, DisplayOptions{}, printer, out, err, interrupt, false);
         bool said = false;
         std::string sentence;
-        request = IDType(1, 2);
         Canceller canceller(client->conversation(), client->engine(), interrupt, request, [&](const std::string& text) {
             sentence = text;
             said = true;

@@ -73,11 +73,12 @@ class PromptTest : public ::testing::Test, protected CaughtOutput {
         return client->request(iip, krutil::cmddistributor::WhenToDequeue::DEQUEUE_AT_IDLE, "", false).exitCode;
     }
 
-    ExitCode run(const ScriptedEngine& peer) {
+    ExitCode run(ScriptedEngine& peer) {
         begin(peer);
         const Prompts answering(*client, script(input), script(typed));
         const ExitCode code = request();
         EXPECT_EQ(client->finish(), "");
+        peer.waitForEnd();
         return code;
     }
 

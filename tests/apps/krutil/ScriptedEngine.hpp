@@ -61,8 +61,15 @@ class ScriptedEngine : private foundation::msg_svc::transport::layers::session::
         // Wakes a thread that still waits for a connection.
         ::shutdown(listener_.get(), SHUT_RDWR);
         stop();
-        thread_.join();
+        waitForEnd();
         std::filesystem::remove_all(directory_);
+    }
+
+    /// Returns once the session has ended, after which the test may read what its action wrote.
+    void waitForEnd() {
+        if (thread_.joinable()) {
+            thread_.join();
+        }
     }
 
     const std::string& path() const { return path_; }
