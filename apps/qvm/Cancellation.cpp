@@ -43,7 +43,7 @@ Cancellation::~Cancellation() {
 
 void Cancellation::begin(const IDType& id) {
     std::lock_guard lock(mutex_);
-    running_.push_back({id, false});
+    running_.push_back({id});
     update();
 }
 
@@ -76,6 +76,18 @@ bool Cancellation::takeInterrupt() {
         return false;
     }
     running_.back().interrupt = false;
+    running_.back().given = true;
+    update();
+    return true;
+}
+
+bool Cancellation::repeatInterrupt() {
+    std::lock_guard lock(mutex_);
+    if (running_.empty() || !running_.back().given) {
+        return false;
+    }
+    running_.back().interrupt = true;
+    running_.back().given = false;
     update();
     return true;
 }

@@ -54,10 +54,15 @@ class Cancellation {
     /// Whether the request that began last is to be interrupted; each interrupt is given once.
     bool takeInterrupt();
 
+    /// The interrupt that takeInterrupt() gave was lost before it reached the request's code, and is to be given again.
+    /// Returns false when that request was given none.
+    bool repeatInterrupt();
+
   private:
     struct Running {
         IDType id;
-        bool interrupt;
+        bool interrupt = false;
+        bool given = false;
     };
 
     void update() noexcept;

@@ -91,6 +91,11 @@ RuntimeException interruption(const std::string& text) {
 // The answer at an input prompt that is none.
 constexpr std::u16string_view kEndOfInput = u"\u0004";
 
+// What the client must be able to do to answer there.
+Capability neededAt(DequeuePoint point) {
+    return point == DequeuePoint::DebugPrompt ? Capability::Debugging : Capability::InteractiveCommandLine;
+}
+
 // The command as a person would have typed it at Python's prompt.
 std::u16string promptedLines(const std::u16string& command) {
     std::u16string text;
@@ -169,13 +174,14 @@ ExitCode Engine::run(int in, int out) {
         std::lock_guard lock(exchangeMutex_);
         leaving_ = true;
     }
-    leavingChanged_.notify_all();
+    exchangeChanged_.notify_all();
     session_->close();
     return exitCode_;
 }
 
 void Engine::serve() {
     python_ = std::make_unique<Interpreter>(recordBounds());
+    descriptors_.emplace();
     loop();
     queue_.close();
     for (const Request& request : queue_.takeAll()) {
@@ -201,8 +207,22 @@ void Engine::loop() {
     }
 }
 
+// Running code may have closed what the threads of this process wait with. Nothing can be sent or waited for then; the
+// client finds its stream at an end.
+void Engine::checkDescriptors() {
+    if (descriptors_->areOpen()) {
+        return;
+    }
+    // A session that is over has closed its own, and says so at once.
+    std::unique_lock lock(exchangeMutex_);
+    if (!exchangeChanged_.wait_for(lock, kGrace, [this] { return sessionOver_; })) {
+        log_.say("Running code has closed descriptors of the engine, so its session cannot go on.");
+        ::_exit(static_cast<int>(ExitCode::Lost));
+    }
+}
+
 // Outputs are sent from Python's own memory, which the next request might change. And a client that only sends must not
-// make this process grow.
+// make this process grow. A cancel ends the wait, so what was returned at a prompt has been copied.
 void Engine::settle() {
     python_->unlocked([this] { session_->waitUntilWritten(cancellation_.descriptor()); });
     python_->dropReleased();
@@ -269,12 +289,16 @@ std::unique_ptr<IIPResult> Engine::runCode(const Request& request, PyObject* fra
     Interpreter::CallOutcome outcome;
     const auto* const call = dynamic_cast<const FEvalIIP*>(request.message->getIIP().get());
     if (call != nullptr) {
-        outcome = python_->call(*call);
+        // A cancel of the code that a prompt holds up does not wait for the reply to be read: that code may then change
+        // what it returned.
+        const bool atPrompt = running_.size() > 1;
+        outcome = python_->call(*call, atPrompt ? Interpreter::Outputs::Copied : Interpreter::Outputs::Shared);
     } else {
         echo(request);
         static_cast<Interpreter::Outcome&>(outcome) =
             python_->evaluate(dynamic_cast<const EvalIIP&>(*request.message->getIIP()), frame);
     }
+    checkDescriptors();
     capture_->finish();
     const bool toldToStop = cancellation_.end();
     if (running_.size() == 1) {
@@ -283,7 +307,7 @@ std::unique_ptr<IIPResult> Engine::runCode(const Request& request, PyObject* fra
     }
     output_->end();
     exit = outcome.exit;
-    if (toldToStop && !exit) {
+    if (toldToStop) {
         // The cancel was answered, but the code ended first.
         outcome.error = interruption("");
         outcome.printed.clear();
@@ -340,15 +364,17 @@ PromptEnd Engine::hold(Prompt& prompt, InputRequester loop) {
 PromptEnd Engine::attend(Prompt& prompt) {
     const auto batch = static_cast<unsigned>(prompts_.size());
     while (!prompt.end) {
+        // What the client sent while it could be asked is an answer still.
+        const bool withdrawn = !capabilities_.lists().client.contains(neededAt(prompt.point));
+        const RequestQueue::Deadline deadline = withdrawn ? std::chrono::steady_clock::now() : prompt.deadline;
         RequestQueue::Wait wait = RequestQueue::Wait::Interrupted;
         {
             SignalsBlocked blocked;
             if (interrupted()) {
                 return PromptEnd::Raised;
             }
-            python_->unlocked([&] {
-                wait = queue_.wait(prompt.point, cancellation_.descriptor(), prompt.deadline, blocked.before());
-            });
+            python_->unlocked(
+                [&] { wait = queue_.wait(prompt.point, cancellation_.descriptor(), deadline, blocked.before()); });
         }
         if (interrupted()) {
             return PromptEnd::Raised;
@@ -357,7 +383,7 @@ PromptEnd Engine::attend(Prompt& prompt) {
             case RequestQueue::Wait::Closed:
                 return prompt.text != nullptr ? PromptEnd::EndOfInput : PromptEnd::Quit;
             case RequestQueue::Wait::TimedOut:
-                return PromptEnd::Continued;
+                return withdrawn ? PromptEnd::Withdrawn : PromptEnd::Continued;
             case RequestQueue::Wait::Interrupted:
                 continue;
             case RequestQueue::Wait::Due:
@@ -491,6 +517,10 @@ int Engine::interruptDescriptor() {
 
 bool Engine::takeInterrupt() {
     return cancellation_.takeInterrupt();
+}
+
+bool Engine::repeatInterrupt() {
+    return std::this_thread::get_id() == mainThread_ && cancellation_.repeatInterrupt();
 }
 
 bool Engine::drainDescriptors() {
@@ -657,6 +687,8 @@ void Engine::cancel(framing::StreamID stream, const IIPCancelMessage& message) {
 void Engine::onEvent(framing::StreamID, const boost::shared_ptr<const BaseEvent>& event) {
     if (const auto* const changed = dynamic_cast<const CapabilitiesChanged*>(event.get())) {
         capabilities_.setClient(changed->getClientCapabilities());
+        // A prompt looks whether the client can still answer.
+        queue_.interruptWait();
     }
 }
 
@@ -685,8 +717,10 @@ void Engine::onEnd(const SessionEnd& end) {
     queue_.close();
     std::unique_lock lock(exchangeMutex_);
     exitCode_ = code;
+    sessionOver_ = true;
+    exchangeChanged_.notify_all();
     // Nobody listens any more, so running code is not waited for.
-    if (!leavingChanged_.wait_for(lock, kGrace, [this] { return leaving_; })) {
+    if (!exchangeChanged_.wait_for(lock, kGrace, [this] { return leaving_; })) {
         ::_exit(static_cast<int>(code));
     }
 }

@@ -29,6 +29,7 @@
 #include "qvm/Log.hpp"
 #include "qvm/Options.hpp"
 #include "qvm/OutputCapture.hpp"
+#include "qvm/OwnDescriptors.hpp"
 #include "qvm/Request.hpp"
 #include "qvm/RequestQueue.hpp"
 #include "qvm/TextOutput.hpp"
@@ -78,6 +79,7 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
     void setDebugging(bool on) override;
     int interruptDescriptor() override;
     bool takeInterrupt() override;
+    bool repeatInterrupt() override;
     bool drainDescriptors() override;
 
     // A prompt that holds up the request on top of the others.
@@ -100,6 +102,7 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
     PromptEnd attend(Prompt& prompt);
     void answer(Prompt& prompt, const Request& request);
     bool interrupted();
+    void checkDescriptors();
     void settle();
     const Request* current() const noexcept;
     void echo(const Request& request);
@@ -125,6 +128,7 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
     std::unique_ptr<TextOutput> output_;
     std::unique_ptr<OutputCapture> capture_;
     std::unique_ptr<Interpreter> python_;
+    std::optional<OwnDescriptors> descriptors_;
 
     const std::thread::id mainThread_ = std::this_thread::get_id();
     Cancellation cancellation_;
@@ -136,9 +140,10 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
     // Guards the members below. While it is held, each request is either in the queue, or among the running ones, or
     // has ended; so a cancel finds it.
     std::mutex exchangeMutex_;
-    std::condition_variable leavingChanged_;
+    std::condition_variable exchangeChanged_;
     bool shutdownSent_ = false;  // nothing may follow the shutdown event
     bool leaving_ = false;       // the thread of run() is done with Python
+    bool sessionOver_ = false;   // and its descriptors are closed
     ExitCode exitCode_ = ExitCode::Ok;
 };
 

@@ -118,6 +118,18 @@ void onInterruptSignal(const py::object&, const py::object&) {
     }
 }
 
+// sys.unraisablehook. Where Python drops an interrupt, in a finaliser for example, the code around that would never see
+// it. No Python code runs between its repetition and the return, or that would take it.
+void onUnraisable(const py::object& unraisable) {
+    const py::object type = unraisable.attr("exc_type");
+    if (!inForkedChild() && type.ptr() == PyExc_KeyboardInterrupt && services->repeatInterrupt()) {
+        return;
+    }
+    if (PyObject* const print = PySys_GetObject("__unraisablehook__")) {
+        py::reinterpret_borrow<py::object>(print)(unraisable);
+    }
+}
+
 bool canUse(Capability capability) {
     return !inForkedChild() && services->canUse(capability);
 }
@@ -131,6 +143,8 @@ const char* nameOf(PromptEnd end) {
             return "quit";
         case PromptEnd::Exit:
             return "exit";
+        case PromptEnd::Withdrawn:
+            return "withdrawn";
         case PromptEnd::Raised:
             break;
     }
@@ -216,6 +230,7 @@ PYBIND11_EMBEDDED_MODULE(_qvm, module) {
     module.def("in_forked_child", &inForkedChild);
     module.attr("interrupt_signal") = Cancellation::signal();
     module.def("on_interrupt_signal", &onInterruptSignal);
+    module.def("on_unraisable", &onUnraisable);
     module.def("can_debug", [] { return canUse(Capability::Debugging); });
     module.def("can_ask", [] { return canUse(Capability::InteractiveCommandLine); });
     module.def("debug_prompt",

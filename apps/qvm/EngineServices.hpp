@@ -19,11 +19,12 @@ enum class PromptEnd {
     Quit,        ///< the code is to be ended
     Exit,        ///< the session is to be ended
     EndOfInput,  ///< there will be no answer
+    Withdrawn,   ///< the client cannot be asked any more
     Raised,      ///< a Python exception is set
 };
 
-/// Calls come from Python code and hold the interpreter lock; they never come in a forked child. prompt(), readText()
-/// and takeInterrupt() are for the main thread, the rest for any.
+/// Calls come from Python code and hold the interpreter lock; they never come in a forked child. prompt(), readText(),
+/// takeInterrupt() and repeatInterrupt() are for the main thread, the rest for any.
 class EngineServices {
   public:
     virtual ~EngineServices() = default;
@@ -54,6 +55,10 @@ class EngineServices {
 
     /// Whether the request that runs is to be interrupted; each interrupt is given once, to the main thread.
     virtual bool takeInterrupt() = 0;
+
+    /// Python has dropped an interrupt that takeInterrupt() gave, so it is given again. Returns false when the request
+    /// that runs was given none.
+    virtual bool repeatInterrupt() = 0;
 
     /// Hands on what was written to descriptors 1 and 2. Returns whether that was anything.
     virtual bool drainDescriptors() = 0;

@@ -38,7 +38,8 @@ std::size_t utf8Length(Py_UCS4 point) noexcept {
 // Builds one record and its causes. The members are what all levels share.
 class Builder {
   public:
-    explicit Builder(const RecordBounds& bounds) : bounds_(bounds), left_(bounds.totalBytes) {}
+    Builder(const RecordBounds& bounds, bool& interrupted)
+        : bounds_(bounds), left_(bounds.totalBytes), interrupted_(interrupted) {}
 
     RuntimeException build(PyObject* exception, inExecutionStatus status, std::size_t depth) {
         seen_.insert(exception);
@@ -124,9 +125,24 @@ class Builder {
         return boundedUtf8(dotted.ptr(), kNameBytes);
     }
 
+    // The text where it is what the exception was made with; null where only code can tell.
+    static py::object plainText(PyObject* exception) {
+        PyObject* const arguments = reinterpret_cast<PyBaseExceptionObject*>(exception)->args;
+        if (Py_TYPE(exception)->tp_str != reinterpret_cast<PyTypeObject*>(PyExc_BaseException)->tp_str ||
+            PyTuple_GET_SIZE(arguments) > 1) {
+            return {};
+        }
+        if (PyTuple_GET_SIZE(arguments) == 0) {
+            return py::str();
+        }
+        PyObject* const text = PyTuple_GET_ITEM(arguments, 0);
+        return PyUnicode_CheckExact(text) ? py::reinterpret_borrow<py::object>(text) : py::object();
+    }
+
     std::u16string message(PyObject* exception, const std::string& name) {
-        const py::object text = owned(PyObject_Str(exception));
+        const py::object text = interrupted_ ? plainText(exception) : owned(PyObject_Str(exception));
         if (!text) {
+            interrupted_ = interrupted_ || PyErr_ExceptionMatches(PyExc_KeyboardInterrupt) != 0;
             PyErr_Clear();
             const std::string unprintable = "<unprintable " + name + " object>";
             take(unprintable.size());
@@ -198,12 +214,14 @@ class Builder {
     const RecordBounds bounds_;
     std::size_t left_;
     std::unordered_set<PyObject*> seen_;
+    bool& interrupted_;
 };
 
 }  // namespace
 
-RuntimeException errorRecord(PyObject* exception, inExecutionStatus status, const RecordBounds& bounds) {
-    return Builder(bounds).build(exception, status, 1);
+RuntimeException errorRecord(PyObject* exception, inExecutionStatus status, const RecordBounds& bounds,
+                             bool& interrupted) {
+    return Builder(bounds, interrupted).build(exception, status, 1);
 }
 
 inExecutionStatus statusOf(PyObject* exception) noexcept {

@@ -27,10 +27,11 @@ struct RecordBounds {
 /// each exception once, however often it is reached. `status` is that of the error itself; its causes have
 /// inEXECUTION_CTRLC for an interrupt and inRUNTIME_ERROR otherwise.
 ///
-/// Runs the exceptions' own __str__ and nothing else of theirs. Leaves no Python exception set; throws std::bad_alloc
-/// only. The caller holds the interpreter lock.
+/// Runs the exceptions' own __str__ and nothing else of theirs, and not even that once `interrupted` is set, which a
+/// KeyboardInterrupt does that leaves one: then only texts that need no code are there. Leaves no Python exception set;
+/// throws std::bad_alloc only. The caller holds the interpreter lock.
 cmddistributor::RuntimeException errorRecord(PyObject* exception, krutil::cmddistributor::inExecutionStatus status,
-                                             const RecordBounds& bounds = {});
+                                             const RecordBounds& bounds, bool& interrupted);
 
 /// Status of an error that running code raised, by its type.
 krutil::cmddistributor::inExecutionStatus statusOf(PyObject* exception) noexcept;

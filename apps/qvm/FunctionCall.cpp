@@ -66,7 +66,7 @@ std::vector<py::str> partsOf(const std::string& name) {
 
 // The module of this name, imported if need be; null when there is none.
 py::object importIfThere(const py::str& moduleName) {
-    if (py::object module = py::reinterpret_steal<py::object>(PyImport_Import(moduleName.ptr()))) {
+    if (auto module = py::reinterpret_steal<py::object>(PyImport_Import(moduleName.ptr()))) {
         return module;
     }
     py::error_already_set error;
@@ -78,8 +78,8 @@ py::object importIfThere(const py::str& moduleName) {
 }
 
 // An attribute, or null when there is none.
-py::object attributeIfThere(const py::object& object, const py::str& attribute) {
-    py::object found = py::reinterpret_steal<py::object>(PyObject_GetAttr(object.ptr(), attribute.ptr()));
+py::object attributeIfThere(const py::handle& object, const py::str& attribute) {
+    auto found = py::reinterpret_steal<py::object>(PyObject_GetAttr(object.ptr(), attribute.ptr()));
     if (!found) {
         if (PyErr_ExceptionMatches(PyExc_AttributeError) == 0) {
             throw py::error_already_set();
@@ -114,7 +114,7 @@ py::object further(const py::object& container, const std::string& path, const p
                                         typeNameOf(container) + ") has no attribute " + quoted(partName));
     }
     const py::object package = attributeIfThere(container, py::str("__name__"));
-    if (package && PyUnicode_Check(package.ptr()) && py::hasattr(container, "__path__")) {
+    if (package && PyUnicode_Check(package.ptr()) && attributeIfThere(container, py::str("__path__"))) {
         if (py::object module = importIfThere(py::str(package) + py::str(".") + part)) {
             return module;
         }
@@ -132,7 +132,7 @@ Array output(const py::handle& value, const std::string& what, ReleaseQueue& rel
 }
 
 bool isNumber(const py::handle& value) {
-    return PyNumber_Check(value.ptr()) != 0 && !py::hasattr(value, "__len__");
+    return PyNumber_Check(value.ptr()) != 0 && !attributeIfThere(value, py::str("__len__"));
 }
 
 std::string outputs(std::uint64_t count) {

@@ -31,6 +31,7 @@ namespace {
 
 using cmddistributor::RuntimeException;
 using krutil::cmddistributor::inCOMPILE_ERROR;
+using krutil::cmddistributor::inEXECUTION_CTRLC;
 using krutil::cmddistributor::inEXECUTION_DBQUIT;
 using krutil::cmddistributor::inExecutionStatus;
 using krutil::cmddistributor::inRUNTIME_ERROR;
@@ -247,7 +248,7 @@ Interpreter::Outcome Interpreter::evaluate(const cmddistributor::EvalIIP& reques
     names.forgetWarnings();
     const std::string file = "<eval-" + std::to_string(++evaluations_) + ">";
     const auto source = py::reinterpret_steal<py::object>(strOf(request.getCommand()));
-    const py::object compiled = py::reinterpret_steal<py::object>(
+    const auto compiled = py::reinterpret_steal<py::object>(
         source ? PyObject_CallFunction(state_->compile.ptr(), "Osi", source.ptr(), file.c_str(),
                                        static_cast<int>(request.getCodeType()))
                : nullptr);
@@ -279,7 +280,7 @@ Interpreter::Outcome Interpreter::evaluate(const cmddistributor::EvalIIP& reques
     return {};
 }
 
-Interpreter::CallOutcome Interpreter::call(const cmddistributor::FEvalIIP& request) {
+Interpreter::CallOutcome Interpreter::call(const cmddistributor::FEvalIIP& request, Outputs outputs) {
     Namespace(state_->globals).forgetWarnings();
     CallOutcome outcome;
     try {
@@ -290,6 +291,12 @@ Interpreter::CallOutcome Interpreter::call(const cmddistributor::FEvalIIP& reque
             endForkedChild({});
         }
         outcome.outputs = outputsOf(value, name, request.getNlhs(), state_->releases);
+        if (outputs == Outputs::Copied) {
+            for (foundation::korveldata::Array& array : outcome.outputs) {
+                // Gives an array over memory of another owner elements of its own.
+                array.mutableData();
+            }
+        }
     } catch (py::error_already_set& error) {
         error.restore();
     } catch (const std::bad_alloc&) {
@@ -317,26 +324,37 @@ Interpreter::Outcome Interpreter::failure(inExecutionStatus status) {
         endForkedChild(exception);
     }
     Outcome outcome;
+    bool interrupted = isA(exception, PyExc_KeyboardInterrupt);
+    if (interrupted) {
+        outcome.error = errorRecord(exception.ptr(), statusOf(exception.ptr()), bounds_, interrupted);
+        return outcome;
+    }
     if (isA(exception, PyExc_SystemExit)) {
         outcome.exit = true;
         if (exitStatus(exception) != 0) {
-            RuntimeException record = errorRecord(exception.ptr(), inRUNTIME_ERROR, bounds_);
+            RuntimeException record = errorRecord(exception.ptr(), inRUNTIME_ERROR, bounds_, interrupted);
             outcome.error =
                 RuntimeException(inRUNTIME_ERROR, record.GetUnicodeMessageTxt(), "SystemExit", record.getFunctionName(),
                                  record.getStackFrames(), record.getCauses(), false);
         }
-    } else if (isA(exception, PyExc_KeyboardInterrupt)) {
-        outcome.error = errorRecord(exception.ptr(), statusOf(exception.ptr()), bounds_);
     } else if (isA(exception, state_->debuggerQuit.ptr())) {
-        outcome.error = errorRecord(exception.ptr(), inEXECUTION_DBQUIT, bounds_);
+        outcome.error = errorRecord(exception.ptr(), inEXECUTION_DBQUIT, bounds_, interrupted);
     } else {
-        outcome.error = errorRecord(exception.ptr(), status, bounds_);
-        outcome.printed = printedText(exception.ptr(), *outcome.error);
+        outcome.error = errorRecord(exception.ptr(), status, bounds_, interrupted);
+        if (!interrupted) {
+            outcome.printed = printedText(exception.ptr(), *outcome.error, interrupted);
+        }
+    }
+    if (interrupted) {
+        outcome.error =
+            RuntimeException(inEXECUTION_CTRLC, u"The request was interrupted while its error was formatted.",
+                             "KeyboardInterrupt", "", {}, {*outcome.error}, false);
+        outcome.printed.clear();
     }
     return outcome;
 }
 
-std::u16string Interpreter::printedText(PyObject* exception, const RuntimeException& record) const {
+std::u16string Interpreter::printedText(PyObject* exception, const RuntimeException& record, bool& interrupted) const {
     // A character is at most four bytes on the wire, and the record takes up to half of what a message may hold.
     const auto text = py::reinterpret_steal<py::object>(PyObject_CallFunction(
         state_->formatError.ptr(), "On", exception, static_cast<Py_ssize_t>(bounds_.totalBytes / 8)));
@@ -344,6 +362,7 @@ std::u16string Interpreter::printedText(PyObject* exception, const RuntimeExcept
         return utf16Of(text.ptr());
     }
     // Types of running code can make formatting fail.
+    interrupted = !text && PyErr_ExceptionMatches(PyExc_KeyboardInterrupt) != 0;
     PyErr_Clear();
     std::u16string plain = msg_svc::protobuf::utf8_to_ustring(record.GetID());
     if (!record.GetUnicodeMessageTxt().empty()) {

@@ -36,6 +36,9 @@ class Interpreter {
         std::vector<foundation::korveldata::Array> outputs;  ///< none after an error
     };
 
+    /// What becomes of the memory of a call's outputs.
+    enum class Outputs { Shared, Copied };
+
     /// Starts Python. The module _qvm must have been installed. Throws std::runtime_error with Python's reason.
     explicit Interpreter(RecordBounds bounds);
 
@@ -46,15 +49,16 @@ class Interpreter {
     Interpreter& operator=(const Interpreter&) = delete;
 
     /// Runs the request's text as its code type says. Nothing that the text raises leaves this function, SystemExit
-    /// included. In a process that the text has forked it does not return. `frame` is one that stands still, whose
-    /// variables the text sees and assigns; null for the namespace of the session. Evaluations nest.
+    /// included. An interrupt that comes while its error is put into words is the error then. In a process that the
+    /// text has forked it does not return. `frame` is one that stands still, whose variables the text sees and assigns;
+    /// null for the namespace of the session. Evaluations nest.
     Outcome evaluate(const cmddistributor::EvalIIP& request, PyObject* frame = nullptr);
 
     /// Calls the function that the request names with the arrays that it carries, which are taken out of it, and
-    /// returns as many outputs as it asks for; see FunctionCall.hpp. The outputs share memory with Python: it comes
-    /// back through dropReleased(), and nothing that could write to it should run before they are sent. Everything else
-    /// is as for evaluate().
-    CallOutcome call(const cmddistributor::FEvalIIP& request);
+    /// returns as many outputs as it asks for; see FunctionCall.hpp. Unless they are to be copied, the outputs share
+    /// memory with Python: it comes back through dropReleased(), and nothing that could write to it should run before
+    /// they are sent. Everything else is as for evaluate().
+    CallOutcome call(const cmddistributor::FEvalIIP& request, Outputs outputs);
 
     /// Drops Python's share in the memory of outputs that are not used any more, on whatever thread they ended.
     void dropReleased() noexcept;
@@ -77,7 +81,8 @@ class Interpreter {
 
     // The outcome of the Python exception that is set.
     Outcome failure(krutil::cmddistributor::inExecutionStatus status);
-    std::u16string printedText(PyObject* exception, const cmddistributor::RuntimeException& record) const;
+    std::u16string printedText(PyObject* exception, const cmddistributor::RuntimeException& record,
+                               bool& interrupted) const;
 
     const RecordBounds bounds_;
     std::unique_ptr<State> state_;

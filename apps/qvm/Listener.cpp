@@ -27,6 +27,9 @@ namespace {
 // How long sessions have to end after they were told to.
 constexpr std::chrono::seconds kSessionPatience{2};
 
+// How long a client waits that could not be accepted, until that is tried again. The end of a session shortens it.
+constexpr int kAcceptPauseMilliseconds = 1000;
+
 [[noreturn]] void fail(const std::string& what) {
     throw std::runtime_error(what);
 }
@@ -108,12 +111,22 @@ bool somebodyAnswers(const sockaddr_un& address) {
     return ::connect(probe.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)) == 0 || errno == EAGAIN;
 }
 
+// Whether the system lacks what every accept needs, whoever waits.
+bool isShortage(int error) noexcept {
+    return error == EMFILE || error == ENFILE || error == ENOBUFS || error == ENOMEM;
+}
+
+// Those that end the engine are not among them if whoever started it has had them ignored.
 sigset_t watchedSignals() {
     sigset_t signals;
     ::sigemptyset(&signals);
     ::sigaddset(&signals, SIGCHLD);
-    ::sigaddset(&signals, SIGTERM);
-    ::sigaddset(&signals, SIGINT);
+    for (const int number : {SIGTERM, SIGINT, SIGHUP}) {
+        struct sigaction handling {};
+        if (::sigaction(number, nullptr, &handling) == 0 && handling.sa_handler != SIG_IGN) {
+            ::sigaddset(&signals, number);
+        }
+    }
     return signals;
 }
 
@@ -176,8 +189,10 @@ void Listener::bindSocket() {
 ExitCode Listener::run() {
     log_.say("serving " + options_.listen);
     while (true) {
-        std::array<pollfd, 2> watched{{{signals_, POLLIN, 0}, {socket_, POLLIN, 0}}};
-        if (::poll(watched.data(), watched.size(), -1) < 0 && errno != EINTR) {
+        // The socket stays readable while clients wait, so it is not watched while none can be accepted.
+        const bool paused = failedAccepts_ > 0;
+        std::array<pollfd, 2> watched{{{signals_, POLLIN, 0}, {paused ? -1 : socket_, POLLIN, 0}}};
+        if (::poll(watched.data(), watched.size(), paused ? kAcceptPauseMilliseconds : -1) < 0 && errno != EINTR) {
             failWithErrno("Cannot wait for clients");
         }
         signalfd_siginfo signal{};
@@ -189,7 +204,9 @@ ExitCode Listener::run() {
             endSessions();
             return ExitCode::Ok;
         }
-        accept();
+        if (paused || watched[1].revents != 0) {
+            accept();
+        }
         if (connection_ >= 0) {
             Engine engine(options_, log_);
             return engine.run(connection_, connection_);
@@ -199,7 +216,19 @@ ExitCode Listener::run() {
 
 void Listener::accept() {
     const int connection = ::accept4(socket_, nullptr, nullptr, SOCK_CLOEXEC);
+    if (connection < 0 && isShortage(errno)) {
+        if (failedAccepts_ == 0) {
+            log_.say("cannot accept a client: " + std::generic_category().message(errno) + "; clients wait meanwhile");
+        }
+        ++failedAccepts_;
+        return;
+    }
+    if (failedAccepts_ > 0) {
+        log_.say("clients are accepted again after " + std::to_string(failedAccepts_) + " failed attempts");
+        failedAccepts_ = 0;
+    }
     if (connection < 0) {
+        // The client has gone again.
         return;
     }
     ucred peer{};

@@ -26,8 +26,9 @@ class Listener {
     Listener(const Listener&) = delete;
     Listener& operator=(const Listener&) = delete;
 
-    /// Accepts clients of the same user until SIGTERM or SIGINT, then ends the sessions that are left. Returns how the
-    /// process is to end: this one, or one that was forked for a session.
+    /// Accepts clients of the same user until SIGTERM, SIGINT or SIGHUP, as far as they are not ignored, then ends the
+    /// sessions that are left. While the system has no descriptor for a client, clients wait. Returns how the process
+    /// is to end: this one, or one that was forked for a session.
     ExitCode run();
 
   private:
@@ -42,6 +43,8 @@ class Listener {
     int signals_ = -1;
     ino_t inode_ = 0;
     std::set<pid_t> sessions_;
+    // Attempts since there was last a descriptor for a client.
+    unsigned failedAccepts_ = 0;
     // Set in a process that was forked for a session.
     int connection_ = -1;
 };

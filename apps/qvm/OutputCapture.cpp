@@ -188,9 +188,8 @@ void OutputCapture::finish() {
 }
 
 void OutputCapture::run() {
+    std::array<pollfd, 3> watched{{{stop_, POLLIN, 0}, {sources_[0].pipe, POLLIN, 0}, {sources_[1].pipe, POLLIN, 0}}};
     while (true) {
-        std::array<pollfd, 3> watched{
-            {{stop_, POLLIN, 0}, {sources_[0].pipe, POLLIN, 0}, {sources_[1].pipe, POLLIN, 0}}};
         if (::poll(watched.data(), watched.size(), -1) < 0 && errno != EINTR) {
             return;
         }
@@ -198,6 +197,12 @@ void OutputCapture::run() {
             return;
         }
         drain();
+        for (pollfd& each : watched) {
+            if (each.revents != 0 && (each.revents & POLLIN) == 0) {
+                // Running code has closed one of the ends, so nothing will ever come.
+                each.fd = -1;
+            }
+        }
         waitForRoom_();
     }
 }

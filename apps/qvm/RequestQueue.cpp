@@ -107,11 +107,14 @@ RequestQueue::Wait RequestQueue::wait(DequeuePoint point, int interrupt, Deadlin
             if (std::any_of(entries_.begin(), entries_.end(), isMeant)) {
                 return Wait::Due;
             }
+            if (std::exchange(interruptWait_, false)) {
+                return Wait::Interrupted;
+            }
         }
         timespec left{};
         if (deadline) {
             const auto span = *deadline - std::chrono::steady_clock::now();
-            if (span <= span.zero()) {
+            if (span <= std::chrono::steady_clock::duration::zero()) {
                 return Wait::TimedOut;
             }
             const auto seconds = std::chrono::duration_cast<std::chrono::seconds>(span);
@@ -193,6 +196,14 @@ std::vector<Request> RequestQueue::takeAll() {
     entries_.clear();
     bytes_ = 0;
     return requests;
+}
+
+void RequestQueue::interruptWait() {
+    {
+        std::lock_guard lock(mutex_);
+        interruptWait_ = true;
+    }
+    wake();
 }
 
 void RequestQueue::close() {

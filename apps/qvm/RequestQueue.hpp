@@ -52,7 +52,7 @@ class RequestQueue {
     enum class Wait {
         Due,          ///< take() has something to give
         Closed,       ///< close() has been called
-        Interrupted,  ///< a signal was delivered to this thread, or `interrupt` is readable
+        Interrupted,  ///< a signal was delivered to this thread, `interrupt` is readable, or interruptWait() was called
         TimedOut,     ///< the deadline has passed
     };
 
@@ -73,6 +73,9 @@ class RequestQueue {
     /// readable, -1 for none. `signals` are blocked during the wait instead of those that the thread blocks now; null
     /// for no change.
     Wait wait(DequeuePoint point, int interrupt = -1, Deadline deadline = {}, const sigset_t* signals = nullptr);
+
+    /// Ends the wait that is under way, or else the next one, unless that has a request.
+    void interruptWait();
 
     /// Takes out the first request that is due at `point` and of no batch. Empty when none is; works on a closed queue
     /// too.
@@ -116,6 +119,7 @@ class RequestQueue {
     std::deque<Entry> entries_;
     std::size_t bytes_ = 0;
     bool closed_ = false;
+    bool interruptWait_ = false;
 };
 
 }  // namespace qvm

@@ -16,6 +16,9 @@ import sys as _sys
 import time as _time
 import traceback as _traceback
 import warnings as _warnings
+from errno import EINVAL as _EINVAL
+from functools import wraps as _wraps
+from os import strerror as _strerror
 import _warnings as _c_warnings
 from _thread import _local as _Local
 from operator import index as _index
@@ -157,11 +160,13 @@ class DebuggerQuit(BaseException):
 
 
 def _take_commands(prompt, frame):
+    """Whether the client could be asked to the end."""
     end = prompt(frame)
     if end == "quit":
         raise DebuggerQuit("The debugger was left with quit.")
     if end == "exit":
         raise SystemExit
+    return end != "withdrawn"
 
 
 def _breakpoint(*arguments, **options):
@@ -173,7 +178,8 @@ def _breakpoint(*arguments, **options):
     code = frame.f_code
     line = _linecache.getline(code.co_filename, frame.f_lineno).strip()
     _qvm.show(f"Stopped in {code.co_name} ({code.co_filename}:{frame.f_lineno})\n" + (f"    {line}\n" if line else ""))
-    _take_commands(_qvm.debug_prompt, frame)
+    if not _take_commands(_qvm.debug_prompt, frame):
+        _warn("breakpoint() goes on: the client has no debugger any more", RuntimeWarning, 2)
 
 
 def keyboard():
@@ -181,20 +187,22 @@ def keyboard():
     if not _qvm.can_ask():
         _warn("qvm.keyboard() goes on: the client cannot be asked", RuntimeWarning, 2)
         return
-    _take_commands(_qvm.keyboard_prompt, _sys._getframe(1))
+    if not _take_commands(_qvm.keyboard_prompt, _sys._getframe(1)):
+        _warn("qvm.keyboard() goes on: the client cannot be asked any more", RuntimeWarning, 2)
 
 
 def pause(seconds=None):
     """Holds the running code up until the client says to go on, or for so many seconds."""
     if seconds is not None:
         seconds = float(seconds)
-    if _qvm.can_ask():
-        if _qvm.pause_prompt(seconds) == "exit":
-            raise SystemExit
-    elif seconds is not None:
-        _time.sleep(max(seconds, 0))
-    else:
+    begin = _time.monotonic()
+    way_out = _qvm.pause_prompt(seconds) if _qvm.can_ask() else "withdrawn"
+    if way_out == "exit":
+        raise SystemExit
+    if way_out == "withdrawn" and seconds is None:
         _warn("qvm.pause() goes on: the client cannot be asked", RuntimeWarning, 2)
+    elif way_out == "withdrawn":
+        _time.sleep(max(begin + seconds - _time.monotonic(), 0))
 
 
 def dbcont():
@@ -323,6 +331,21 @@ def _warn_explicit(message, category, filename, lineno, *arguments, **options):
                shown)
 
 
+def _safe_string(value, what, func=str):
+    """traceback._safe_string: as Python's own, but an interrupt ends the formatting."""
+    try:
+        return func(value)
+    except KeyboardInterrupt:
+        raise
+    except:
+        return f"<{what} {func.__name__}() failed>"
+
+
+def _print_error(type, error, traceback):
+    """sys.excepthook: Python's own drops interrupts."""
+    _traceback.print_exception(type, error, traceback)
+
+
 def _hide_engine(report):
     """Takes the engine's frames out of a traceback.TracebackException and all that it refers to."""
     seen, waiting = set(), [report]
@@ -338,7 +361,9 @@ def _hide_engine(report):
 
 def _format_error(error, limit):
     """The text that Python prints for an uncaught error, cut after about limit characters."""
-    report = _traceback.TracebackException(type(error), error, error.__traceback__, compact=True)
+    # As many frames as Python's own printing shows.
+    frames = getattr(_sys, "tracebacklimit", -1000)
+    report = _traceback.TracebackException(type(error), error, error.__traceback__, limit=frames, compact=True)
     _hide_engine(report)
     pieces, length = [], 0
     for piece in report.format():
@@ -348,6 +373,23 @@ def _format_error(error, limit):
         pieces.append(piece)
         length += len(piece)
     return "".join(pieces)
+
+
+# The signal that carries cancels is to code what SIGKILL is: it can be neither handled nor blocked.
+_set_handler = _signal.signal
+_set_mask = _signal.pthread_sigmask
+
+
+@_wraps(_set_handler)
+def _signal_signal(signalnum, handler):
+    if signalnum == _qvm.interrupt_signal:
+        raise OSError(_EINVAL, _strerror(_EINVAL))
+    return _set_handler(signalnum, handler)
+
+
+@_wraps(_set_mask)
+def _signal_pthread_sigmask(how, mask):
+    return _set_mask(how, [each for each in mask if each != _qvm.interrupt_signal])
 
 
 # Sources of evaluated code, for tracebacks and inspection: the newest, by number and by length.
@@ -423,7 +465,11 @@ _sys.stderr = _sys.__stderr__ = _TextStream("<stderr>", 2, _qvm.write_error)
 _sys.displayhook = _sys.__displayhook__ = _show
 _sys.stdin = _sys.__stdin__ = _InputStream()
 _sys.breakpointhook = _sys.__breakpointhook__ = _breakpoint
-_signal.signal(_qvm.interrupt_signal, _qvm.on_interrupt_signal)
+_sys.excepthook = _sys.__excepthook__ = _print_error
+_sys.unraisablehook = _qvm.on_unraisable
+_set_handler(_qvm.interrupt_signal, _qvm.on_interrupt_signal)
+_signal.signal, _signal.pthread_sigmask = _signal_signal, _signal_pthread_sigmask
+_traceback._safe_string = _safe_string
 _warnings._showwarnmsg = _on_shown
 for _name, _function in (("warn", _warn), ("warn_explicit", _warn_explicit)):
     _function.__name__ = _function.__qualname__ = _name

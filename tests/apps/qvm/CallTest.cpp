@@ -2,6 +2,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstdlib>
 
 #include "CallFixture.hpp"
@@ -219,6 +220,49 @@ TEST_F(CallTest, ReplyIsWrittenBeforeTheNextRequestRuns) {
     ASSERT_EQ(got.size(), 1U);
     EXPECT_EQ(difference(got[0], "numpy.ones(4 << 20)"), "");
     EXPECT_EQ(difference(call("current", {}).at(0), "numpy.full(4 << 20, 2.0)"), "");
+}
+
+TEST(CallAtAPromptTest, OutputIsWhatItWasThoughACancelLetsTheCodeGoOnBeforeItIsRead) {
+    EngineSession engine({}, {}, {capabilities::Capability::Debugging});
+    EngineClient& client = engine.client;
+    Gate returned;
+    Gate changed;
+    // The thread opens the first gate when the call is over and the main thread waits for its reply to be read.
+    const IDType outer = client.enqueue(
+        "import numpy, sys, threading, time\n"
+        "whole = numpy.full(50_000_000, 1, 'u1')\n"
+        "main = threading.get_ident()\n"
+        "def names(frame): return [] if frame is None else [frame.f_code.co_name] + names(frame.f_back)\n"
+        "def watch():\n"
+        "    while 'get' in names(sys._current_frames()[main]): time.sleep(0.001)\n"
+        "    while '<lambda>' in names(sys._current_frames()[main]): time.sleep(0.001)\n"
+        "    " +
+        returned.wait() +
+        "\n"
+        "def get():\n"
+        "    threading.Thread(target=watch).start()\n"
+        "    return whole\n"
+        "try: breakpoint()\n"
+        "finally:\n"
+        "    whole[:] = 2\n"
+        "    " +
+        changed.wait());
+    client.awaitLoop(outer, cmddistributor::DebugLoopEvent::ENTER);
+    client.stopReading();
+    EvalOptions atPrompt;
+    atPrompt.mode = krutil::cmddistributor::WhenToDequeue::DEQUEUE_AT_PROMPT;
+    const IDType inner = client.enqueue(callOf("get", {}), atPrompt);
+    returned.open();
+    const session::framing::StreamID cancel = client.startCancel(outer);
+    // The memory is changed while the reply, which no buffer on the way can hold, has not been read.
+    changed.open();
+    client.readOn();
+    EXPECT_EQ(client.awaitCancel(cancel), cmddistributor::IIPCancelReply::PENDING_CANCEL);
+    const std::vector<Array> outputs = outputsOf(client.await(inner));
+    ASSERT_EQ(outputs.size(), 1U);
+    const char* const elements = outputs[0].data();
+    EXPECT_EQ(std::count(elements, elements + outputs[0].sizeInBytes(), '\1'), 50'000'000);
+    EXPECT_EQ(client.await(outer).errorId(), "KeyboardInterrupt");
 }
 
 TEST_F(CallTest, OutputsMayBeArgumentsAndShareMemory) {

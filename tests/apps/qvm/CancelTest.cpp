@@ -2,8 +2,10 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <chrono>
 
+#include "CallFixture.hpp"
 #include "EngineFixture.hpp"
 
 namespace qvm_test {
@@ -22,7 +24,7 @@ class CancelTest : public testing::Test {
     EngineClient& client() { return engine_.client; }
 
     // Waits until the code of a request is running.
-    IDType running(const std::string& code) { return startedBy("print('ready')\n" + code); }
+    IDType running(const std::string& code) { return startedBy("print('ready\\n', end='')\n" + code); }
 
     // The same for code that prints "ready" itself.
     IDType startedBy(const std::string& code) {
@@ -39,14 +41,19 @@ class CancelTest : public testing::Test {
         EXPECT_FALSE(result.discarded());
     }
 
-    // Cancels running code, which has a second to end.
+    // Cancels running code, which has a second to end. A machine that is busy with other things may need longer now and
+    // then, but not each time.
     void expectStops(const std::string& code) {
-        const IDType id = running(code);
-        const auto begin = std::chrono::steady_clock::now();
-        EXPECT_EQ(client().cancel(id), IIPCancelReply::PENDING_CANCEL);
-        expectInterrupted(client().await(id));
-        EXPECT_LT(std::chrono::steady_clock::now() - begin, std::chrono::seconds(1)) << code;
-        EXPECT_EQ(client().eval("1 + 1").shown(), "2\n");
+        std::chrono::steady_clock::duration fastest = kPatience;
+        for (int i = 0; i < 5 && fastest > std::chrono::seconds(1); ++i) {
+            const IDType id = running(code);
+            const auto begin = std::chrono::steady_clock::now();
+            EXPECT_EQ(client().cancel(id), IIPCancelReply::PENDING_CANCEL);
+            expectInterrupted(client().await(id));
+            fastest = std::min(fastest, std::chrono::steady_clock::now() - begin);
+            EXPECT_EQ(client().eval("1 + 1").shown(), "2\n");
+        }
+        EXPECT_LT(fastest, std::chrono::seconds(1)) << code;
     }
 
     EngineSession engine_{{}, {}, {Capability::InteractiveCommandLine, Capability::Debugging}};
@@ -79,6 +86,93 @@ TEST_F(CancelTest, CompilationStops) {
 
 TEST_F(CancelTest, SlowTextOfAValueStops) {
     expectStops("class Slow:\n    def __repr__(self):\n        while True: pass\nSlow()");
+}
+
+// Body of a function that goes on for ever.
+constexpr const char* kEndless = "    print('ready\\n', end='')\n    while True: pass\n";
+
+TEST_F(CancelTest, EndlessCodeStopsWhereverItIsCalledFrom) {
+    const std::string endlessText = "class E(Exception):\n    def __str__(self): endless()\n";
+    const std::string endlessEnd = "class D:\n    def __del__(self): endless()\n";
+    const std::vector<std::pair<const char*, std::string>> places{
+        {"text of an error", endlessText + "raise E"},
+        {"texts of many causes", endlessText + "e = E()\nfor i in range(50):\n    e, e.__cause__ = E(), e\nraise e"},
+        {"second text of an error",
+         "class E(Exception):\n    asked = False\n    def __str__(self):\n        if E.asked: endless()\n"
+         "        E.asked = True\n        return ''\nraise E"},
+        {"cause of an error", "class E(Exception):\n    __cause__ = property(lambda self: endless())\nraise E"},
+        {"note of an error", endlessText + "e = ValueError()\ne.__notes__ = [E()]\nraise e"},
+        {"making of an error", "class E(Exception):\n    def __init__(self): endless()\nraise E"},
+        {"text of a value", "class V:\n    def __repr__(self): endless()\nV()"},
+        {"display hook", "import sys\nsys.displayhook = lambda value: endless()\n1"},
+        {"hook for errors", endlessText + "import sys\ntry: raise E\nexcept E: sys.excepthook(*sys.exc_info())"},
+        {"printing of an error", endlessText + "import traceback\ntry: raise E\nexcept E: traceback.print_exc()"},
+        {"text of a warning",
+         "class W(UserWarning):\n    def __str__(self): endless()\nimport warnings\nwarnings.warn(W())"},
+        {"taker of warnings", "import warnings\nwarnings.showwarning = lambda *a: endless()\nwarnings.warn('w')"},
+        {"import",
+         "import sys\nclass F:\n    def find_spec(self, *a): endless()\nsys.meta_path.insert(0, F())\nimport nothing"},
+        {"finaliser", endlessEnd + "D()\nprint('not reached')"},
+        {"finalisers", endlessEnd + "many = [D() for i in range(50)]\ndel many\nprint('not reached')"},
+        {"finaliser of a local variable", endlessEnd + "def f():\n    d = D()\n    1 / 0\nf()"},
+        {"finaliser after a call", endlessEnd + "def f(): d = D()\nf()\nprint('not reached')"},
+        {"callback of a weak reference",
+         "import weakref\nclass C: pass\nc = C()\nr = weakref.ref(c, lambda r: endless())\ndel c\nprint('not "
+         "reached')"},
+        {"exit function", "import atexit\natexit.register(endless)\natexit._run_exitfuncs()\nprint('not reached')"},
+    };
+    for (const auto& [place, code] : places) {
+        SCOPED_TRACE(place);
+        const IDType id = startedBy(std::string("def endless():\n") + kEndless + code);
+        EXPECT_EQ(client().cancel(id), IIPCancelReply::PENDING_CANCEL);
+        const Evaluation result = client().await(id);
+        expectInterrupted(result);
+        EXPECT_EQ(result.output().find("not reached"), std::string::npos);
+        EXPECT_EQ(result.errors(), "");
+        client().eval(
+            "import atexit, sys, warnings\n"
+            "atexit._clear()\n"
+            "sys.displayhook = sys.__displayhook__\n"
+            "sys.meta_path[:] = [each for each in sys.meta_path if type(each).__name__ != 'F']\n"
+            "warnings.showwarning = warnings._showwarning_orig");
+        EXPECT_EQ(client().eval("1 + 1").shown(), "2\n");
+    }
+}
+
+TEST_F(CancelTest, ErrorWhoseTextWasInterruptedIsTheCause) {
+    const IDType id = client().enqueue(std::string("class E(Exception):\n    def __str__(self):\n    ") +
+                                       "    print('ready\\n', end='')\n        while True: pass\n"
+                                       "try: 1 / 0\nexcept ZeroDivisionError: raise E");
+    client().awaitText("ready");
+    client().cancel(id);
+    const Evaluation result = client().await(id);
+    expectInterrupted(result);
+    EXPECT_EQ(result.errorText(), "The request was interrupted while its error was formatted.");
+    ASSERT_EQ(result.error->getCauses().size(), 1U);
+    const cmddistributor::RuntimeException& error = result.error->getCauses()[0];
+    EXPECT_EQ(error.GetID(), "__main__.E");
+    EXPECT_EQ(error.GetUnicodeMessageTxt(), u"<unprintable __main__.E object>");
+    EXPECT_EQ(error.getStackFrames().back().line, 6);
+    ASSERT_EQ(error.getCauses().size(), 1U);
+    EXPECT_EQ(error.getCauses()[0].GetUnicodeMessageTxt(), u"division by zero");
+}
+
+TEST_F(CancelTest, SessionEndsThoughTheTextOfItsLastErrorWasInterrupted) {
+    const IDType id = startedBy(std::string("class E(SystemExit):\n    def __str__(self):\n    ") +
+                                "    print('ready\\n', end='')\n        while True: pass\nraise E(3)");
+    client().cancel(id);
+    expectInterrupted(client().await(id));
+    EXPECT_EQ(client().awaitEnd().reason, session::SessionEnd::Reason::Finished);
+    EXPECT_EQ(engine_.process.wait(), 0);
+}
+
+TEST_F(CancelTest, EndlessSearchForAFunctionStops) {
+    client().eval("import types\nm = types.ModuleType('m')\nm.__getattr__ = lambda name: endless()\ndef endless():\n" +
+                  std::string(kEndless));
+    const IDType id = client().enqueue(callOf("m.function", {}));
+    client().awaitText("ready");
+    EXPECT_EQ(client().cancel(id), IIPCancelReply::PENDING_CANCEL);
+    expectInterrupted(client().await(id));
 }
 
 TEST_F(CancelTest, InputStops) {
@@ -140,8 +234,8 @@ TEST_F(CancelTest, FinishedAndUnknownRequestsAreDone) {
 }
 
 TEST_F(CancelTest, CodeMayCatchTheInterruptAndGoOn) {
-    const IDType id =
-        startedBy("try:\n    print('ready')\n    while True: pass\nexcept KeyboardInterrupt:\n    print('caught')");
+    const IDType id = startedBy(
+        "try:\n    print('ready\\n', end='')\n    while True: pass\nexcept KeyboardInterrupt:\n    print('caught')");
     EXPECT_EQ(client().cancel(id), IIPCancelReply::PENDING_CANCEL);
     const Evaluation result = client().await(id);
     EXPECT_FALSE(result.error);
@@ -150,7 +244,7 @@ TEST_F(CancelTest, CodeMayCatchTheInterruptAndGoOn) {
 
 TEST_F(CancelTest, SecondCancelInterruptsAgain) {
     const IDType id = startedBy(
-        "try:\n    print('ready')\n    while True: pass\nexcept KeyboardInterrupt:\n    print('caught')\n"
+        "try:\n    print('ready\\n', end='')\n    while True: pass\nexcept KeyboardInterrupt:\n    print('caught')\n"
         "while True: pass");
     EXPECT_EQ(client().cancel(id), IIPCancelReply::PENDING_CANCEL);
     client().awaitText("caught");
@@ -164,7 +258,8 @@ TEST_F(CancelTest, OwnHandlerOfTheInterruptSignalDoesNotMatter) {
 }
 
 TEST_F(CancelTest, CleanupOfInterruptedCodeRuns) {
-    const IDType id = startedBy("try:\n    print('ready')\n    while True: pass\nfinally:\n    print('cleaned up')");
+    const IDType id =
+        startedBy("try:\n    print('ready\\n', end='')\n    while True: pass\nfinally:\n    print('cleaned up')");
     client().cancel(id);
     const Evaluation result = client().await(id);
     expectInterrupted(result);

@@ -3,7 +3,9 @@
 #include <gtest/gtest.h>
 
 #include "EngineFixture.hpp"
+#include "korvel/lang/diagnostic/IssuedEnabledWarningEvent.hpp"
 #include "krutil/capabilities_api/CapabilitiesChanged.hpp"
+#include "msg_svc/protobuf/ustring.hpp"
 
 namespace qvm_test {
 namespace {
@@ -12,6 +14,7 @@ using capabilities::Capability;
 using capabilities::CapabilityList;
 using cmddistributor::DebugLoopEvent;
 using krutil::capabilities_api::CapabilitiesChanged;
+using msg_svc::protobuf::ustring_to_utf8;
 using testing::Contains;
 using testing::ElementsAre;
 using testing::Not;
@@ -66,6 +69,122 @@ TEST(CapabilityTest, ChangeOfTheClientCounts) {
     EXPECT_EQ(engine.client.await(id).output(), "now\n");
     engine.client.changeCapabilities({});
     EXPECT_EQ(engine.client.eval("input()").errorId(), "EOFError");
+}
+
+class WithdrawalTest : public testing::Test {
+  protected:
+    EngineClient& client() { return engine_.client; }
+
+    IDType stopped(const std::string& code, const EvalOptions& options = {}) {
+        const IDType id = client().enqueue(code, options);
+        client().awaitLoop(id, DebugLoopEvent::ENTER);
+        return id;
+    }
+
+    // Waits until the engine has taken everything that was sent.
+    void settle() { client().cancel(IDType::random()); }
+
+    static std::string warningOf(const Evaluation& result) {
+        for (const Happening& each : result.events) {
+            if (const auto* const issued =
+                    dynamic_cast<const korvel::lang::diagnostic::IssuedEnabledWarningEvent*>(each.event.get())) {
+                return ustring_to_utf8(issued->getWarning().getMessage());
+            }
+        }
+        return "none";
+    }
+
+    EngineSession engine_{{}, {}, kBoth};
+};
+
+TEST_F(WithdrawalTest, InputPromptIsAtItsEnd) {
+    const IDType id = stopped("input('? ')");
+    client().changeCapabilities({Capability::Debugging});
+    const Evaluation result = client().await(id);
+    EXPECT_EQ(result.errorId(), "EOFError");
+    EXPECT_THAT(result.kinds(),
+                ElementsAre("IIPStartedEvent", "TextBaseEvent", "IIPSuspendedEvent", "DebugLoopEvent", "DebugLoopEvent",
+                            "IIPResumedEvent", "PrintableErrorEvent", "IIPCompletedEvent", "LastIIPEvent"));
+    client().changeCapabilities(kAsking);
+    const IDType again = stopped("input('? ')");
+    client().eval("line", atPrompt());
+    EXPECT_EQ(client().await(again).shown(), "'line'\n");
+}
+
+TEST_F(WithdrawalTest, AnswerThatWasSentBeforeCounts) {
+    const IDType id = stopped("print(input())");
+    const IDType answer = client().enqueue("in time", atPrompt());
+    client().changeCapabilities({});
+    EXPECT_FALSE(client().await(answer).error);
+    EXPECT_EQ(client().await(id).output(), "in time\n");
+}
+
+TEST_F(WithdrawalTest, OtherCapabilitiesDoNotMatter) {
+    const IDType id = stopped("print(input())");
+    client().changeCapabilities(kAsking);
+    settle();
+    EXPECT_FALSE(client().eval("still there", atPrompt()).error);
+    EXPECT_EQ(client().await(id).output(), "still there\n");
+}
+
+TEST_F(WithdrawalTest, DebugPromptGoesOn) {
+    const IDType id = stopped("breakpoint()\nprint('on')");
+    client().changeCapabilities(kAsking);
+    const Evaluation result = client().await(id);
+    EXPECT_FALSE(result.error);
+    EXPECT_EQ(result.output(), "on\n");
+    EXPECT_EQ(warningOf(result), "breakpoint() goes on: the client has no debugger any more");
+    EXPECT_THAT(result.kinds(),
+                ElementsAre("IIPStartedEvent", "SinkTextEvent", "IIPSuspendedEvent", "DebugLoopEvent", "DebugLoopEvent",
+                            "IIPResumedEvent", "IssuedWarningEvent", "IssuedEnabledWarningEvent", "TextBaseEvent",
+                            "IIPCompletedEvent", "LastIIPEvent"));
+}
+
+TEST_F(WithdrawalTest, RequestAtAPromptRunsToItsEnd) {
+    Gate gate;
+    const IDType outer = stopped("breakpoint()\nprint('on')");
+    const IDType inner = client().enqueue(gate.wait() + "\nprint('inner')", atPrompt());
+    client().awaitKind(inner, "IIPStartedEvent");
+    client().changeCapabilities({});
+    settle();
+    gate.open();
+    EXPECT_EQ(client().await(inner).output(), "inner\n");
+    EXPECT_EQ(client().await(outer).output(), "on\n");
+}
+
+TEST_F(WithdrawalTest, NestedPromptsEndFromTheInnermost) {
+    const IDType outer = stopped("breakpoint()\nprint('on')");
+    const IDType inner = stopped("input()", atPrompt());
+    client().changeCapabilities({});
+    EXPECT_EQ(client().await(inner).errorId(), "EOFError");
+    EXPECT_EQ(client().await(outer).output(), "on\n");
+}
+
+TEST_F(WithdrawalTest, KeyboardAndPauseGoOn) {
+    const IDType keyboard = stopped("import qvm\nqvm.keyboard()\nprint('on')");
+    client().changeCapabilities({});
+    const Evaluation left = client().await(keyboard);
+    EXPECT_EQ(left.output(), "on\n");
+    EXPECT_EQ(warningOf(left), "qvm.keyboard() goes on: the client cannot be asked any more");
+
+    client().changeCapabilities(kBoth);
+    const IDType pause = stopped("qvm.pause()\nprint('on')");
+    client().changeCapabilities({});
+    const Evaluation paused = client().await(pause);
+    EXPECT_EQ(paused.output(), "on\n");
+    EXPECT_EQ(warningOf(paused), "qvm.pause() goes on: the client cannot be asked");
+}
+
+TEST_F(WithdrawalTest, PauseLastsItsSecondsAllTheSame) {
+    const IDType id = stopped("import qvm\nqvm.pause(1000)\nprint('over')");
+    client().changeCapabilities({});
+    client().awaitLoop(id, DebugLoopEvent::EXIT);
+    // Only a cancel ends it now.
+    client().awaitKind(id, "IIPResumedEvent");
+    EXPECT_EQ(client().cancel(id), cmddistributor::IIPCancelReply::PENDING_CANCEL);
+    const Evaluation result = client().await(id);
+    EXPECT_EQ(result.errorId(), "KeyboardInterrupt");
+    EXPECT_EQ(warningOf(result), "none");
 }
 
 TEST(CapabilityTest, EngineSwitchesItsDebuggerAndSaysSo) {

@@ -5,7 +5,7 @@
 //     const Evaluation result = client.eval("print(1 + 1)");
 //     EXPECT_EQ(result.output(), "2\n");
 //
-// The events of every evaluation are checked for their order (RequestLife.hpp).
+// Every request's events and its reply are checked for their order as they come (RequestLife.hpp).
 #pragma once
 
 #include <sys/types.h>
@@ -21,6 +21,7 @@
 #include <string>
 #include <vector>
 
+#include "RequestLife.hpp"
 #include "capabilities/CapabilityList.hpp"
 #include "cmddistributor/CodeType.hpp"
 #include "cmddistributor/DebugLoopEvent.hpp"
@@ -109,7 +110,8 @@ struct Evaluation {
     /// All texts of one kind, joined.
     std::string text(const std::string& kind, StreamTypeEnum type) const;
 
-    /// Kinds of the events in order.
+    /// Kinds of the events in order. Pieces of one text count as one: a line that takes long to be written comes in
+    /// several.
     std::vector<std::string> kinds() const;
 
     bool discarded() const;
@@ -142,7 +144,7 @@ class EngineClient : private session::SessionHandler {
     /// The same for any kind of request.
     IDType enqueue(const boost::shared_ptr<const cmddistributor::IIP>& iip, const EvalOptions& options = {});
 
-    /// Waits for the reply; checks the order of the request's events. Throws std::runtime_error when the session ends
+    /// Waits for the reply. Throws std::runtime_error when the session ends
     /// or the patience is over before.
     Evaluation await(const IDType& id);
 
@@ -194,6 +196,7 @@ class EngineClient : private session::SessionHandler {
   private:
     struct Exchange {
         IDType id;
+        session_test::RequestLife life;  ///< of a request
         std::vector<Happening> events;
         boost::shared_ptr<const krutil::cmddistributor::IIPReply> reply;
         boost::shared_ptr<const cmddistributor::IIPCancelReply> cancelReply;

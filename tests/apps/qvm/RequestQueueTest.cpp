@@ -196,6 +196,17 @@ TEST(RequestQueueTest, WaitEndsWhenTheQueueIsClosed) {
     EXPECT_EQ(waited.get(), RequestQueue::Wait::Closed);
 }
 
+TEST(RequestQueueTest, WaitThatIsInterruptedEndsOnceAndOnlyWithoutARequest) {
+    RequestQueue queue({});
+    auto waiting = std::async(std::launch::async, [&queue] { return queue.wait(DequeuePoint::Idle); });
+    queue.interruptWait();
+    EXPECT_EQ(waiting.get(), RequestQueue::Wait::Interrupted);
+    EXPECT_EQ(queue.wait(DequeuePoint::Idle, -1, std::chrono::steady_clock::now()), RequestQueue::Wait::TimedOut);
+    queue.put(numbered(1));
+    queue.interruptWait();
+    EXPECT_EQ(queue.wait(DequeuePoint::Idle), RequestQueue::Wait::Due);
+}
+
 TEST(RequestQueueTest, WaitEndsWhenItsInterruptIsReadable) {
     RequestQueue queue({});
     const int interrupt = ::eventfd(1, EFD_CLOEXEC);

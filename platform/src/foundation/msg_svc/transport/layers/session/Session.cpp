@@ -194,6 +194,7 @@ class Session::Impl {
     void onRead(ErrorCode error, std::size_t count);
     bool takeRead(const ErrorCode& error, std::size_t count);
     void onEndOfStream();
+    void awaitHangUp();
     void take(MessageReader::Item item);
     void takeMessage(std::vector<std::unique_ptr<framing::Frame>> frames);
     template <class T>
@@ -203,6 +204,7 @@ class Session::Impl {
     void writeFailed(int error);
     void beginClose(std::chrono::milliseconds patience);
     SessionEnd ownEnd() const;
+    bool shutdownWritten() const;
     void violation(const std::string& text);
     void finish(SessionEnd end, const std::string& abortReason);
     void closeDown();
@@ -671,15 +673,12 @@ void Session::Impl::onEndOfStream() {
         readingStopped_ = true;
         if (writeError_ != 0) {
             finish({SessionEnd::Reason::Lost, "cannot write to the stream: " + errorText(writeError_)}, {});
+        } else {
+            awaitHangUp();
         }
         return;
     }
-    bool told = shutdownReceived_;
-    if (!client) {
-        const std::lock_guard lock(mutex_);
-        told = shutdownSent_ && queue_.empty() && !writeFailed_;
-    }
-    if (boundary && told) {
+    if (boundary && (client ? shutdownReceived_ : shutdownWritten())) {
         finish({SessionEnd::Reason::Finished, {}}, {});
         return;
     }
@@ -691,6 +690,21 @@ void Session::Impl::onEndOfStream() {
         text += "; writing to it had failed: " + errorText(writeError_);
     }
     finish({SessionEnd::Reason::Lost, text}, {});
+}
+
+// A client that has said goodbye may end its direction of the stream. When it has ended both, nobody waits for what is
+// to come, which may take for ever.
+void Session::Impl::awaitHangUp() {
+    out_.async_wait(asio::posix::stream_descriptor::wait_error, [this](const ErrorCode& error) {
+        if (error == asio::error::operation_aborted || down_) {
+            return;
+        }
+        if (shutdownWritten()) {
+            finish({SessionEnd::Reason::Finished, {}}, {});
+        } else {
+            finish({SessionEnd::Reason::Lost, "the client has gone before the engine's shutdown event"}, {});
+        }
+    });
 }
 
 void Session::Impl::take(MessageReader::Item item) {
@@ -821,6 +835,11 @@ SessionEnd Session::Impl::ownEnd() const {
     const bool finished =
         !writeFailed_ && (config.role == Role::Client ? shutdownReceived_ : goodbyeReceived_ && shutdownSent_);
     return {finished ? SessionEnd::Reason::Finished : SessionEnd::Reason::Closed, {}};
+}
+
+bool Session::Impl::shutdownWritten() const {
+    const std::lock_guard lock(mutex_);
+    return shutdownSent_ && queue_.empty() && !writeFailed_;
 }
 
 void Session::Impl::beginClose(std::chrono::milliseconds patience) {
