@@ -88,14 +88,15 @@ krutil::contextmgr::QvmID randomClientID() {
     return id;
 }
 
-// Shows how far the arrays of a call are, as long as the object lives and `err` is a terminal.
+// Shows how far the arrays of a call are, as long as the object lives and `err` is a terminal with a cursor with a
+// cursor.
 class TransferDisplay {
   public:
     TransferDisplay(Client& client, Output& err, std::uint64_t toSend)
         : client_(client),
           err_(err),
           progress_(client.conversation().session().traffic(), toSend, Progress::Clock::now()) {
-        if (!err_.isTerminal()) {
+        if (!err_.hasCursor()) {
             return;
         }
         const auto note = [this](const krutil::io::TextBase& text) {
@@ -126,7 +127,7 @@ class TransferDisplay {
 
     void write(const std::string& text) {
         if (!text.empty()) {
-            err_.write(text);
+            err_.show(text);
         }
     }
 

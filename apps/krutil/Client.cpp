@@ -5,7 +5,6 @@
 #include <algorithm>
 #include <boost/make_shared.hpp>
 #include <functional>
-#include <iostream>
 #include <stdexcept>
 #include <utility>
 
@@ -100,15 +99,16 @@ class Unanswered {
 }  // namespace
 
 Client::Client(const ConnectionOptions& connection, const DisplayOptions& display, Printer& printer, const Output& out,
-               const Output& err, Interrupt& interrupt, bool interactive)
+               Output& err, Interrupt& interrupt, bool interactive)
     : printer_(printer),
       interrupt_(interrupt),
+      err_(err),
       outTerminal_(out.isTerminal()),
-      errTerminal_(err.isTerminal()),
       timing_(display.timing),
       throughShell_(connection.engine.has_value()),
       begin_(Conversation::Clock::now()),
-      tracer_(display.trace ? std::make_unique<Tracer>() : nullptr),
+      tracer_(display.trace || display.traceFile ? std::make_unique<Tracer>(display.trace, display.traceFile)
+                                                 : nullptr),
       engine_(findEngine(connection)) {
     const auto noteTime = [this](const auto&) {
         if (!firstText_) {
@@ -125,15 +125,16 @@ Client::Client(const ConnectionOptions& connection, const DisplayOptions& displa
     conversation_ = shakeHands(connection, interactive);
     conversation_->watch(engine_.watch(), [this] {
         // The end of the stream follows, and is what ends a request; unless another process holds the stream.
+        const bool idle = unanswered_.empty();
         try {
             if (conversation_->runUntil(Conversation::Clock::now() + patienceForStream,
-                                        [this] { return unanswered_.empty(); })) {
+                                        [this, idle] { return !idle && unanswered_.empty(); })) {
                 return;
             }
         } catch (const SessionOver&) {
             return;
         }
-        failLost("its stream stayed open", "before it answered");
+        failLost("its stream stayed open", idle ? "while it was idle" : "before it answered");
     });
     engineCapabilities_ = conversation_->session().peer().capabilities;
     ready_ = Conversation::Clock::now() - begin_;
@@ -187,7 +188,7 @@ krutil::io::SinkTraits Client::outTraits(const SinkOptions& options) const {
 }
 
 krutil::io::SinkTraits Client::errTraits(const SinkOptions& options) const {
-    return {false, options.hotlinks && errTerminal_, errTerminal_, options.diary, options.echo, options.log};
+    return {false, options.hotlinks && err_.isTerminal(), err_.isTerminal(), options.diary, options.echo, options.log};
 }
 
 Answer Client::request(const boost::shared_ptr<const cmddistributor::IIP>& iip,
@@ -275,8 +276,11 @@ std::string Client::finish() {
         fail(*ended, "after it answered");
     }
     conversation_.reset();
+    const bool lost = ended && ended->reason == Conversation::SessionEnd::Reason::Lost;
     if (!engine_.isChild()) {
-        return {};
+        return !ended ? "the engine did not end after it answered; the connection was closed"
+               : lost ? "the engine was lost after it answered: " + ended->text
+                      : std::string();
     }
     const auto left = std::chrono::ceil<std::chrono::milliseconds>(deadline - Conversation::Clock::now());
     const auto end = engine_.waitForEnd(std::max(left, std::chrono::milliseconds(0)));
@@ -284,11 +288,11 @@ std::string Client::finish() {
         engine_.kill();
         return "the engine did not end after it answered, and was killed";
     }
-    return end->signalled ? "the engine " + end->text() + " after it answered" : std::string();
+    return lost || end->signalled ? "the engine " + end->text() + " after it answered" : std::string();
 }
 
 void Client::say(const std::string& sentence) {
-    std::cerr << "krutil: " << sentence << std::endl;
+    err_.write("krutil: " + sentence + "\n");
 }
 
 void Client::fail(const Conversation::SessionEnd& end, const std::string& when) {

@@ -32,9 +32,9 @@ struct Answer {
 class Client {
   public:
     /// `interactive` tells the engine that there is a person who can be asked and who can use a debugger. `printer`,
-    /// `out` and `interrupt` must outlive the object. Blocks until the handshake is done. Throws Failure, Cancelled.
+    /// `err` and `interrupt` must outlive the object. Blocks until the handshake is done. Throws Failure, Cancelled.
     Client(const ConnectionOptions& connection, const DisplayOptions& display, Printer& printer, const Output& out,
-           const Output& err, Interrupt& interrupt, bool interactive);
+           Output& err, Interrupt& interrupt, bool interactive);
     ~Client();
     Client(const Client&) = delete;
     Client& operator=(const Client&) = delete;
@@ -80,8 +80,8 @@ class Client {
 
     Printer& printer_;
     Interrupt& interrupt_;
+    Output& err_;
     bool outTerminal_;
-    bool errTerminal_;
     bool timing_;
     bool throughShell_;
     Conversation::Clock::time_point begin_;

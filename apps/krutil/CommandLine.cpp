@@ -65,6 +65,10 @@ void addDisplayOptions(CLI::App& app, DisplayOptions& options) {
     app.add_flag("--json", options.json, "Print one JSON object a line for each event, and nothing else")
         ->group("Display");
     app.add_flag("--trace", options.trace, "Print each frame of the session to standard error")->group("Display");
+    app.add_option("--trace-to", options.traceFile,
+                   "Write each frame of the session to this file, which is emptied first")
+        ->type_name("FILE")
+        ->group("Display");
     app.add_flag("--timing", options.timing, "Say how long things took")->group("Display");
     static const std::map<std::string, Color> colors{
         {"auto", Color::Auto}, {"always", Color::Always}, {"never", Color::Never}};
@@ -170,7 +174,8 @@ After -- an argument may begin with a dash; a negative number may at any place.)
 std::vector<std::string> withLiteralsKept(int argc, const char* const* argv) {
     std::vector<std::string> arguments(argv + std::min(argc, 1), argv + argc);
     const auto takesValue = [](const std::string& argument) {
-        return argument == "-o" || argument == "--output" || argument == "--engine" || argument == "--connect";
+        return argument == "-o" || argument == "--output" || argument == "--engine" || argument == "--connect" ||
+               argument == "--trace-to";
     };
     for (std::size_t i = 1; i < arguments.size() && arguments[0] == "call"; ++i) {
         if (arguments[i].starts_with('[') && !takesValue(arguments[i - 1])) {

@@ -30,7 +30,8 @@ enum class Color { Auto, Always, Never };
 /// What is shown, and how.
 struct DisplayOptions {
     bool json = false;
-    bool trace = false;
+    bool trace = false;                    ///< each frame goes to standard error
+    std::optional<std::string> traceFile;  ///< each frame goes to this file
     bool timing = false;
     bool warningStack = false;  ///< warnings tell where they were issued
     Color color = Color::Auto;

@@ -169,6 +169,9 @@ void Conversation::stopPastime() {
 
 // Returns whether only the descriptor has something.
 bool Conversation::waitForSomething(std::optional<Clock::time_point> deadline, int descriptor) {
+    if (pastime_.start) {
+        pastime_.start();
+    }
     std::array<pollfd, 4> watched{pollfd{wake_.get(), POLLIN, 0}, pollfd{interrupt_.fd(), POLLIN, 0},
                                   pollfd{watched_, POLLIN, 0}, pollfd{descriptor, POLLIN, 0}};
     if (pastime_.tick) {
@@ -193,7 +196,9 @@ bool Conversation::waitForSomething(std::optional<Clock::time_point> deadline, i
         }
         return false;
     }
-    stopPastime();
+    if (ready > (watched[3].revents != 0 ? 1 : 0)) {
+        stopPastime();
+    }
     if (watched[1].revents != 0) {
         interrupt_.dispatch();
     }

@@ -12,6 +12,7 @@
 #include <mutex>
 #include <optional>
 #include <unordered_map>
+#include <utility>
 #include <variant>
 
 #include "Descriptor.hpp"
@@ -80,14 +81,17 @@ class Conversation : private foundation::msg_svc::transport::layers::session::Se
     /// none.
     void watch(int descriptor, std::function<void()> action);
 
-    /// What to do while a run function waits: `tick` is called every `interval` that passes without a delivery, `stop`
-    /// before whatever comes is delivered.
+    /// What to do while a run function waits: `start` is called whenever it begins to wait, `tick` every `interval`
+    /// that passes without a delivery, `stop` before whatever comes is delivered. Each may be empty for nothing to do.
     struct Pastime {
         std::chrono::milliseconds interval{};
-        std::function<void()> tick{};  ///< empty for nothing to do
+        std::function<void()> tick{};
         std::function<void()> stop{};
+        std::function<void()> start{};
     };
-    void setPastime(Pastime pastime) { pastime_ = std::move(pastime); }
+
+    /// Replaces the pastime, and returns the one before. What it throws comes out of the run functions.
+    Pastime setPastime(Pastime pastime) { return std::exchange(pastime_, std::move(pastime)); }
 
     /// Says goodbye, and delivers what arrives until the session is over or `patience` has passed. Returns how it
     /// ended, empty when it did not. Throws what subscribers and the interrupt's action throw.

@@ -19,13 +19,13 @@ namespace {
 // All that the signal handler knows.
 std::atomic<int> eventOfProcess{-1};
 std::atomic<int> socketToShutDown{-1};
+std::atomic<bool> pressed{false};
 struct sigaction previousHandling;
 
 void onSignal(int) {
     const int savedError = errno;
-    const std::uint64_t one = 1;
-    // The counter cannot be full, and a handler could do nothing about it.
-    [[maybe_unused]] const auto written = ::write(eventOfProcess.load(), &one, sizeof one);
+    pressed = true;
+    Interrupt::wake();
     if (const int socket = socketToShutDown.load(); socket >= 0) {
         ::shutdown(socket, SHUT_RDWR);
     }
@@ -39,6 +39,7 @@ Interrupt::Interrupt() : event_(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)), actio
         throw std::system_error(errno, std::generic_category(), "eventfd");
     }
     eventOfProcess = event_.get();
+    pressed = false;
     // A shell that starts the program in the background has Ctrl-C ignored; that stays so.
     ::sigaction(SIGINT, nullptr, &previousHandling);
     if (previousHandling.sa_handler == SIG_IGN) {
@@ -57,11 +58,19 @@ Interrupt::~Interrupt() {
 
 void Interrupt::dispatch() {
     std::uint64_t count = 0;
-    if (::read(event_.get(), &count, sizeof count) == sizeof count) {
+    if (::read(event_.get(), &count, sizeof count) == sizeof count && pressed.exchange(false)) {
         // A copy: the action may replace itself.
         const auto action = action_;
         action();
     }
+}
+
+void Interrupt::wake() noexcept {
+    const int savedError = errno;
+    const std::uint64_t one = 1;
+    // The counter cannot be full, and a handler could do nothing about it.
+    [[maybe_unused]] const auto written = ::write(eventOfProcess.load(), &one, sizeof one);
+    errno = savedError;
 }
 
 Interrupt::ShutsDown::ShutsDown(int socket) : socket_(::fcntl(socket, F_DUPFD_CLOEXEC, 0)) {

@@ -18,12 +18,15 @@ class Interrupt {
     Interrupt(const Interrupt&) = delete;
     Interrupt& operator=(const Interrupt&) = delete;
 
-    /// Readable while a Ctrl-C has not been dispatched.
+    /// Readable while a Ctrl-C, or a wake(), has not been dispatched.
     int fd() const noexcept { return event_.get(); }
 
     /// Calls the action once if there was any Ctrl-C since the last call. Whatever the action throws reaches the
     /// caller.
     void dispatch();
+
+    /// Makes fd() readable without a Ctrl-C, so that whatever waits looks around. For signal handlers.
+    static void wake() noexcept;
 
     /// Replaces what a Ctrl-C does, and returns what it did before. The first action throws Cancelled.
     std::function<void()> setAction(std::function<void()> action) { return std::exchange(action_, std::move(action)); }

@@ -6,24 +6,33 @@
 #include <string>
 
 #include "Conversation.hpp"
+#include "LastLine.hpp"
 #include "LineReader.hpp"
+#include "Output.hpp"
 
 namespace client {
 
-/// Reads lines from standard input, which must be a terminal like standard output; they are edited with the usual keys
-/// and kept in a history. What arrives in the session is delivered meanwhile, and Ctrl-C is dispatched. One object a
-/// process: it sets the process's character type to UTF-8. Main thread only.
+/// Reads lines from standard input, a terminal, where they are edited with the usual keys. What arrives in the session
+/// is delivered meanwhile: the line is taken away before, and shown again behind it. Ctrl-C is dispatched, Ctrl-Z stops
+/// the program and leaves the terminal as it was. One object a process: it sets the process's character type to UTF-8.
+/// Main thread only.
 class LineEditor {
   public:
-    /// `historyFile` is read now and written when the object goes, for its owner only; empty for none. A history that
-    /// cannot be read or written is none. `conversation` must outlive the object.
-    LineEditor(Conversation& conversation, std::string historyFile);
+    /// What a line is typed for.
+    enum class For {
+        Code,   ///< it is remembered in the history
+        Input,  ///< what runs has asked for it: the last line of the terminal is a part of the prompt
+    };
+
+    /// Code is remembered in `historyFile`, see LineHistory; empty for none. `out` is the terminal, which has a cursor,
+    /// and which nothing but outputs with this `lastLine` writes to. All must outlive the object.
+    LineEditor(Conversation& conversation, Output& out, LastLine& lastLine, std::string historyFile);
     ~LineEditor();
     LineEditor(const LineEditor&) = delete;
     LineEditor& operator=(const LineEditor&) = delete;
 
     /// As LineReader::read() does. Whatever leaves Conversation::run() ends the editing.
-    ReadLine read(const std::string& prompt, const std::function<bool()>& done);
+    ReadLine read(For what, const std::string& prompt, const std::function<bool()>& done);
 
   private:
     class Impl;

@@ -12,9 +12,24 @@ LineReader::LineReader(int fd, Conversation& conversation, Output& out)
     : fd_(fd), conversation_(conversation), out_(out), terminal_(::isatty(fd) == 1) {}
 
 ReadLine LineReader::read(const std::string& prompt, const std::function<bool()>& done) {
-    if (terminal_) {
-        out_.write(prompt);
+    if (!terminal_) {
+        return readOn(done);
     }
+    out_.write(prompt);
+    try {
+        ReadLine line = readOn(done);
+        // With a line, its newline is on the terminal too.
+        if (line.end != ReadLine::End::Newline) {
+            out_.write("\n");
+        }
+        return line;
+    } catch (...) {
+        out_.write("\n");
+        throw;
+    }
+}
+
+ReadLine LineReader::readOn(const std::function<bool()>& done) {
     for (;;) {
         if (const auto newline = rest_.find('\n'); newline != std::string::npos) {
             std::string line = rest_.substr(0, newline);
@@ -25,7 +40,6 @@ ReadLine LineReader::read(const std::string& prompt, const std::function<bool()>
             if (terminal_) {
                 ::tcflush(fd_, TCIFLUSH);
                 rest_.clear();
-                out_.write("\n");
             }
             return {ReadLine::End::Done, {}};
         }
@@ -34,9 +48,6 @@ ReadLine LineReader::read(const std::string& prompt, const std::function<bool()>
         if (got > 0) {
             rest_.append(piece.data(), static_cast<std::size_t>(got));
         } else if (got == 0 || (errno != EINTR && errno != EAGAIN)) {
-            if (terminal_) {
-                out_.write("\n");
-            }
             if (!rest_.empty()) {
                 return {ReadLine::End::Newline, std::exchange(rest_, {})};
             }

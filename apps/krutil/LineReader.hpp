@@ -1,6 +1,7 @@
 // Lines that a person types while a session goes on.
 #pragma once
 
+#include <exception>
 #include <functional>
 #include <string>
 
@@ -8,6 +9,12 @@
 #include "Output.hpp"
 
 namespace client {
+
+/// Thrown by what Ctrl-C does, to drop the line that is being read. Passes through the readers of lines.
+class LineDropped : public std::exception {
+  public:
+    const char* what() const noexcept override { return "the line was dropped"; }
+};
 
 /// What came of reading a line.
 struct ReadLine {
@@ -28,10 +35,13 @@ class LineReader {
     LineReader(int fd, Conversation& conversation, Output& out);
 
     /// Shows `prompt` and reads a line until `done` returns true. What a terminal holds of a line that is not wanted
-    /// any more is dropped. Throws what Conversation::run() and Output::write() throw.
+    /// any more is dropped. Throws what Conversation::run() and Output::write() throw. Whatever ends it, a terminal is
+    /// at the beginning of a line then.
     ReadLine read(const std::string& prompt, const std::function<bool()>& done);
 
   private:
+    ReadLine readOn(const std::function<bool()>& done);
+
     int fd_;
     Conversation& conversation_;
     Output& out_;

@@ -9,11 +9,13 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 #include <string>
 
 #include "ExitCode.hpp"
 #include "Interrupt.hpp"
+#include "LastLine.hpp"
 
 namespace client {
 namespace {
@@ -25,8 +27,19 @@ bool isFile(int fd) {
 
 }  // namespace
 
-Output::Output(int fd, std::string_view name, Interrupt& interrupt)
-    : fd_(fd), name_(name), interrupt_(interrupt), terminal_(::isatty(fd) == 1), mayBlock_(!isFile(fd)) {}
+Output::Output(int fd, std::string_view name, Interrupt& interrupt, LastLine* lastLine)
+    : fd_(fd),
+      name_(name),
+      interrupt_(interrupt),
+      terminal_(::isatty(fd) == 1),
+      mayBlock_(!isFile(fd)),
+      lastLine_(lastLine) {}
+
+bool Output::hasCursor() const noexcept {
+    const char* const variable = std::getenv("TERM");
+    const std::string_view name = variable != nullptr ? variable : "";
+    return terminal_ && !name.empty() && name != "dumb" && name != "emacs";
+}
 
 std::size_t Output::columns() const noexcept {
     winsize size{};
@@ -34,7 +47,24 @@ std::size_t Output::columns() const noexcept {
     return ::ioctl(fd_, TIOCGWINSZ, &size) == 0 && size.ws_col != 0 ? size.ws_col : usual;
 }
 
+std::size_t Output::rows() const noexcept {
+    winsize size{};
+    constexpr std::size_t usual = 24;
+    return ::ioctl(fd_, TIOCGWINSZ, &size) == 0 && size.ws_row != 0 ? size.ws_row : usual;
+}
+
 void Output::write(std::string_view text) {
+    if (terminal_ && lastLine_ != nullptr) {
+        lastLine_->add(text);
+    }
+    put(text, true);
+}
+
+void Output::show(std::string_view text) {
+    put(text, false);
+}
+
+void Output::put(std::string_view text, bool interruptible) {
     while (!text.empty()) {
         std::size_t piece = text.size();
         if (mayBlock_) {
@@ -43,7 +73,7 @@ void Output::write(std::string_view text) {
                 throw Failure(ExitCode::Stream,
                               std::string("cannot wait for ") + std::string(name_) + ": " + std::strerror(errno));
             }
-            if (watched[1].revents != 0) {
+            if (watched[1].revents != 0 && (interruptible || watched[0].revents == 0)) {
                 interrupt_.dispatch();
             }
             if (watched[0].revents == 0) {

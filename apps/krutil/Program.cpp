@@ -8,7 +8,9 @@
 #include <iostream>
 #include <memory>
 #include <optional>
+#include <string>
 #include <string_view>
+#include <utility>
 
 #include "CallCommand.hpp"
 #include "Client.hpp"
@@ -17,7 +19,9 @@
 #include "Interrupt.hpp"
 #include "JsonPrinter.hpp"
 #include "KrutilProtocol.hpp"
+#include "LastLine.hpp"
 #include "LineEditor.hpp"
+#include "LineReader.hpp"
 #include "Output.hpp"
 #include "PersonPrinter.hpp"
 #include "Prompts.hpp"
@@ -49,6 +53,14 @@ bool wantsColor(Color color, const Output& output) {
     return output.isTerminal() && variable("NO_COLOR").empty() && variable("TERM") != "dumb";
 }
 
+// What connects the program to whoever started it.
+struct Terminal {
+    Interrupt interrupt{};
+    LastLine lastLine{};
+    Output out{STDOUT_FILENO, "standard output", interrupt, &lastLine};
+    Output err{STDERR_FILENO, "standard error", interrupt, &lastLine};
+};
+
 std::unique_ptr<Printer> makePrinter(const DisplayOptions& options, Output& out, Output& err) {
     if (options.json) {
         return std::make_unique<JsonPrinter>(out);
@@ -65,30 +77,43 @@ void finish(Client& client) {
 // A client that asks the person at standard input, if there is one, what the engine wants to know.
 class AskingClient {
   public:
-    /// With `history`, a file's name that may be empty, code at prompts is edited on a terminal.
-    AskingClient(const Options& options, Printer& printer, Output& out, Output& err, Interrupt& interrupt,
-                 bool interactive, const std::optional<std::string>& history = std::nullopt)
-        : client_(options.connection, options.display, printer, out, err, interrupt, interactive),
-          reader_(STDIN_FILENO, client_.conversation(), options.display.json || !out.isTerminal() ? err : out),
-          editor_(history && interactive && out.isTerminal() && !options.display.json
-                      ? std::make_unique<LineEditor>(client_.conversation(), *history)
-                      : nullptr),
-          prompts_(
-              client_, [this](const auto& prompt, const auto& done) { return reader_.read(prompt, done); }, read()) {}
+    /// On a terminal, lines are edited; code among them is remembered in the file `history`, if it has a name.
+    AskingClient(const Options& options, Printer& printer, Terminal& terminal, bool interactive,
+                 std::string history = {})
+        : client_(options.connection, options.display, printer, terminal.out, terminal.err, terminal.interrupt,
+                  interactive),
+          terminal_(terminal),
+          history_(std::move(history)),
+          edits_(interactive && terminal.out.hasCursor() && !options.display.json),
+          reader_(STDIN_FILENO, client_.conversation(),
+                  options.display.json || !terminal.out.isTerminal() ? terminal.err : terminal.out),
+          prompts_(client_, reading(LineEditor::For::Input), reading(LineEditor::For::Code)) {}
 
     Client& client() noexcept { return client_; }
 
     /// How code is read. The object must outlive what is returned.
-    Prompts::Read read() {
-        return [this](const std::string& prompt, const std::function<bool()>& done) {
-            return editor_ ? editor_->read(prompt, done) : reader_.read(prompt, done);
+    Prompts::Read readingCode() { return reading(LineEditor::For::Code); }
+
+  private:
+    Prompts::Read reading(LineEditor::For what) {
+        return [this, what](const std::string& prompt, const std::function<bool()>& done) {
+            if (!edits_) {
+                return reader_.read(prompt, done);
+            }
+            // Most commands end without a question.
+            if (!editor_) {
+                editor_.emplace(client_.conversation(), terminal_.out, terminal_.lastLine, history_);
+            }
+            return editor_->read(what, prompt, done);
         };
     }
 
-  private:
     Client client_;
+    Terminal& terminal_;
+    const std::string history_;
+    const bool edits_;
     LineReader reader_;
-    std::unique_ptr<LineEditor> editor_;
+    std::optional<LineEditor> editor_;
     Prompts prompts_;
 };
 
@@ -96,41 +121,36 @@ bool standardInputIsTerminal() {
     return ::isatty(STDIN_FILENO) == 1;
 }
 
-ExitCode runCommand(const Options& options, const EvalOptions& eval, Printer& printer, Output& out, Output& err,
-                    Interrupt& interrupt) {
+ExitCode runCommand(const Options& options, const EvalOptions& eval, Printer& printer, Terminal& terminal) {
     const std::string code = readCode(eval);
-    AskingClient asking(options, printer, out, err, interrupt, !eval.fromStandardInput && standardInputIsTerminal());
+    AskingClient asking(options, printer, terminal, !eval.fromStandardInput && standardInputIsTerminal());
     const ExitCode result = evaluate(asking.client(), eval, code);
     finish(asking.client());
     return result;
 }
 
-ExitCode runCommand(const Options& options, const ReplOptions& repl, Printer& printer, Output& out, Output& err,
-                    Interrupt& interrupt) {
-    const bool terminal = standardInputIsTerminal();
-    AskingClient asking(options, printer, out, err, interrupt, terminal,
-                        repl.noHistory ? std::string() : defaultHistoryFile());
-    const ExitCode result =
-        readAndEvaluate(asking.client(), repl, asking.read(), terminal, options.display.json ? err : out, interrupt);
+ExitCode runCommand(const Options& options, const ReplOptions& repl, Printer& printer, Terminal& terminal) {
+    const bool person = standardInputIsTerminal();
+    AskingClient asking(options, printer, terminal, person, repl.noHistory ? std::string() : defaultHistoryFile());
+    const ExitCode result = readAndEvaluate(asking.client(), repl, asking.readingCode(), person,
+                                            options.display.json ? terminal.err : terminal.out, terminal.interrupt);
     finish(asking.client());
     return result;
 }
 
-ExitCode runCommand(const Options& options, const RunOptions& run, Printer& printer, Output& out, Output& err,
-                    Interrupt& interrupt) {
+ExitCode runCommand(const Options& options, const RunOptions& run, Printer& printer, Terminal& terminal) {
     const std::string program = readProgram(run);
-    AskingClient asking(options, printer, out, err, interrupt, standardInputIsTerminal());
+    AskingClient asking(options, printer, terminal, standardInputIsTerminal());
     const ExitCode result = runProgramText(asking.client(), run, program);
     finish(asking.client());
     return result;
 }
 
-ExitCode runCommand(const Options& options, const CallOptions& call, Printer& printer, Output& out, Output& err,
-                    Interrupt& interrupt) {
+ExitCode runCommand(const Options& options, const CallOptions& call, Printer& printer, Terminal& terminal) {
     PreparedCall prepared = prepareCall(call);
-    AskingClient asking(options, printer, out, err, interrupt, standardInputIsTerminal());
+    AskingClient asking(options, printer, terminal, standardInputIsTerminal());
     try {
-        const ExitCode result = callFunction(asking.client(), call, std::move(prepared), printer, err);
+        const ExitCode result = callFunction(asking.client(), call, std::move(prepared), printer, terminal.err);
         finish(asking.client());
         return result;
     } catch (const Failure& failure) {
@@ -143,10 +163,8 @@ ExitCode runCommand(const Options& options, const CallOptions& call, Printer& pr
 }
 
 ExitCode runReporting(const Options& options) {
-    Interrupt interrupt;
-    Output out(STDOUT_FILENO, "standard output", interrupt);
-    Output err(STDERR_FILENO, "standard error", interrupt);
-    const auto printer = makePrinter(options.display, out, err);
+    Terminal terminal;
+    const auto printer = makePrinter(options.display, terminal.out, terminal.err);
     const auto report = [&](ExitCode code, const std::string& sentence) {
         std::cerr << "krutil: " << sentence << std::endl;
         try {
@@ -157,9 +175,8 @@ ExitCode runReporting(const Options& options) {
         return code;
     };
     try {
-        return std::visit(
-            [&](const auto& command) { return runCommand(options, command, *printer, out, err, interrupt); },
-            options.command);
+        return std::visit([&](const auto& command) { return runCommand(options, command, *printer, terminal); },
+                          options.command);
     } catch (const Failure& failure) {
         return report(failure.code(), failure.what());
     } catch (const Cancelled& cancelled) {

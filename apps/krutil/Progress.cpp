@@ -10,6 +10,8 @@ namespace {
 
 // Smaller frames are no array worth a line: pieces of text, for example.
 constexpr std::uint64_t leastFrame = 1U << 20;
+// Of the row: what was there before, and the key Ctrl-C as the terminal shows it.
+constexpr const char* eraseRest = "\x1b[K";
 // Beside the bar itself.
 constexpr std::size_t barWidth = 30;
 constexpr std::size_t roomBesideBar = 50;
@@ -74,18 +76,16 @@ std::string Progress::show(const char* what, std::uint64_t done, std::uint64_t t
     if (line == shown_) {
         return {};
     }
-    const std::size_t rest = shown_.size() > line.size() ? shown_.size() - line.size() : 0;
     shown_ = line;
-    return '\r' + line + std::string(rest, ' ') + std::string(rest, '\b');
+    return '\r' + line + eraseRest;
 }
 
 std::string Progress::clear() {
     if (shown_.empty()) {
         return {};
     }
-    const std::string text = '\r' + std::string(shown_.size(), ' ') + '\r';
     shown_.clear();
-    return text;
+    return std::string("\r") + eraseRest;
 }
 
 }  // namespace client

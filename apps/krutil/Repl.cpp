@@ -20,10 +20,7 @@ Ctrl-C drops what has been typed, or cancels what runs; a second one within two 
 At debug> and keyboard>, :c goes on and :q (or Ctrl-D) quits.
 )";
 
-// Ctrl-C at the prompt.
-class LineDropped : public std::exception {};
-
-// What Ctrl-C does at the prompt, as long as this lives.
+// Ctrl-C drops a line, as long as this lives.
 class Dropping {
   public:
     explicit Dropping(Interrupt& interrupt)
@@ -91,9 +88,8 @@ ExitCode readAndEvaluate(Client& client, const ReplOptions& options, const Promp
             if (code.end == ReadLine::End::EndOfInput) {
                 break;
             }
-            if (code.end == ReadLine::End::Done) {
-                out.write("^C\n");
-            } else if (code.text[0] == ':') {
+            // A line that was dropped is empty.
+            if (code.text[0] == ':') {
                 if (!obey(client, code.text, out)) {
                     break;
                 }
@@ -105,9 +101,6 @@ ExitCode readAndEvaluate(Client& client, const ReplOptions& options, const Promp
             }
         }
     } catch (const SessionOver& over) {
-        if (terminal) {
-            out.write("\n");
-        }
         // The code has ended the engine with SystemExit, or nothing is left to ask.
         if (over.end().reason != Conversation::SessionEnd::Reason::Finished) {
             client.lost(over, "while it was idle");

@@ -2,8 +2,10 @@
 
 #include <algorithm>
 #include <array>
+#include <climits>
 #include <cmath>
 #include <cstdio>
+#include <cwchar>
 
 #include "msg_svc/protobuf/ustring.hpp"
 
@@ -18,6 +20,36 @@ std::optional<std::size_t> firstInvalidUtf8(const std::string& text) {
     }
     return static_cast<std::size_t>(std::mismatch(text.begin(), text.end(), back.begin(), back.end()).first -
                                     text.begin());
+}
+
+std::string toUtf8(std::wstring_view text) {
+    std::mbstate_t state{};
+    std::string result;
+    std::array<char, MB_LEN_MAX> bytes{};
+    for (const wchar_t c : text) {
+        const auto length = std::wcrtomb(bytes.data(), c, &state);
+        if (length == static_cast<std::size_t>(-1)) {
+            result += "\uFFFD";
+            state = {};
+        } else {
+            result.append(bytes.data(), length);
+        }
+    }
+    return result;
+}
+
+std::wstring toWide(std::string_view text) {
+    std::wstring result;
+    while (!text.empty()) {
+        std::mbstate_t state{};
+        wchar_t c = L'\0';
+        const auto length = std::mbrtowc(&c, text.data(), text.size(), &state);
+        const bool valid = length <= text.size();
+        result += valid ? c : L'\uFFFD';
+        // A NUL has the length 0.
+        text.remove_prefix(valid ? std::max<std::size_t>(length, 1) : 1);
+    }
+    return result;
 }
 
 std::string_view streamName(krutil::io::StreamTypeEnum stream) {

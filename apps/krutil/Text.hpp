@@ -13,6 +13,11 @@ namespace client {
 /// Offset in bytes of the first byte of `text` that is not part of valid UTF-8; empty when all of it is.
 std::optional<std::size_t> firstInvalidUtf8(const std::string& text);
 
+/// Text between UTF-8 and characters of the C library, whose LC_CTYPE must be one of UTF-8. What is ill-formed becomes
+/// U+FFFD.
+std::string toUtf8(std::wstring_view text);
+std::wstring toWide(std::string_view text);
+
 /// "output", "error" or "generic".
 std::string_view streamName(krutil::io::StreamTypeEnum stream);
 

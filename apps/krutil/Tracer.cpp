@@ -1,5 +1,6 @@
 #include "Tracer.hpp"
 
+#include <fcntl.h>
 #include <google/protobuf/descriptor.h>
 #include <google/protobuf/io/zero_copy_stream_impl_lite.h>
 #include <google/protobuf/message.h>
@@ -8,8 +9,11 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstring>
+#include <iostream>
 #include <memory>
 
+#include "ExitCode.hpp"
 #include "common/MessageNames.hpp"
 #include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
 
@@ -66,6 +70,18 @@ std::string decoded(const framing::TaggedFrame& frame) {
     return whole ? text : text + " (malformed)";
 }
 
+bool writeFully(int descriptor, const std::string& line) {
+    std::size_t done = 0;
+    while (done < line.size()) {
+        const auto written = ::write(descriptor, line.data() + done, line.size() - done);
+        if (written < 0 && errno != EINTR) {
+            return false;
+        }
+        done += written > 0 ? static_cast<std::size_t>(written) : 0;
+    }
+    return true;
+}
+
 }  // namespace
 
 std::string traceLine(const foundation::msg_svc::transport::layers::session::FrameTrace& trace) {
@@ -82,16 +98,29 @@ std::string traceLine(const foundation::msg_svc::transport::layers::session::Fra
     return content.empty() ? text : text + ": " + content;
 }
 
+Tracer::Tracer(bool toStandardError, const std::optional<std::string>& file)
+    : toStandardError_(toStandardError), fileName_(file.value_or(std::string())) {
+    if (!file) {
+        return;
+    }
+    file_.reset(::open(fileName_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_APPEND | O_CLOEXEC, 0600));
+    if (file_.get() < 0) {
+        const std::string reason = std::strerror(errno);
+        throw Failure(ExitCode::Usage, "cannot open '" + fileName_ + "' for the trace: " + reason);
+    }
+}
+
 void Tracer::operator()(const foundation::msg_svc::transport::layers::session::FrameTrace& trace) {
     const std::string line = traceLine(trace) + '\n';
     const std::lock_guard lock(mutex_);
-    std::size_t done = 0;
-    while (done < line.size()) {
-        const auto written = ::write(STDERR_FILENO, line.data() + done, line.size() - done);
-        if (written < 0 && errno != EINTR) {
-            return;  // A trace that nobody can read holds up nothing.
-        }
-        done += written > 0 ? static_cast<std::size_t>(written) : 0;
+    if (toStandardError_) {
+        // A trace that nobody can read holds up nothing.
+        static_cast<void>(writeFully(STDERR_FILENO, line));
+    }
+    if (file_.get() >= 0 && !writeFully(file_.get(), line)) {
+        const std::string reason = std::strerror(errno);
+        file_.reset();
+        std::cerr << "krutil: cannot write to '" + fileName_ + "': " + reason + "; the trace ends here\n" << std::flush;
     }
 }
 

@@ -2,8 +2,10 @@
 #pragma once
 
 #include <mutex>
+#include <optional>
 #include <string>
 
+#include "Descriptor.hpp"
 #include "foundation/msg_svc/transport/layers/session/Session.hpp"
 
 namespace client {
@@ -16,13 +18,21 @@ namespace client {
 /// An arrow to the right goes to the engine. Content is shown up to 2,000 characters, bytes up to 32.
 std::string traceLine(const foundation::msg_svc::transport::layers::session::FrameTrace& trace);
 
-/// Writes these lines to standard error; from any thread.
+/// Writes these lines to standard error, to a file or to both, as soon as a frame is there: what ends the program ends
+/// no trace early. Lines of several threads are not mixed. When a line cannot be written to the file, one sentence on
+/// standard error says so, and the file gets no more of them. May be called from any thread.
 class Tracer {
   public:
+    /// `file` is emptied, or created for this user alone. Throws Failure (Usage) when it cannot be opened.
+    Tracer(bool toStandardError, const std::optional<std::string>& file);
+
     void operator()(const foundation::msg_svc::transport::layers::session::FrameTrace& trace);
 
   private:
+    const bool toStandardError_;
+    const std::string fileName_;
     std::mutex mutex_;
+    Descriptor file_;
 };
 
 }  // namespace client

@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <csignal>
 #include <fstream>
+#include <iterator>
 #include <nlohmann/json.hpp>
 #include <sstream>
 
@@ -36,22 +37,13 @@ std::vector<std::string> eventNames(const std::vector<json>& events) {
     return names;
 }
 
-// What the events of one request are, between "connected" and the engine's end, with runs of texts as one.
-std::vector<std::string> lifeOf(const std::string& lines) {
-    std::vector<std::string> names;
-    for (auto& name : eventNames(objects(lines))) {
-        if (name == "text" || name == "value" || name == "error") {
-            name = "output";
-        }
-        if (names.empty() || name != "output" || names.back() != name) {
-            names.push_back(name);
-        }
-    }
-    return names;
-}
-
 void write(const std::string& path, const std::string& content) {
     std::ofstream(path, std::ios::binary) << content;
+}
+
+std::string contentOf(const std::string& path) {
+    std::ifstream in(path, std::ios::binary);
+    return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
 }
 
 TEST(EvalTest, ShowsTheValueOfATrailingExpression) {
@@ -176,30 +168,7 @@ TEST(EvalTest, LeavingTheInterpreterWithAnErrorIsAnError) {
     EXPECT_EQ(runClient({"eval", "raise SystemExit"}).exitCode, 0);
 }
 
-TEST(EvalTest, OutputThenCompletedThenLastThenReplyThenShutdown) {
-    const std::vector<std::string> code{"print('a'); 1", "for i in range(1000): print(i)",
-                                        "import sys; print('e', file=sys.stderr); print('o', end='')"};
-    for (const auto& text : code) {
-        const Ran ran = runClient({"eval", "--json", text});
-        EXPECT_THAT(lifeOf(ran.out),
-                    ElementsAre("connected", "started", "output", "completed", "last", "reply", "shutdown"))
-            << text;
-        EXPECT_EQ(ran.err, "");
-        EXPECT_EQ(ran.exitCode, 0);
-    }
-}
-
-TEST(EvalTest, TheOrderIsTheSameForAnErrorAndForLeavingTheInterpreter) {
-    for (const std::string text : {"print('a'); 1/0", "print('a'); raise SystemExit(1)"}) {
-        const Ran ran = runClient({"eval", "--json", text});
-        EXPECT_THAT(lifeOf(ran.out),
-                    ElementsAre("connected", "started", "output", "completed", "last", "reply", "shutdown"))
-            << text;
-        EXPECT_EQ(ran.exitCode, 1);
-    }
-}
-
-TEST(EvalTest, EveryEventOfARequestCarriesItsIdentifier) {
+TEST(EvalTest, JsonHasEachEventInItsOrderWithTheIdentifierOfTheRequest) {
     const auto events = objects(runClient({"eval", "--json", "print(1)\n2"}).out);
     ASSERT_EQ(eventNames(events), (std::vector<std::string>{"connected", "started", "text", "value", "completed",
                                                             "last", "reply", "shutdown"}));
@@ -254,6 +223,58 @@ TEST(EvalTest, TraceHasALineForEachFrame) {
     EXPECT_THAT(ran.err, HasSubstr("cmd: \"print(\\'traced\\')\\n5\""));
     EXPECT_THAT(ran.err, HasSubstr("text: \"traced\\n\""));
     EXPECT_THAT(ran.err, HasSubstr("type: LastIIPEvent"));
+}
+
+TEST(EvalTest, TheTraceOfAFileIsThatOfStandardError) {
+    const TemporaryDirectory directory;
+    const std::string file = directory.file("trace");
+    write(file, "older\n");
+    const Ran ran = runClient({"eval", "--trace", "--trace-to", file, "print('traced')\n5"});
+    EXPECT_EQ(ran.out, "traced\n5\n");
+    EXPECT_THAT(ran.err, HasSubstr("krutil:QVMShutdownEvent"));
+    EXPECT_EQ(contentOf(file), ran.err);
+    EXPECT_EQ(ran.exitCode, 0);
+    const Ran quiet = runClient({"eval", "--trace-to", file, "1"});
+    EXPECT_EQ(quiet.out, "1\n");
+    EXPECT_EQ(quiet.err, "");
+    EXPECT_THAT(contentOf(file), HasSubstr("cmd: \"1\""));
+}
+
+TEST(EvalTest, EveryCommandThatBeginsASessionIsTraced) {
+    const TemporaryDirectory directory;
+    write(directory.file("program.py"), "print('a program')\n");
+    const std::vector<std::vector<std::string>> commands{
+        {"eval", "1"}, {"call", "abs", "-1"}, {"run", directory.file("program.py")}, {"repl"}};
+    for (auto command : commands) {
+        const std::string file = directory.file(command.front());
+        command.insert(command.begin() + 1, {"--trace-to", file});
+        EXPECT_EQ(runClient(command, {.input = "1\n"}).exitCode, 0) << command.front();
+        EXPECT_THAT(contentOf(file), HasSubstr(" krutil:IIPReply ")) << command.front();
+    }
+}
+
+TEST(EvalTest, ATraceThatCannotBeOpenedIsAUsageErrorBeforeAnEngineIsStarted) {
+    const Ran ran =
+        runClient({"eval", "--trace-to", "/nonexistent/trace", "--engine", "echo started >&2; exec sleep 600", "1"});
+    EXPECT_EQ(ran.err, "krutil: cannot open '/nonexistent/trace' for the trace: No such file or directory\n");
+    EXPECT_EQ(ran.exitCode, 2);
+}
+
+TEST(EvalTest, ATraceThatFindsNoRoomEndsAndTheSessionGoesOn) {
+    const Ran ran = runClient({"eval", "--trace-to", "/dev/full", "print('on')"});
+    EXPECT_EQ(ran.out, "on\n");
+    EXPECT_EQ(ran.err, "krutil: cannot write to '/dev/full': No space left on device; the trace ends here\n");
+    EXPECT_EQ(ran.exitCode, 0);
+}
+
+TEST(EvalTest, ATraceIsCompleteUpToWhatEndedTheEngine) {
+    const TemporaryDirectory directory;
+    const std::string file = directory.file("trace");
+    const Ran ran =
+        runClient({"eval", "--trace-to", file, "print('last words', flush=True)\nimport os\nos.kill(os.getpid(), 9)"});
+    EXPECT_EQ(ran.exitCode, 3);
+    const std::string trace = contentOf(file);
+    EXPECT_THAT(trace.substr(trace.rfind('\n', trace.size() - 2) + 1), HasSubstr("text: \"last words\\n\""));
 }
 
 TEST(EvalTest, TimingIsToldAfterTheAnswer) {

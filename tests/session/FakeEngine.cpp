@@ -5,6 +5,8 @@
 //                         with BYTES "count" relays all and writes their number to the file named next
 //   leaves-its-stream     ends without an answer, while a process that it started keeps the stream open
 //   ignores-goodbye       answers, and then neither shuts down nor ends
+//   event TAG HEX         answers a request, with an event whose content is the request's identifier and these bytes
+//   result TAG HEX        answers a request with a result whose content is that
 //   anything else         shakes hands, waits for a request, and sends what the scene is named for
 //
 // Frames are put together here byte by byte, because no session would send them.
@@ -108,6 +110,40 @@ std::string wholeReply(std::uint32_t stream, const exchange::IDType& id) {
            tagged(true, stream, 2, "krutil:IIPReply", reply(id, 1));
 }
 
+std::string started(std::uint32_t stream) {
+    return tagged(true, stream, 1, "krutil:IIPStartedEvent");
+}
+
+std::string ended(std::uint32_t stream) {
+    return tagged(true, stream, 1, "krutil:IIPCompletedEvent") + tagged(true, stream, 1, "krutil:detail::LastIIPEvent");
+}
+
+// All that a request without output is answered with.
+std::string answer(std::uint32_t stream, const exchange::IDType& id) {
+    return started(stream) + ended(stream) + wholeReply(stream, id);
+}
+
+std::string shutdown() {
+    return tagged(true, 0, 1, "krutil:QVMShutdownEvent");
+}
+
+// What pairs of hexadecimal digits stand for.
+std::string bytesOf(const std::string& digits) {
+    std::string bytes;
+    for (std::size_t i = 0; i + 1 < digits.size(); i += 2) {
+        bytes += static_cast<char>(std::stoi(digits.substr(i, 2), nullptr, 16));
+    }
+    return bytes;
+}
+
+// Content that begins with the identifier: events and results have it in the same field, but for one type of results,
+// which holds a result of the other type.
+std::string withIdentifier(const std::string& tag, const exchange::IDType& id, const std::string& bytes) {
+    const std::string head = result(id);
+    const bool nested = tag == "krutil:FEvalResult";
+    return (nested ? "\x0a" + std::string(1, static_cast<char>(head.size())) : std::string()) + head + bytes;
+}
+
 using Scene = std::function<std::string(std::uint32_t stream, const exchange::IDType& id)>;
 
 const std::map<std::string, Scene> scenes{
@@ -121,9 +157,9 @@ const std::map<std::string, Scene> scenes{
      }},
     {"data-last", [](auto stream, const auto&) { return data(true, stream, 1); }},
     {"reply-to-nothing", [](auto, const auto& id) { return wholeReply(1234, id); }},
-    {"second-reply", [](auto stream, const auto& id) { return wholeReply(stream, id) + wholeReply(stream, id); }},
+    {"second-reply", [](auto stream, const auto& id) { return answer(stream, id) + wholeReply(stream, id); }},
     {"reply-of-another-request",
-     [](auto stream, const auto& id) { return wholeReply(stream, exchange::IDType(id.hi() ^ 1U, id.lo())); }},
+     [](auto stream, const auto& id) { return answer(stream, exchange::IDType(id.hi() ^ 1U, id.lo())); }},
     {"event-of-nothing", [](auto, const auto&) { return tagged(true, 1234, 1, "krutil:TextBaseEvent"); }},
     {"wrong-index", [](auto stream, const auto&) { return tagged(true, stream, 2, "krutil:TextBaseEvent"); }},
     {"index-zero", [](auto stream, const auto&) { return tagged(true, stream, 0, "krutil:TextBaseEvent"); }},
@@ -146,30 +182,41 @@ const std::map<std::string, Scene> scenes{
          return std::string(bytes.data(), bytes.size()) + "x";
      }},
     {"text-after-reply",
-     [](auto stream, const auto& id) {
-         return wholeReply(stream, id) + tagged(true, stream, 1, "krutil:TextBaseEvent");
-     }},
+     [](auto stream, const auto& id) { return answer(stream, id) + tagged(true, stream, 1, "krutil:TextBaseEvent"); }},
     {"nothing-after-shutdown",
-     [](auto stream, const auto&) {
-         return tagged(true, 0, 1, "krutil:QVMShutdownEvent") + tagged(true, stream, 1, "krutil:TextBaseEvent");
-     }},
+     [](auto stream, const auto&) { return shutdown() + tagged(true, stream, 1, "krutil:TextBaseEvent"); }},
     {"bad-text",
      [](auto stream, const auto& id) {
          // A string field with a byte that no UTF-8 text has; parsers report it and go on.
-         return tagged(true, stream, 1, "krutil:TextBaseEvent",
+         return started(stream) +
+                tagged(true, stream, 1, "krutil:TextBaseEvent",
                        std::string("\x1a\x04"
                                    "a\xff"
                                    "bc")) +
-                wholeReply(stream, id) + tagged(true, 0, 1, "krutil:QVMShutdownEvent");
+                ended(stream) + wholeReply(stream, id) + shutdown();
      }},
     {"reply-without-result",
      [](auto stream, const auto& id) {
-         return tagged(true, stream, 1, "krutil:IIPReply", reply(id, 0)) +
-                tagged(true, 0, 1, "krutil:QVMShutdownEvent");
+         return started(stream) + ended(stream) + tagged(true, stream, 1, "krutil:IIPReply", reply(id, 0)) + shutdown();
      }},
     {"leaves-its-stream", [](auto, const auto&) { return std::string(); }},
-    {"ignores-goodbye", [](auto stream, const auto& id) { return wholeReply(stream, id); }},
+    {"ignores-goodbye", [](auto stream, const auto& id) { return answer(stream, id); }},
 };
+
+// The scenes that need more than a name.
+Scene eventOf(const std::string& tag, const std::string& bytes) {
+    return [=](auto stream, const auto& id) {
+        return started(stream) + tagged(true, stream, 1, tag, withIdentifier(tag, id, bytes)) + ended(stream) +
+               wholeReply(stream, id) + shutdown();
+    };
+}
+
+Scene resultOf(const std::string& tag, const std::string& bytes) {
+    return [=](auto stream, const auto& id) {
+        return started(stream) + ended(stream) + tagged(false, stream, 1, tag, withIdentifier(tag, id, bytes)) +
+               tagged(true, stream, 2, "krutil:IIPReply", reply(id, 1)) + shutdown();
+    };
+}
 
 // Hands out the first request.
 class FirstRequest : public session::SessionHandler {
@@ -312,6 +359,10 @@ int main(int argc, char** argv) {
     }
     if (name == "cut" && argc > 3) {
         return relay(argv[2], argv + 3);
+    }
+    if ((name == "event" || name == "result") && argc > 2) {
+        const std::string bytes = bytesOf(argc > 3 ? argv[3] : "");
+        return play(name, name == "event" ? eventOf(argv[2], bytes) : resultOf(argv[2], bytes));
     }
     const auto scene = scenes.find(name);
     if (scene == scenes.end()) {

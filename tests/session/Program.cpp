@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <poll.h>
+#include <pty.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -10,9 +11,7 @@
 #include <array>
 #include <cerrno>
 #include <csignal>
-#include <cstdlib>
 #include <cstring>
-#include <filesystem>
 #include <stdexcept>
 #include <system_error>
 
@@ -29,10 +28,28 @@ void makePipe(int (&ends)[2]) {
     }
 }
 
+// A process on the terminal has one end as both its standard input and output, whoever watches it the other.
+void makeTerminal(int (&in)[2], int (&out)[2]) {
+    const winsize size{24, 100, 0, 0};
+    if (::openpty(&out[0], &out[1], nullptr, nullptr, &size) != 0) {
+        throw std::system_error(errno, std::generic_category(), "openpty");
+    }
+    ::fcntl(out[0], F_SETFD, FD_CLOEXEC);
+    ::fcntl(out[1], F_SETFD, FD_CLOEXEC);
+    in[0] = ::fcntl(out[1], F_DUPFD_CLOEXEC, 0);
+    in[1] = ::fcntl(out[0], F_DUPFD_CLOEXEC, 0);
+}
+
 void closeDescriptor(int& descriptor) {
     if (descriptor >= 0) {
         ::close(descriptor);
         descriptor = -1;
+    }
+}
+
+void requireProcess(pid_t pid) {
+    if (pid <= 1) {
+        throw std::logic_error("no process of a test has the number " + std::to_string(pid));
     }
 }
 
@@ -48,23 +65,33 @@ std::vector<char*> pointersTo(const std::vector<std::string>& texts) {
 }  // namespace
 
 Program::Program(const std::vector<std::string>& arguments, const Options& options)
-    : input_(options.input), deadline_(std::chrono::steady_clock::now() + patience) {
+    : command_(arguments),
+      session_(command_),
+      input_(options.input),
+      deadline_(std::chrono::steady_clock::now() + patience) {
     std::signal(SIGPIPE, SIG_IGN);
     int in[2];
     int out[2];
     int err[2];
-    makePipe(in);
-    makePipe(out);
+    if (options.terminal) {
+        makeTerminal(in, out);
+    } else {
+        makePipe(in);
+        makePipe(out);
+    }
     makePipe(err);
     std::vector<std::string> environment = options.environment;
     for (char** variable = environ; *variable != nullptr; ++variable) {
         environment.emplace_back(*variable);
     }
-    const auto argumentPointers = pointersTo(arguments);
+    const auto argumentPointers = pointersTo(command_);
     const auto environmentPointers = pointersTo(environment);
     pid_ = ::fork();
     if (pid_ == 0) {
         ::signal(SIGPIPE, SIG_DFL);
+        if (options.terminal) {
+            ::setpgid(0, 0);
+        }
         ::dup2(in[0], STDIN_FILENO);
         ::dup2(out[1], STDOUT_FILENO);
         ::dup2(err[1], STDERR_FILENO);
@@ -74,6 +101,9 @@ Program::Program(const std::vector<std::string>& arguments, const Options& optio
         ::execvpe(argumentPointers[0], argumentPointers.data(), environmentPointers.data());
         ::_exit(127);
     }
+    if (pid_ < 0) {
+        throw std::system_error(errno, std::generic_category(), "fork");
+    }
     ::close(in[0]);
     ::close(out[1]);
     ::close(err[1]);
@@ -81,7 +111,7 @@ Program::Program(const std::vector<std::string>& arguments, const Options& optio
     out_ = out[0];
     err_ = err[0];
     ::fcntl(in_, F_SETFL, O_NONBLOCK);
-    if (input_.empty()) {
+    if (input_.empty() && !options.terminal) {
         closeDescriptor(in_);
     }
 }
@@ -93,13 +123,25 @@ Program::~Program() {
     if (pid_ > 0) {
         ::kill(pid_, SIGKILL);
         ::waitpid(pid_, nullptr, 0);
+        ran_.exitCode = 128 + SIGKILL;
+        checkSession();
+    }
+}
+
+void Program::checkSession() {
+    if (const std::string wrong = session_.whatIsWrong(ran_.exitCode, ran_.err); !wrong.empty()) {
+        std::string text = "in the session of";
+        for (const std::string& word : command_) {
+            text += " " + quotedForShell(word.substr(0, 200));
+        }
+        ADD_FAILURE() << text << ":\n" << wrong;
     }
 }
 
 void Program::giveUp(const std::string& what) {
     ADD_FAILURE() << what << "\nstandard output: " << ran_.out.substr(0, 2000)
                   << "\nstandard error: " << ran_.err.substr(0, 2000);
-    ::kill(pid_, SIGKILL);
+    signalOne(pid_, SIGKILL);
 }
 
 // Moves what there is; false when nothing can come any more.
@@ -107,7 +149,8 @@ bool Program::pump() {
     if (out_ < 0 && err_ < 0) {
         return false;
     }
-    std::array<pollfd, 3> watched{pollfd{in_, POLLOUT, 0}, pollfd{out_, POLLIN, 0}, pollfd{err_, POLLIN, 0}};
+    std::array<pollfd, 3> watched{pollfd{input_.empty() ? -1 : in_, POLLOUT, 0}, pollfd{out_, POLLIN, 0},
+                                  pollfd{err_, POLLIN, 0}};
     const auto left =
         std::chrono::ceil<std::chrono::milliseconds>(deadline_ - std::chrono::steady_clock::now()).count();
     const int ready = ::poll(watched.data(), watched.size(), left > 0 ? static_cast<int>(left) : 0);
@@ -143,22 +186,24 @@ bool Program::pump() {
     return true;
 }
 
-bool Program::waitForOut(const std::string& text) {
-    while (ran_.out.find(text) == std::string::npos) {
+bool Program::waitFor(const std::string& text, const std::string& where, std::size_t& seen) {
+    auto found = where.find(text, seen);
+    while (found == std::string::npos) {
         if (!pump()) {
             return false;
         }
+        found = where.find(text, seen);
     }
+    seen = found + text.size();
     return true;
 }
 
+bool Program::waitForOut(const std::string& text) {
+    return waitFor(text, ran_.out, seenOut_);
+}
+
 bool Program::waitForErr(const std::string& text) {
-    while (ran_.err.find(text) == std::string::npos) {
-        if (!pump()) {
-            return false;
-        }
-    }
-    return true;
+    return waitFor(text, ran_.err, seenErr_);
 }
 
 void Program::closeOut() {
@@ -166,7 +211,16 @@ void Program::closeOut() {
 }
 
 void Program::signal(int number) {
-    ::kill(pid_, number);
+    signalOne(pid_, number);
+}
+
+void Program::type(const std::string& keys) {
+    ASSERT_EQ(::write(in_, keys.data(), keys.size()), static_cast<ssize_t>(keys.size()));
+}
+
+void Program::pressCtrlC() {
+    requireProcess(pid_);
+    ::kill(-pid_, SIGINT);
 }
 
 Ran Program::finish() {
@@ -183,7 +237,13 @@ Ran Program::finish() {
     ::waitpid(pid_, &status, 0);
     pid_ = -1;
     ran_.exitCode = WIFSIGNALED(status) ? 128 + WTERMSIG(status) : WEXITSTATUS(status);
+    checkSession();
     return ran_;
+}
+
+void signalOne(pid_t pid, int number) {
+    requireProcess(pid);
+    ::kill(pid, number);
 }
 
 bool waitUntilGone(pid_t pid) {
@@ -223,19 +283,6 @@ std::string quotedForShell(const std::string& text) {
         quoted += c == '\'' ? std::string("'\\''") : std::string(1, c);
     }
     return quoted + "'";
-}
-
-TemporaryDirectory::TemporaryDirectory() {
-    std::string path = (std::filesystem::temp_directory_path() / "krutil-test-XXXXXX").string();
-    if (::mkdtemp(path.data()) == nullptr) {
-        throw std::system_error(errno, std::generic_category(), "mkdtemp");
-    }
-    path_ = path;
-}
-
-TemporaryDirectory::~TemporaryDirectory() {
-    std::error_code ignored;
-    std::filesystem::remove_all(path_, ignored);
 }
 
 }  // namespace session_test

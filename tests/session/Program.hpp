@@ -7,6 +7,9 @@
 #include <string>
 #include <vector>
 
+#include "TemporaryDirectory.hpp"
+#include "TracedSession.hpp"
+
 namespace session_test {
 
 /// What a program left behind.
@@ -18,13 +21,14 @@ struct Ran {
 
 /// A running child process with pipes as its standard input, output and error. Every wait has a deadline of a minute,
 /// after which the test fails and the process is killed; nothing waits for a fixed time. An object that goes kills what
-/// still runs.
+/// still runs. When the client has ended, the test fails if a request of its session had no legal life.
 class Program {
   public:
     struct Options {
         std::string input{};                     ///< for its standard input, which ends then
         std::vector<std::string> environment{};  ///< "NAME=value", in addition to that of the test
         std::string directory{};                 ///< to run in; empty for that of the test
+        bool terminal = false;  ///< a terminal instead of the first two pipes; the process leads a group of its own
     };
 
     explicit Program(const std::vector<std::string>& arguments) : Program(arguments, Options{}) {}
@@ -33,7 +37,8 @@ class Program {
     Program(const Program&) = delete;
     Program& operator=(const Program&) = delete;
 
-    /// Reads until standard output (standard error) holds `text`; false if it ends without.
+    /// Reads until standard output (standard error) holds `text` after what the last call waited for; false if it ends
+    /// without.
     bool waitForOut(const std::string& text);
     bool waitForErr(const std::string& text);
 
@@ -42,6 +47,13 @@ class Program {
 
     void signal(int number);
 
+    /// Types at its terminal, "\r" for Enter and "\x04" for Ctrl-D.
+    void type(const std::string& keys);
+
+    /// Does what its terminal does for Ctrl-C: signals the whole group. The test's terminal is not the one that
+    /// controls the process, so that the signal has been sent when this returns.
+    void pressCtrlC();
+
     /// Reads to the end, reaps the process and returns what it left.
     Ran finish();
 
@@ -49,16 +61,26 @@ class Program {
 
   private:
     bool pump();
+    bool waitFor(const std::string& text, const std::string& where, std::size_t& seen);
     void giveUp(const std::string& what);
+    void checkSession();
 
+    std::vector<std::string> command_;
+    TracedSession session_;
     pid_t pid_ = -1;
     int in_ = -1;
     int out_ = -1;
     int err_ = -1;
     std::string input_;
     Ran ran_;
+    std::size_t seenOut_ = 0;
+    std::size_t seenErr_ = 0;
     std::chrono::steady_clock::time_point deadline_;
 };
+
+/// Signals one process. Throws std::logic_error for a number that is none: the system takes those for groups, or for
+/// all processes that there are.
+void signalOne(pid_t pid, int number);
 
 /// Waits until the process `pid`, which may be nobody's child here, has ended; false if it outlives the deadline.
 bool waitUntilGone(pid_t pid);
@@ -78,19 +100,5 @@ std::string fakeEngine(const std::string& scene);
 
 /// `text` as one word of a shell command.
 std::string quotedForShell(const std::string& text);
-
-/// A private directory that goes, with all that is in it, when the object does.
-class TemporaryDirectory {
-  public:
-    TemporaryDirectory();
-    ~TemporaryDirectory();
-    TemporaryDirectory(const TemporaryDirectory&) = delete;
-    TemporaryDirectory& operator=(const TemporaryDirectory&) = delete;
-
-    std::string file(const std::string& name) const { return path_ + "/" + name; }
-
-  private:
-    std::string path_;
-};
 
 }  // namespace session_test

@@ -137,7 +137,7 @@ TEST_F(CallTransferTest, TheSessionTellsHowFarTheBytesHaveCome) {
     EXPECT_EQ(traffic.arrived, 0U);
 }
 
-TEST_F(CallTransferTest, ATickComesWhileNothingArrivesAndAStopBeforeADelivery) {
+TEST_F(CallTransferTest, APastimeStartsWithEachWaitTicksMeanwhileAndStopsBeforeADelivery) {
     std::vector<std::string> calls;
     int ticks = 0;
     conversation->setPastime({std::chrono::milliseconds(1),
@@ -145,9 +145,9 @@ TEST_F(CallTransferTest, ATickComesWhileNothingArrivesAndAStopBeforeADelivery) {
                                   calls.emplace_back("tick");
                                   ++ticks;
                               },
-                              [&] { calls.emplace_back("stop"); }});
+                              [&] { calls.emplace_back("stop"); }, [&] { calls.emplace_back("start"); }});
     conversation->run([&] { return ticks == 2; });
-    EXPECT_EQ(calls, (std::vector<std::string>{"tick", "tick"}));
+    EXPECT_EQ(calls, (std::vector<std::string>{"start", "tick", "start", "tick"}));
     echo({counted({2})});
     ASSERT_FALSE(calls.empty());
     EXPECT_EQ(calls.back(), "stop");

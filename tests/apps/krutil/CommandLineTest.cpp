@@ -68,6 +68,21 @@ TEST(CommandLineTest, EachFlagSetsItsOwnOption) {
     }
 }
 
+TEST(CommandLineTest, AFileForTheTrace) {
+    for (const std::vector<const char*>& arguments : {std::vector<const char*>{"eval", "--trace-to", "a file", "x"},
+                                                      {"call", "--trace-to", "a file", "abs", "-1"},
+                                                      {"run", "--trace-to", "a file", "x.py"},
+                                                      {"repl", "--trace-to", "a file"}}) {
+        const Options options = std::get<Options>(parse(arguments));
+        EXPECT_EQ(options.display.traceFile, "a file");
+        EXPECT_FALSE(options.display.trace);
+    }
+    EXPECT_EQ(std::get<Options>(parse({"eval", "--trace", "x"})).display.traceFile, std::nullopt);
+    EXPECT_EQ(std::get<Options>(parse({"call", "--trace-to", "[1", "abs", "[1,2]"})).display.traceFile, "[1");
+    EXPECT_EQ(parseFinished({"eval", "x", "--trace-to"}).err,
+              "krutil: --trace-to: 1 required FILE missing\nRun krutil --help for help.\n");
+}
+
 TEST(CommandLineTest, TheEngine) {
     const auto connection = [](const std::vector<const char*>& arguments) {
         return std::get<Options>(parse(arguments)).connection;
@@ -137,10 +152,11 @@ TEST(CommandLineTest, HelpOfACommandFitsInOneHundredColumns) {
     const Finished finished = parseFinished({"eval", "--help"});
     EXPECT_EQ(finished.code, ExitCode::Ok);
     EXPECT_THAT(finished.out, HasSubstr("Usage: krutil eval [OPTIONS] [CODE]\n"));
-    for (const auto* option : {"-f,--file FILE", "--type TYPE", "--sparingly", "--engine COMMAND", "--connect PATH",
-                               "--json", "--trace", "--timing", "--handshake-timeout SECONDS", "--limit-tag SIZE",
-                               "--limit-tagged-frame SIZE", "--limit-array-message SIZE", "--limit-message SIZE",
-                               "--limit-frames COUNT", "--echo", "--diary", "--log", "--hotlinks"}) {
+    for (const auto* option :
+         {"-f,--file FILE", "--type TYPE", "--sparingly", "--engine COMMAND", "--connect PATH", "--json", "--trace",
+          "--trace-to FILE", "--timing", "--handshake-timeout SECONDS", "--limit-tag SIZE", "--limit-tagged-frame SIZE",
+          "--limit-array-message SIZE", "--limit-message SIZE", "--limit-frames COUNT", "--echo", "--diary", "--log",
+          "--hotlinks"}) {
         EXPECT_THAT(finished.out, HasSubstr(std::string("\n  ") + option));
     }
     std::size_t begin = 0;

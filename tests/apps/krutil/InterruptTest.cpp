@@ -63,6 +63,14 @@ TEST(InterruptTest, ASocketIsShutDownOnlyWhileThatIsAskedFor) {
     EXPECT_EQ(::read(there.get(), &byte, 1), 0);
 }
 
+TEST(InterruptTest, WakingIsNoCtrlC) {
+    Interrupt interrupt;
+    Interrupt::wake();
+    EXPECT_TRUE(readable(interrupt.fd()));
+    interrupt.dispatch();
+    EXPECT_FALSE(readable(interrupt.fd()));
+}
+
 TEST(InterruptTest, AnIgnoredCtrlCStaysIgnored) {
     const auto previous = std::signal(SIGINT, SIG_IGN);
     {

@@ -7,6 +7,7 @@
 
 #include "ExitCode.hpp"
 #include "Interrupt.hpp"
+#include "LastLine.hpp"
 #include "Pipe.hpp"
 
 namespace client {
@@ -65,6 +66,20 @@ TEST_F(OutputTest, CtrlCIsDispatchedWhileNobodyReads) {
     ::kill(::getpid(), SIGINT);
     EXPECT_THROW(output.write(std::string(1'000'000, 'x')), Cancelled);
     EXPECT_EQ(seen, 1);
+}
+
+TEST_F(OutputTest, WhatIsOnlyShownIsNotInterruptedWhileSomebodyReads) {
+    Output output(pipe.write.get(), "standard output", interrupt);
+    ::kill(::getpid(), SIGINT);
+    output.show("shown");
+    EXPECT_THROW(output.write("written"), Cancelled);
+    EXPECT_EQ(pipe.content(), "shown");
+}
+
+TEST_F(OutputTest, APipeHasNoLastLine) {
+    LastLine lastLine;
+    Output(pipe.write.get(), "standard output", interrupt, &lastLine).write("text");
+    EXPECT_EQ(lastLine.text(), "");
 }
 
 TEST_F(OutputTest, APipeIsNoTerminal) {

@@ -2,43 +2,19 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <stdlib.h>
 #include <sys/stat.h>
 
 #include <filesystem>
 #include <fstream>
 #include <memory>
 
-#include "Terminal.hpp"
+#include "TerminalFixture.hpp"
 
 namespace client {
 namespace {
 
 using ::testing::HasSubstr;
 using ::testing::Not;
-
-class TerminalTest : public ::testing::Test {
-  protected:
-    TerminalTest() {
-        std::string name = (std::filesystem::temp_directory_path() / "krutil-terminal-XXXXXX").string();
-        if (::mkdtemp(name.data()) == nullptr) {
-            throw std::runtime_error("no directory for the test's files");
-        }
-        directory = name;
-    }
-    ~TerminalTest() override { std::filesystem::remove_all(directory); }
-
-    std::vector<std::pair<std::string, std::string>> environment(const std::string& noColor = "1") const {
-        return {{"TERM", "xterm"}, {"XDG_STATE_HOME", directory.string()}, {"NO_COLOR", noColor}};
-    }
-
-    std::vector<std::string> command(std::vector<std::string> arguments) const {
-        arguments.insert(arguments.begin(), KRUTIL_CLIENT);
-        return arguments;
-    }
-
-    std::filesystem::path directory;
-};
 
 TEST_F(TerminalTest, EvalShowsWhatTheCodePrintsAndItsValue) {
     Terminal terminal(command({"eval", "print('hel' + 'lo')\n6 * 7"}), environment());
@@ -51,8 +27,8 @@ TEST_F(TerminalTest, AnErrorIsShownOnce) {
     Terminal terminal(command({"eval", "1 / 0"}), environment());
     terminal.expect("ZeroDivisionError: division by zero\r\n");
     EXPECT_EQ(terminal.exitCode(), 1);
-    const auto first = terminal.screen().find("ZeroDivisionError");
-    EXPECT_EQ(terminal.screen().find("ZeroDivisionError", first + 1), std::string::npos) << terminal.screen();
+    const auto first = terminal.sent().find("ZeroDivisionError");
+    EXPECT_EQ(terminal.sent().find("ZeroDivisionError", first + 1), std::string::npos) << terminal.sent();
 }
 
 TEST_F(TerminalTest, CtrlCCancelsWhatRuns) {
@@ -123,7 +99,7 @@ TEST_F(TerminalTest, TheDebuggersQuitEndsTheRequest) {
     terminal.type(":q\r");
     terminal.expect("krutil: the debugger was left with quit\r\n");
     EXPECT_EQ(terminal.exitCode(), 1);
-    EXPECT_THAT(terminal.screen(), Not(HasSubstr("never here")));
+    EXPECT_THAT(terminal.sent(), Not(HasSubstr("never here")));
 }
 
 TEST_F(TerminalTest, KeyboardAndPauseAskToo) {
@@ -155,68 +131,37 @@ TEST_F(TerminalTest, ErrorsAndWarningsAreToldApartByColour) {
         "import sys, warnings\nwarnings.warn('careful')\nsys.stderr.write('bad\\n')\nprint('good')";
     Terminal colored(command({"eval", code}), environment(""));
     EXPECT_EQ(colored.exitCode(), 0);
-    EXPECT_THAT(colored.screen(), HasSubstr("\x1b[33mWarning: careful (UserWarning)\r\n\x1b[0m"));
-    EXPECT_THAT(colored.screen(), HasSubstr("\x1b[31mbad\r\n\x1b[0m"));
-    EXPECT_THAT(colored.screen(), HasSubstr("\x1b[0mgood\r\n"));
+    EXPECT_THAT(colored.sent(), HasSubstr("\x1b[33mWarning: careful (UserWarning)\r\n\x1b[0m"));
+    EXPECT_THAT(colored.sent(), HasSubstr("\x1b[31mbad\r\n\x1b[0m"));
+    EXPECT_THAT(colored.sent(), HasSubstr("\x1b[0mgood\r\n"));
     Terminal plain(command({"eval", code}), environment("1"));
     EXPECT_EQ(plain.exitCode(), 0);
-    EXPECT_THAT(plain.screen(), Not(HasSubstr("\x1b")));
+    EXPECT_THAT(plain.sent(), Not(HasSubstr("\x1b")));
     Terminal always(command({"eval", "--color", "always", code}), environment("1"));
     EXPECT_EQ(always.exitCode(), 0);
-    EXPECT_THAT(always.screen(), HasSubstr("\x1b[31mbad\r\n\x1b[0m"));
+    EXPECT_THAT(always.sent(), HasSubstr("\x1b[31mbad\r\n\x1b[0m"));
     Terminal never(command({"eval", "--color", "never", code}), environment(""));
     EXPECT_EQ(never.exitCode(), 0);
-    EXPECT_THAT(never.screen(), Not(HasSubstr("\x1b")));
+    EXPECT_THAT(never.sent(), Not(HasSubstr("\x1b")));
 }
-
-class TerminalReplTest : public TerminalTest {
-  protected:
-    void expectPrompt() { terminal->expect(">>> "); }
-
-    void begin(const std::vector<std::string>& arguments = {"repl"}) {
-        terminal = std::make_unique<Terminal>(command(arguments), environment());
-        expectPrompt();
-    }
-
-    // A line whose end on the screen is waited for, so that what follows is what came of it.
-    void enter(const std::string& line) {
-        terminal->type(line);
-        terminal->expect(line);
-        terminal->type("\r");
-        terminal->expect("\r\n");
-    }
-
-    std::unique_ptr<Terminal> terminal;
-};
 
 TEST_F(TerminalReplTest, LinesAreEvaluatedInOneSession) {
     begin({});
-    enter("x = 41");
-    expectPrompt();
-    enter("x + 1");
-    terminal->expect("42\r\n");
-    expectPrompt();
-    enter("1 / 0");
-    terminal->expect("ZeroDivisionError: division by zero\r\n");
-    expectPrompt();
-    enter("'still ' + 'here'");
-    terminal->expect("'still here'\r\n");
-    expectPrompt();
-    terminal->type("\x04");
-    EXPECT_EQ(terminal->exitCode(), 0);
+    evaluate("x = 41");
+    evaluate("x + 1", "42\r\n");
+    evaluate("1 / 0", "ZeroDivisionError: division by zero\r\n");
+    evaluate("'still ' + 'here'", "'still here'\r\n");
+    leave();
 }
 
 TEST_F(TerminalReplTest, ABlockEndsWithAnEmptyLine) {
     begin();
-    enter("for i in range(2):");
-    terminal->expect("... ");
-    enter("    print('i', i)");
-    terminal->expect("... ");
+    evaluate("for i in range(2):", "", "... ");
+    evaluate("    print('i', i)", "", "... ");
     terminal->type("\r");
     terminal->expect("i 0\r\ni 1\r\n");
     expectPrompt();
-    enter(":quit");
-    EXPECT_EQ(terminal->exitCode(), 0);
+    leave(":quit\r");
 }
 
 TEST_F(TerminalReplTest, CtrlCAtThePromptDropsWhatHasBeenTyped) {
@@ -226,11 +171,8 @@ TEST_F(TerminalReplTest, CtrlCAtThePromptDropsWhatHasBeenTyped) {
     terminal->type("\x03");
     terminal->expect("^C");
     expectPrompt();
-    enter("6 * 7");
-    terminal->expect("42\r\n");
-    expectPrompt();
-    enter(":quit");
-    EXPECT_EQ(terminal->exitCode(), 0);
+    evaluate("6 * 7", "42\r\n");
+    leave(":quit\r");
 }
 
 TEST_F(TerminalReplTest, CtrlCCancelsWhatRunsAndTheSessionGoesOn) {
@@ -240,33 +182,20 @@ TEST_F(TerminalReplTest, CtrlCCancelsWhatRunsAndTheSessionGoesOn) {
     terminal->type("\x03");
     terminal->expect("krutil: cancelled\r\n");
     expectPrompt();
-    enter("6 * 7");
-    terminal->expect("42\r\n");
-    expectPrompt();
-    enter(":quit");
-    EXPECT_EQ(terminal->exitCode(), 0);
+    evaluate("6 * 7", "42\r\n");
+    leave(":quit\r");
 }
 
 TEST_F(TerminalReplTest, TheDebuggerCanBeSwitchedOff) {
     begin();
-    enter("breakpoint()");
-    terminal->expect("debug> ");
-    enter(":c");
-    expectPrompt();
-    enter(":debugger off");
-    expectPrompt();
-    enter("breakpoint()");
-    terminal->expect("Warning: breakpoint() goes on");
-    expectPrompt();
-    enter(":debugger on");
-    expectPrompt();
-    enter("breakpoint()");
-    terminal->expect("debug> ");
-    enter(":q");
-    terminal->expect("krutil: the debugger was left with quit\r\n");
-    expectPrompt();
-    terminal->type("\x04");
-    EXPECT_EQ(terminal->exitCode(), 0);
+    evaluate("breakpoint()", "", "debug> ");
+    evaluate(":c");
+    evaluate(":debugger off");
+    evaluate("breakpoint()", "Warning: breakpoint() goes on");
+    evaluate(":debugger on");
+    evaluate("breakpoint()", "", "debug> ");
+    evaluate(":q", "krutil: the debugger was left with quit\r\n");
+    leave();
 }
 
 TEST_F(TerminalReplTest, InputIsReadBetweenLines) {
@@ -276,36 +205,23 @@ TEST_F(TerminalReplTest, InputIsReadBetweenLines) {
     terminal->type("Ada\r");
     terminal->expect("'hi Ada'\r\n");
     expectPrompt();
-    terminal->type("\x04");
-    EXPECT_EQ(terminal->exitCode(), 0);
+    leave();
 }
 
 TEST_F(TerminalReplTest, TimingIsShownOnDemand) {
     begin();
-    enter(":timing on");
-    expectPrompt();
-    enter("1");
-    terminal->expect("answered after ");
-    expectPrompt();
-    enter(":timing off");
-    expectPrompt();
-    enter(":help");
-    terminal->expect(":debugger on|off");
-    expectPrompt();
-    enter(":nonsense");
-    terminal->expect("There is no command ':nonsense'; :help lists them.\r\n");
-    expectPrompt();
-    enter(":quit");
-    EXPECT_EQ(terminal->exitCode(), 0);
+    evaluate(":timing on");
+    evaluate("1", "answered after ");
+    evaluate(":timing off");
+    evaluate(":help", ":debugger on|off");
+    evaluate(":nonsense", "There is no command ':nonsense'; :help lists them.\r\n");
+    leave(":quit\r");
 }
 
 TEST_F(TerminalReplTest, TheHistoryIsKeptForItsOwnerOnly) {
     begin();
-    enter("'\u00e4' + 'mber'");
-    terminal->expect("'\u00e4mber'\r\n");
-    expectPrompt();
-    enter(":quit");
-    EXPECT_EQ(terminal->exitCode(), 0);
+    evaluate("'\u00e4' + 'mber'", "'\u00e4mber'\r\n");
+    leave(":quit\r");
     struct stat status {};
     ASSERT_EQ(::stat((directory / "krutil/history").c_str(), &status), 0);
     EXPECT_EQ(status.st_mode & 0777U, 0600U);
@@ -314,26 +230,14 @@ TEST_F(TerminalReplTest, TheHistoryIsKeptForItsOwnerOnly) {
     terminal->type("\x1b[A\x1b[A\r");
     terminal->expect("'\u00e4mber'\r\n");
     expectPrompt();
-    terminal->type("\x04");
-    EXPECT_EQ(terminal->exitCode(), 0);
+    leave();
 }
 
 TEST_F(TerminalReplTest, WithoutHistoryNothingIsKept) {
     begin({"repl", "--no-history"});
-    enter("1");
-    expectPrompt();
-    terminal->type("\x04");
-    EXPECT_EQ(terminal->exitCode(), 0);
+    evaluate("1");
+    leave();
     EXPECT_FALSE(std::filesystem::exists(directory / "krutil"));
-}
-
-TEST_F(TerminalReplTest, AnEngineThatIsKilledAtThePromptIsTalkedAbout) {
-    begin();
-    enter("import os, signal, threading");
-    expectPrompt();
-    enter("threading.Timer(0.2, os.kill, (os.getpid(), signal.SIGKILL)).start()");
-    terminal->expect("krutil: the engine was killed by signal 9 (Killed) while it was idle\r\n");
-    EXPECT_EQ(terminal->exitCode(), 3);
 }
 
 TEST_F(TerminalReplTest, LinesThatComeFromNoTerminalAreReadPlainly) {
@@ -344,7 +248,7 @@ TEST_F(TerminalReplTest, LinesThatComeFromNoTerminalAreReadPlainly) {
     terminal->expect("EOFError");
     terminal->expect("ZeroDivisionError: division by zero\r\n");
     EXPECT_EQ(terminal->exitCode(), 1);
-    EXPECT_THAT(terminal->screen(), Not(HasSubstr(">>>")));
+    EXPECT_THAT(terminal->sent(), Not(HasSubstr(">>>")));
     EXPECT_FALSE(std::filesystem::exists(directory / "krutil"));
 }
 

@@ -3,8 +3,16 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <cstdlib>
 #include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <stdexcept>
+#include <thread>
+#include <vector>
 
+#include "ExitCode.hpp"
 #include "KrutilProtocol.hpp"
 #include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
 #include "foundation/vantor/carrier/framing/DataFrame.hpp"
@@ -81,6 +89,98 @@ TEST(TracerTest, LongContentIsCutAndHugeContentIsNotDecoded) {
     EXPECT_THAT(huge,
                 StartsWith("<-- stream 7 frame 1 last type 29 krutil:TextBaseEvent 2097157 bytes: 1a80808001616161"));
     EXPECT_LT(huge.size(), 300U);
+}
+
+class TracerFileTest : public ::testing::Test {
+  protected:
+    TracerFileTest() {
+        if (::mkdtemp(directory_.data()) == nullptr) {
+            throw std::runtime_error("no directory for the trace");
+        }
+    }
+    ~TracerFileTest() override { std::filesystem::remove_all(directory_); }
+
+    std::string file() const { return directory_ + "/trace"; }
+
+    std::string content() const {
+        std::ifstream in(file());
+        return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+    }
+
+    static void traceOne(Tracer& tracer) { tracer({false, true, tagged("krutil:QVMShutdownEvent", "")}); }
+
+    static constexpr const char* line = "<-- stream 7 frame 1 last type 29 krutil:QVMShutdownEvent 0 bytes\n";
+
+  private:
+    std::string directory_ = (std::filesystem::temp_directory_path() / "krutil-trace-XXXXXX").string();
+};
+
+TEST_F(TracerFileTest, LinesAreInTheFileAtOnceAndNotOnStandardError) {
+    Tracer tracer(false, file());
+    ::testing::internal::CaptureStderr();
+    traceOne(tracer);
+    EXPECT_EQ(content(), line);
+    traceOne(tracer);
+    EXPECT_EQ(content(), std::string(line) + line);
+    EXPECT_EQ(::testing::internal::GetCapturedStderr(), "");
+}
+
+TEST_F(TracerFileTest, LinesAreOnStandardErrorAsWellIfThatIsWanted) {
+    Tracer tracer(true, file());
+    ::testing::internal::CaptureStderr();
+    traceOne(tracer);
+    EXPECT_EQ(::testing::internal::GetCapturedStderr(), line);
+    EXPECT_EQ(content(), line);
+}
+
+TEST_F(TracerFileTest, AFileThatIsThereIsEmptiedAndANewOneIsForThisUserAlone) {
+    std::ofstream(file()) << "older";
+    const Tracer emptied(false, file());
+    EXPECT_EQ(content(), "");
+    std::filesystem::remove(file());
+    const Tracer created(false, file());
+    EXPECT_EQ(std::filesystem::status(file()).permissions(), std::filesystem::perms(0600));
+}
+
+TEST_F(TracerFileTest, LinesOfSeveralThreadsAreWhole) {
+    Tracer tracer(false, file());
+    std::vector<std::thread> threads;
+    for (int i = 0; i < 4; ++i) {
+        threads.emplace_back([&tracer] {
+            for (int j = 0; j < 250; ++j) {
+                traceOne(tracer);
+            }
+        });
+    }
+    std::string expected;
+    for (std::thread& thread : threads) {
+        thread.join();
+        for (int j = 0; j < 250; ++j) {
+            expected += line;
+        }
+    }
+    EXPECT_EQ(content(), expected);
+}
+
+TEST_F(TracerFileTest, AFileThatCannotBeOpenedIsAUsageError) {
+    for (const std::string& name : {file() + "-nowhere/trace", std::string()}) {
+        try {
+            const Tracer tracer(false, name);
+            ADD_FAILURE() << name;
+        } catch (const Failure& failure) {
+            EXPECT_EQ(failure.code(), ExitCode::Usage);
+            EXPECT_EQ(failure.what(), "cannot open '" + name + "' for the trace: No such file or directory");
+        }
+    }
+}
+
+TEST_F(TracerFileTest, AFileWithoutRoomEndsTheTraceWithOneSentence) {
+    Tracer tracer(false, "/dev/full");
+    ::testing::internal::CaptureStderr();
+    traceOne(tracer);
+    traceOne(tracer);
+    EXPECT_EQ(::testing::internal::GetCapturedStderr(),
+              "krutil: cannot write to '/dev/full': No space left on device; the trace ends here\n");
 }
 
 TEST(TracerTest, EveryByteOfALineIsPrintable) {
