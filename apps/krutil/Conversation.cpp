@@ -196,11 +196,11 @@ bool Conversation::waitForSomething(std::optional<Clock::time_point> deadline, i
         }
         return false;
     }
-    if (ready > (watched[3].revents != 0 ? 1 : 0)) {
+    if (watched[0].revents != 0 || watched[2].revents != 0) {
         stopPastime();
     }
     if (watched[1].revents != 0) {
-        interrupt_.dispatch();
+        interrupt_.dispatch([this] { stopPastime(); });
     }
     if (watched[2].revents != 0) {
         watched_ = -1;

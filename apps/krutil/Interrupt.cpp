@@ -56,9 +56,12 @@ Interrupt::~Interrupt() {
     eventOfProcess = -1;
 }
 
-void Interrupt::dispatch() {
+void Interrupt::dispatch(const std::function<void()>& before) {
     std::uint64_t count = 0;
     if (::read(event_.get(), &count, sizeof count) == sizeof count && pressed.exchange(false)) {
+        if (before) {
+            before();
+        }
         // A copy: the action may replace itself.
         const auto action = action_;
         action();

@@ -21,9 +21,9 @@ class Interrupt {
     /// Readable while a Ctrl-C, or a wake(), has not been dispatched.
     int fd() const noexcept { return event_.get(); }
 
-    /// Calls the action once if there was any Ctrl-C since the last call. Whatever the action throws reaches the
-    /// caller.
-    void dispatch();
+    /// Calls the action once if there was any Ctrl-C since the last call, and `before` ahead of it. Whatever they throw
+    /// reaches the caller.
+    void dispatch(const std::function<void()>& before = nullptr);
 
     /// Makes fd() readable without a Ctrl-C, so that whatever waits looks around. For signal handlers.
     static void wake() noexcept;
