@@ -33,23 +33,21 @@ OwnedHistory makeHistory() {
     return history;
 }
 
-// Opens the file for this program alone until the descriptor is closed; none where that cannot be. Ctrl-C ends waiting.
-Descriptor openLocked(const std::string& file, int flags) {
-    // One who replaces the file while this one waits leaves it with a lock on the old one. Nobody does so again and
-    // again: that is done at the start only.
-    for (int attempt = 0; attempt < 10; ++attempt) {
-        Descriptor opened(::open(file.c_str(), flags | O_CLOEXEC | O_NOFOLLOW, 0600));
-        struct stat here {};
-        struct stat there {};
-        if (!opened || ::flock(opened.get(), LOCK_EX) != 0 || ::fstat(opened.get(), &here) != 0 ||
-            !S_ISREG(here.st_mode)) {
-            return Descriptor();
-        }
-        if (::stat(file.c_str(), &there) == 0 && here.st_dev == there.st_dev && here.st_ino == there.st_ino) {
-            return ::fchmod(opened.get(), 0600) == 0 ? std::move(opened) : Descriptor();
-        }
-    }
-    return Descriptor();
+// Keeps other programs from the file until the descriptor is closed; none where that cannot be, or Ctrl-C has ended the
+// waiting. It is the directory that is locked, because the file is replaced by another one at times.
+Descriptor lock(const std::string& file) {
+    const auto directory = std::filesystem::path(file).parent_path();
+    Descriptor locked(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    return locked && ::flock(locked.get(), LOCK_EX) == 0 ? std::move(locked) : Descriptor();
+}
+
+// None for anything but a file of its own.
+Descriptor openFile(const std::string& file, int flags) {
+    Descriptor opened(::open(file.c_str(), flags | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, 0600));
+    struct stat status {};
+    const bool usable =
+        opened && ::fstat(opened.get(), &status) == 0 && S_ISREG(status.st_mode) && ::fchmod(opened.get(), 0600) == 0;
+    return usable ? std::move(opened) : Descriptor();
 }
 
 // Writes at the end; the library begins an empty file with its own first line.
@@ -79,7 +77,8 @@ LineHistory::LineHistory(std::string file) : file_(std::move(file)), history_(ma
     if (file_.empty()) {
         return;
     }
-    if (const Descriptor locked = openLocked(file_, O_RDWR)) {
+    const Descriptor locked = lock(file_);
+    if (locked && openFile(file_, O_RDWR)) {
         HistEventW event{};
         ::history_w(history_, &event, H_LOAD, file_.c_str());
         if (::history_w(history_, &event, H_GETSIZE) >= 0 && event.num >= lines) {
@@ -100,10 +99,12 @@ void LineHistory::add(const wchar_t* line) {
     }
     std::error_code ignored;
     std::filesystem::create_directories(std::filesystem::path(file_).parent_path(), ignored);
-    if (Descriptor locked = openLocked(file_, O_RDWR | O_CREAT | O_APPEND)) {
+    const Descriptor locked = lock(file_);
+    Descriptor opened = locked ? openFile(file_, O_RDWR | O_CREAT) : Descriptor();
+    if (opened) {
         const OwnedHistory only = makeHistory();
         ::history_w(only.get(), &event, H_ENTER, line);
-        append(only.get(), std::move(locked));
+        append(only.get(), std::move(opened));
     }
 }
 

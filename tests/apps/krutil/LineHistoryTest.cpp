@@ -7,6 +7,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <clocale>
 #include <filesystem>
 #include <fstream>
@@ -108,14 +109,31 @@ TEST_F(LineHistoryTest, TheFileIsCutToTheNewestLines) {
     EXPECT_EQ(std::distance(std::filesystem::directory_iterator(std::filesystem::path(file).parent_path()), {}), 1);
 }
 
-TEST_F(LineHistoryTest, OneThatIsCutLosesNoLineOfAnother) {
+TEST_F(LineHistoryTest, CuttingLosesNoLineThatAnotherAddsMeanwhile) {
     LineHistory other(file);
     for (int i = 0; i < LineHistory::lines; ++i) {
-        other.add((std::to_wstring(i) + L"\n").c_str());
+        other.add((L"before " + std::to_wstring(i) + L"\n").c_str());
     }
-    linesInFile();
-    other.add(L"after\n");
-    EXPECT_EQ(linesInFile().front(), "after\n");
+    constexpr int count = 300;
+    std::atomic<bool> done{false};
+    std::thread cutting([&] {
+        while (!done) {
+            const LineHistory cut(file);
+        }
+    });
+    for (int i = 0; i < count; ++i) {
+        other.add((L"meanwhile " + std::to_wstring(i) + L"\n").c_str());
+    }
+    done = true;
+    cutting.join();
+    auto lines = linesInFile();
+    ASSERT_THAT(lines, SizeIs(LineHistory::lines));
+    lines.resize(count);
+    std::vector<std::string> wanted;
+    for (int i = count; i > 0; --i) {
+        wanted.push_back("meanwhile " + std::to_string(i - 1) + "\n");
+    }
+    EXPECT_EQ(lines, wanted);
 }
 
 TEST_F(LineHistoryTest, TheFileIsForItsOwnerOnly) {
