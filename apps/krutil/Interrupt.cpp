@@ -20,7 +20,6 @@ namespace {
 std::atomic<int> eventOfProcess{-1};
 std::atomic<int> socketToShutDown{-1};
 std::atomic<bool> pressed{false};
-struct sigaction previousHandling;
 
 void onSignal(int) {
     const int savedError = errno;
@@ -41,8 +40,9 @@ Interrupt::Interrupt() : event_(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)), actio
     eventOfProcess = event_.get();
     pressed = false;
     // A shell that starts the program in the background has Ctrl-C ignored; that stays so.
-    ::sigaction(SIGINT, nullptr, &previousHandling);
-    if (previousHandling.sa_handler == SIG_IGN) {
+    struct sigaction previous {};
+    ::sigaction(SIGINT, nullptr, &previous);
+    if (previous.sa_handler == SIG_IGN) {
         return;
     }
     // Without SA_RESTART, so that a write to a terminal that is held up ends too.
@@ -52,7 +52,7 @@ Interrupt::Interrupt() : event_(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)), actio
 }
 
 Interrupt::~Interrupt() {
-    ::sigaction(SIGINT, &previousHandling, nullptr);
+    // The handler stays, and does nothing.
     eventOfProcess = -1;
 }
 

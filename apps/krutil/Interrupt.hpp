@@ -10,7 +10,8 @@ namespace client {
 
 /// Turns SIGINT into a readable descriptor and a call on the main thread. Everything that waits there watches fd() and
 /// calls dispatch() when it is readable, so that Ctrl-C is answered at once, whatever the program waits for. One object
-/// a process; it restores the previous handling of the signal when it is destroyed. Main thread only.
+/// at a time; after it, Ctrl-C does nothing, so that a program ends with the exit code that it has decided on. Main
+/// thread only.
 class Interrupt {
   public:
     Interrupt();

@@ -71,6 +71,13 @@ TEST(InterruptTest, WakingIsNoCtrlC) {
     EXPECT_FALSE(readable(interrupt.fd()));
 }
 
+TEST(InterruptTest, CtrlCAfterItsEndDoesNothing) {
+    { const Interrupt interrupt; }
+    ::raise(SIGINT);
+    Interrupt next;
+    EXPECT_FALSE(readable(next.fd()));
+}
+
 TEST(InterruptTest, AnIgnoredCtrlCStaysIgnored) {
     const auto previous = std::signal(SIGINT, SIG_IGN);
     {
