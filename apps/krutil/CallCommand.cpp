@@ -88,8 +88,7 @@ krutil::contextmgr::QvmID randomClientID() {
     return id;
 }
 
-// Shows how far the arrays of a call are, as long as the object lives and `err` is a terminal with a cursor with a
-// cursor.
+// Shows how far the arrays of a call are, as long as the object lives and `err` is a terminal with a cursor.
 class TransferDisplay {
   public:
     TransferDisplay(Client& client, Output& err, std::uint64_t toSend)
