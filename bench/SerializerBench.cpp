@@ -10,11 +10,11 @@
 #include <vector>
 
 #include "Comparison.hpp"
-#include "Samples.hpp"
-#include "TestTransport.hpp"
 #include "foundation/korveldata/ArrayFactory.hpp"
 #include "krutil/io/TextBaseEvent.hpp"
+#include "krutil_protobuf/support/TestTransport.hpp"
 #include "msg_svc/protobuf/ustring.hpp"
+#include "samples/Samples.hpp"
 
 namespace bench {
 namespace {

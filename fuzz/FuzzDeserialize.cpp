@@ -5,13 +5,13 @@
 #include <stdexcept>
 #include <typeinfo>
 
-#include "FuzzInput.hpp"
-#include "Samples.hpp"
-#include "TestTransport.hpp"
 #include "common/Precheck.hpp"
 #include "foundation/korveldata/ArrayFormatError.hpp"
 #include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
 #include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
+#include "input/FuzzInput.hpp"
+#include "krutil_protobuf/support/TestTransport.hpp"
+#include "samples/Samples.hpp"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
     using foundation::vantor::carrier::framing::TaggedFrame;

@@ -4,9 +4,9 @@
 #include <fstream>
 #include <iostream>
 
-#include "FuzzInput.hpp"
-#include "Samples.hpp"
-#include "TestTransport.hpp"
+#include "input/FuzzInput.hpp"
+#include "krutil_protobuf/support/TestTransport.hpp"
+#include "samples/Samples.hpp"
 
 namespace {
 

@@ -10,8 +10,6 @@ namespace apps {
 namespace {
 
 constexpr std::uint64_t kibi = 1024;
-// The layout of a frame has 16 bits for the length of its tag.
-constexpr std::uint64_t longestTag = 65'535;
 constexpr std::uint64_t unlimited = std::numeric_limits<std::uint64_t>::max();
 constexpr std::array<std::string_view, 5> units{"", "KiB", "MiB", "GiB", "TiB"};
 
@@ -69,7 +67,8 @@ CLI::Option* addSizeOption(CLI::App& app, const std::string& name, std::uint64_t
 }
 
 void addLimitOptions(CLI::App& app, foundation::msg_svc::transport::layers::session::Limits& limits) {
-    addSizeOption(app, "--limit-tag", limits.tag, "Longest tag of a frame that is accepted", longestTag);
+    addSizeOption(app, "--limit-tag", limits.tag, "Longest tag of a frame that is accepted",
+                  foundation::msg_svc::transport::layers::session::Limits::longestTag);
     addSizeOption(app, "--limit-tagged-frame", limits.taggedFrame, "Largest tagged frame that is accepted");
     addSizeOption(app, "--limit-array-message", limits.arrayMessage,
                   "Largest tagged frame of an array that is accepted");

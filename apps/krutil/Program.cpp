@@ -1,4 +1,4 @@
-#include "Program.hpp"
+#include "krutil/Program.hpp"
 
 #include <fcntl.h>
 #include <unistd.h>
@@ -12,24 +12,24 @@
 #include <string_view>
 #include <utility>
 
-#include "CallCommand.hpp"
-#include "Client.hpp"
-#include "CommandLine.hpp"
-#include "EvalCommand.hpp"
-#include "Interrupt.hpp"
-#include "JsonPrinter.hpp"
 #include "KrutilProtocol.hpp"
-#include "LastLine.hpp"
-#include "LineEditor.hpp"
-#include "LineReader.hpp"
-#include "Output.hpp"
-#include "PersonPrinter.hpp"
-#include "Prompts.hpp"
-#include "Repl.hpp"
-#include "RunCommand.hpp"
 #include "common/ProtobufLog.hpp"
+#include "krutil/base/Interrupt.hpp"
+#include "krutil/base/LastLine.hpp"
+#include "krutil/base/Output.hpp"
+#include "krutil/commands/CallCommand.hpp"
+#include "krutil/commands/CommandLine.hpp"
+#include "krutil/commands/EvalCommand.hpp"
+#include "krutil/commands/Repl.hpp"
+#include "krutil/commands/RunCommand.hpp"
+#include "krutil/display/JsonPrinter.hpp"
+#include "krutil/display/PersonPrinter.hpp"
+#include "krutil/session/Client.hpp"
+#include "krutil/terminal/LineEditor.hpp"
+#include "krutil/terminal/LineReader.hpp"
+#include "krutil/terminal/Prompts.hpp"
 
-namespace client {
+namespace krutil_client {
 namespace {
 
 // Descriptors 0 to 2 that the program was started without are taken, so that nothing else is ever mistaken for them.
@@ -213,4 +213,4 @@ int runProgram(int argc, const char* const* argv) {
     return static_cast<int>(ExitCode::Stream);
 }
 
-}  // namespace client
+}  // namespace krutil_client

@@ -1,5 +1,5 @@
-#include "Program.hpp"
+#include "krutil/Program.hpp"
 
 int main(int argc, char** argv) {
-    return client::runProgram(argc, argv);
+    return krutil_client::runProgram(argc, argv);
 }

@@ -16,6 +16,7 @@
 #include "cmddistributor/IIPStateEvent.hpp"
 #include "common/Build.hpp"
 #include "common/Precheck.hpp"
+#include "foundation/core/posix/SignalsBlocked.hpp"
 #include "korvel/lang/diagnostic/IssuedEnabledWarningEvent.hpp"
 #include "korvel/lang/diagnostic/IssuedWarningEvent.hpp"
 #include "krutil/capabilities_api/CapabilitiesChanged.hpp"
@@ -25,9 +26,9 @@
 #include "krutil/io/SinkTextEvent.hpp"
 #include "krutil/io/TextBaseEvent.hpp"
 #include "msg_svc/protobuf/ustring.hpp"
-#include "qvm/EngineModule.hpp"
-#include "qvm/ForkedChild.hpp"
-#include "qvm/WarningRecord.hpp"
+#include "qvm/process/ForkedChild.hpp"
+#include "qvm/python/EngineModule.hpp"
+#include "qvm/python/WarningRecord.hpp"
 
 namespace qvm {
 namespace {
@@ -58,26 +59,6 @@ using session_layer::SessionConfig;
 
 // How long a session that has lost its client waits for its own threads before it ends the process.
 constexpr std::chrono::milliseconds kGrace{200};
-
-// Threads that start while an object lives get no signals: those are for Python's main thread. And a signal that comes
-// between a last look and a wait is not missed, when the wait lets it through.
-class SignalsBlocked {
-  public:
-    SignalsBlocked() {
-        sigset_t all;
-        ::sigfillset(&all);
-        ::pthread_sigmask(SIG_BLOCK, &all, &before_);
-    }
-    ~SignalsBlocked() { ::pthread_sigmask(SIG_SETMASK, &before_, nullptr); }
-    SignalsBlocked(const SignalsBlocked&) = delete;
-    SignalsBlocked& operator=(const SignalsBlocked&) = delete;
-
-    // What was blocked before.
-    const sigset_t* before() const noexcept { return &before_; }
-
-  private:
-    sigset_t before_{};
-};
 
 RuntimeException communicationError(const std::string& text) {
     return {inCOMM_ERROR, msg_svc::protobuf::utf8_to_ustring(text), "", "", {}, {}, false};
@@ -153,7 +134,7 @@ ExitCode Engine::run(int in, int out) {
     settings.maxUnits = static_cast<std::size_t>(
         std::clamp<std::uint64_t>(session_->peer().limits.taggedFrame / 8, 16, settings.maxUnits));
     {
-        SignalsBlocked blocked;
+        posix::SignalsBlocked blocked;
         output_ = std::make_unique<TextOutput>(
             settings, [this](const TextTarget& target, std::u16string text) { emitText(target, std::move(text)); });
         capture_ = std::make_unique<OutputCapture>(
@@ -232,7 +213,7 @@ std::optional<Request> Engine::next() {
     while (true) {
         RequestQueue::Wait wait = RequestQueue::Wait::Interrupted;
         {
-            SignalsBlocked blocked;
+            posix::SignalsBlocked blocked;
             python_->handleSignals();
             python_->unlocked(
                 [&] { wait = queue_.wait(DequeuePoint::Idle, python_->releasedDescriptor(), {}, blocked.before()); });
@@ -369,7 +350,7 @@ PromptEnd Engine::attend(Prompt& prompt) {
         const RequestQueue::Deadline deadline = withdrawn ? std::chrono::steady_clock::now() : prompt.deadline;
         RequestQueue::Wait wait = RequestQueue::Wait::Interrupted;
         {
-            SignalsBlocked blocked;
+            posix::SignalsBlocked blocked;
             if (interrupted()) {
                 return PromptEnd::Raised;
             }

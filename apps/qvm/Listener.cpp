@@ -19,10 +19,13 @@
 #include <stdexcept>
 #include <system_error>
 
-#include "qvm/StandardDescriptors.hpp"
+#include "foundation/core/posix/OwnedDescriptor.hpp"
+#include "qvm/process/StandardDescriptors.hpp"
 
 namespace qvm {
 namespace {
+
+namespace posix = foundation::core::posix;
 
 // How long sessions have to end after they were told to.
 constexpr std::chrono::seconds kSessionPatience{2};
@@ -37,23 +40,6 @@ constexpr int kAcceptPauseMilliseconds = 1000;
 [[noreturn]] void failWithErrno(const std::string& what) {
     fail(what + ": " + std::generic_category().message(errno));
 }
-
-// Closes a descriptor at the end of a scope.
-class Descriptor {
-  public:
-    explicit Descriptor(int descriptor) : descriptor_(descriptor) {}
-    ~Descriptor() {
-        if (descriptor_ >= 0) {
-            ::close(descriptor_);
-        }
-    }
-    Descriptor(const Descriptor&) = delete;
-    Descriptor& operator=(const Descriptor&) = delete;
-    int get() const noexcept { return descriptor_; }
-
-  private:
-    int descriptor_;
-};
 
 std::string octal(mode_t mode) {
     std::array<char, 8> text{};
@@ -106,7 +92,7 @@ int newSocket() {
 }
 
 bool somebodyAnswers(const sockaddr_un& address) {
-    const Descriptor probe(newSocket());
+    const posix::OwnedDescriptor probe(newSocket());
     // EAGAIN: a listener whose backlog is full.
     return ::connect(probe.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)) == 0 || errno == EAGAIN;
 }
@@ -161,7 +147,7 @@ void Listener::bindSocket() {
     const std::string& path = options_.listen;
     const sockaddr_un address = addressOf(path);
     const std::filesystem::path parent = std::filesystem::path(path).parent_path();
-    const Descriptor directory(openPrivateDirectory(parent.empty() ? "." : parent.string()));
+    const posix::OwnedDescriptor directory(openPrivateDirectory(parent.empty() ? "." : parent.string()));
     // Two engines that start at the same time must not both find a dead socket and remove each other's.
     if (::flock(directory.get(), LOCK_EX) != 0) {
         failWithErrno("Cannot lock the directory of \"" + path + "\"");

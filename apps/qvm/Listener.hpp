@@ -7,8 +7,8 @@
 #include <string>
 
 #include "qvm/Engine.hpp"
-#include "qvm/Log.hpp"
 #include "qvm/Options.hpp"
+#include "qvm/process/Log.hpp"
 
 namespace qvm {
 

@@ -6,7 +6,7 @@
 #include <string>
 
 #include "foundation/msg_svc/transport/layers/session/Limits.hpp"
-#include "qvm/RequestQueue.hpp"
+#include "qvm/requests/RequestQueue.hpp"
 
 namespace qvm {
 

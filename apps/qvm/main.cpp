@@ -10,9 +10,9 @@
 #include "common/ProtobufLog.hpp"
 #include "qvm/Engine.hpp"
 #include "qvm/Listener.hpp"
-#include "qvm/Log.hpp"
 #include "qvm/Options.hpp"
-#include "qvm/StandardDescriptors.hpp"
+#include "qvm/process/Log.hpp"
+#include "qvm/process/StandardDescriptors.hpp"
 
 namespace {
 

@@ -7,7 +7,7 @@
 #include <iostream>
 #include <set>
 
-#include "Goldens.hpp"
+#include "krutil_protobuf/support/Goldens.hpp"
 
 int main() try {
     const auto registry = transport::sessionRegistry();

@@ -1,4 +1,5 @@
-"""Checks that includes point one way only: apps -> product (its public face) -> platform/include.
+"""Checks that includes point one way only: apps -> product (its public face) -> platform/include, and, within a
+program, from its upper rooms to its lower ones.
 
     includes.py ROOT
 
@@ -29,9 +30,21 @@ ALLOWED = {
     "apps": {"apps", "product/public", "product/generated", "platform/include", "platform/generated"},
 }
 
+# The rooms of the programs, from the bottom up: a file includes from its own room and from those before it. What lies
+# beside the rooms may include all of them. Neither program includes from the other, nor does what both share.
+PROGRAM_ROOMS = {
+    "apps/common": [],
+    "apps/krutil": ["base", "arrays", "display", "session", "terminal", "commands"],
+    "apps/qvm": ["process", "requests", "python"],
+}
+
 # Headers of platform/include that serve the reference host alone: a host with a platform of its own lacks them.
 HOST_ONLY = {
     "foundation/core/diag/AssertionSwitch.hpp",
+    "foundation/core/posix/EventDescriptor.hpp",
+    "foundation/core/posix/OwnedDescriptor.hpp",
+    "foundation/core/posix/SignalsBlocked.hpp",
+    "foundation/core/posix/writeFully.hpp",
     "foundation/msg_svc/transport/layers/session/Limits.hpp",
     "foundation/msg_svc/transport/layers/session/Session.hpp",
     "foundation/msg_svc/transport/layers/session/SessionError.hpp",
@@ -50,14 +63,39 @@ def room(path):
     return path.split("/")[0]
 
 
+def program_room(path):
+    """The program that a path below apps/ belongs to, and how high its room lies there; None for other paths."""
+    parts = path.split("/")
+    program = "/".join(parts[:2])
+    if program not in PROGRAM_ROOMS:
+        return None
+    rooms = PROGRAM_ROOMS[program]
+    if len(parts) == 3:
+        return program, len(rooms)
+    return program, rooms.index(parts[2]) if parts[2] in rooms else -1
+
+
+def check_programs(place, including, included):
+    """Findings about an include within apps/."""
+    source, target = program_room(including), program_room(included)
+    if source is None or target is None:
+        return []
+    findings = []
+    if source[1] < 0:
+        findings.append(f"{place}: {including} is in no room of {source[0]}; tests/repository/includes.py lists them")
+    elif target[0] not in (source[0], "apps/common"):
+        findings.append(f"{place}: {source[0]} must not include {included} of {target[0]}")
+    elif target[0] == source[0] and target[1] > source[1]:
+        findings.append(f"{place}: {included} lies in a room above that of {including}")
+    return findings
+
+
 def resolve(root, including, bracket, name):
     """The room of an included file and its path; None for a system header; an unknown room for what is nowhere."""
     for pattern, generated in GENERATED.items():
         if "/" not in name and fnmatch.fnmatch(name, pattern):
             return generated, name
     directories = list(INCLUDE_DIRECTORIES)
-    if including.startswith("apps/"):
-        directories.append("/".join(including.split("/")[:2]))
     if bracket == '"':
         directories.insert(0, os.path.dirname(including))
     for directory in directories:
@@ -86,6 +124,8 @@ def check(root):
                 findings.append(f"{place}: {room(path)} must not include {target[1]} of {target[0]}")
             elif room(path).startswith("product") and match[2] in HOST_ONLY:
                 findings.append(f"{place}: {target[1]} is the reference host's own; other platforms do not have it")
+            else:
+                findings += check_programs(place, path, target[1])
     return findings
 
 

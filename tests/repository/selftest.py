@@ -76,6 +76,23 @@ class IncludesTest(Planted):
     def test_apps_include_platform_implementation(self):
         self.expect("apps/qvm/A.cpp", '#include "io/Detail.hpp"', "of platform/src")
 
+    def test_program_includes_the_other_program(self):
+        self.write("apps/krutil/base/A.hpp", "// A.\n")
+        self.expect("apps/qvm/A.cpp", '#include "krutil/base/A.hpp"', "apps/qvm must not include", "of apps/krutil")
+
+    def test_lower_room_includes_an_upper_one(self):
+        self.write("apps/krutil/commands/A.hpp", "// A.\n")
+        self.expect("apps/krutil/base/B.cpp", '#include "krutil/commands/A.hpp"', "in a room above")
+
+    def test_upper_room_includes_a_lower_one(self):
+        self.write("apps/qvm/process/A.hpp", "// A.\n")
+        self.write("apps/qvm/python/B.cpp", '#include "qvm/process/A.hpp"\n')
+        self.write("apps/qvm/C.cpp", '#include "qvm/process/A.hpp"\n')
+        self.assertEqual(includes.check(self.root), [])
+
+    def test_room_that_is_not_listed(self):
+        self.expect("apps/qvm/attic/A.cpp", '#include "common/Build.hpp"', "in no room of apps/qvm")
+
     def test_included_file_that_is_nowhere(self):
         self.expect("apps/qvm/A.cpp", '#include "io/Missing.hpp"', "in no room")
 

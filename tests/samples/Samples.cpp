@@ -1,4 +1,4 @@
-#include "Samples.hpp"
+#include "samples/Samples.hpp"
 
 #include <bit>
 #include <boost/make_shared.hpp>

@@ -5,18 +5,18 @@
 
 #include <boost/make_shared.hpp>
 
-#include "Interrupt.hpp"
-#include "Output.hpp"
-#include "Pipe.hpp"
 #include "foundation/msg_svc/eventmgr/EventMgr.hpp"
+#include "krutil/base/Interrupt.hpp"
+#include "krutil/base/Output.hpp"
+#include "support/Pipe.hpp"
 
-namespace client {
+namespace krutil_client {
 
 /// Both outputs of the client, and where they go.
 struct CaughtOutput {
     Interrupt interrupt;
-    Pipe outPipe;
-    Pipe errPipe;
+    test_support::Pipe outPipe;
+    test_support::Pipe errPipe;
     Output out{outPipe.write.get(), "standard output", interrupt};
     Output err{errPipe.write.get(), "standard error", interrupt};
 };
@@ -32,4 +32,4 @@ class PrinterFixture : public ::testing::Test, protected CaughtOutput {
     foundation::msg_svc::eventmgr::EventMgr events;
 };
 
-}  // namespace client
+}  // namespace krutil_client

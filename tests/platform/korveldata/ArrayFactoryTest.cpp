@@ -7,8 +7,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "ArrayTestSupport.hpp"
 #include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
+#include "platform/korveldata/ArrayTestSupport.hpp"
 
 namespace foundation::korveldata {
 namespace {

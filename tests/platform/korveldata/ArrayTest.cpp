@@ -11,9 +11,9 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include "ArrayTestSupport.hpp"
 #include "foundation/korveldata/ArrayFactory.hpp"
 #include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
+#include "platform/korveldata/ArrayTestSupport.hpp"
 
 namespace foundation::korveldata {
 namespace {

@@ -347,7 +347,7 @@ std::string join(const std::vector<std::string>& mismatches) {
 Peer peerOf(const SessionHello& hello) {
     Peer peer;
     peer.build = sentence(hello.build(), longestBuild);
-    peer.limits.tag = std::min<std::uint64_t>(hello.limits().tag(), 65'535);
+    peer.limits.tag = std::min<std::uint64_t>(hello.limits().tag(), Limits::longestTag);
     peer.limits.taggedFrame = hello.limits().taggedframe();
     peer.limits.arrayMessage = hello.limits().arraymessage();
     peer.limits.message = hello.limits().message();

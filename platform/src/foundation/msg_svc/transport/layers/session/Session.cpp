@@ -30,6 +30,8 @@
 #include <variant>
 #include <vector>
 
+#include "foundation/core/posix/OwnedDescriptor.hpp"
+#include "foundation/core/posix/SignalsBlocked.hpp"
 #include "foundation/korveldata/Array.hpp"
 #include "foundation/msg_svc/transport/layers/serialization/SerializerAPI.hpp"
 #include "foundation/msg_svc/transport/layers/session/Handshake.hpp"
@@ -44,6 +46,9 @@
 
 namespace foundation::msg_svc::transport::layers::session {
 namespace {
+
+using core::posix::OwnedDescriptor;
+using core::posix::SignalsBlocked;
 
 namespace asio = boost::asio;
 using ErrorCode = boost::system::error_code;
@@ -82,26 +87,6 @@ std::string tagOfArrays(const serialization::Registry& registry) {
     }
 }
 
-// A descriptor that is closed unless somebody takes it over.
-class OwnedDescriptor {
-  public:
-    explicit OwnedDescriptor(int descriptor) noexcept : descriptor_(descriptor) {}
-    ~OwnedDescriptor() {
-        if (descriptor_ >= 0) {
-            ::close(descriptor_);
-        }
-    }
-    OwnedDescriptor(const OwnedDescriptor&) = delete;
-    OwnedDescriptor& operator=(const OwnedDescriptor&) = delete;
-
-    int get() const noexcept { return descriptor_; }
-    void reset(int descriptor) noexcept { descriptor_ = descriptor; }
-    int release() noexcept { return std::exchange(descriptor_, -1); }
-
-  private:
-    int descriptor_;
-};
-
 void prepare(int descriptor) {
     const int flags = ::fcntl(descriptor, F_GETFL);
     if (flags < 0 || ::fcntl(descriptor, F_SETFL, flags | O_NONBLOCK) < 0 ||
@@ -117,25 +102,6 @@ void ignoreBrokenPipes() {
         ::signal(SIGPIPE, SIG_IGN);
     }
 }
-
-// Signals of the process belong to the program's own threads; those that report a fault of the running thread stay.
-class SignalsBlocked {
-  public:
-    SignalsBlocked() {
-        sigset_t blocked;
-        ::sigfillset(&blocked);
-        for (const int fault : {SIGSEGV, SIGBUS, SIGFPE, SIGILL, SIGABRT, SIGTRAP, SIGSYS, SIGPROF}) {
-            ::sigdelset(&blocked, fault);
-        }
-        ::pthread_sigmask(SIG_SETMASK, &blocked, &previous_);
-    }
-    ~SignalsBlocked() { ::pthread_sigmask(SIG_SETMASK, &previous_, nullptr); }
-    SignalsBlocked(const SignalsBlocked&) = delete;
-    SignalsBlocked& operator=(const SignalsBlocked&) = delete;
-
-  private:
-    sigset_t previous_{};
-};
 
 }  // namespace
 
@@ -979,7 +945,7 @@ std::unique_ptr<Session> Session::open(int in, int out, SessionConfig config) {
     prepare(ownedIn.get());
     prepare(ownedOut.get());
     ignoreBrokenPipes();
-    config.limits.tag = std::min<std::uint64_t>(config.limits.tag, 65'535);
+    config.limits.tag = std::min(config.limits.tag, Limits::longestTag);
     Settlement settlement = shakeHands(ownedIn.get(), ownedOut.get(), config);
     return std::unique_ptr<Session>(
         new Session(std::make_unique<Impl>(ownedIn, ownedOut, std::move(config), std::move(settlement))));

@@ -1,0 +1,87 @@
+// What the program is asked to do, in structures: filled by the command line, read by everything else.
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <optional>
+#include <string>
+#include <variant>
+#include <vector>
+
+#include "cmddistributor/CodeType.hpp"
+#include "foundation/msg_svc/transport/layers/session/Limits.hpp"
+
+namespace krutil_client {
+
+/// Which engine, and what is agreed with it.
+struct ConnectionOptions {
+    std::optional<std::string> engine;  ///< a shell command; empty for the engine that comes with this program
+    std::optional<std::string> socket;  ///< a Unix socket to connect to instead of starting an engine
+    std::chrono::milliseconds handshakeTimeout{10'000};
+    bool noPrecheck = false;  ///< a number that the protocol does not know ends this program, not just the session
+    bool noZeroCopy = false;  ///< elements of arrays travel inside their messages
+    foundation::msg_svc::transport::layers::session::Limits limits;
+};
+
+/// Whether errors and warnings are coloured.
+enum class Color { Auto, Always, Never };
+
+/// What is shown, and how.
+struct DisplayOptions {
+    bool json = false;
+    bool trace = false;                    ///< each frame goes to standard error
+    std::optional<std::string> traceFile;  ///< each frame goes to this file
+    bool timing = false;
+    bool warningStack = false;  ///< warnings tell where they were issued
+    Color color = Color::Auto;
+};
+
+/// What a request asks of the place that shows its text.
+struct SinkOptions {
+    bool hotlinks = false;
+    bool echo = false;
+    bool diary = false;
+    bool log = false;
+};
+
+/// `krutil eval`.
+struct EvalOptions {
+    std::string source;     ///< the code, or the file that holds it
+    bool fromFile = false;  ///< `source` names a file
+    bool fromStandardInput = false;
+    cmddistributor::CodeType type = cmddistributor::CodeType::CodeBlockType;
+    bool sparingly = false;
+    SinkOptions sink;
+};
+
+/// `krutil call`.
+struct CallOptions {
+    std::string function;                ///< dotted name
+    std::vector<std::string> arguments;  ///< literals and files, as they were typed
+    std::size_t outputs = 1;             ///< that are wanted
+    std::vector<std::string> files;      ///< for the first outputs, in order
+    bool sparingly = false;
+    SinkOptions sink;
+};
+
+/// `krutil run`.
+struct RunOptions {
+    std::string file;
+    std::vector<std::string> arguments;  ///< of the script
+    bool sparingly = false;
+    SinkOptions sink;
+};
+
+/// `krutil repl`.
+struct ReplOptions {
+    bool noHistory = false;  ///< lines are not kept for later sessions
+    SinkOptions sink;
+};
+
+struct Options {
+    ConnectionOptions connection;
+    DisplayOptions display;
+    std::variant<EvalOptions, CallOptions, RunOptions, ReplOptions> command;
+};
+
+}  // namespace krutil_client

@@ -1,0 +1,30 @@
+// Conversions of text for display.
+#pragma once
+
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "krutil/cmddistributor/inExecutionStatus.hpp"
+#include "krutil/io/StreamTypeEnum.hpp"
+
+namespace krutil_client {
+
+/// Offset in bytes of the first byte of `text` that is not part of valid UTF-8; empty when all of it is.
+std::optional<std::size_t> firstInvalidUtf8(const std::string& text);
+
+/// Text between UTF-8 and characters of the C library, whose LC_CTYPE must be one of UTF-8. What is ill-formed becomes
+/// U+FFFD.
+std::string toUtf8(std::wstring_view text);
+std::wstring toWide(std::string_view text);
+
+/// "output", "error" or "generic".
+std::string_view streamName(krutil::io::StreamTypeEnum stream);
+
+/// "success", "compile error", "runtime error", "debugger quit", "cancelled" or "communication error".
+std::string_view statusName(krutil::cmddistributor::inExecutionStatus status);
+
+/// A line number, which peers state as a floating-point number: without a fraction where it has none.
+std::string lineText(double line);
+
+}  // namespace krutil_client

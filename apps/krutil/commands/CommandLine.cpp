@@ -1,0 +1,266 @@
+#include "krutil/commands/CommandLine.hpp"
+
+#include <CLI/CLI.hpp>
+#include <algorithm>
+#include <map>
+#include <memory>
+#include <sstream>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "common/Build.hpp"
+#include "common/HelpFormatter.hpp"
+#include "common/LimitOptions.hpp"
+
+namespace krutil_client {
+namespace {
+
+constexpr const char* exitCodes = R"(Exit codes:
+  0  ok
+  1  the code or the function raised an error
+  2  the command line, the code text or a file cannot be used, or an argument is larger than the
+     engine accepts
+  3  no engine could be started or reached, or its stream was lost
+  4  the engine broke the protocol
+  5  the ends do not fit: protocol version or features
+  6  cancelled)";
+
+void addConnectionOptions(CLI::App& app, ConnectionOptions& options) {
+    auto* engine =
+        app.add_option("--engine", options.engine,
+                       "Start the engine with this shell command, for example 'ssh HOST krutil-qvm --stdio'; "
+                       "otherwise krutil-qvm beside this program, or on PATH")
+            ->type_name("COMMAND")
+            ->group("Engine");
+    app.add_option("--connect", options.socket, "Connect to the engine that listens at this Unix socket")
+        ->type_name("PATH")
+        ->excludes(engine)
+        ->group("Engine");
+    app.add_option_function<double>(
+           "--handshake-timeout",
+           [&options](const double& seconds) {
+               options.handshakeTimeout =
+                   std::chrono::milliseconds(static_cast<std::chrono::milliseconds::rep>(seconds * 1'000.0));
+           },
+           "How long the engine may take to start and answer")
+        ->check(CLI::Range(0.001, 86'400.0).description(""))
+        ->type_name("SECONDS")
+        ->default_str("10")
+        ->group("Engine");
+    app.add_flag(
+           "--no-zero-copy", options.noZeroCopy,
+           "Copy arrays into their messages, as QX_DISABLE_ZEROCOPY=1 does; both ends must. An engine that is started "
+           "here is told so, any other needs the option as well")
+        ->group("Engine");
+    app.add_flag(
+           "--no-precheck", options.noPrecheck,
+           "Do not look for numbers that the protocol does not know before a message is read; one that comes then "
+           "ends this program at once")
+        ->group("Engine");
+    apps::addLimitOptions(app, options.limits);
+}
+
+void addDisplayOptions(CLI::App& app, DisplayOptions& options) {
+    app.add_flag("--json", options.json, "Print one JSON object a line for each event, and nothing else")
+        ->group("Display");
+    app.add_flag("--trace", options.trace, "Print each frame of the session to standard error")->group("Display");
+    app.add_option("--trace-to", options.traceFile,
+                   "Write each frame of the session to this file, which is emptied first")
+        ->type_name("FILE")
+        ->group("Display");
+    app.add_flag("--timing", options.timing, "Say how long things took")->group("Display");
+    static const std::map<std::string, Color> colors{
+        {"auto", Color::Auto}, {"always", Color::Always}, {"never", Color::Never}};
+    app.add_option_function<std::string>(
+           "--color", [&options](const std::string& name) { options.color = colors.at(name); },
+           "Tell errors and warnings apart by colour: auto (on a terminal, unless NO_COLOR is set), always or never")
+        ->check(CLI::IsMember(&colors).description(""))
+        ->type_name("WHEN")
+        ->default_str("auto")
+        ->group("Display");
+    app.add_flag("--warning-stack", options.warningStack, "Show where each warning was issued")->group("Display");
+}
+
+void addSinkOptions(CLI::App& app, SinkOptions& options) {
+    app.add_flag("--diary", options.diary, "Add the text to the engine's diary as well")->group("Request");
+    app.add_flag("--log", options.log, "Write the text to the engine's log as well")->group("Request");
+    app.add_flag("--hotlinks", options.hotlinks, "Let a terminal show hyperlinks")->group("Request");
+}
+
+CLI::App* addEval(CLI::App& app, Options& options, EvalOptions& eval) {
+    auto* command = app.add_subcommand("eval", "Evaluate code and show what it prints");
+    auto* code =
+        command->add_option("CODE", eval.source, "The code, or - for standard input; after -- it may begin with a dash")
+            ->type_name("");
+    auto* file = command->add_option("-f,--file", eval.source, "Take the code from a file")->type_name("FILE");
+    file->excludes(code);
+    static const std::map<std::string, cmddistributor::CodeType> types{
+        {"block", cmddistributor::CodeType::CodeBlockType},
+        {"script", cmddistributor::CodeType::ScriptType},
+        {"conventional", cmddistributor::CodeType::ConventionalType}};
+    command
+        ->add_option_function<std::string>(
+            "--type", [&eval](const std::string& name) { eval.type = types.at(name); },
+            "How the code is read: block (statements; the value of a trailing expression is shown), script (a program) "
+            "or conventional (one statement)")
+        ->check(CLI::IsMember(&types).description(""))
+        ->type_name("TYPE")
+        ->default_str("block")
+        ->group("Request");
+    command
+        ->add_flag("--sparingly", eval.sparingly, "Let the engine send output in large pieces instead of line by line")
+        ->group("Request");
+    command->add_flag("--echo", eval.sink.echo, "Show the code before what it prints")->group("Request");
+    addSinkOptions(*command, eval.sink);
+    addDisplayOptions(*command, options.display);
+    addConnectionOptions(*command, options.connection);
+    command->footer(exitCodes);
+    command->callback([&options, &eval, code, file] {
+        if (code->count() == 0 && file->count() == 0) {
+            throw CLI::RequiredError("CODE or --file");
+        }
+        eval.fromFile = file->count() > 0;
+        eval.fromStandardInput = !eval.fromFile && eval.source == "-";
+        options.command = eval;
+    });
+    return command;
+}
+
+constexpr const char* promptHelp = R"(Prompts:
+  Code that reads a line, pauses or stops at breakpoint() asks for it here if standard input is a
+  terminal. At debug> and keyboard> code is evaluated where the program stands; :c goes on, :q (or
+  Ctrl-D) quits. Ctrl-C cancels; a second one within two seconds ends the engine.)";
+
+void addRun(CLI::App& app, Options& options, RunOptions& run) {
+    auto* command = app.add_subcommand("run", "Run a Python program from a file");
+    command->add_option("FILE", run.file, "The program, a file of this machine; the engine gets its text")
+        ->required()
+        ->type_name("");
+    command
+        ->add_option(
+            "ARG", run.arguments,
+            "What the program finds in sys.argv after its name; put -- before the first one if any begins with a dash")
+        ->type_name("");
+    command
+        ->add_flag("--sparingly", run.sparingly, "Let the engine send output in large pieces instead of line by line")
+        ->group("Request");
+    addSinkOptions(*command, run.sink);
+    addDisplayOptions(*command, options.display);
+    addConnectionOptions(*command, options.connection);
+    command->footer(std::string(promptHelp) + "\n\n" + exitCodes);
+    command->callback([&options, &run] { options.command = run; });
+}
+
+void addRepl(CLI::App& app, Options& options, ReplOptions& repl) {
+    auto* command = app.add_subcommand("repl", "Evaluate code line by line, as krutil without a command does");
+    command->add_flag("--no-history", repl.noHistory, "Keep no history of the lines that are typed")->group("Display");
+    addSinkOptions(*command, repl.sink);
+    addDisplayOptions(*command, options.display);
+    addConnectionOptions(*command, options.connection);
+    command->footer(std::string(promptHelp) + "\n\n" + exitCodes);
+    command->callback([&options, &repl] { options.command = repl; });
+}
+
+constexpr const char* argumentForms = R"(Arguments:
+  7  3.5  1e3  1+2j  true       a number or a truth value
+  [1,2,3]  [[1,2.5],[3,4]]      an array, with one dimension for each level of lists
+  '"text"'                      a text in double quotes, with quotes around them for the shell
+  FILE.npy  @FILE               the array of a .npy file, sent from the file without a copy
+After -- an argument may begin with a dash; a negative number may at any place.)";
+
+// What begins and ends with a bracket is taken apart at its commas by the parser of the command line, unless there is a
+// space before it, which an array's literal may begin with.
+std::vector<std::string> withLiteralsKept(int argc, const char* const* argv) {
+    std::vector<std::string> arguments(argv + std::min(argc, 1), argv + argc);
+    const auto takesValue = [](const std::string& argument) {
+        return argument == "-o" || argument == "--output" || argument == "--engine" || argument == "--connect" ||
+               argument == "--trace-to";
+    };
+    for (std::size_t i = 1; i < arguments.size() && arguments[0] == "call"; ++i) {
+        if (arguments[i].starts_with('[') && !takesValue(arguments[i - 1])) {
+            arguments[i].insert(0, 1, ' ');
+        }
+    }
+    return arguments;
+}
+
+void addCall(CLI::App& app, Options& options, CallOptions& call) {
+    auto* command = app.add_subcommand("call", "Call a function with arrays and show what it returns");
+    command->add_option("FUNCTION", call.function, "Name of the function, for example numpy.linalg.svd")
+        ->required()
+        ->type_name("");
+    auto* arguments = command->add_option("ARG", call.arguments, "Literals and .npy files, see below")->type_name("");
+    auto* outputs = command
+                        ->add_option("--nout", call.outputs,
+                                     "How many outputs are wanted; otherwise one, or as many as there are --output")
+                        ->check(CLI::Range(std::size_t{0}, std::size_t{65'535}).description(""))
+                        ->type_name("COUNT")
+                        ->group("Request");
+    command
+        ->add_option("-o,--output", call.files,
+                     "Write an output to this .npy file instead of showing it; once for each, in order")
+        ->allow_extra_args(false)
+        ->type_name("FILE")
+        ->group("Request");
+    command
+        ->add_flag("--sparingly", call.sparingly, "Let the engine send output in large pieces instead of line by line")
+        ->group("Request");
+    addSinkOptions(*command, call.sink);
+    addDisplayOptions(*command, options.display);
+    addConnectionOptions(*command, options.connection);
+    command->footer(std::string(argumentForms) + "\n\n" + exitCodes);
+    command->callback([&options, &call, arguments, outputs] {
+        // As they were typed: a conversion would take {} for none.
+        call.arguments = arguments->results();
+        for (std::string& argument : call.arguments) {
+            if (argument.starts_with(" [")) {
+                argument.erase(0, 1);
+            }
+        }
+        if (outputs->count() == 0) {
+            call.outputs = std::max<std::size_t>(call.files.size(), 1);
+        }
+        options.command = call;
+    });
+}
+
+}  // namespace
+
+std::variant<Options, Finished> parseCommandLine(int argc, const char* const* argv) {
+    Options options;
+    EvalOptions eval;
+    CallOptions call;
+    RunOptions run;
+    ReplOptions repl;
+    options.command = repl;
+    CLI::App app("Evaluates code on an engine in another process. Without a command, code is read line by line.",
+                 "krutil");
+    app.set_version_flag("--version", apps::buildString("krutil"), "Print the version and exit");
+    app.set_help_flag("-h,--help", "Print this help and exit");
+    app.require_subcommand(0, 1);
+    app.footer(exitCodes);
+    app.formatter(std::make_shared<apps::HelpFormatter>());
+    addEval(app, options, eval);
+    addCall(app, options, call);
+    addRun(app, options, run);
+    addRepl(app, options, repl);
+    try {
+        auto arguments = withLiteralsKept(argc, argv);
+        std::reverse(arguments.begin(), arguments.end());
+        app.parse(std::move(arguments));
+    } catch (const CLI::ParseError& error) {
+        std::ostringstream out;
+        std::ostringstream err;
+        app.exit(error, out, err);
+        // Help and version are no errors.
+        if (error.get_exit_code() == static_cast<int>(CLI::ExitCodes::Success)) {
+            return Finished{ExitCode::Ok, out.str(), {}};
+        }
+        return Finished{
+            ExitCode::Usage, {}, std::string("krutil: ") + error.what() + "\nRun krutil --help for help.\n"};
+    }
+    return options;
+}
+
+}  // namespace krutil_client

@@ -1,0 +1,73 @@
+#include "krutil/session/Canceller.hpp"
+
+#include <boost/make_shared.hpp>
+#include <utility>
+
+#include "cmddistributor/IIPCancelMessage.hpp"
+#include "krutil/base/ExitCode.hpp"
+
+namespace krutil_client {
+
+using cmddistributor::IIPCancelReply;
+
+Canceller::Canceller(Conversation& conversation, EngineProcess& engine, Interrupt& interrupt,
+                     const foundation::msg_svc::exchange::IDType& request, Say say)
+    : conversation_(conversation),
+      engine_(engine),
+      interrupt_(interrupt),
+      request_(request),
+      say_(std::move(say)),
+      actionBefore_(interrupt.setAction([this] { interrupted(); })) {}
+
+Canceller::~Canceller() {
+    *alive_ = false;
+    interrupt_.setAction(std::move(actionBefore_));
+}
+
+void Canceller::run(const std::function<bool()>& done) {
+    while (!done()) {
+        if (!impatientAt_) {
+            conversation_.run([&] { return impatientAt_ || done(); });
+        } else if (!conversation_.runUntil(*impatientAt_, done)) {
+            impatientAt_.reset();
+            say_(
+                "the engine has not stopped yet; code that is not Python's may hold it up. Press Ctrl-C twice to end "
+                "the engine");
+        }
+    }
+}
+
+void Canceller::interrupted() {
+    const auto now = Conversation::Clock::now();
+    if (asked_ && now - *asked_ <= again) {
+        // Before the stream closes, or the child would complain about that on the standard error that it shares.
+        const bool child = engine_.isChild();
+        engine_.kill();
+        throw Failure(ExitCode::Cancelled, child ? "cancelled; the engine was killed"
+                                                 : "cancelled; the connection was closed, which ends the session");
+    }
+    asked_ = now;
+    conversation_.send(boost::make_shared<const cmddistributor::IIPCancelMessage>(request_, true),
+                       [this, alive = alive_](const Conversation::Reply& reply) {
+                           const auto cancel = boost::dynamic_pointer_cast<const IIPCancelReply>(reply);
+                           if (*alive && cancel) {
+                               answered(cancel->getStatus());
+                           }
+                       });
+}
+
+void Canceller::answered(IIPCancelReply::CancelStatus status) {
+    switch (status) {
+        case IIPCancelReply::PENDING_CANCEL:
+            impatientAt_ = Conversation::Clock::now() + patience;
+            break;
+        case IIPCancelReply::UNABLE_TO_CANCEL_ALREADY_RUNNING:
+            say_("the engine does not interrupt this request. Press Ctrl-C twice to end the engine");
+            break;
+        case IIPCancelReply::UNABLE_TO_CANCEL_ALREADY_DONE:
+        case IIPCancelReply::SUCCESSFUL_CANCEL:
+            break;
+    }
+}
+
+}  // namespace krutil_client

@@ -1,0 +1,321 @@
+#include "krutil/session/Client.hpp"
+
+#include <unistd.h>
+
+#include <algorithm>
+#include <boost/make_shared.hpp>
+#include <functional>
+#include <stdexcept>
+#include <utility>
+
+#include "KrutilProtocol.hpp"
+#include "cmddistributor/IIPEnqueueMessage.hpp"
+#include "common/Build.hpp"
+#include "common/Precheck.hpp"
+#include "krutil/capabilities_api/CapabilitiesChanged.hpp"
+#include "krutil/io/PrintableErrorEvent.hpp"
+#include "krutil/io/SinkTextEvent.hpp"
+#include "krutil/io/TextBaseEvent.hpp"
+#include "krutil/session/Canceller.hpp"
+#include "msg_svc/protobuf/ustring.hpp"
+
+namespace krutil_client {
+namespace {
+
+namespace session = foundation::msg_svc::transport::layers::session;
+using namespace std::chrono_literals;
+
+// How long a child may take to end after its stream did, before the sentence about it is said without.
+constexpr auto patienceForEnd = 2s;
+// How long an engine may take to shut down after the goodbye.
+constexpr auto patienceForGoodbye = 5s;
+// How long a stream may stay open after the child that was to serve it has ended, because another process holds it.
+constexpr auto patienceForStream = 1s;
+
+EngineProcess findEngine(const ConnectionOptions& options) {
+    if (options.socket) {
+        return EngineProcess::connect(*options.socket);
+    }
+    if (options.engine) {
+        return EngineProcess::start({"/bin/sh", "-c", *options.engine});
+    }
+    try {
+        return EngineProcess::start(defaultEngineCommand());
+    } catch (const Failure& failure) {
+        throw Failure(failure.code(), std::string(failure.what()) + "; name another one with --engine");
+    }
+}
+
+capabilities::CapabilityList capabilitiesHere(const ConnectionOptions& options, bool interactive) {
+    capabilities::CapabilityList list;
+    if (interactive) {
+        list |= capabilities::Capability::InteractiveCommandLine;
+        list |= capabilities::Capability::Debugging;
+    }
+    // A shell command may lead to another machine.
+    if (!options.engine) {
+        list |= capabilities::Capability::LocalClient;
+    }
+    return list;
+}
+
+// Whether the engine has sent the text to print for a request's error, as long as this lives.
+class ErrorPrinted {
+  public:
+    ErrorPrinted(foundation::msg_svc::eventmgr::EventMgr& events, const foundation::msg_svc::exchange::IDType& request)
+        : events_(events),
+          subscription_(events.subscribe<krutil::io::PrintableErrorEvent>(
+              [this, request](const krutil::io::PrintableErrorEvent& event) {
+                  printed_ = printed_ || event.getRequestId() == request;
+              })) {}
+    ~ErrorPrinted() { events_.unsubscribe(subscription_); }
+    ErrorPrinted(const ErrorPrinted&) = delete;
+    ErrorPrinted& operator=(const ErrorPrinted&) = delete;
+
+    bool printed() const noexcept { return printed_; }
+
+  private:
+    foundation::msg_svc::eventmgr::EventMgr& events_;
+    bool printed_ = false;
+    foundation::msg_svc::eventmgr::EventMgr::Subscription subscription_;
+};
+
+// A request among the unanswered ones, as long as this lives.
+class Unanswered {
+  public:
+    using IDType = foundation::msg_svc::exchange::IDType;
+
+    Unanswered(std::vector<IDType>& requests, const IDType& request) : requests_(requests) {
+        requests_.push_back(request);
+    }
+    ~Unanswered() { requests_.pop_back(); }
+    Unanswered(const Unanswered&) = delete;
+    Unanswered& operator=(const Unanswered&) = delete;
+
+  private:
+    std::vector<IDType>& requests_;
+};
+
+}  // namespace
+
+Client::Client(const ConnectionOptions& connection, const DisplayOptions& display, Printer& printer, const Output& out,
+               Output& err, Interrupt& interrupt, bool interactive)
+    : printer_(printer),
+      interrupt_(interrupt),
+      err_(err),
+      outTerminal_(out.isTerminal()),
+      timing_(display.timing),
+      throughShell_(connection.engine.has_value()),
+      begin_(Conversation::Clock::now()),
+      tracer_(display.trace || display.traceFile ? std::make_unique<Tracer>(display.trace, display.traceFile)
+                                                 : nullptr),
+      engine_(findEngine(connection)) {
+    const auto noteTime = [this](const auto&) {
+        if (!firstText_) {
+            firstText_ = Conversation::Clock::now();
+        }
+    };
+    events_.subscribe<krutil::io::TextBaseEvent>(noteTime);
+    events_.subscribe<krutil::io::SinkTextEvent>(noteTime);
+    events_.subscribe<krutil::capabilities_api::CapabilitiesChanged>(
+        [this](const krutil::capabilities_api::CapabilitiesChanged& event) {
+            engineCapabilities_ = event.getQvmCapabilities();
+        });
+    printer_.subscribe(events_);
+    conversation_ = shakeHands(connection, interactive);
+    conversation_->watch(engine_.watch(), [this] {
+        // The end of the stream follows, and is what ends a request; unless another process holds the stream.
+        const bool idle = unanswered_.empty();
+        try {
+            if (conversation_->runUntil(Conversation::Clock::now() + patienceForStream,
+                                        [this, idle] { return !idle && unanswered_.empty(); })) {
+                return;
+            }
+        } catch (const SessionOver&) {
+            return;
+        }
+        failLost("its stream stayed open", idle ? "while it was idle" : "before it answered");
+    });
+    engineCapabilities_ = conversation_->session().peer().capabilities;
+    ready_ = Conversation::Clock::now() - begin_;
+    printer_.connected(conversation_->session().peer(), conversation_->session().features());
+}
+
+Client::~Client() {
+    // After finish() the child has gone. Without it the session was given up, and a child that is killed before its
+    // stream closes does not complain about that on the standard error that it shares with this program.
+    engine_.kill();
+    conversation_.reset();
+}
+
+std::unique_ptr<Conversation> Client::shakeHands(const ConnectionOptions& connection, bool interactive) {
+    session::SessionConfig config;
+    config.role = session::Role::Client;
+    config.protocol = krutil::protobuf::KrutilProtocol::protocolName;
+    config.version = krutil::protobuf::KrutilProtocol::protocolVersion;
+    config.build = apps::buildString("krutil");
+    config.limits = connection.limits;
+    capabilities_ = capabilitiesHere(connection, interactive);
+    config.capabilities = capabilities_;
+    config.handshakeTimeout = connection.handshakeTimeout;
+    if (!connection.noPrecheck) {
+        config.check = apps::precheck;
+    }
+    if (tracer_) {
+        config.trace = std::ref(*tracer_);
+    }
+    try {
+        return std::make_unique<Conversation>(engine_.takeStream(), std::move(config), events_, interrupt_);
+    } catch (const session::HandshakeRefused& error) {
+        interrupt_.dispatch();
+        throw Failure(ExitCode::Refused, error.what());
+    } catch (const session::ProtocolViolation& error) {
+        interrupt_.dispatch();
+        throw Failure(ExitCode::Violation, error.what());
+    } catch (const session::StreamLost& error) {
+        // Ctrl-C during the handshake ends it by shutting the stream down.
+        interrupt_.dispatch();
+        // An engine that was too slow may end now, for want of a stream; that is not what went wrong.
+        if (Conversation::Clock::now() - begin_ >= connection.handshakeTimeout) {
+            throw Failure(ExitCode::Stream, error.what());
+        }
+        failLost(error.what(), "before the session began");
+    }
+}
+
+krutil::io::SinkTraits Client::outTraits(const SinkOptions& options) const {
+    return {false, options.hotlinks && outTerminal_, outTerminal_, options.diary, options.echo, options.log};
+}
+
+krutil::io::SinkTraits Client::errTraits(const SinkOptions& options) const {
+    return {false, options.hotlinks && err_.isTerminal(), err_.isTerminal(), options.diary, options.echo, options.log};
+}
+
+Answer Client::request(const boost::shared_ptr<const cmddistributor::IIP>& iip,
+                       krutil::cmddistributor::WhenToDequeue::WhenToDequeue when, const std::string& name,
+                       bool sparingly) {
+    const auto id = foundation::msg_svc::exchange::IDType::random();
+    const auto message = boost::make_shared<const cmddistributor::IIPEnqueueMessage>(
+        iip, id, krutil::contextmgr::QcrID{0}, boost::none, nullptr, when, msg_svc::protobuf::utf8_to_ustring(name),
+        capabilities::CapabilityList{}, nullptr, sparingly);
+    Timing timing;
+    if (timing_) {
+        timing.ready = std::exchange(ready_, std::nullopt);
+    }
+    firstText_.reset();
+    const auto sent = Conversation::Clock::now();
+    const ErrorPrinted errorPrinted(events_, id);
+    // Shared with the action, which may be called after this call has ended with an exception.
+    const auto answer = std::make_shared<Conversation::Reply>();
+    try {
+        const Unanswered unanswered(unanswered_, id);
+        Canceller canceller(*conversation_, engine_, interrupt_, id,
+                            [this](const std::string& sentence) { say(sentence); });
+        conversation_->send(message, [answer](const Conversation::Reply& reply) { *answer = reply; });
+        canceller.run([&answer] { return *answer != nullptr; });
+    } catch (const SessionOver& over) {
+        fail(over.end(), "before it answered");
+    } catch (const session::LimitExceeded& error) {
+        throw Failure(ExitCode::Usage, error.what());
+    }
+    timing.answered = Conversation::Clock::now() - sent;
+    if (firstText_) {
+        timing.firstOutput = *firstText_ - sent;
+    }
+
+    const auto reply = boost::dynamic_pointer_cast<const krutil::cmddistributor::IIPReply>(*answer);
+    if (!reply || (reply->getResult() && reply->getResult()->id != id)) {
+        violated(!reply ? "the engine answered a request with something that is no answer to it"
+                        : "the engine answered a request with the result of another one");
+    }
+    const auto* error =
+        reply->getResult() && reply->getResult()->getException() ? &*reply->getResult()->getException() : nullptr;
+    printer_.replied({id, error, errorPrinted.printed()});
+    // Requests at prompts are a part of the one that they hold up.
+    if (timing_ && unanswered_.empty()) {
+        printer_.timed(timing);
+    }
+    if (error == nullptr) {
+        return {ExitCode::Ok, reply};
+    }
+    const bool cancelled = error->getExecutionStatus() == krutil::cmddistributor::inEXECUTION_CTRLC;
+    return {cancelled ? ExitCode::Cancelled : ExitCode::CodeError, reply};
+}
+
+void Client::setDebugging(bool on) {
+    const auto before = capabilities_;
+    if (on) {
+        capabilities_ |= capabilities::Capability::Debugging;
+    } else {
+        capabilities_ = capabilities_.without({capabilities::Capability::Debugging});
+    }
+    if (capabilities_ != before) {
+        const auto inForce = before.without(before.without(engineCapabilities_));
+        conversation_->session().send(
+            0, boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent>(
+                   boost::make_shared<const krutil::capabilities_api::CapabilitiesChanged>(
+                       inForce, engineCapabilities_, capabilities_, capabilities::CapabilityList{})));
+    }
+}
+
+void Client::violated(const std::string& text) {
+    conversation_->session().abort(text);
+    throw Failure(ExitCode::Violation, text);
+}
+
+std::string Client::finish() {
+    conversation_->watch(-1, nullptr);
+    const auto deadline = Conversation::Clock::now() + patienceForGoodbye;
+    std::optional<Conversation::SessionEnd> ended;
+    try {
+        ended = conversation_->finish(patienceForGoodbye);
+    } catch (const SessionOver& over) {
+        ended = over.end();
+    }
+    if (ended && ended->reason == Conversation::SessionEnd::Reason::Violation) {
+        fail(*ended, "after it answered");
+    }
+    conversation_.reset();
+    const bool lost = ended && ended->reason == Conversation::SessionEnd::Reason::Lost;
+    if (!engine_.isChild()) {
+        return !ended ? "the engine did not end after it answered; the connection was closed"
+               : lost ? "the engine was lost after it answered: " + ended->text
+                      : std::string();
+    }
+    const auto left = std::chrono::ceil<std::chrono::milliseconds>(deadline - Conversation::Clock::now());
+    const auto end = engine_.waitForEnd(std::max(left, std::chrono::milliseconds(0)));
+    if (!end) {
+        engine_.kill();
+        return "the engine did not end after it answered, and was killed";
+    }
+    return lost || end->signalled ? "the engine " + end->text() + " after it answered" : std::string();
+}
+
+void Client::say(const std::string& sentence) {
+    err_.write("krutil: " + sentence + "\n");
+}
+
+void Client::fail(const Conversation::SessionEnd& end, const std::string& when) {
+    switch (end.reason) {
+        case Conversation::SessionEnd::Reason::Violation:
+            throw Failure(ExitCode::Violation, end.text);
+        case Conversation::SessionEnd::Reason::Lost:
+            failLost(end.text, when);
+        case Conversation::SessionEnd::Reason::Finished:
+        case Conversation::SessionEnd::Reason::Closed:
+            break;
+    }
+    throw Failure(ExitCode::Stream, "the engine ended the session " + when);
+}
+
+void Client::failLost(const std::string& text, const std::string& when) {
+    if (const auto end = engine_.waitForEnd(patienceForEnd)) {
+        constexpr int notFound = 127;
+        const bool missing = throughShell_ && !end->signalled && end->number == notFound;
+        throw Failure(ExitCode::Stream,
+                      "the engine " + end->text() + (missing ? " (the shell did not find the command) " : " ") + when);
+    }
+    throw Failure(ExitCode::Stream, "the engine was lost " + when + ": " + text);
+}
+
+}  // namespace krutil_client

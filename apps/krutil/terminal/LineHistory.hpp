@@ -1,0 +1,36 @@
+// The lines that a person has typed, kept in a file.
+#pragma once
+
+#include <histedit.h>
+
+#include <string>
+
+namespace krutil_client {
+
+/// A history for the line editor. Each line is appended to its file at once, so that programs that run at the same time
+/// lose none of each other's; what others add is read with the next start. A file that cannot be read or written is
+/// none. The file is for its owner only, and is cut to size when an object is made. LC_CTYPE must be one of UTF-8. Main
+/// thread only.
+class LineHistory {
+  public:
+    /// How many lines are remembered, and left in the file.
+    static constexpr int lines = 1000;
+
+    /// `file` is created with its directory when there is a line to keep; empty for none.
+    explicit LineHistory(std::string file);
+    ~LineHistory();
+    LineHistory(const LineHistory&) = delete;
+    LineHistory& operator=(const LineHistory&) = delete;
+
+    /// What the editor takes its lines from.
+    HistoryW* get() const noexcept { return history_; }
+
+    /// Remembers a line, which may end in a newline.
+    void add(const wchar_t* line);
+
+  private:
+    const std::string file_;
+    HistoryW* const history_;
+};
+
+}  // namespace krutil_client

@@ -1,0 +1,60 @@
+#include "qvm/process/StandardDescriptors.hpp"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <system_error>
+
+namespace qvm {
+namespace {
+
+// Programs that run code dup onto low numbers; the protocol stays clear of them.
+constexpr int kPrivateFrom = 100;
+
+[[noreturn]] void fail(const char* what) {
+    throw std::system_error(errno, std::generic_category(), what);
+}
+
+int moveAside(int descriptor, const char* name) {
+    const int moved = ::fcntl(descriptor, F_DUPFD_CLOEXEC, kPrivateFrom);
+    if (moved < 0) {
+        fail(name);
+    }
+    return moved;
+}
+
+}  // namespace
+
+void holdStandardDescriptors() {
+    // The lowest free number is used, so this fills 0, 1 and 2 in turn.
+    int descriptor = 0;
+    do {
+        descriptor = ::open("/dev/null", O_RDWR);
+        if (descriptor < 0) {
+            fail("Cannot open /dev/null");
+        }
+    } while (descriptor <= STDERR_FILENO);
+    ::close(descriptor);
+}
+
+ProtocolDescriptors moveProtocolAside() {
+    const int in = moveAside(STDIN_FILENO, "Cannot move standard input aside");
+    const int out = moveAside(STDOUT_FILENO, "Cannot move standard output aside");
+    giveToRunningCode();
+    return {in, out};
+}
+
+void giveToRunningCode() {
+    const int null = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
+    if (null < 0) {
+        fail("Cannot open /dev/null");
+    }
+    const bool done = ::dup2(null, STDIN_FILENO) >= 0 && ::dup2(STDERR_FILENO, STDOUT_FILENO) >= 0;
+    ::close(null);
+    if (!done) {
+        fail("Cannot redirect the standard descriptors");
+    }
+}
+
+}  // namespace qvm

@@ -1,0 +1,255 @@
+#include "qvm/python/EngineModule.hpp"
+
+#include <pybind11/embed.h>
+#include <pybind11/stl.h>
+
+#include <unistd.h>
+
+#include <chrono>
+#include <optional>
+#include <string>
+
+#include "foundation/core/posix/writeFully.hpp"
+#include "msg_svc/protobuf/ustring.hpp"
+#include "qvm/process/AppendFile.hpp"
+#include "qvm/process/ForkedChild.hpp"
+#include "qvm/python/PythonText.hpp"
+#include "qvm/python/WarningRecord.hpp"
+#include "qvm/requests/Cancellation.hpp"
+
+namespace py = pybind11;
+
+namespace qvm {
+namespace {
+
+using capabilities::Capability;
+using foundation::msg_svc::transport::layers::session::Session;
+using krutil::prompt::InputRequester;
+
+TextOutput* output = nullptr;
+Session* session = nullptr;
+EngineServices* services = nullptr;
+
+// Code points that are taken out of one long text at a time, with a look at the session's room after each.
+constexpr std::size_t kPiecePoints = 16'384;
+
+[[noreturn]] void raise(PyObject* type, const char* text = "") {
+    PyErr_SetString(type, text);
+    throw py::error_already_set();
+}
+
+// Lets other threads run while the client catches up. An interrupt ends the wait.
+void waitForRoom() {
+    const int interrupt = services->interruptDescriptor();
+    bool room = false;
+    {
+        py::gil_scoped_release unlocked;
+        room = session->waitForRoom(interrupt);
+    }
+    if (!room && services->takeInterrupt()) {
+        raise(PyExc_KeyboardInterrupt);
+    }
+}
+
+// A forked child writes to the plain descriptors, in whole lines where it can, since its siblings write there too. The
+// interpreter lock guards the text.
+class PlainStream {
+  public:
+    explicit PlainStream(int descriptor) : descriptor_(descriptor) {}
+
+    void write(PyObject* text) {
+        held_ += msg_svc::protobuf::ustring_to_utf8(utf16Of(text));
+        const std::size_t lines = held_.rfind('\n') + 1;
+        const std::size_t ready = lines == 0 && held_.size() >= kHeldBytes ? held_.size() : lines;
+        posix::writeFully(descriptor_, std::string_view(held_).substr(0, ready));
+        held_.erase(0, ready);
+    }
+
+    void flush() {
+        posix::writeFully(descriptor_, held_);
+        held_.clear();
+    }
+
+  private:
+    static constexpr std::size_t kHeldBytes = 8192;
+
+    const int descriptor_;
+    std::string held_;
+};
+
+PlainStream& plainStream(TextSource source) {
+    static PlainStream plainOutput(STDOUT_FILENO);
+    static PlainStream plainError(STDERR_FILENO);
+    return source == TextSource::Error ? plainError : plainOutput;
+}
+
+std::size_t write(TextSource source, const py::object& text) {
+    if (!PyUnicode_Check(text.ptr())) {
+        throw py::type_error(std::string("write() argument must be str, not ") + Py_TYPE(text.ptr())->tp_name);
+    }
+    const auto length = static_cast<std::size_t>(PyUnicode_GET_LENGTH(text.ptr()));
+    if (inForkedChild()) {
+        plainStream(source).write(text.ptr());
+        return length;
+    }
+    if (services->drainDescriptors()) {
+        waitForRoom();
+    }
+    for (std::size_t begin = 0; begin < length; begin += kPiecePoints) {
+        if (output->write(source, utf16Of(text.ptr(), begin, kPiecePoints))) {
+            waitForRoom();
+        }
+    }
+    return length;
+}
+
+void flush() {
+    if (inForkedChild()) {
+        plainStream(TextSource::Output).flush();
+        plainStream(TextSource::Error).flush();
+    } else if (output->flush()) {
+        waitForRoom();
+    }
+}
+
+// Python's handler of the signal that interrupts.
+void onInterruptSignal(const py::object&, const py::object&) {
+    if (!inForkedChild() && services->takeInterrupt()) {
+        raise(PyExc_KeyboardInterrupt);
+    }
+}
+
+// sys.unraisablehook. Where Python drops an interrupt, in a finaliser for example, the code around that would never see
+// it. No Python code runs between its repetition and the return, or that would take it.
+void onUnraisable(const py::object& unraisable) {
+    const py::object type = unraisable.attr("exc_type");
+    if (!inForkedChild() && type.ptr() == PyExc_KeyboardInterrupt && services->repeatInterrupt()) {
+        return;
+    }
+    if (PyObject* const print = PySys_GetObject("__unraisablehook__")) {
+        py::reinterpret_borrow<py::object>(print)(unraisable);
+    }
+}
+
+bool canUse(Capability capability) {
+    return !inForkedChild() && services->canUse(capability);
+}
+
+const char* nameOf(PromptEnd end) {
+    switch (end) {
+        case PromptEnd::Continued:
+            return "continue";
+        case PromptEnd::Quit:
+        case PromptEnd::EndOfInput:
+            return "quit";
+        case PromptEnd::Exit:
+            return "exit";
+        case PromptEnd::Withdrawn:
+            return "withdrawn";
+        case PromptEnd::Raised:
+            break;
+    }
+    throw py::error_already_set();
+}
+
+void require(Capability capability) {
+    if (!canUse(capability)) {
+        raise(PyExc_RuntimeError, "the client cannot be asked here");
+    }
+}
+
+const char* commandPrompt(InputRequester loop, const py::object& frame) {
+    if (!PyFrame_Check(frame.ptr())) {
+        raise(PyExc_TypeError, "a frame is required");
+    }
+    require(loop == InputRequester::mnDEBUG_PROMPT ? Capability::Debugging : Capability::InteractiveCommandLine);
+    return nameOf(services->prompt(loop, frame.ptr(), std::nullopt));
+}
+
+const char* pausePrompt(const std::optional<double>& seconds) {
+    require(Capability::InteractiveCommandLine);
+    std::optional<std::chrono::steady_clock::time_point> deadline;
+    // What lies beyond a lifetime is no deadline, and would not fit either.
+    constexpr double kForever = 1e9;
+    if (seconds && *seconds < kForever) {
+        deadline = std::chrono::steady_clock::now() + std::chrono::duration_cast<std::chrono::steady_clock::duration>(
+                                                          std::chrono::duration<double>(*seconds > 0 ? *seconds : 0));
+    }
+    return nameOf(services->prompt(InputRequester::mnPAUSE_PROMPT, nullptr, deadline));
+}
+
+// The answer with a newline at its end; empty at the end of input.
+py::object readLine() {
+    std::u16string text;
+    if (!canUse(Capability::InteractiveCommandLine)) {
+        return py::str("");
+    }
+    const PromptEnd end = services->readText(text);
+    if (end == PromptEnd::Raised) {
+        throw py::error_already_set();
+    }
+    if (end != PromptEnd::Continued) {
+        return py::str("");
+    }
+    if (text.empty() || text.back() != u'\n') {
+        text += u'\n';
+    }
+    auto line = py::reinterpret_steal<py::object>(strOf(text));
+    if (!line) {
+        throw py::error_already_set();
+    }
+    return line;
+}
+
+void leavePrompt(bool quit) {
+    if (inForkedChild() || !services->leavePrompt(quit ? PromptEnd::Quit : PromptEnd::Continued)) {
+        raise(PyExc_RuntimeError, "no debug, keyboard or pause prompt is open");
+    }
+}
+
+void issueWarning(const py::str& identifier, const py::str& format, const py::list& arguments, const py::str& message,
+                  const py::list& stack, bool wasDisabled) {
+    services->issueWarning(warningRecord({identifier, format, arguments, message, stack, wasDisabled}));
+}
+
+void setDebugging(bool on) {
+    if (!inForkedChild()) {
+        services->setDebugging(on);
+    }
+}
+
+}  // namespace
+
+PYBIND11_EMBEDDED_MODULE(_qvm, module) {
+    module.def("write_output", [](const py::object& text) { return write(TextSource::Output, text); });
+    module.def("write_error", [](const py::object& text) { return write(TextSource::Error, text); });
+    module.def("show", [](const py::object& text) { write(TextSource::ShownOutput, text); });
+    module.def("flush", &flush);
+    module.def("formats_values",
+               [] { return !inForkedChild() && output->outputTraits().getNeedsFormattingForDisplay(); });
+    module.def("makes_links", [] { return !inForkedChild() && output->outputTraits().getSupportsHotlinks(); });
+    module.def("in_forked_child", &inForkedChild);
+    module.attr("interrupt_signal") = Cancellation::signal();
+    module.def("on_interrupt_signal", &onInterruptSignal);
+    module.def("on_unraisable", &onUnraisable);
+    module.def("can_debug", [] { return canUse(Capability::Debugging); });
+    module.def("can_ask", [] { return canUse(Capability::InteractiveCommandLine); });
+    module.def("debug_prompt",
+               [](const py::object& frame) { return commandPrompt(InputRequester::mnDEBUG_PROMPT, frame); });
+    module.def("keyboard_prompt",
+               [](const py::object& frame) { return commandPrompt(InputRequester::mnKEYBOARD_PROMPT, frame); });
+    module.def("pause_prompt", &pausePrompt);
+    module.def("leave_prompt", &leavePrompt);
+    module.def("read_line", &readLine);
+    module.def("issue_warning", &issueWarning);
+    module.def("set_debugging", &setDebugging);
+}
+
+void installEngineModule(TextOutput& textOutput, Session& engineSession, EngineServices& engineServices) {
+    // The macro above has entered the module into Python's table when the program was loaded.
+    output = &textOutput;
+    session = &engineSession;
+    services = &engineServices;
+}
+
+}  // namespace qvm

@@ -1,0 +1,397 @@
+#include "qvm/python/Interpreter.hpp"
+
+#include <pybind11/embed.h>
+
+#include <frameobject.h>
+
+#include <unistd.h>
+
+#include <atomic>
+#include <new>
+#include <stdexcept>
+#include <string>
+#include <utility>
+
+#include "msg_svc/protobuf/ustring.hpp"
+#include "qvm/process/ForkedChild.hpp"
+#include "qvm/python/FunctionCall.hpp"
+#include "qvm/python/PythonText.hpp"
+#include "qvm/python/QvmModuleSource.hpp"
+#include "qvm/python/ReleaseQueue.hpp"
+
+namespace py = pybind11;
+
+#if defined(KRUTIL_SANITIZED)
+// Absent in builds with a sanitizer that does not look for leaks. Ends the process when there are any.
+extern "C" void __lsan_do_leak_check() __attribute__((weak));
+#endif
+
+namespace qvm {
+namespace {
+
+using cmddistributor::RuntimeException;
+using krutil::cmddistributor::inCOMPILE_ERROR;
+using krutil::cmddistributor::inEXECUTION_CTRLC;
+using krutil::cmddistributor::inEXECUTION_DBQUIT;
+using krutil::cmddistributor::inExecutionStatus;
+using krutil::cmddistributor::inRUNTIME_ERROR;
+
+void check(const PyStatus& status) {
+    if (PyStatus_Exception(status) != 0) {
+        throw std::runtime_error(std::string("Python cannot be started: ") +
+                                 (status.err_msg != nullptr ? status.err_msg : "unknown reason"));
+    }
+}
+
+void startPython() {
+    // Independent of the environment of whoever started the engine, and UTF-8 whatever the locale.
+    PyPreConfig preConfig;
+    PyPreConfig_InitIsolatedConfig(&preConfig);
+    preConfig.utf8_mode = 1;
+#if defined(KRUTIL_SANITIZED)
+    preConfig.allocator = PYMEM_ALLOCATOR_MALLOC;
+#endif
+    check(Py_PreInitialize(&preConfig));
+
+    PyConfig config;
+    PyConfig_InitIsolatedConfig(&config);
+    config.user_site_directory = 1;
+    config.install_signal_handlers = 1;
+    PyStatus status = PyConfig_SetBytesString(&config, &config.program_name, QVM_PYTHON_EXECUTABLE);
+    if (PyStatus_Exception(status) == 0) {
+        status = Py_InitializeFromConfig(&config);
+    }
+    PyConfig_Clear(&config);
+    check(status);
+}
+
+// The exception that is set, as an instance with its traceback; none is set afterwards.
+py::object takeException() {
+    PyObject* type = nullptr;
+    PyObject* value = nullptr;
+    PyObject* traceback = nullptr;
+    PyErr_Fetch(&type, &value, &traceback);
+    PyErr_NormalizeException(&type, &value, &traceback);
+    if (traceback != nullptr) {
+        PyException_SetTraceback(value, traceback);
+    }
+    Py_XDECREF(type);
+    Py_XDECREF(traceback);
+    return py::reinterpret_steal<py::object>(value);
+}
+
+bool isA(const py::object& object, PyObject* type) {
+    return PyObject_TypeCheck(object.ptr(), reinterpret_cast<PyTypeObject*>(type)) != 0;
+}
+
+// As at the end of a Python program: nothing and integers are exit statuses, anything else is a failure.
+long exitStatus(const py::object& exitException) {
+    PyObject* const code = reinterpret_cast<PySystemExitObject*>(exitException.ptr())->code;
+    if (code == nullptr || code == Py_None) {
+        return 0;
+    }
+    if (!PyLong_Check(code)) {
+        return 1;
+    }
+    const long status = PyLong_AsLong(code);
+    PyErr_Clear();
+    return status;
+}
+
+[[noreturn]] void endForkedChild(const py::object& exception) {
+    int status = 0;
+    if (exception && isA(exception, PyExc_SystemExit)) {
+        status = static_cast<int>(exitStatus(exception) & 0xFF);
+        PyObject* const code = reinterpret_cast<PySystemExitObject*>(exception.ptr())->code;
+        if (code != nullptr && code != Py_None && !PyLong_Check(code)) {
+            PyFile_WriteObject(code, PySys_GetObject("stderr"), Py_PRINT_RAW);
+            PyFile_WriteString("\n", PySys_GetObject("stderr"));
+        }
+    } else if (exception) {
+        status = 1;
+        PyErr_Display(reinterpret_cast<PyObject*>(Py_TYPE(exception.ptr())), exception.ptr(),
+                      PyException_GetTraceback(exception.ptr()));
+    }
+    try {
+        py::module_::import("qvm").attr("_finish")();
+        py::module_::import("_qvm").attr("flush")();
+    } catch (const py::error_already_set&) {
+        status = status == 0 ? 1 : status;
+    }
+    ::_exit(status);
+}
+
+// Where code finds its names.
+class Namespace {
+  public:
+    explicit Namespace(const py::dict& globals) : globals_(globals), locals_(globals) {}
+
+    // That of a frame that stands still.
+    explicit Namespace(PyObject* frame)
+        : frame_(reinterpret_cast<PyFrameObject*>(frame)),
+          globals_(py::reinterpret_steal<py::object>(PyFrame_GetGlobals(frame_))),
+          locals_(py::reinterpret_steal<py::object>(PyFrame_GetLocals(frame_))) {}
+
+    // Lets warnings that were shown once be shown again: locations of another evaluation look the same.
+    void forgetWarnings() const {
+        static PyObject* const name = PyUnicode_InternFromString("__warningregistry__");
+        if (PyDict_Contains(globals_.ptr(), name) == 1) {
+            PyDict_DelItem(globals_.ptr(), name);
+        }
+        PyErr_Clear();
+    }
+
+    // New reference, or null with an exception set.
+    PyObject* run(PyObject* code) const { return assigned(PyEval_EvalCode(code, globals_.ptr(), locals_.ptr())); }
+
+    // The same for an expression. Functions and comprehensions inside it see the frame's variables as global ones,
+    // because they see no others.
+    PyObject* value(PyObject* code) const {
+        if (frame_ == nullptr || globals_.is(locals_) || !holdsCode(code)) {
+            return run(code);
+        }
+        const auto merged = py::reinterpret_steal<py::object>(PyDict_Copy(globals_.ptr()));
+        if (!merged || PyDict_Update(merged.ptr(), locals_.ptr()) != 0) {
+            return nullptr;
+        }
+        return assigned(PyEval_EvalCode(code, merged.ptr(), locals_.ptr()));
+    }
+
+  private:
+    static bool holdsCode(PyObject* code) {
+        PyObject* const constants = reinterpret_cast<PyCodeObject*>(code)->co_consts;
+        for (Py_ssize_t i = 0; i < PyTuple_GET_SIZE(constants); ++i) {
+            if (PyCode_Check(PyTuple_GET_ITEM(constants, i))) {
+                return true;
+            }
+        }
+        return false;
+    }
+
+    // Gives the frame its variables back, which code has assigned in a copy.
+    PyObject* assigned(PyObject* result) const {
+        if (frame_ != nullptr) {
+            PyObject* type = nullptr;
+            PyObject* error = nullptr;
+            PyObject* traceback = nullptr;
+            PyErr_Fetch(&type, &error, &traceback);
+            PyFrame_LocalsToFast(frame_, 1);
+            PyErr_Restore(type, error, traceback);
+        }
+        return result;
+    }
+
+    PyFrameObject* frame_ = nullptr;
+    py::object globals_;
+    py::object locals_;
+};
+
+}  // namespace
+
+struct Interpreter::State {
+    py::dict globals;
+    py::object compile;
+    py::object finish;
+    py::object formatError;
+    py::object debuggerQuit;
+    ReleaseQueue releases;
+};
+
+Interpreter::Interpreter(RecordBounds bounds) : bounds_(bounds) {
+    startPython();
+    try {
+        state_ = std::make_unique<State>();
+        state_->globals = py::module_::import("__main__").attr("__dict__");
+        const auto code =
+            py::reinterpret_steal<py::object>(Py_CompileString(kModuleSource, kEngineFile, Py_file_input));
+        if (!code) {
+            throw py::error_already_set();
+        }
+        const auto module = py::reinterpret_steal<py::object>(PyImport_ExecCodeModule("qvm", code.ptr()));
+        if (!module) {
+            throw py::error_already_set();
+        }
+        state_->compile = module.attr("_compile");
+        state_->finish = module.attr("_finish");
+        state_->formatError = module.attr("_format_error");
+        state_->debuggerQuit = module.attr("DebuggerQuit");
+    } catch (const py::error_already_set& error) {
+        throw std::runtime_error(std::string("The engine's Python code cannot be loaded: ") + error.what());
+    }
+}
+
+Interpreter::~Interpreter() {
+#if defined(KRUTIL_SANITIZED)
+    bool alone = false;
+    try {
+        alone = py::module_::import("threading").attr("active_count")().cast<int>() == 1;
+    } catch (const py::error_already_set&) {
+        alone = false;
+    }
+    if (alone) {
+        dropReleased();
+        state_.reset();
+        py::finalize_interpreter();
+        if (__lsan_do_leak_check != nullptr) {
+            __lsan_do_leak_check();
+        }
+        return;
+    }
+#endif
+    // Kept reachable: it is left behind on purpose, and no leak.
+    static std::atomic<State*> left{nullptr};
+    left = state_.release();
+}
+
+Interpreter::Outcome Interpreter::evaluate(const cmddistributor::EvalIIP& request, PyObject* frame) {
+    const Namespace names = frame == nullptr ? Namespace(state_->globals) : Namespace(frame);
+    names.forgetWarnings();
+    const std::string file = "<eval-" + std::to_string(++evaluations_) + ">";
+    const auto source = py::reinterpret_steal<py::object>(strOf(request.getCommand()));
+    const auto compiled = py::reinterpret_steal<py::object>(
+        source ? PyObject_CallFunction(state_->compile.ptr(), "Osi", source.ptr(), file.c_str(),
+                                       static_cast<int>(request.getCodeType()))
+               : nullptr);
+    if (!compiled) {
+        return failure(inCOMPILE_ERROR);
+    }
+    PyObject* const statements = PyTuple_GET_ITEM(compiled.ptr(), 0);
+    PyObject* const expression = PyTuple_GET_ITEM(compiled.ptr(), 1);
+
+    py::object done = py::none();
+    if (statements != Py_None) {
+        done = py::reinterpret_steal<py::object>(names.run(statements));
+    }
+    if (done && expression != Py_None) {
+        const auto value = py::reinterpret_steal<py::object>(names.value(expression));
+        PyObject* const hook = PySys_GetObject("displayhook");
+        if (value && hook == nullptr) {
+            PyErr_SetString(PyExc_RuntimeError, "lost sys.displayhook");
+        }
+        done = py::reinterpret_steal<py::object>(value && hook != nullptr ? PyObject_CallOneArg(hook, value.ptr())
+                                                                          : nullptr);
+    }
+    if (!done) {
+        return failure(inRUNTIME_ERROR);
+    }
+    if (inForkedChild()) {
+        endForkedChild({});
+    }
+    return {};
+}
+
+Interpreter::CallOutcome Interpreter::call(const cmddistributor::FEvalIIP& request, Outputs outputs) {
+    Namespace(state_->globals).forgetWarnings();
+    CallOutcome outcome;
+    try {
+        const std::string& name = request.getFunctionName();
+        const py::object function = findFunction(name, state_->globals);
+        const py::object value = callWithArrays(function, name, request.getData()->takeArrays(), state_->globals);
+        if (inForkedChild()) {
+            endForkedChild({});
+        }
+        outcome.outputs = outputsOf(value, name, request.getNlhs(), state_->releases);
+        if (outputs == Outputs::Copied) {
+            for (foundation::korveldata::Array& array : outcome.outputs) {
+                // Gives an array over memory of another owner elements of its own.
+                array.mutableData();
+            }
+        }
+    } catch (py::error_already_set& error) {
+        error.restore();
+    } catch (const std::bad_alloc&) {
+        PyErr_NoMemory();
+    } catch (const std::exception& error) {
+        PyErr_SetString(PyExc_RuntimeError, error.what());
+    }
+    if (PyErr_Occurred() != nullptr) {
+        static_cast<Outcome&>(outcome) = failure(inRUNTIME_ERROR);
+    }
+    return outcome;
+}
+
+void Interpreter::dropReleased() noexcept {
+    state_->releases.drain();
+}
+
+int Interpreter::releasedDescriptor() const noexcept {
+    return state_->releases.descriptor();
+}
+
+Interpreter::Outcome Interpreter::failure(inExecutionStatus status) {
+    const py::object exception = takeException();
+    if (inForkedChild()) {
+        endForkedChild(exception);
+    }
+    Outcome outcome;
+    bool interrupted = isA(exception, PyExc_KeyboardInterrupt);
+    if (interrupted) {
+        outcome.error = errorRecord(exception.ptr(), statusOf(exception.ptr()), bounds_, interrupted);
+        return outcome;
+    }
+    if (isA(exception, PyExc_SystemExit)) {
+        outcome.exit = true;
+        if (exitStatus(exception) != 0) {
+            RuntimeException record = errorRecord(exception.ptr(), inRUNTIME_ERROR, bounds_, interrupted);
+            outcome.error =
+                RuntimeException(inRUNTIME_ERROR, record.GetUnicodeMessageTxt(), "SystemExit", record.getFunctionName(),
+                                 record.getStackFrames(), record.getCauses(), false);
+        }
+    } else if (isA(exception, state_->debuggerQuit.ptr())) {
+        outcome.error = errorRecord(exception.ptr(), inEXECUTION_DBQUIT, bounds_, interrupted);
+    } else {
+        outcome.error = errorRecord(exception.ptr(), status, bounds_, interrupted);
+        if (!interrupted) {
+            outcome.printed = printedText(exception.ptr(), *outcome.error, interrupted);
+        }
+    }
+    if (interrupted) {
+        outcome.error =
+            RuntimeException(inEXECUTION_CTRLC, u"The request was interrupted while its error was formatted.",
+                             "KeyboardInterrupt", "", {}, {*outcome.error}, false);
+        outcome.printed.clear();
+    }
+    return outcome;
+}
+
+std::u16string Interpreter::printedText(PyObject* exception, const RuntimeException& record, bool& interrupted) const {
+    // A character is at most four bytes on the wire, and the record takes up to half of what a message may hold.
+    const auto text = py::reinterpret_steal<py::object>(PyObject_CallFunction(
+        state_->formatError.ptr(), "On", exception, static_cast<Py_ssize_t>(bounds_.totalBytes / 8)));
+    if (text && PyUnicode_Check(text.ptr())) {
+        return utf16Of(text.ptr());
+    }
+    // Types of running code can make formatting fail.
+    interrupted = !text && PyErr_ExceptionMatches(PyExc_KeyboardInterrupt) != 0;
+    PyErr_Clear();
+    std::u16string plain = msg_svc::protobuf::utf8_to_ustring(record.GetID());
+    if (!record.GetUnicodeMessageTxt().empty()) {
+        plain += u": " + record.GetUnicodeMessageTxt();
+    }
+    return plain + u"\n";
+}
+
+void Interpreter::handleSignals() noexcept {
+    while (PyErr_CheckSignals() != 0) {
+        if (PyErr_ExceptionMatches(PyExc_KeyboardInterrupt) != 0) {
+            PyErr_Clear();
+        } else {
+            PyErr_WriteUnraisable(nullptr);
+        }
+    }
+}
+
+void Interpreter::unlocked(const std::function<void()>& wait) {
+    py::gil_scoped_release unlocked;
+    wait();
+}
+
+void Interpreter::finish() noexcept {
+    PyObject* const done = PyObject_CallNoArgs(state_->finish.ptr());
+    if (done == nullptr) {
+        PyErr_Clear();
+    }
+    Py_XDECREF(done);
+}
+
+}  // namespace qvm

@@ -1,0 +1,92 @@
+// The embedded Python of one session.
+#pragma once
+
+#include <Python.h>
+
+#include <boost/optional.hpp>
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "cmddistributor/EvalIIP.hpp"
+#include "cmddistributor/FEvalIIP.hpp"
+#include "cmddistributor/RuntimeException.hpp"
+#include "foundation/korveldata/Array.hpp"
+#include "qvm/python/ErrorRecord.hpp"
+
+namespace qvm {
+
+/// Runs code in one namespace, which lives as long as the object: what one request defines, the next finds. One object
+/// a process. The thread that makes it is Python's main thread; it holds the interpreter lock all the time but for
+/// unlocked(), and all members are for that thread.
+class Interpreter {
+  public:
+    /// How an evaluation ended.
+    struct Outcome {
+        boost::optional<cmddistributor::RuntimeException> error;
+        std::u16string printed;  ///< the error as Python prints it; empty for none and for ends that are no failures
+        bool exit = false;       ///< the code asked for the end of the session
+    };
+
+    /// How a function call ended.
+    struct CallOutcome : Outcome {
+        std::vector<foundation::korveldata::Array> outputs;  ///< none after an error
+    };
+
+    /// What becomes of the memory of a call's outputs.
+    enum class Outputs { Shared, Copied };
+
+    /// Starts Python. The module _qvm must have been installed. Throws std::runtime_error with Python's reason.
+    explicit Interpreter(RecordBounds bounds);
+
+    /// Leaves Python as it is, because threads of running code may still be in it: the process is about to end. Builds
+    /// with a sanitizer finalise it where they can, so that leaks show.
+    ~Interpreter();
+    Interpreter(const Interpreter&) = delete;
+    Interpreter& operator=(const Interpreter&) = delete;
+
+    /// Runs the request's text as its code type says. Nothing that the text raises leaves this function, SystemExit
+    /// included. An interrupt that comes while its error is put into words is the error then. In a process that the
+    /// text has forked it does not return. `frame` is one that stands still, whose variables the text sees and assigns;
+    /// null for the namespace of the session. Evaluations nest.
+    Outcome evaluate(const cmddistributor::EvalIIP& request, PyObject* frame = nullptr);
+
+    /// Calls the function that the request names with the arrays that it carries, which are taken out of it, and
+    /// returns as many outputs as it asks for; see FunctionCall.hpp. Unless they are to be copied, the outputs share
+    /// memory with Python: it comes back through dropReleased(), and nothing that could write to it should run before
+    /// they are sent. Everything else is as for evaluate().
+    CallOutcome call(const cmddistributor::FEvalIIP& request, Outputs outputs);
+
+    /// Drops Python's share in the memory of outputs that are not used any more, on whatever thread they ended.
+    void dropReleased() noexcept;
+
+    /// Readable when dropReleased() has something to do.
+    int releasedDescriptor() const noexcept;
+
+    /// Runs handlers of signals that have arrived since the last evaluation. An interrupt has nothing to end any more
+    /// and is dropped.
+    void handleSignals() noexcept;
+
+    /// Calls `wait` without the interpreter lock, so that threads of running code go on.
+    void unlocked(const std::function<void()>& wait);
+
+    /// Runs exit functions and flushes open files. Call once, when nothing will be evaluated any more.
+    void finish() noexcept;
+
+  private:
+    struct State;
+
+    // The outcome of the Python exception that is set.
+    Outcome failure(krutil::cmddistributor::inExecutionStatus status);
+    std::u16string printedText(PyObject* exception, const cmddistributor::RuntimeException& record,
+                               bool& interrupted) const;
+
+    const RecordBounds bounds_;
+    std::unique_ptr<State> state_;
+    std::uint64_t evaluations_ = 0;
+};
+
+}  // namespace qvm

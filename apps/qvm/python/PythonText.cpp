@@ -1,0 +1,45 @@
+#include "qvm/python/PythonText.hpp"
+
+#include <algorithm>
+
+#include "msg_svc/protobuf/ustring.hpp"
+
+namespace qvm {
+namespace {
+
+constexpr char16_t kReplacement = 0xFFFD;
+
+}  // namespace
+
+std::u16string utf16Of(PyObject* text, std::size_t begin, std::size_t count) {
+    const auto length = static_cast<std::size_t>(PyUnicode_GET_LENGTH(text));
+    const std::size_t end = begin + std::min(count, length - std::min(begin, length));
+    const int kind = PyUnicode_KIND(text);
+    const void* data = PyUnicode_DATA(text);
+
+    std::u16string units;
+    units.reserve(end - std::min(begin, end));
+    for (std::size_t i = begin; i < end; ++i) {
+        const Py_UCS4 point = PyUnicode_READ(kind, data, i);
+        if (point >= 0x10000) {
+            units += static_cast<char16_t>(0xD800 + ((point - 0x10000) >> 10));
+            units += static_cast<char16_t>(0xDC00 + ((point - 0x10000) & 0x3FF));
+        } else if (point >= 0xD800 && point <= 0xDFFF) {
+            units += kReplacement;
+        } else {
+            units += static_cast<char16_t>(point);
+        }
+    }
+    return units;
+}
+
+std::u16string utf16Of(PyObject* text) {
+    return utf16Of(text, 0, static_cast<std::size_t>(PyUnicode_GET_LENGTH(text)));
+}
+
+PyObject* strOf(const std::u16string& text) {
+    const std::string utf8 = msg_svc::protobuf::ustring_to_utf8(text);
+    return PyUnicode_DecodeUTF8(utf8.data(), static_cast<Py_ssize_t>(utf8.size()), "replace");
+}
+
+}  // namespace qvm

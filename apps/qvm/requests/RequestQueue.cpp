@@ -1,0 +1,207 @@
+#include "qvm/requests/RequestQueue.hpp"
+
+#include <poll.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <system_error>
+#include <utility>
+
+namespace qvm {
+namespace {
+
+using namespace krutil::cmddistributor::WhenToDequeue;
+
+struct Row {
+    WhenToDequeue mode;
+    bool idle, prompt, inputPrompt, debugPrompt, pause;
+};
+
+// A request that asks for no particular point waits for idle. Idle takes all but what only a debugger's prompt may
+// take; a prompt takes what was sent for it, and what may run anywhere. docs/protocol.md shows the same table.
+constexpr std::array<Row, 8> kDue{{
+    // mode                        idle   prompt input  debug  pause
+    {DEQUEUE_UNKNOWN, true, false, false, false, false},
+    {DEQUEUE_AT_PPE, true, true, false, true, true},
+    {DEQUEUE_AT_PAUSE, true, false, false, false, true},
+    {DEQUEUE_AT_PROMPT, true, true, true, true, true},
+    {DEQUEUE_AT_NON_DEBUG_PROMPT, true, true, true, false, true},
+    {DEQUEUE_AT_DEBUG_PROMPT, false, false, false, true, false},
+    {DEQUEUE_AT_IDLE, true, false, false, false, false},
+    {DEQUEUE_AT_BOOTSTRAP, true, false, false, false, false},
+}};
+
+}  // namespace
+
+bool isDue(WhenToDequeue mode, DequeuePoint point) noexcept {
+    const auto row = std::find_if(kDue.begin(), kDue.end(), [mode](const Row& each) { return each.mode == mode; });
+    if (row == kDue.end()) {
+        return false;
+    }
+    switch (point) {
+        case DequeuePoint::Idle:
+            return row->idle;
+        case DequeuePoint::Prompt:
+            return row->prompt;
+        case DequeuePoint::InputPrompt:
+            return row->inputPrompt;
+        case DequeuePoint::DebugPrompt:
+            return row->debugPrompt;
+        case DequeuePoint::Pause:
+            return row->pause;
+    }
+    return false;
+}
+
+bool RequestQueue::isFreeAndDue(const Entry& entry, DequeuePoint point) noexcept {
+    return entry.batch == 0 && isDue(entry.request.message->getDequeueMode(), point);
+}
+
+RequestQueue::RequestQueue(Bounds bounds) : bounds_(bounds), changed_("The request queue") {}
+
+RequestQueue::Put RequestQueue::put(Request request) {
+    const std::size_t bytes = memoryOf(request);
+    {
+        std::lock_guard lock(mutex_);
+        if (closed_) {
+            return Put::Closed;
+        }
+        if (entries_.size() >= bounds_.count) {
+            return Put::TooMany;
+        }
+        if (bytes > bounds_.bytes - bytes_) {
+            return Put::TooLarge;
+        }
+        const auto isOther = [](const Entry& entry) {
+            return entry.request.message->getDequeueMode() != DEQUEUE_AT_BOOTSTRAP;
+        };
+        const auto place = request.message->getDequeueMode() == DEQUEUE_AT_BOOTSTRAP
+                               ? std::find_if(entries_.begin(), entries_.end(), isOther)
+                               : entries_.end();
+        entries_.insert(place, {std::move(request), bytes});
+        bytes_ += bytes;
+    }
+    changed_.raise();
+    return Put::Taken;
+}
+
+RequestQueue::Wait RequestQueue::wait(DequeuePoint point, int interrupt, Deadline deadline, const sigset_t* signals) {
+    const auto isMeant = [point](const Entry& entry) { return isFreeAndDue(entry, point); };
+    while (true) {
+        {
+            std::lock_guard lock(mutex_);
+            if (closed_) {
+                return Wait::Closed;
+            }
+            if (std::any_of(entries_.begin(), entries_.end(), isMeant)) {
+                return Wait::Due;
+            }
+            if (std::exchange(interruptWait_, false)) {
+                return Wait::Interrupted;
+            }
+        }
+        timespec left{};
+        if (deadline) {
+            const auto span = *deadline - std::chrono::steady_clock::now();
+            if (span <= std::chrono::steady_clock::duration::zero()) {
+                return Wait::TimedOut;
+            }
+            const auto seconds = std::chrono::duration_cast<std::chrono::seconds>(span);
+            left.tv_sec = seconds.count();
+            left.tv_nsec = std::chrono::nanoseconds(span - seconds).count();
+        }
+        // ppoll() ignores a negative descriptor.
+        std::array<pollfd, 2> watched{{{changed_.get(), POLLIN, 0}, {interrupt, POLLIN, 0}}};
+        if (::ppoll(watched.data(), watched.size(), deadline ? &left : nullptr, signals) < 0 ||
+            watched[1].revents != 0) {
+            return Wait::Interrupted;
+        }
+        // Emptied before the next look at the entries, so that no change is missed.
+        changed_.clear();
+    }
+}
+
+template <class Predicate>
+std::optional<Request> RequestQueue::takeFirst(Predicate isMeant) {
+    std::lock_guard lock(mutex_);
+    const auto entry = std::find_if(entries_.begin(), entries_.end(), isMeant);
+    if (entry == entries_.end()) {
+        return std::nullopt;
+    }
+    bytes_ -= entry->bytes;
+    std::optional<Request> request = std::move(entry->request);
+    entries_.erase(entry);
+    return request;
+}
+
+std::optional<Request> RequestQueue::take(DequeuePoint point) {
+    return takeFirst([point](const Entry& entry) { return isFreeAndDue(entry, point); });
+}
+
+std::vector<Request> RequestQueue::takeBatch(unsigned number, DequeuePoint point) {
+    std::lock_guard lock(mutex_);
+    std::vector<Request> again;
+    for (Entry& entry : entries_) {
+        if (isFreeAndDue(entry, point)) {
+            entry.batch = number;
+            if (entry.request.requeued) {
+                again.push_back(entry.request);
+                entry.request.requeued = false;
+            }
+        }
+    }
+    return again;
+}
+
+std::optional<Request> RequestQueue::takeOfBatch(unsigned number) {
+    return takeFirst([number](const Entry& entry) { return entry.batch == number; });
+}
+
+std::vector<Request> RequestQueue::closeBatch(unsigned number) {
+    std::lock_guard lock(mutex_);
+    std::vector<Request> left;
+    for (Entry& entry : entries_) {
+        if (entry.batch == number) {
+            entry.batch = 0;
+            entry.request.requeued = true;
+            left.push_back(entry.request);
+        }
+    }
+    return left;
+}
+
+std::optional<Request> RequestQueue::remove(const foundation::msg_svc::exchange::IDType& id) {
+    return takeFirst([&id](const Entry& entry) { return entry.request.id() == id; });
+}
+
+std::vector<Request> RequestQueue::takeAll() {
+    std::lock_guard lock(mutex_);
+    std::vector<Request> requests;
+    requests.reserve(entries_.size());
+    for (Entry& entry : entries_) {
+        requests.push_back(std::move(entry.request));
+    }
+    entries_.clear();
+    bytes_ = 0;
+    return requests;
+}
+
+void RequestQueue::interruptWait() {
+    {
+        std::lock_guard lock(mutex_);
+        interruptWait_ = true;
+    }
+    changed_.raise();
+}
+
+void RequestQueue::close() {
+    {
+        std::lock_guard lock(mutex_);
+        closed_ = true;
+    }
+    changed_.raise();
+}
+
+}  // namespace qvm

@@ -1,0 +1,121 @@
+// The example of docs/session-wire.md is what the programs write.
+
+#include <boost/make_shared.hpp>
+#include <fstream>
+#include <future>
+#include <iomanip>
+#include <sstream>
+
+#include "KrutilProtocol.hpp"
+#include "cmddistributor/EvalIIP.hpp"
+#include "cmddistributor/IIPEnqueueMessage.hpp"
+#include "platform/session/support/TestSessions.hpp"
+
+namespace testing_sessions {
+namespace {
+
+using exchange::IDType;
+using krutil::io::SinkTraits;
+
+// The bytes of each block of the document that is marked "hex": what stands before a semicolon on its lines.
+std::vector<std::string> blocksOf(const std::string& path) {
+    std::ifstream file(path);
+    EXPECT_TRUE(file) << path;
+    std::vector<std::string> blocks;
+    bool inside = false;
+    for (std::string line; std::getline(file, line);) {
+        if (line.starts_with("```")) {
+            inside = line == "```hex";
+            if (inside) {
+                blocks.emplace_back();
+            }
+        } else if (inside) {
+            std::istringstream digits(line.substr(0, line.find(';')));
+            for (std::string pair; digits >> pair;) {
+                blocks.back() += static_cast<char>(std::stoi(pair, nullptr, 16));
+            }
+        }
+    }
+    return blocks;
+}
+
+std::string hex(const std::string& bytes) {
+    std::ostringstream text;
+    text << std::hex << std::setfill('0');
+    for (std::size_t i = 0; i < bytes.size(); ++i) {
+        text << std::setw(2) << static_cast<int>(static_cast<unsigned char>(bytes[i])) << (i % 16 == 15 ? '\n' : ' ');
+    }
+    return text.str();
+}
+
+TEST(WireDocumentTest, ExampleIsWhatAClientAndAnEngineWrite) {
+    krutil::protobuf::KrutilProtocol::init();
+    const std::vector<std::string> blocks = blocksOf(KRUTIL_WIRE_DOCUMENT);
+    std::size_t next = 0;
+    const auto compare = [&](const std::string& what, const std::string& bytes) {
+        const std::string documented = next < blocks.size() ? blocks[next] : "";
+        ++next;
+        EXPECT_EQ(hex(documented), hex(bytes)) << "block " << next << ", " << what;
+    };
+    const auto open = [](Role role, Ends& ends) {
+        SessionConfig config = configOf(role);
+        config.protocol = "krutil";
+        config.build = role == Role::Client ? "krutil 0.1.0" : "krutil-qvm 0.1.0";
+        config.capabilities = {capabilities::Capability::LocalClient};
+        ends = socketPair();
+        return std::async(std::launch::async, [config, ends] { return Session::open(ends.in, ends.out, config); });
+    };
+    const auto answerHello = [](wire::ByteEnd& peer) {
+        const std::string head = peer.read(16);
+        const auto length = static_cast<std::size_t>(static_cast<unsigned char>(head.at(12)));
+        const std::string hello = head + peer.read(length);
+        msg_svc::protobuf::SessionHello mine;
+        EXPECT_TRUE(mine.ParseFromString(hello.substr(16)));
+        mine.set_role(mine.role() == msg_svc::protobuf::SessionHello::CLIENT ? msg_svc::protobuf::SessionHello::ENGINE
+                                                                             : msg_svc::protobuf::SessionHello::CLIENT);
+        peer.write(wire::helloBytes(mine));
+        return hello;
+    };
+
+    Ends ends{};
+    auto opening = open(Role::Client, ends);
+    wire::ByteEnd engine(ends.otherIn, ends.otherOut);
+    compare("the client's hello", answerHello(engine));
+    const std::string length = engine.read(4);
+    const std::string verdict = engine.read(static_cast<std::size_t>(length.at(0)));
+    compare("the verdict of either end", length + verdict);
+    engine.write(length + verdict);
+    const auto client = opening.get();
+    Recorder clientSaw;
+    client->start(clientSaw);
+    const SinkTraits shown(false, false, true, false, false, false);
+    client->send(client->newStreamID(),
+                 boost::make_shared<const cmddistributor::IIPEnqueueMessage>(
+                     boost::make_shared<const cmddistributor::EvalIIP>(
+                         "eval", cmddistributor::IqmStreamID::ekIqmCmdWinStream, nullptr, shown, shown, u"1+1",
+                         cmddistributor::CodeType::CodeBlockType),
+                     IDType(0, 1), 1, boost::none, nullptr, krutil::cmddistributor::WhenToDequeue::DEQUEUE_AT_IDLE, u"",
+                     capabilities::CapabilityList(), nullptr, false));
+    client->sayGoodbye();
+    client->close();
+    const std::string said = engine.readAll();
+    ASSERT_GT(said.size(), 24U);
+    compare("a request", said.substr(0, said.size() - 24));
+    compare("the goodbye", said.substr(said.size() - 24));
+
+    opening = open(Role::Engine, ends);
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    answerHello(peer);
+    peer.write(length + verdict);
+    EXPECT_EQ(peer.read(4 + verdict.size()), length + verdict);
+    const auto real = opening.get();
+    Recorder engineSaw;
+    real->start(engineSaw);
+    real->send(0, shutdownEvent());
+    real->close();
+    compare("the shutdown event", peer.readAll());
+    EXPECT_EQ(next, blocks.size()) << "blocks of the document";
+}
+
+}  // namespace
+}  // namespace testing_sessions

@@ -1,0 +1,481 @@
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <future>
+
+#include "platform/session/support/TestSessions.hpp"
+#include "platform/session/support/WireBytes.hpp"
+
+namespace testing_sessions {
+namespace {
+
+using capabilities::Capability;
+using msg_svc::protobuf::SessionHello;
+using msg_svc::protobuf::SessionVerdict;
+using session::FeatureHandling;
+using session::FeatureRequest;
+using session::HandshakeRefused;
+using session::ProtocolViolation;
+using session::StreamLost;
+using testing::Pair;
+using testing::UnorderedElementsAre;
+
+FeatureRequest required(const std::string& name, const std::string& value) {
+    return {name, value, FeatureHandling::Required};
+}
+
+FeatureRequest optional(const std::string& name, const std::string& value) {
+    return {name, value, FeatureHandling::Optional};
+}
+
+// Opens a client of the protocol "one" against an engine of the protocol "two", which the wire calls by one name, so
+// that the two ends can be given different features in one process.
+struct Outcome {
+    std::unique_ptr<Session> client;
+    std::unique_ptr<Session> engine;
+    std::string clientText;
+    std::string engineText;
+};
+
+Outcome openBoth(const SessionConfig& clientConfig, const SessionConfig& engineConfig) {
+    const Ends ends = socketPair();
+    const auto open = [](int descriptor, const SessionConfig& config, std::unique_ptr<Session>& opened) -> std::string {
+        try {
+            opened = Session::open(descriptor, descriptor, config);
+            return {};
+        } catch (const HandshakeRefused& refused) {
+            return refused.what();
+        }
+    };
+    Outcome outcome;
+    auto client = std::async(std::launch::async, [&] { return open(ends.in, clientConfig, outcome.client); });
+    outcome.engineText = open(ends.otherIn, engineConfig, outcome.engine);
+    outcome.clientText = client.get();
+    return outcome;
+}
+
+class HandshakeTest : public testing::Test {
+  protected:
+    // The client opens; the test plays the engine with these bytes. Returns what open() throws.
+    template <class Error>
+    std::string openAgainst(const std::string& bytes, bool closed = true) {
+        const Ends ends = socketPair();
+        wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+        peer.write(bytes);
+        if (closed) {
+            peer.closeWriting();
+        }
+        return textOf<Error>([&] { Session::open(ends.in, ends.out, configOf(Role::Client)); });
+    }
+
+    // Refusal of a client that meets an engine with this hello; both ends' verdicts are read.
+    std::string refusalOf(const SessionHello& engineHello, std::uint32_t layout = 1) {
+        const Ends ends = socketPair();
+        wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+        auto opening = std::async(std::launch::async, [&] {
+            return textOf<HandshakeRefused>([&] { Session::open(ends.in, ends.out, configOf(Role::Client)); });
+        });
+        peer.readHello();
+        peer.write(wire::helloBytes(engineHello, layout));
+        const SessionVerdict verdict = peer.readVerdict();
+        EXPECT_FALSE(verdict.accepted());
+        peer.write(wire::verdictBytes(verdict));
+        const std::string text = opening.get();
+        EXPECT_EQ(text, "the session is refused: " + verdict.refusal());
+        return verdict.refusal();
+    }
+
+    Registered protocol_{"test"};
+};
+
+TEST_F(HandshakeTest, BothEndsLearnAboutEachOther) {
+    SessionConfig clientConfig = configOf(Role::Client);
+    clientConfig.limits.taggedFrame = 1111;
+    clientConfig.capabilities = {Capability::Debugging, Capability::InteractiveCommandLine};
+    SessionConfig engineConfig = configOf(Role::Engine);
+    engineConfig.limits = {1, 2, 3, 4, 5};
+    const Outcome outcome = openBoth(clientConfig, engineConfig);
+    ASSERT_TRUE(outcome.client && outcome.engine);
+    EXPECT_EQ(outcome.client->peer().build, "test engine 1");
+    EXPECT_EQ(outcome.client->peer().limits, engineConfig.limits);
+    EXPECT_TRUE(outcome.client->peer().capabilities.empty());
+    EXPECT_EQ(outcome.engine->peer().build, "test client 1");
+    EXPECT_EQ(outcome.engine->peer().limits, clientConfig.limits);
+    EXPECT_EQ(outcome.engine->peer().capabilities, clientConfig.capabilities);
+    EXPECT_EQ(outcome.client->registry()->serializers().size(), 7U);
+    EXPECT_NE(outcome.client->registry(), outcome.engine->registry());
+    EXPECT_TRUE(outcome.client->features().empty());
+}
+
+TEST_F(HandshakeTest, HelloIsTheFrozenFirstMessage) {
+    const Ends ends = socketPair();
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    auto opening = std::async(std::launch::async, [&] {
+        textOf<StreamLost>([&] { Session::open(ends.in, ends.out, configOf(Role::Client)); });
+    });
+    SessionHello expected = wire::hello(SessionHello::CLIENT);
+    expected.set_build("test client 1");
+    const std::string bytes = wire::helloBytes(expected);
+    EXPECT_EQ(peer.read(bytes.size()), bytes);
+    EXPECT_EQ(bytes.substr(0, 12), std::string("\x89KRUTIL\n\x01\x00\x00\x00", 12));
+    peer.close();
+    opening.get();
+}
+
+TEST_F(HandshakeTest, BuildTextThatIsNotUtf8IsRepairedAndCut) {
+    SessionConfig clientConfig = configOf(Role::Client);
+    clientConfig.build = "bad \xFF\x1B[2J" + std::string(5000, 'x');
+    const Outcome outcome = openBoth(clientConfig, configOf(Role::Engine));
+    ASSERT_TRUE(outcome.engine);
+    EXPECT_TRUE(outcome.engine->peer().build.starts_with("bad \xEF\xBF\xBD\xEF\xBF\xBD[2Jxxx"));
+    EXPECT_LT(outcome.engine->peer().build.size(), 1100U);
+}
+
+// Features.
+
+class FeatureTest : public testing::Test {
+  protected:
+    // The protocol's configuration function is asked by each end in turn, and answers by the role that asks next.
+    Outcome settle(const std::vector<FeatureRequest>& client, const std::vector<FeatureRequest>& engine) {
+        static thread_local bool engineThread = false;
+        engineThread = true;
+        session::ProtocolRegistry::getRegistry()->registerProtocolInitializer(
+            "features",
+            [](const auto& registry, const auto& version, const auto& features) {
+                return initialize(registry, version, features);
+            },
+            [client, engine] { return engineThread ? engine : client; });
+        SessionConfig clientConfig = configOf(Role::Client);
+        SessionConfig engineConfig = configOf(Role::Engine);
+        clientConfig.protocol = engineConfig.protocol = "features";
+        Outcome outcome = openBoth(clientConfig, engineConfig);
+        session::ProtocolRegistry::getRegistry()->unregister("features");
+        if (outcome.client && outcome.engine) {
+            EXPECT_EQ(outcome.client->features(), outcome.engine->features());
+        }
+        return outcome;
+    }
+};
+
+TEST_F(FeatureTest, FirstValueInTheClientsOrderThatTheEngineListsIsSettled) {
+    const Outcome outcome =
+        settle({required("X", "a"), required("X", "b"), required("X", "c")}, {required("X", "c"), required("X", "b")});
+    ASSERT_TRUE(outcome.client);
+    EXPECT_THAT(outcome.client->features(), UnorderedElementsAre(Pair("X", "b")));
+}
+
+TEST_F(FeatureTest, OptionalFeatureWithoutACommonValueIsLeftOut) {
+    const Outcome outcome = settle({optional("X", "a"), optional("Y", "1")}, {optional("X", "b"), optional("Y", "1")});
+    ASSERT_TRUE(outcome.client);
+    EXPECT_THAT(outcome.client->features(), UnorderedElementsAre(Pair("Y", "1")));
+}
+
+TEST_F(FeatureTest, IgnoredFeatureIsNeverSettled) {
+    const FeatureRequest ignored("X", "a", FeatureHandling::Ignore);
+    const Outcome outcome = settle({ignored}, {ignored});
+    ASSERT_TRUE(outcome.client);
+    EXPECT_TRUE(outcome.client->features().empty());
+}
+
+TEST_F(FeatureTest, RequiredFeatureWithoutACommonValueIsRefusedByBoth) {
+    const Outcome outcome = settle({required("X", "a")}, {required("X", "b"), required("X", "c")});
+    EXPECT_EQ(outcome.clientText,
+              "the session is refused: feature \"X\": the client accepts \"a\", the engine \"b\", \"c\"");
+    EXPECT_EQ(outcome.engineText, outcome.clientText);
+}
+
+TEST_F(FeatureTest, FeatureThatOneEndRequiresAndTheOtherDoesNotKnowIsRefused) {
+    EXPECT_EQ(settle({required("X", "a")}, {}).clientText,
+              "the session is refused: feature \"X\": the client accepts \"a\", the engine no value");
+    EXPECT_EQ(settle({}, {required("X", "a")}).clientText,
+              "the session is refused: feature \"X\": the client accepts no value, the engine \"a\"");
+    EXPECT_EQ(settle({optional("X", "b")}, {required("X", "a")}).engineText,
+              "the session is refused: feature \"X\": the client accepts \"b\", the engine \"a\"");
+}
+
+TEST_F(FeatureTest, EveryMismatchIsListed) {
+    const Outcome outcome = settle({required("X", "a"), required("Y", "1"), required("Z", "z")},
+                                   {required("X", "b"), required("Y", "2"), required("Z", "z")});
+    EXPECT_EQ(outcome.clientText,
+              "the session is refused: feature \"X\": the client accepts \"a\", the engine \"b\"; feature \"Y\": the "
+              "client accepts \"1\", the engine \"2\"");
+}
+
+TEST_F(FeatureTest, InitializerGetsTheSettledValues) {
+    std::mutex mutex;
+    std::vector<std::unordered_map<std::string, std::string>> seen;
+    const Registered protocol("seen", {required("X", "a"), optional("Y", "1")},
+                              [&](const auto& registry, const auto& version, const auto& features) {
+                                  const std::lock_guard lock(mutex);
+                                  seen.push_back(features);
+                                  return initialize(registry, version, features);
+                              });
+    SessionConfig clientConfig = configOf(Role::Client);
+    SessionConfig engineConfig = configOf(Role::Engine);
+    clientConfig.protocol = engineConfig.protocol = "seen";
+    openBoth(clientConfig, engineConfig);
+    const auto settled = UnorderedElementsAre(Pair("X", "a"), Pair("Y", "1"));
+    EXPECT_THAT(seen, testing::ElementsAre(settled, settled));
+}
+
+// Refusals.
+
+TEST_F(HandshakeTest, OtherVersionIsRefusedByBoth) {
+    SessionConfig clientConfig = configOf(Role::Client);
+    clientConfig.version = {1, 1};
+    const Outcome outcome = openBoth(clientConfig, configOf(Role::Engine));
+    EXPECT_EQ(outcome.clientText, "the session is refused: protocol version: the client has (1, 1), the engine (1, 0)");
+    EXPECT_EQ(outcome.engineText, outcome.clientText);
+}
+
+TEST_F(HandshakeTest, TwoClientsAreRefused) {
+    const Outcome outcome = openBoth(configOf(Role::Client), configOf(Role::Client));
+    EXPECT_EQ(outcome.clientText,
+              "the session is refused: role: a session needs a client and an engine, this end is a client, the other "
+              "end is a client");
+    EXPECT_EQ(outcome.engineText, outcome.clientText);
+}
+
+TEST_F(HandshakeTest, RefusalListsEveryMismatch) {
+    SessionHello hello = wire::hello(SessionHello::ENGINE);
+    hello.set_protocol("evil\x1B[2J");
+    hello.set_versionmajor(2);
+    hello.set_versionminor(7);
+    msg_svc::protobuf::SessionFeature& feature = *hello.add_features();
+    feature.set_name("NEEDED");
+    feature.set_value("yes");
+    feature.set_handling(3);
+    EXPECT_EQ(refusalOf(hello, 9),
+              "layout version: the client has 1, the engine 9; protocol: the client has \"test\", the engine "
+              "\"evil\\x1b[2J\"; protocol version: the client has (1, 0), the engine (2, 7); feature \"NEEDED\": the "
+              "client accepts no value, the engine \"yes\"");
+}
+
+TEST_F(HandshakeTest, UnknownRoleIsRefused) {
+    SessionHello hello = wire::hello(SessionHello::ENGINE);
+    hello.set_role(static_cast<SessionHello::Role>(7));
+    EXPECT_EQ(refusalOf(hello),
+              "role: a session needs a client and an engine, this end is a client, the other end is unknown (7)");
+}
+
+TEST_F(HandshakeTest, RefusalOfThePeerAloneNamesThePeer) {
+    const Ends ends = socketPair();
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    SessionVerdict verdict;
+    verdict.set_refusal("the moon is wrong\x07");
+    peer.write(wire::helloBytes(wire::hello(SessionHello::ENGINE)) + wire::verdictBytes(verdict));
+    EXPECT_EQ(textOf<HandshakeRefused>([&] { Session::open(ends.in, ends.out, configOf(Role::Client)); }),
+              "the session is refused by the engine: the moon is wrong\xEF\xBF\xBD");
+}
+
+TEST_F(HandshakeTest, WhatOnlyThePeerKnowsIsAddedToTheOwnRefusal) {
+    const Ends ends = socketPair();
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    SessionHello hello = wire::hello(SessionHello::ENGINE);
+    hello.set_versionminor(3);
+    SessionVerdict verdict;
+    verdict.set_refusal("too old");
+    peer.write(wire::helloBytes(hello) + wire::verdictBytes(verdict));
+    EXPECT_EQ(textOf<HandshakeRefused>([&] { Session::open(ends.in, ends.out, configOf(Role::Client)); }),
+              "the session is refused: protocol version: the client has (1, 0), the engine (1, 3); the engine says: "
+              "too old");
+}
+
+TEST_F(HandshakeTest, PeerThatSettledOnOtherValuesIsRefused) {
+    const Ends ends = socketPair();
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    SessionVerdict verdict = wire::acceptance();
+    verdict.add_features()->set_name("X");
+    peer.write(wire::helloBytes(wire::hello(SessionHello::ENGINE)) + wire::verdictBytes(verdict));
+    EXPECT_EQ(textOf<HandshakeRefused>([&] { Session::open(ends.in, ends.out, configOf(Role::Client)); }),
+              "the session is refused: the engine settled on other feature values than the client");
+}
+
+TEST_F(HandshakeTest, InitializerThatRefusesTheVersionRefusesTheSession) {
+    const Registered protocol("fussy", {},
+                              [](const auto&, const auto&, const auto&) { return std::pair(0xFFFFU, 0xFFFFU); });
+    SessionConfig clientConfig = configOf(Role::Client);
+    SessionConfig engineConfig = configOf(Role::Engine);
+    clientConfig.protocol = engineConfig.protocol = "fussy";
+    const Outcome outcome = openBoth(clientConfig, engineConfig);
+    EXPECT_EQ(outcome.clientText,
+              "the session is refused: protocol version: the client cannot set up version (1, 0) of \"fussy\"; the "
+              "engine says: protocol version: the engine cannot set up version (1, 0) of \"fussy\"");
+}
+
+TEST_F(HandshakeTest, InitializerThatThrowsRefusesTheSession) {
+    const Registered protocol("broken", {}, [](const auto&, const auto&, const auto&) -> session::ProtocolVersion {
+        throw std::runtime_error("no room");
+    });
+    SessionConfig config = configOf(Role::Client);
+    config.protocol = "broken";
+    const Ends ends = socketPair();
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    SessionHello hello = wire::hello(SessionHello::ENGINE);
+    hello.set_protocol("broken");
+    peer.write(wire::helloBytes(hello) + wire::verdictBytes(wire::acceptance()));
+    EXPECT_EQ(textOf<HandshakeRefused>([&] { Session::open(ends.in, ends.out, config); }),
+              "the session is refused: protocol \"broken\": the client cannot set it up: no room");
+}
+
+// Garbage.
+
+TEST_F(HandshakeTest, OtherFirstBytesAreAViolationThatShowsThem) {
+    EXPECT_EQ(openAgainst<ProtocolViolation>("bash: krutil-qvm: command not found\n"),
+              "the peer does not speak this protocol: expected a first message that begins with \"\\x89KRUTIL\\n\", "
+              "got \"bash: krutil-qvm: command not found\\n\"");
+}
+
+TEST_F(HandshakeTest, FirstWrongByteIsEnough) {
+    // Nothing else ever comes, and the stream stays open.
+    EXPECT_EQ(openAgainst<ProtocolViolation>("\x89KRAUT", false),
+              "the peer does not speak this protocol: expected a first message that begins with \"\\x89KRUTIL\\n\", "
+              "got \"\\x89KRAUT\"");
+}
+
+TEST_F(HandshakeTest, HelloThatIsTooLongIsAViolation) {
+    EXPECT_EQ(openAgainst<ProtocolViolation>("\x89KRUTIL\n" + wire::little(1, 4) + wire::little(65'537, 4)),
+              "length of the peer's hello: expected at most 65536 bytes, got 65537");
+    EXPECT_EQ(openAgainst<ProtocolViolation>("\x89KRUTIL\n" + wire::little(1, 4) + wire::little(0xFFFFFFFF, 4)),
+              "length of the peer's hello: expected at most 65536 bytes, got 4294967295");
+}
+
+TEST_F(HandshakeTest, HelloThatDoesNotParseIsAViolation) {
+    EXPECT_EQ(openAgainst<ProtocolViolation>(wire::helloBytes(std::string("\x0A\xFF\xFF", 3))),
+              "the peer's hello: its 3 bytes are not a message of its type");
+}
+
+TEST_F(HandshakeTest, HelloWithoutLimitsIsAViolation) {
+    SessionHello hello = wire::hello(SessionHello::ENGINE);
+    hello.clear_limits();
+    EXPECT_EQ(openAgainst<ProtocolViolation>(wire::helloBytes(hello)),
+              "the peer's hello: expected the limits of the peer, got none");
+}
+
+TEST_F(HandshakeTest, UnknownFieldsAndCapabilitiesOfALaterPeerAreIgnored) {
+    const Ends ends = socketPair();
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    SessionHello hello = wire::hello(SessionHello::ENGINE);
+    hello.add_capabilities(6);
+    hello.add_capabilities(64);
+    hello.add_capabilities(1ULL << 60);
+    peer.write(wire::helloBytes(hello.SerializeAsString() + "\xF8\x07\x01") + wire::verdictBytes(wire::acceptance()));
+    const auto session = Session::open(ends.in, ends.out, configOf(Role::Client));
+    EXPECT_EQ(session->peer().capabilities, (capabilities::CapabilityList{Capability::Debugging}));
+}
+
+TEST_F(HandshakeTest, VerdictThatIsTooLongIsAViolation) {
+    EXPECT_EQ(
+        openAgainst<ProtocolViolation>(wire::helloBytes(wire::hello(SessionHello::ENGINE)) + wire::little(70'000, 4)),
+        "length of the peer's verdict: expected at most 65536 bytes, got 70000");
+}
+
+// Lost streams and time limits.
+
+TEST_F(HandshakeTest, StreamThatEndsTellsHowFarItCame) {
+    EXPECT_EQ(openAgainst<StreamLost>(""),
+              "the peer closed the stream during the handshake: 0 of 16 bytes of the peer's first message had arrived");
+    EXPECT_EQ(openAgainst<StreamLost>("\x89KRU"),
+              "the peer closed the stream during the handshake: 4 of 16 bytes of the peer's first message had arrived");
+    const std::string hello = wire::helloBytes(wire::hello(SessionHello::ENGINE));
+    EXPECT_EQ(openAgainst<StreamLost>(hello.substr(0, 20)), "the peer closed the stream during the handshake: 4 of " +
+                                                                std::to_string(hello.size() - 16) +
+                                                                " bytes of the peer's hello had arrived");
+    EXPECT_EQ(openAgainst<StreamLost>(hello),
+              "the peer closed the stream during the handshake: 0 of 4 bytes of the peer's verdict had arrived");
+}
+
+TEST_F(HandshakeTest, EveryCutOfAHandshakeIsALostStream) {
+    const std::string bytes =
+        wire::helloBytes(wire::hello(SessionHello::ENGINE)) + wire::verdictBytes(wire::acceptance());
+    for (std::size_t cut = 0; cut < bytes.size(); ++cut) {
+        const std::string text = openAgainst<StreamLost>(bytes.substr(0, cut));
+        ASSERT_TRUE(text.starts_with("the peer closed the stream during the handshake: ")) << text;
+    }
+}
+
+TEST_F(HandshakeTest, SilentPeerTimesOut) {
+    const Ends ends = socketPair();
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    peer.write("\x89KRU");
+    SessionConfig config = configOf(Role::Client);
+    config.handshakeTimeout = std::chrono::milliseconds(50);
+    EXPECT_EQ(textOf<StreamLost>([&] { Session::open(ends.in, ends.out, config); }),
+              "the handshake timed out after 50 milliseconds: 4 of 16 bytes of the peer's first message had arrived");
+}
+
+TEST_F(HandshakeTest, UnknownProtocolNameIsOutOfRangeAndTheDescriptorsAreClosed) {
+    const Ends ends = socketPair();
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    SessionConfig config = configOf(Role::Client);
+    config.protocol = "unheard of";
+    EXPECT_EQ(textOf<std::out_of_range>([&] { Session::open(ends.in, ends.out, config); }),
+              "ProtocolRegistry: no protocol named \"unheard of\" is registered in this process");
+    EXPECT_EQ(peer.readAll(), "");
+    EXPECT_EQ(::fcntl(ends.in, F_GETFD), -1);
+}
+
+TEST_F(HandshakeTest, DescriptorThatIsNotOneIsRefused) {
+    EXPECT_EQ(textOf<StreamLost>([] { Session::open(-1, -1, configOf(Role::Client)); }),
+              "cannot use descriptor -1 for a session: Bad file descriptor");
+}
+
+TEST_F(HandshakeTest, DescriptorsBecomeNonBlockingAndCloseOnExec) {
+    const Ends ends = pipes();
+    ::fcntl(ends.in, F_SETFD, 0);
+    ::fcntl(ends.out, F_SETFD, 0);
+    const SessionPair pair(configOf(Role::Client), configOf(Role::Engine), ends);
+    for (const int descriptor : {ends.in, ends.out}) {
+        EXPECT_EQ(::fcntl(descriptor, F_GETFD) & FD_CLOEXEC, FD_CLOEXEC);
+        EXPECT_EQ(::fcntl(descriptor, F_GETFL) & O_NONBLOCK, O_NONBLOCK);
+    }
+}
+
+TEST_F(HandshakeTest, BrokenPipesAreIgnoredOnlyWhereTheProgramSaidNothing) {
+    struct sigaction before {};
+    struct sigaction after {};
+    const auto open = [] { SessionPair pair; };
+    ::signal(SIGPIPE, SIG_DFL);
+    open();
+    ::sigaction(SIGPIPE, nullptr, &after);
+    EXPECT_EQ(after.sa_handler, SIG_IGN);
+    before.sa_handler = [](int) {};
+    ::sigaction(SIGPIPE, &before, nullptr);
+    open();
+    ::sigaction(SIGPIPE, nullptr, &after);
+    EXPECT_EQ(after.sa_handler, before.sa_handler);
+    ::signal(SIGPIPE, SIG_IGN);
+}
+
+TEST_F(HandshakeTest, HellosOfBothEndsMayExceedWhatThePipesTake) {
+    const Ends ends = pipes();
+    for (const int descriptor : {ends.out, ends.otherOut}) {
+        ASSERT_GT(::fcntl(descriptor, F_SETPIPE_SZ, 4096), 0);
+    }
+    std::vector<FeatureRequest> features;
+    for (int i = 0; i < 500; ++i) {
+        features.push_back(optional("feature " + std::to_string(i), std::string(100, 'v')));
+    }
+    const Registered protocol("long", features);
+    SessionConfig clientConfig = configOf(Role::Client);
+    SessionConfig engineConfig = configOf(Role::Engine);
+    clientConfig.protocol = engineConfig.protocol = "long";
+    const SessionPair pair(clientConfig, engineConfig, ends);
+    EXPECT_EQ(pair.client->features().size(), 500U);
+    EXPECT_EQ(pair.client->features(), pair.engine->features());
+}
+
+TEST_F(HandshakeTest, OwnHelloThatIsTooLongIsALengthError) {
+    const Registered protocol("too long", {optional("X", std::string(70'000, 'v'))});
+    SessionConfig config = configOf(Role::Client);
+    config.protocol = "too long";
+    const Ends ends = socketPair();
+    const wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    EXPECT_TRUE(textOf<std::length_error>([&] {
+                    Session::open(ends.in, ends.out, config);
+                }).starts_with("Session::open: expected a hello of at most 65536 bytes, got 70"));
+}
+
+}  // namespace
+}  // namespace testing_sessions

@@ -1,0 +1,344 @@
+// Back-pressure, and how sessions end.
+
+#include <fcntl.h>
+#include <sys/eventfd.h>
+#include <unistd.h>
+
+#include <future>
+#include <thread>
+
+#include "platform/session/support/TestSessions.hpp"
+#include "platform/session/support/WireBytes.hpp"
+
+namespace testing_sessions {
+namespace {
+
+using std::chrono::milliseconds;
+using testing::ElementsAre;
+
+class SessionFlowTest : public testing::Test {
+  protected:
+    // More than any socket buffer takes.
+    static constexpr std::size_t plenty = 8U << 20;
+
+    static std::shared_ptr<Bulk> bulk(std::size_t size) {
+        auto made = std::make_shared<Bulk>();
+        made->bytes.assign(size, 'b');
+        return made;
+    }
+
+    // Fills the stream of an engine whose peer does not read, until output has to wait.
+    static std::size_t fill(Session& engine) {
+        std::size_t sent = 0;
+        while (sent < plenty) {
+            engine.send(0, notice(std::string(65'536, 'n')));
+            sent += 65'536 + 24 + 11;
+        }
+        return sent;
+    }
+
+    Registered protocol_{"test"};
+};
+
+// Back-pressure.
+
+TEST_F(SessionFlowTest, SendNeverWaitsForAPeerThatDoesNotRead) {
+    SessionWithBytes end(configOf(Role::Engine));
+    const std::size_t sent = fill(*end.session);
+    // The peer's questions come through all the same.
+    end.peer->write(wire::tagged(1, 1, true, questionTag, "q"));
+    EXPECT_THAT(end.saw.waitForLines(1), ElementsAre("question 1 q"));
+    std::thread reader([&] { EXPECT_EQ(end.peer->read(sent).size(), sent); });
+    EXPECT_TRUE(end.session->waitUntilWritten());
+    reader.join();
+}
+
+TEST_F(SessionFlowTest, WaitForRoomReturnsAtOnceWhenThereIsRoom) {
+    SessionWithBytes end(configOf(Role::Engine));
+    EXPECT_TRUE(end.session->waitForRoom());
+    EXPECT_TRUE(end.session->waitUntilWritten());
+    end.session->send(0, notice("n"));
+    EXPECT_TRUE(end.session->waitForRoom());
+}
+
+TEST_F(SessionFlowTest, WaitsEndWhenTheirDescriptorBecomesReadable) {
+    SessionWithBytes end(configOf(Role::Engine));
+    fill(*end.session);
+    const int interrupt = ::eventfd(0, EFD_CLOEXEC);
+    auto room = std::async(std::launch::async, [&] { return end.session->waitForRoom(interrupt); });
+    auto written = std::async(std::launch::async, [&] { return end.session->waitUntilWritten(interrupt); });
+    EXPECT_EQ(room.wait_for(milliseconds(20)), std::future_status::timeout);
+    EXPECT_EQ(::eventfd_write(interrupt, 1), 0);
+    EXPECT_FALSE(room.get());
+    EXPECT_FALSE(written.get());
+    ::close(interrupt);
+}
+
+TEST_F(SessionFlowTest, WaitForRoomEndsWhenThePeerHasReadEnough) {
+    SessionConfig config = configOf(Role::Engine);
+    config.roomBytes = 100'000;
+    SessionWithBytes end(config);
+    const std::size_t sent = fill(*end.session);
+    const int never = ::eventfd(0, EFD_CLOEXEC);
+    auto room = std::async(std::launch::async, [&] { return end.session->waitForRoom(never); });
+    EXPECT_EQ(end.peer->read(sent - 90'000).size(), sent - 90'000);
+    EXPECT_TRUE(room.get());
+    end.peer->read(90'000);
+    EXPECT_TRUE(end.session->waitUntilWritten(never));
+    ::close(never);
+}
+
+TEST_F(SessionFlowTest, WaitsEndWhenTheSessionEnds) {
+    SessionWithBytes end(configOf(Role::Engine));
+    fill(*end.session);
+    auto room = std::async(std::launch::async, [&] { return end.session->waitForRoom(); });
+    auto written = std::async(std::launch::async, [&] { return end.session->waitUntilWritten(); });
+    end.peer->close();
+    EXPECT_TRUE(room.get());
+    EXPECT_TRUE(written.get());
+    end.session->send(0, notice("into the void"));
+    EXPECT_TRUE(end.session->waitForRoom());
+}
+
+TEST_F(SessionFlowTest, BuffersAreLetGoWhenTheyAreWrittenNotBefore) {
+    SessionWithBytes end(configOf(Role::Client));
+    const auto bytes = bulk(plenty);
+    end.session->send(1, question("q", {bytes}));
+    EXPECT_FALSE(bytes->dropped);
+    std::thread reader([&] { end.peer->read(plenty + 24 + 24 + 13 + 1); });
+    EXPECT_TRUE(end.session->waitUntilWritten());
+    EXPECT_TRUE(bytes->dropped);
+    reader.join();
+}
+
+TEST_F(SessionFlowTest, BuffersAreLetGoWhenTheSessionEndsUnwritten) {
+    const auto bytes = bulk(plenty);
+    {
+        SessionWithBytes end(configOf(Role::Client));
+        end.session->send(1, question("q", {bytes}));
+        EXPECT_FALSE(bytes->dropped);
+    }
+    EXPECT_TRUE(bytes->dropped);
+}
+
+TEST_F(SessionFlowTest, PeerThatAsksWithoutReadingIsClosed) {
+    SessionConfig config = configOf(Role::Engine);
+    config.maxPendingAnswers = 5;
+    SessionWithBytes end(config);
+    end.saw.answerWith([&](framing::StreamID stream, const Question&) {
+        end.session->send(stream, answer("a"), Session::Urgency::Answer);
+    });
+    const std::size_t sent = fill(*end.session);
+    for (std::uint64_t stream = 1; stream <= 6; ++stream) {
+        end.peer->write(wire::tagged(stream, 1, true, questionTag, "q"));
+    }
+    EXPECT_TRUE(end.session->waitUntilWritten()) << "because it is over";
+    std::string bytes;
+    std::thread reader([&] { bytes = end.peer->readAll(); });
+    const SessionEnd ended = end.saw.waitForEnd();
+    reader.join();
+    EXPECT_EQ(ended.reason, Reason::Violation);
+    EXPECT_EQ(ended.text, "the client asks without reading: expected at most 5 answers to be waiting, got 6");
+    EXPECT_LT(bytes.size(), sent);
+    EXPECT_TRUE(bytes.ends_with(wire::abort(ended.text))) << "after the message that was written in part";
+}
+
+TEST_F(SessionFlowTest, AnswersThatAreReadDoNotCount) {
+    SessionConfig config = configOf(Role::Engine);
+    config.maxPendingAnswers = 1;
+    SessionPair pair(configOf(Role::Client), config);
+    pair.engineSaw.answerWith([&](framing::StreamID stream, const Question&) {
+        pair.engine->send(stream, answer("a"), Session::Urgency::Answer);
+    });
+    for (framing::StreamID stream = 1; stream <= 50; ++stream) {
+        pair.client->send(stream, question("q"));
+        pair.clientSaw.waitForLines(stream);
+    }
+}
+
+// The end of a session.
+
+TEST_F(SessionFlowTest, ClientWhoseEngineClosesWithoutAShutdownEventHasLostIt) {
+    SessionWithBytes end(configOf(Role::Client));
+    end.peer->close();
+    const SessionEnd ended = end.saw.waitForEnd();
+    EXPECT_EQ(ended.reason, Reason::Lost);
+    EXPECT_EQ(ended.text, "the stream ended between two messages, before the engine's shutdown event");
+}
+
+TEST_F(SessionFlowTest, EngineWhoseClientClosesWithoutAGoodbyeHasLostIt) {
+    SessionWithBytes end(configOf(Role::Engine));
+    end.peer->close();
+    const SessionEnd ended = end.saw.waitForEnd();
+    EXPECT_EQ(ended.reason, Reason::Lost);
+    EXPECT_EQ(ended.text, "the stream ended between two messages, without the client's goodbye");
+}
+
+TEST_F(SessionFlowTest, StreamThatEndsWithinAMessageTellsWhere) {
+    SessionWithBytes end(configOf(Role::Engine));
+    end.peer->write(wire::data(1, 1, false, "12345") + wire::tagged(1, 2, true, questionTag, "question").substr(0, 40));
+    end.peer->close();
+    EXPECT_EQ(end.saw.waitForEnd().text,
+              "the stream ended in the middle of a message: 3 of 8 content bytes of frame 2, tag \"test:question\", "
+              "had arrived");
+}
+
+TEST_F(SessionFlowTest, ClientThatWasToldOfTheShutdownIsFinished) {
+    SessionWithBytes end(configOf(Role::Client));
+    end.peer->write(wire::tagged(0, 1, true, shutdownTag, ""));
+    end.peer->close();
+    EXPECT_EQ(end.saw.waitForEnd().reason, Reason::Finished);
+    EXPECT_THAT(end.saw.lines(), ElementsAre("event 0 shutdown", "end: finished"));
+}
+
+TEST_F(SessionFlowTest, ClientThatClosesAfterTheShutdownEventIsFinished) {
+    SessionWithBytes end(configOf(Role::Client));
+    end.peer->write(wire::tagged(0, 1, true, shutdownTag, ""));
+    end.saw.waitForLines(1);
+    end.session->close();
+    EXPECT_EQ(end.saw.waitForEnd().reason, Reason::Finished);
+}
+
+TEST_F(SessionFlowTest, EngineGoesOnSendingAfterTheClientsGoodbyeAndEndOfStream) {
+    const Ends ends = socketPair();
+    SessionWithBytes end(configOf(Role::Engine), ends);
+    end.peer->write(wire::tagged(1, 1, true, questionTag, "q") + wire::goodbye());
+    end.peer->closeWriting();
+    EXPECT_THAT(end.saw.waitForLines(2), ElementsAre("question 1 q", "goodbye"));
+    end.session->send(1, answer("a"));
+    end.session->send(0, shutdownEvent());
+    end.session->close();
+    EXPECT_EQ(end.peer->readAll(),
+              wire::tagged(1, 1, true, answerTag, "a") + wire::tagged(0, 1, true, shutdownTag, ""));
+    EXPECT_THAT(end.saw.lines(), ElementsAre("question 1 q", "goodbye", "end: finished"));
+}
+
+TEST_F(SessionFlowTest, EngineWhoseClientHasGoneAfterTheGoodbyeHasLostIt) {
+    SessionWithBytes end(configOf(Role::Engine));
+    end.peer->write(wire::goodbye());
+    end.saw.waitForLines(1);
+    end.peer->close();
+    // Without a write that would fail.
+    const SessionEnd ended = end.saw.waitForEnd();
+    EXPECT_EQ(ended.reason, Reason::Lost);
+    EXPECT_EQ(ended.text, "the client has gone before the engine's shutdown event");
+}
+
+TEST_F(SessionFlowTest, EngineWhoseClientClosesUponTheShutdownEventIsFinished) {
+    SessionWithBytes end(configOf(Role::Engine));
+    end.session->send(0, shutdownEvent());
+    end.peer->read(24 + 13);
+    end.peer->close();
+    EXPECT_EQ(end.saw.waitForEnd().reason, Reason::Finished);
+}
+
+TEST_F(SessionFlowTest, CloseWithoutCeremonyIsClosedHereAndLostThere) {
+    SessionPair pair;
+    pair.client->close();
+    EXPECT_THAT(pair.clientSaw.lines(), ElementsAre("end: closed"));
+    EXPECT_EQ(pair.engineSaw.waitForEnd().reason, Reason::Lost);
+    pair.client->close();
+    pair.client->send(1, question("too late"));
+    pair.client->abort("too late");
+    EXPECT_THAT(pair.clientSaw.lines(), ElementsAre("end: closed"));
+}
+
+TEST_F(SessionFlowTest, CloseWritesWhatIsUnwritten) {
+    SessionWithBytes end(configOf(Role::Engine));
+    const std::size_t sent = fill(*end.session);
+    auto reader = std::async(std::launch::async, [&] { return end.peer->readAll().size(); });
+    end.session->close(std::chrono::seconds(30));
+    EXPECT_EQ(reader.get(), sent);
+    EXPECT_EQ(end.saw.waitForEnd().reason, Reason::Closed);
+}
+
+TEST_F(SessionFlowTest, CloseLosesPatienceWithAPeerThatDoesNotRead) {
+    SessionWithBytes end(configOf(Role::Engine));
+    fill(*end.session);
+    end.session->close(milliseconds(10));
+    EXPECT_THAT(end.saw.lines(), ElementsAre("end: closed"));
+}
+
+TEST_F(SessionFlowTest, SeveralThreadsMayClose) {
+    SessionPair pair;
+    std::vector<std::thread> threads;
+    for (int i = 0; i < 4; ++i) {
+        threads.emplace_back([&] {
+            pair.client->close();
+            EXPECT_EQ(pair.clientSaw.lines().size(), 1U);
+        });
+    }
+    for (std::thread& thread : threads) {
+        thread.join();
+    }
+}
+
+TEST_F(SessionFlowTest, DestructionClosesAndTellsTheHandler) {
+    const Ends ends = socketPair();
+    Recorder saw;
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    {
+        auto opening =
+            std::async(std::launch::async, [&] { return Session::open(ends.in, ends.out, configOf(Role::Client)); });
+        peer.shakeHands();
+        const auto session = opening.get();
+        session->start(saw);
+    }
+    EXPECT_THAT(saw.lines(), ElementsAre("end: closed"));
+    EXPECT_EQ(peer.readAll(), "");
+}
+
+TEST_F(SessionFlowTest, SessionThatEndedBeforeItsStartStillTellsTheHandler) {
+    const Ends ends = socketPair();
+    Recorder saw;
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    auto opening =
+        std::async(std::launch::async, [&] { return Session::open(ends.in, ends.out, configOf(Role::Client)); });
+    peer.shakeHands();
+    const auto session = opening.get();
+    session->abort("never mind");
+    EXPECT_EQ(peer.readAll(), wire::abort("never mind"));
+    session->start(saw);
+    EXPECT_EQ(saw.waitForEnd().text, "never mind");
+}
+
+TEST_F(SessionFlowTest, SessionThatIsNeverStartedCanBeDestroyed) {
+    const Ends ends = socketPair();
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    auto opening =
+        std::async(std::launch::async, [&] { return Session::open(ends.in, ends.out, configOf(Role::Client)); });
+    peer.shakeHands();
+    auto session = opening.get();
+    session->send(1, question("q"));
+    session.reset();
+    EXPECT_EQ(peer.readAll(), wire::tagged(1, 1, true, questionTag, "q"));
+}
+
+// The peer has said its last words and closed; this end's own writing fails first.
+TEST_F(SessionFlowTest, LastWordsAreHeardAfterAWriteHasFailed) {
+    const Ends ends = pipes();
+    SessionWithBytes end(configOf(Role::Client), ends);
+    // Keeps this end's input open while its output loses its reader.
+    const int keptOpen = ::fcntl(ends.otherOut, F_DUPFD_CLOEXEC, 0);
+    end.peer->close();
+    end.session->send(1, question("q"));
+    wire::ByteEnd lastWords(-1, keptOpen);
+    lastWords.write(wire::tagged(0, 1, true, shutdownTag, ""));
+    lastWords.close();
+    EXPECT_EQ(end.saw.waitForEnd().reason, Reason::Finished);
+}
+
+TEST_F(SessionFlowTest, StreamWhoseWritingFailsIsLostThoughItsInputStaysOpen) {
+    const Ends ends = pipes();
+    SessionWithBytes end(configOf(Role::Client), ends);
+    const int keptOpen = ::fcntl(ends.otherOut, F_DUPFD_CLOEXEC, 0);
+    end.peer->close();
+    end.session->send(1, question("q"));
+    const SessionEnd ended = end.saw.waitForEnd();
+    EXPECT_EQ(ended.reason, Reason::Lost);
+    EXPECT_EQ(ended.text, "cannot write to the stream: Broken pipe");
+    ::close(keptOpen);
+}
+
+}  // namespace
+}  // namespace testing_sessions
