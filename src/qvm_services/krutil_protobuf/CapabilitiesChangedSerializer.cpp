@@ -2,7 +2,7 @@
 
 #include <boost/make_shared.hpp>
 
-#include "CapabilityConversion.hpp"
+#include "CapabilityConversions.hpp"
 
 namespace krutil::protobuf_serializer {
 

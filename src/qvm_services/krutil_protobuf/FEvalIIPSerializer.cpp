@@ -3,9 +3,9 @@
 #include <boost/make_shared.hpp>
 #include <boost/variant/get.hpp>
 
-#include "ArrayRoutines.hpp"
 #include "FieldConversions.hpp"
 #include "IIPSerializer.hpp"
+#include "NestedArrays.hpp"
 #include "foundation/core/diag/assertions.hpp"
 
 namespace krutil::protobuf_serializer {

@@ -2,9 +2,9 @@
 
 #include <boost/variant/get.hpp>
 
-#include "ArrayRoutines.hpp"
 #include "FieldConversions.hpp"
 #include "IIPResultSerializer.hpp"
+#include "NestedArrays.hpp"
 
 namespace krutil::protobuf_serializer {
 

@@ -1,7 +1,7 @@
 #include "IIPResultSerializer.hpp"
 
 #include "FieldConversions.hpp"
-#include "RuntimeExceptionSerialization.hpp"
+#include "RuntimeExceptionConversions.hpp"
 
 namespace krutil::protobuf_serializer {
 

@@ -14,7 +14,7 @@ IssuedEnabledWarningEventSerializer::IssuedEnabledWarningEventSerializer()
 protobuf::IssuedEnabledWarningEvent IssuedEnabledWarningEventSerializer::toProtobuf(
     const IssuedEnabledWarningEvent& event) {
     protobuf::IssuedEnabledWarningEvent proto;
-    *proto.mutable_warningevent() = WarningConversion::eventToProtobuf(event);
+    *proto.mutable_warningevent() = WarningConversions::eventToProtobuf(event);
     return proto;
 }
 
@@ -22,7 +22,7 @@ boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> IssuedEnabledW
     const protobuf::IssuedEnabledWarningEvent& proto) {
     const protobuf::IssuedWarningEvent& nested = proto.warningevent();
     return boost::make_shared<IssuedEnabledWarningEvent>(IDTypeSerializer::fromProtobuf(nested.id()),
-                                                         WarningConversion::fromProtobuf(nested.warning()));
+                                                         WarningConversions::fromProtobuf(nested.warning()));
 }
 
 }  // namespace krutil::protobuf_serializer

@@ -2,7 +2,7 @@
 #pragma once
 
 #include "TaggedSerializer.hpp"
-#include "WarningConversion.hpp"
+#include "WarningConversions.hpp"
 
 namespace krutil::protobuf_serializer {
 

@@ -12,13 +12,13 @@ IssuedWarningEventSerializer::IssuedWarningEventSerializer()
     : TaggedSerializer("korvel:lang:diagnostic:IssuedWarningEvent") {}
 
 protobuf::IssuedWarningEvent IssuedWarningEventSerializer::toProtobuf(const IssuedWarningEvent& event) {
-    return WarningConversion::eventToProtobuf(event);
+    return WarningConversions::eventToProtobuf(event);
 }
 
 boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> IssuedWarningEventSerializer::fromProtobuf(
     const protobuf::IssuedWarningEvent& proto) {
     return boost::make_shared<IssuedWarningEvent>(IDTypeSerializer::fromProtobuf(proto.id()),
-                                                  WarningConversion::fromProtobuf(proto.warning()));
+                                                  WarningConversions::fromProtobuf(proto.warning()));
 }
 
 }  // namespace krutil::protobuf_serializer

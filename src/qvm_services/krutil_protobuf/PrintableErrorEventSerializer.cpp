@@ -3,7 +3,7 @@
 #include <boost/make_shared.hpp>
 
 #include "FieldConversions.hpp"
-#include "RuntimeExceptionSerialization.hpp"
+#include "RuntimeExceptionConversions.hpp"
 
 namespace krutil::protobuf_serializer {
 

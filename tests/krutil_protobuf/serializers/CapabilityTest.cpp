@@ -5,7 +5,7 @@
 #include <stdexcept>
 
 #include "CapabilitiesChangedSerializer.hpp"
-#include "CapabilityConversion.hpp"
+#include "CapabilityConversions.hpp"
 #include "krutil_protobuf/support/TestTransport.hpp"
 
 namespace {
@@ -26,7 +26,7 @@ RepeatedField<int> field(const std::vector<int>& values) {
     return {values.begin(), values.end()};
 }
 
-TEST(CapabilityConversionTest, WireNumbersAreTheHostsPlusOneInTheSetsOrder) {
+TEST(CapabilityConversionsTest, WireNumbersAreTheHostsPlusOneInTheSetsOrder) {
     RepeatedField<int> written;
     toProtobuf(CapabilityList{Capability::Debugging, Capability::InteractiveCommandLine}, &written);
     EXPECT_EQ(numbers(written), (std::vector{1, 7}));
@@ -38,31 +38,31 @@ TEST(CapabilityConversionTest, WireNumbersAreTheHostsPlusOneInTheSetsOrder) {
     }
 }
 
-TEST(CapabilityConversionTest, UnknownWireNumbersAreSkippedAndDuplicatesCountOnce) {
+TEST(CapabilityConversionsTest, UnknownWireNumbersAreSkippedAndDuplicatesCountOnce) {
     EXPECT_EQ(fromProtobuf(field({0, 3, 9, -1, 3})), CapabilityList{Capability::ComplexSwing});
     EXPECT_EQ(fromProtobuf(field({8, -2147483647 - 1, 2147483647})), CapabilityList());
 }
 
-TEST(CapabilityConversionTest, UnknownHostNumbersAreSkipped) {
+TEST(CapabilityConversionsTest, UnknownHostNumbersAreSkipped) {
     RepeatedField<int> written;
     toProtobuf(CapabilityList{static_cast<Capability>(7), Capability::Swing, static_cast<Capability>(63)}, &written);
     EXPECT_EQ(numbers(written), std::vector{2});
 }
 
-TEST(CapabilityConversionTest, TheFieldIsAppendedTo) {
+TEST(CapabilityConversionsTest, TheFieldIsAppendedTo) {
     RepeatedField<int> written = field({5});
     toProtobuf(CapabilityList{Capability::InteractiveCommandLine, Capability::Debugging}, &written);
     EXPECT_EQ(numbers(written), (std::vector{5, 1, 7}));
 }
 
-TEST(CapabilityConversionTest, AnEmptySetIsAnEmptyFieldAndAnAbsentFieldAnEmptySet) {
+TEST(CapabilityConversionsTest, AnEmptySetIsAnEmptyFieldAndAnAbsentFieldAnEmptySet) {
     RepeatedField<int> written;
     toProtobuf(CapabilityList(), &written);
     EXPECT_TRUE(written.empty());
     EXPECT_EQ(fromProtobuf(krutil::protobuf::CapabilitiesChanged().qvmcapabilities()), CapabilityList());
 }
 
-TEST(CapabilityConversionTest, ANullFieldIsAnInvalidArgument) {
+TEST(CapabilityConversionsTest, ANullFieldIsAnInvalidArgument) {
     EXPECT_EQ(errorText<std::invalid_argument>([] { toProtobuf(CapabilityList{Capability::Swing}, nullptr); }),
               "repeatedField must not be nulptr");
     EXPECT_EQ(errorText<std::invalid_argument>([] { toProtobuf(CapabilityList(), nullptr); }),

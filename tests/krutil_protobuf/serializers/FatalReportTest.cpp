@@ -14,7 +14,7 @@
 #include "IIPResultSerializer.hpp"
 #include "IIPSerializer.hpp"
 #include "PrintableErrorEventSerializer.hpp"
-#include "RuntimeExceptionSerialization.hpp"
+#include "RuntimeExceptionConversions.hpp"
 #include "StreamTypeSerializer.hpp"
 #include "TextBaseEventSerializer.hpp"
 #include "krutil/cmddistributor/IIPReply.hpp"

@@ -12,7 +12,7 @@
 #include "IIPEnqueueMessageSerializer.hpp"
 #include "IIPSerializer.hpp"
 #include "IIPStateEventSerializer.hpp"
-#include "RuntimeExceptionSerialization.hpp"
+#include "RuntimeExceptionConversions.hpp"
 #include "StreamTypeSerializer.hpp"
 #include "TextBaseEventSerializer.hpp"
 #include "krutil_protobuf/support/TestTransport.hpp"

@@ -12,9 +12,9 @@
 #include <cstdio>
 #include <stdexcept>
 
-#include "ArrayRoutines.hpp"
 #include "FEvalIIPSerializer.hpp"
 #include "FEvalResultSerializer.hpp"
+#include "NestedArrays.hpp"
 #include "foundation/core/diag/AssertionSwitch.hpp"
 #include "foundation/korveldata/ArrayFactory.hpp"
 #include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
@@ -129,7 +129,7 @@ class ArraysTest : public testing::Test {
 
 // ---- The array routines ---------------------------------------------------------------------------------------------
 
-class ArrayRoutinesTest : public ArraysTest {
+class NestedArraysTest : public ArraysTest {
   protected:
     static google::protobuf::RepeatedField<std::uint64_t> ids(std::vector<std::uint64_t> values) {
         return {values.begin(), values.end()};
@@ -149,7 +149,7 @@ class ArrayRoutinesTest : public ArraysTest {
     }
 };
 
-TEST_F(ArrayRoutinesTest, DataIDsAreTheTaggedFramesBehindTheDataFrames) {
+TEST_F(NestedArraysTest, DataIDsAreTheTaggedFramesBehindTheDataFrames) {
     EXPECT_EQ(writeWith(registry(), {large(), small(1), large()}), (std::vector<DataID>{2, 3, 5}));
     EXPECT_EQ(indexes(frames()), (std::vector<FrameIndex>{1, 2, 3, 4, 5}));
     const auto message = received();
@@ -157,30 +157,30 @@ TEST_F(ArrayRoutinesTest, DataIDsAreTheTaggedFramesBehindTheDataFrames) {
     EXPECT_EQ(back, (std::vector<Array>{large(), small(1), large()}));
 }
 
-TEST_F(ArrayRoutinesTest, NoDataIDsAreNoArraysWhateverTheMessageHolds) {
+TEST_F(NestedArraysTest, NoDataIDsAreNoArraysWhateverTheMessageHolds) {
     const auto message = std::make_unique<Message>(transport::Frames());
     EXPECT_TRUE(read(ids({}), message).empty());
 }
 
-TEST_F(ArrayRoutinesTest, ArraysAreReadInTheOrderOfTheirIDs) {
+TEST_F(NestedArraysTest, ArraysAreReadInTheOrderOfTheirIDs) {
     const auto message = transport::makeMessage(framesOf({small(1), small(2), small(3)}));
     EXPECT_EQ(read(ids({3, 1, 2}), message), (std::vector<Array>{small(3), small(1), small(2)}));
 }
 
-TEST_F(ArrayRoutinesTest, WithoutASerializerOfArraysWritingIsOutOfRangeEvenWithoutArrays) {
+TEST_F(NestedArraysTest, WithoutASerializerOfArraysWritingIsOutOfRangeEvenWithoutArrays) {
     const auto empty = std::make_shared<Registry>();
     EXPECT_THROW(writeWith(empty, {}), std::out_of_range);
     EXPECT_THROW(writeWith(empty, {small(1)}), std::out_of_range);
 }
 
-TEST_F(ArrayRoutinesTest, ASerializerOfAnotherFamilyUnderTheTypeOfArraysIsBadCastEvenWithoutArrays) {
+TEST_F(NestedArraysTest, ASerializerOfAnotherFamilyUnderTheTypeOfArraysIsBadCastEvenWithoutArrays) {
     const auto misplaced = std::make_shared<Registry>();
     misplaced->insert(std::make_shared<transport::MisplacedSerializer<ReplyFamily>>(typeid(Array)));
     EXPECT_THROW(writeWith(misplaced, {}), std::bad_cast);
     EXPECT_THROW(writeWith(misplaced, {small(1)}), std::bad_cast);
 }
 
-TEST_F(ArrayRoutinesTest, AFirstTagThatIsUnknownIsOutOfRangeAndOneOfAnotherFamilyIsBadCast) {
+TEST_F(NestedArraysTest, AFirstTagThatIsUnknownIsOutOfRangeAndOneOfAnotherFamilyIsBadCast) {
     auto given = framesOf({small(1), small(2)});
     given[0].tag = "unknown";
     auto message = transport::makeMessage(given);
@@ -193,7 +193,7 @@ TEST_F(ArrayRoutinesTest, AFirstTagThatIsUnknownIsOutOfRangeAndOneOfAnotherFamil
     }
 }
 
-TEST_F(ArrayRoutinesTest, OnlyTheFirstTagSelectsTheSerializer) {
+TEST_F(NestedArraysTest, OnlyTheFirstTagSelectsTheSerializer) {
     auto given = framesOf({small(1), small(2), small(3)});
     given[1].tag = "unknown";
     given[2].tag = "krutil:EvalIIP";
@@ -201,7 +201,7 @@ TEST_F(ArrayRoutinesTest, OnlyTheFirstTagSelectsTheSerializer) {
     EXPECT_EQ(read(ids({1, 2, 3}), message), (std::vector<Array>{small(1), small(2), small(3)}));
 }
 
-TEST_F(ArrayRoutinesTest, ADataIDWithoutATaggedFrameIsBadCastAtAnyPosition) {
+TEST_F(NestedArraysTest, ADataIDWithoutATaggedFrameIsBadCastAtAnyPosition) {
     const auto given = framesOf({large(), small(2)});  // Data frame 1, arrays 2 and 3.
     for (const FrameIndex bad : {FrameIndex{0}, FrameIndex{1}, FrameIndex{4}, FrameIndex{1} << 32, ~FrameIndex{0}}) {
         EXPECT_THROW(read(ids({bad}), transport::makeMessage(given)), std::bad_cast) << bad;
@@ -211,7 +211,7 @@ TEST_F(ArrayRoutinesTest, ADataIDWithoutATaggedFrameIsBadCastAtAnyPosition) {
     EXPECT_THROW(read(ids({3, 3}), transport::makeMessage(given)), std::bad_cast);
 }
 
-TEST_F(ArrayRoutinesTest, AMillionDataIDsAreOneBadCastAndNoMemoryInProportion) {
+TEST_F(NestedArraysTest, AMillionDataIDsAreOneBadCastAndNoMemoryInProportion) {
     const auto given = framesOf({small(1)});
     for (const std::uint64_t id : {std::uint64_t{1}, std::uint64_t{99}}) {
         google::protobuf::RepeatedField<std::uint64_t> claimed;

@@ -14,8 +14,8 @@
 #include "IssuedEnabledWarningEventSerializer.hpp"
 #include "IssuedWarningEventSerializer.hpp"
 #include "PrintableErrorEventSerializer.hpp"
-#include "RuntimeExceptionSerialization.hpp"
-#include "WarningConversion.hpp"
+#include "RuntimeExceptionConversions.hpp"
+#include "WarningConversions.hpp"
 #include "krutil_protobuf/serializers/AllocationRecorder.hpp"
 #include "krutil_protobuf/support/TestTransport.hpp"
 
@@ -37,7 +37,7 @@ using krutil::protobuf_serializer::IIPCancelReplySerializer;
 using krutil::protobuf_serializer::IssuedEnabledWarningEventSerializer;
 using krutil::protobuf_serializer::IssuedWarningEventSerializer;
 using krutil::protobuf_serializer::PrintableErrorEventSerializer;
-using krutil::protobuf_serializer::WarningConversion;
+using krutil::protobuf_serializer::WarningConversions;
 using transport::errorText;
 using transport::readObject;
 namespace wire = krutil::protobuf;
@@ -169,33 +169,33 @@ TEST(PrintfArgumentTest, EachTypeTravelsInItsOwnFieldAndComesBackAsItself) {
     };
     int alternative = 0;
     for (const auto& [argument, field] : arguments) {
-        const wire::PrintfArgument proto = WarningConversion::toProtobuf(argument);
+        const wire::PrintfArgument proto = WarningConversions::toProtobuf(argument);
         EXPECT_EQ(proto.Value_case(), field);
-        const PrintfArgument back = WarningConversion::fromProtobuf(proto);
+        const PrintfArgument back = WarningConversions::fromProtobuf(proto);
         EXPECT_EQ(back.getValue().which(), alternative++);
         EXPECT_TRUE(back == argument);
     }
 }
 
 TEST(PrintfArgumentTest, NoFieldReadsAsTheIntZero) {
-    const PrintfArgument back = WarningConversion::fromProtobuf(wire::PrintfArgument());
+    const PrintfArgument back = WarningConversions::fromProtobuf(wire::PrintfArgument());
     EXPECT_EQ(back.getValue().which(), 0);
     EXPECT_EQ(boost::get<int>(back.getValue()), 0);
 }
 
 TEST(PrintfArgumentTest, DoublesKeepEveryBit) {
     for (const std::uint64_t bits : {0x7FF8000000C0FFEEULL, 0x8000000000000000ULL, 0xFFF0000000000000ULL}) {
-        const PrintfArgument back = WarningConversion::fromProtobuf(
-            WarningConversion::toProtobuf(PrintfArgument(std::bit_cast<double>(std::uint64_t{bits}))));
+        const PrintfArgument back = WarningConversions::fromProtobuf(
+            WarningConversions::toProtobuf(PrintfArgument(std::bit_cast<double>(std::uint64_t{bits}))));
         EXPECT_EQ(std::bit_cast<std::uint64_t>(boost::get<double>(back.getValue())), bits);
     }
 }
 
 TEST(WarningSerializerTest, WithoutArgumentsAndStackTheListsStayEmpty) {
-    const wire::Warning proto = WarningConversion::toProtobuf(Warning("i", u"f", {}, u"m", {}, true, 1));
+    const wire::Warning proto = WarningConversions::toProtobuf(Warning("i", u"f", {}, u"m", {}, true, 1));
     EXPECT_EQ(proto.arguments_size(), 0);
     EXPECT_EQ(proto.stack_size(), 0);
-    const Warning back = WarningConversion::fromProtobuf(proto);
+    const Warning back = WarningConversions::fromProtobuf(proto);
     EXPECT_TRUE(back.getArguments().empty());
     EXPECT_TRUE(back.getStack().empty());
     EXPECT_EQ(back.getIdentifier(), "i");
@@ -206,8 +206,8 @@ TEST(WarningSerializerTest, WithoutArgumentsAndStackTheListsStayEmpty) {
 TEST(WarningSerializerTest, TheTimeIsCopiedBitForBit) {
     for (const double time : {738000.5, -1.25, 0.0, -0.0, std::numeric_limits<double>::infinity(),
                               std::bit_cast<double>(std::uint64_t{0x7FF8000000C0FFEEULL})}) {
-        const wire::Warning proto = WarningConversion::toProtobuf(Warning("", u"", {}, u"", {}, false, time));
-        const double back = WarningConversion::fromProtobuf(proto).getTime();
+        const wire::Warning proto = WarningConversions::toProtobuf(Warning("", u"", {}, u"", {}, false, time));
+        const double back = WarningConversions::fromProtobuf(proto).getTime();
         EXPECT_EQ(std::bit_cast<std::uint64_t>(back), std::bit_cast<std::uint64_t>(time));
     }
 }
@@ -218,7 +218,7 @@ TEST(WarningSerializerTest, RequiredFieldsAreWrittenEvenWhenEmpty) {
     EXPECT_TRUE(proto.IsInitialized());
     EXPECT_EQ(proto.warning().SerializeAsString(),
               std::string("\x0A\x00\x12\x00\x22\x00\x30\x00\x39\0\0\0\0\0\0\0\0", 17));
-    const wire::WarningStackFrame frame = WarningConversion::toProtobuf(korvel::lang::StackFrame(u"", u"", 0));
+    const wire::WarningStackFrame frame = WarningConversions::toProtobuf(korvel::lang::StackFrame(u"", u"", 0));
     EXPECT_TRUE(frame.has_file() && frame.has_name() && frame.has_line());
 }
 

@@ -10,7 +10,7 @@
 
 #include "IIPReplySerializer.hpp"
 #include "IIPResultSerializer.hpp"
-#include "RuntimeExceptionSerialization.hpp"
+#include "RuntimeExceptionConversions.hpp"
 #include "krutil_protobuf/serializers/AllocationRecorder.hpp"
 #include "krutil_protobuf/support/TestTransport.hpp"
 

@@ -13,7 +13,7 @@ namespace krutil::protobuf_serializer {
 
 /// Nothing here fails but for memory. Out: every required field is set, empty ones too. In: absent fields read as
 /// defaults. Numbers are copied bit for bit.
-class WarningConversion {
+class WarningConversions {
   public:
     /// Sets the one field of the argument's type; none read back is the int 0.
     static protobuf::PrintfArgument toProtobuf(const korvel::lang::PrintfArgument& argument);

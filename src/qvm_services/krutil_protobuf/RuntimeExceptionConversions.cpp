@@ -1,4 +1,4 @@
-#include "RuntimeExceptionSerialization.hpp"
+#include "RuntimeExceptionConversions.hpp"
 
 #include "FieldConversions.hpp"
 

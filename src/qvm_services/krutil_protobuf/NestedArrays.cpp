@@ -1,4 +1,4 @@
-#include "ArrayRoutines.hpp"
+#include "NestedArrays.hpp"
 
 namespace krutil::protobuf_serializer {
 

@@ -1,4 +1,4 @@
-#include "WarningConversion.hpp"
+#include "WarningConversions.hpp"
 
 #include "FieldConversions.hpp"
 
@@ -19,13 +19,13 @@ struct SetValue : boost::static_visitor<> {
 
 }  // namespace
 
-protobuf::PrintfArgument WarningConversion::toProtobuf(const korvel::lang::PrintfArgument& argument) {
+protobuf::PrintfArgument WarningConversions::toProtobuf(const korvel::lang::PrintfArgument& argument) {
     protobuf::PrintfArgument proto;
     boost::apply_visitor(SetValue(proto), argument.getValue());
     return proto;
 }
 
-korvel::lang::PrintfArgument WarningConversion::fromProtobuf(const protobuf::PrintfArgument& proto) {
+korvel::lang::PrintfArgument WarningConversions::fromProtobuf(const protobuf::PrintfArgument& proto) {
     using korvel::lang::PrintfArgument;
     using Value = PrintfArgument::Value;
     // The casts name the alternative: the wire's 64-bit types may be long or long long, the variant's are long.
@@ -48,7 +48,7 @@ korvel::lang::PrintfArgument WarningConversion::fromProtobuf(const protobuf::Pri
     return PrintfArgument();
 }
 
-protobuf::WarningStackFrame WarningConversion::toProtobuf(const korvel::lang::StackFrame& frame) {
+protobuf::WarningStackFrame WarningConversions::toProtobuf(const korvel::lang::StackFrame& frame) {
     protobuf::WarningStackFrame proto;
     proto.set_file(ustring_to_utf8(frame.file));
     proto.set_name(ustring_to_utf8(frame.name));
@@ -56,11 +56,11 @@ protobuf::WarningStackFrame WarningConversion::toProtobuf(const korvel::lang::St
     return proto;
 }
 
-korvel::lang::StackFrame WarningConversion::fromProtobuf(const protobuf::WarningStackFrame& proto) {
+korvel::lang::StackFrame WarningConversions::fromProtobuf(const protobuf::WarningStackFrame& proto) {
     return {utf8_to_ustring(proto.file()), utf8_to_ustring(proto.name()), proto.line()};
 }
 
-protobuf::Warning WarningConversion::toProtobuf(const korvel::lang::diagnostic::Warning& warning) {
+protobuf::Warning WarningConversions::toProtobuf(const korvel::lang::diagnostic::Warning& warning) {
     protobuf::Warning proto;
     proto.set_identifier(warning.getIdentifier());
     proto.set_format(ustring_to_utf8(warning.getFormat()));
@@ -76,7 +76,7 @@ protobuf::Warning WarningConversion::toProtobuf(const korvel::lang::diagnostic::
     return proto;
 }
 
-korvel::lang::diagnostic::Warning WarningConversion::fromProtobuf(const protobuf::Warning& proto) {
+korvel::lang::diagnostic::Warning WarningConversions::fromProtobuf(const protobuf::Warning& proto) {
     std::vector<korvel::lang::PrintfArgument> arguments;
     arguments.reserve(static_cast<std::size_t>(proto.arguments_size()));
     for (const auto& argument : proto.arguments()) {
@@ -93,8 +93,8 @@ korvel::lang::diagnostic::Warning WarningConversion::fromProtobuf(const protobuf
             proto.datenum()};
 }
 
-protobuf::IssuedWarningEvent WarningConversion::toProtobuf(const foundation::msg_svc::exchange::IDType& id,
-                                                           const korvel::lang::diagnostic::Warning& warning) {
+protobuf::IssuedWarningEvent WarningConversions::toProtobuf(const foundation::msg_svc::exchange::IDType& id,
+                                                            const korvel::lang::diagnostic::Warning& warning) {
     protobuf::IssuedWarningEvent proto;
     *proto.mutable_id() = IDTypeSerializer::toProtobuf(id);
     *proto.mutable_warning() = toProtobuf(warning);

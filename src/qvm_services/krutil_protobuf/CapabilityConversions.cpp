@@ -1,4 +1,4 @@
-#include "CapabilityConversion.hpp"
+#include "CapabilityConversions.hpp"
 
 #include <boost/bimap.hpp>
 #include <stdexcept>
