@@ -96,7 +96,7 @@ TEST(LostEngineTest, IsNotListening) {
     EXPECT_EQ(ran.exitCode, 3);
 }
 
-TEST(LostEngineTest, LeavesItsStreamToAnotherProcess) {
+TEST(LostEngineForkTest, LeavesItsStreamToAnotherProcess) {
     // The shell that was to be the engine ends; a process that it started holds the stream and says nothing.
     const Ran ran = runClient({"eval", "--engine", fakeEngine("leaves-its-stream"), "1"});
     EXPECT_EQ(ran.err, "krutil: the engine exited with code 4 before it answered\n");

@@ -35,6 +35,9 @@ class ForkTest : public testing::Test {
     EngineSession engine_;
 };
 
+// The thread sanitizer does not support forks of processes with threads; this suite is not run under it.
+using ThreadForkTest = ForkTest;
+
 TEST_F(ForkTest, ForkedChildWritesToThePlainDescriptors) {
     const Evaluation result =
         client().eval(inChild("import sys; print('of the child'); print('error', file=sys.stderr)"));
@@ -108,7 +111,7 @@ TEST_F(ForkTest, ChildThatIsForkedWhileThreadsWriteStaysOut) {
     EXPECT_EQ(children, 30);
 }
 
-TEST_F(ForkTest, ThreadThatForksLeavesAChildThatEndsWithIt) {
+TEST_F(ThreadForkTest, ThreadThatForksLeavesAChildThatEndsWithIt) {
     const Evaluation result = client().eval(
         "import os, threading\n"
         "pids = []\n"
