@@ -627,14 +627,14 @@ void Engine::enqueue(framing::StreamID stream, const boost::shared_ptr<const IIP
         case RequestQueue::Put::TooMany:
             refuse(request,
                    "The engine's queue is full: " + std::to_string(bounds.count) +
-                       " requests wait already (--max-queued). Send this one again when some are done.",
+                       " requests wait already, which is the engine's bound. Send this one again when some are done.",
                    Session::Urgency::Answer);
             break;
         case RequestQueue::Put::TooLarge:
             refuse(request,
                    "The engine's queue is full: with this request, those that wait would hold more than " +
                        std::to_string(bounds.bytes) +
-                       " bytes (--max-queued-bytes). Send it again when some are done, or send less at a time.",
+                       " bytes, which is the engine's bound. Send it again when some are done, or send less at a time.",
                    Session::Urgency::Answer);
             break;
         case RequestQueue::Put::Closed:

@@ -179,12 +179,11 @@ std::vector<Array> outputsOf(const py::object& value, const std::string& name, s
     const auto given = several ? static_cast<std::uint64_t>(PySequence_Fast_GET_SIZE(value.ptr())) : 1;
     if (wanted == 1) {
         if (value.is_none()) {
-            raise(PyExc_ValueError, "1 output was wanted, but " + quoted(name) + " returned none (--nout 0)");
+            raise(PyExc_ValueError, "1 output was wanted, but " + quoted(name) + " returned none; ask for 0 outputs");
         }
         if (PyTuple_Check(value.ptr()) && !std::all_of(value.begin(), value.end(), isNumber)) {
-            raise(PyExc_ValueError,
-                  "1 output was wanted, but " + quoted(name) + " returned a tuple of " + std::to_string(given) +
-                      ", which is not one array; ask for all of them (--nout " + std::to_string(given) + ")");
+            raise(PyExc_ValueError, "1 output was wanted, but " + quoted(name) + " returned a tuple of " +
+                                        std::to_string(given) + ", which is not one array; ask for " + outputs(given));
         }
         results.push_back(output(value, "The output of " + quoted(name), releases));
         return results;
@@ -194,7 +193,7 @@ std::vector<Array> outputsOf(const py::object& value, const std::string& name, s
                                     (value.is_none() ? std::string("none")
                                      : several       ? std::to_string(given)
                                                      : "1 (of type " + typeNameOf(value) + ")") +
-                                    " (--nout " + std::to_string(value.is_none() ? 0 : given) + ")");
+                                    "; ask for " + outputs(value.is_none() ? 0 : given));
     }
     results.reserve(given);
     for (std::uint64_t i = 0; i < given; ++i) {

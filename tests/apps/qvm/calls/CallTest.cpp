@@ -177,8 +177,9 @@ TEST_F(EngineCallTest, EveryOtherFailureComesInAPlainResultToo) {
     EXPECT_EQ(callError(client, "numpy.linalg.eigh", {bytes(0)}),
               "numpy.linalg.LinAlgError: 1-dimensional array given. Array must be at least two-dimensional");
     EXPECT_EQ(callError(client, "divmod", {bytes(3), bytes(3)}, 3),
-              "ValueError: 3 outputs were wanted, but 'divmod' returned 2 (--nout 2)");
-    EXPECT_EQ(callError(client, "print", {}), "ValueError: 1 output was wanted, but 'print' returned none (--nout 0)");
+              "ValueError: 3 outputs were wanted, but 'divmod' returned 2; ask for 2 outputs");
+    EXPECT_EQ(callError(client, "print", {}),
+              "ValueError: 1 output was wanted, but 'print' returned none; ask for 0 outputs");
     EXPECT_EQ(
         callError(client, "object", {}),
         "TypeError: The output of 'object' has dtype object, which cannot be sent; what can is bool, 8- to 64-bit "
@@ -354,7 +355,7 @@ TEST(FreshEngineTest, WaitingArgumentsCountForTheQueuesBound) {
     EngineSession engine({"--max-queued-bytes", "100KiB"});
     const Evaluation result = engine.client.await(engine.client.enqueue(callOf("len", {bytes(101 << 10)})));
     EXPECT_TRUE(result.discarded());
-    EXPECT_THAT(result.errorText(), HasSubstr("would hold more than 102400 bytes (--max-queued-bytes)"));
+    EXPECT_THAT(result.errorText(), HasSubstr("would hold more than 102400 bytes, which is the engine's bound"));
     EXPECT_EQ(call(engine.client, "len", {bytes(99 << 10)}).size(), 1U);
 }
 

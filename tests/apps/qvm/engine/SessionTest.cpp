@@ -216,7 +216,8 @@ TEST(QueueBoundTest, RequestBeyondTheCountIsAnsweredAtOnce) {
     engine.client.awaitText("on");
     const IDType waiting = engine.client.enqueue("2");
     const std::string full =
-        "The engine's queue is full: 1 requests wait already (--max-queued). Send this one again when some are done.";
+        "The engine's queue is full: 1 requests wait already, which is the engine's bound. Send this one again when "
+        "some are done.";
     expectDiscarded(engine.client.eval("3"), full);
     expectDiscarded(engine.client.eval("4"), full);
     gate.open();
@@ -229,8 +230,8 @@ TEST(QueueBoundTest, RequestBeyondTheBytesIsAnsweredAtOnce) {
     EngineSession engine({"--max-queued-bytes", "10KiB"});
     const Evaluation result = engine.client.eval("'" + std::string(10'000, 'x') + "'");
     expectDiscarded(result,
-                    "The engine's queue is full: with this request, those that wait would hold more than 10240 bytes "
-                    "(--max-queued-bytes). Send it again when some are done, or send less at a time.");
+                    "The engine's queue is full: with this request, those that wait would hold more than 10240 bytes, "
+                    "which is the engine's bound. Send it again when some are done, or send less at a time.");
     EXPECT_EQ(engine.client.eval("5").shown(), "5\n");
 }
 

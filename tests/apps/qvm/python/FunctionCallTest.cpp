@@ -187,16 +187,16 @@ TEST_F(FunctionCallTest, OneOutputIsTheValueItself) {
 }
 
 TEST_F(FunctionCallTest, OneOutputThatIsNoneIsTooFew) {
-    EXPECT_EQ(outputError("None", 1), "ValueError: 1 output was wanted, but 'f' returned none (--nout 0)");
+    EXPECT_EQ(outputError("None", 1), "ValueError: 1 output was wanted, but 'f' returned none; ask for 0 outputs");
 }
 
 TEST_F(FunctionCallTest, TupleOfArraysIsNotOneOutput) {
     EXPECT_EQ(outputError("numpy.linalg.svd(numpy.eye(2))", 1),
-              "ValueError: 1 output was wanted, but 'f' returned a tuple of 3, which is not one array; ask for all of "
-              "them (--nout 3)");
+              "ValueError: 1 output was wanted, but 'f' returned a tuple of 3, which is not one array; ask for 3 "
+              "outputs");
     EXPECT_EQ(outputError("(numpy.array(1), 2)", 1),
-              "ValueError: 1 output was wanted, but 'f' returned a tuple of 2, which is not one array; ask for all of "
-              "them (--nout 2)");
+              "ValueError: 1 output was wanted, but 'f' returned a tuple of 2, which is not one array; ask for 2 "
+              "outputs");
     EXPECT_EQ(outputError("('a', 'b')", 1).substr(0, 10), "ValueError");
 }
 
@@ -209,15 +209,16 @@ TEST_F(FunctionCallTest, SeveralOutputsAreTheElementsOfATupleOrList) {
 }
 
 TEST_F(FunctionCallTest, AnotherNumberOfOutputsTellsBoth) {
-    EXPECT_EQ(outputError("(1, 2, 3)", 2), "ValueError: 2 outputs were wanted, but 'f' returned 3 (--nout 3)");
-    EXPECT_EQ(outputError("(1, 2, 3)", 4), "ValueError: 4 outputs were wanted, but 'f' returned 3 (--nout 3)");
-    EXPECT_EQ(outputError("()", 2), "ValueError: 2 outputs were wanted, but 'f' returned 0 (--nout 0)");
-    EXPECT_EQ(outputError("None", 2), "ValueError: 2 outputs were wanted, but 'f' returned none (--nout 0)");
+    EXPECT_EQ(outputError("(1, 2, 3)", 2), "ValueError: 2 outputs were wanted, but 'f' returned 3; ask for 3 outputs");
+    EXPECT_EQ(outputError("(1, 2, 3)", 4), "ValueError: 4 outputs were wanted, but 'f' returned 3; ask for 3 outputs");
+    EXPECT_EQ(outputError("()", 2), "ValueError: 2 outputs were wanted, but 'f' returned 0; ask for 0 outputs");
+    EXPECT_EQ(outputError("None", 2), "ValueError: 2 outputs were wanted, but 'f' returned none; ask for 0 outputs");
     EXPECT_EQ(outputError("numpy.zeros((2, 2))", 2),
-              "ValueError: 2 outputs were wanted, but 'f' returned 1 (of type numpy.ndarray) (--nout 1)");
-    EXPECT_EQ(outputError("'ab'", 2), "ValueError: 2 outputs were wanted, but 'f' returned 1 (of type str) (--nout 1)");
+              "ValueError: 2 outputs were wanted, but 'f' returned 1 (of type numpy.ndarray); ask for 1 output");
+    EXPECT_EQ(outputError("'ab'", 2),
+              "ValueError: 2 outputs were wanted, but 'f' returned 1 (of type str); ask for 1 output");
     EXPECT_EQ(outputError("(1, 2)", ~std::uint64_t{0}),
-              "ValueError: 18446744073709551615 outputs were wanted, but 'f' returned 2 (--nout 2)");
+              "ValueError: 18446744073709551615 outputs were wanted, but 'f' returned 2; ask for 2 outputs");
 }
 
 TEST_F(FunctionCallTest, OutputThatCannotBeSentIsNamed) {
