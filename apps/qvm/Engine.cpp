@@ -674,7 +674,7 @@ void Engine::onEvent(framing::StreamID, const boost::shared_ptr<const BaseEvent>
 }
 
 void Engine::onGoodbye() {
-    queue_.close();
+    queue_.end();
 }
 
 void Engine::onEnd(const SessionEnd& end) {

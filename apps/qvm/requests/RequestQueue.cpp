@@ -21,7 +21,7 @@ struct Row {
 
 // A request that asks for no particular point waits for idle. Idle takes all but what only a debugger's prompt may
 // take; a prompt takes what was sent for it, and what may run anywhere. docs/protocol.md shows the same table.
-constexpr std::array<Row, 8> kDue{{
+constexpr std::array<Row, 8> dueModes{{
     // mode                        idle   prompt input  debug  pause
     {DEQUEUE_UNKNOWN, true, false, false, false, false},
     {DEQUEUE_AT_PPE, true, true, false, true, true},
@@ -36,8 +36,9 @@ constexpr std::array<Row, 8> kDue{{
 }  // namespace
 
 bool isDue(WhenToDequeue mode, DequeuePoint point) noexcept {
-    const auto row = std::find_if(kDue.begin(), kDue.end(), [mode](const Row& each) { return each.mode == mode; });
-    if (row == kDue.end()) {
+    const auto row =
+        std::find_if(dueModes.begin(), dueModes.end(), [mode](const Row& each) { return each.mode == mode; });
+    if (row == dueModes.end()) {
         return false;
     }
     switch (point) {
@@ -64,8 +65,8 @@ RequestQueue::RequestQueue(Bounds bounds) : bounds_(bounds), changed_("The reque
 RequestQueue::Put RequestQueue::put(Request request) {
     const std::size_t bytes = memoryOf(request);
     {
-        std::lock_guard lock(mutex_);
-        if (closed_) {
+        const std::lock_guard lock(mutex_);
+        if (intake_ != Intake::Open) {
             return Put::Closed;
         }
         if (entries_.size() >= bounds_.count) {
@@ -89,14 +90,17 @@ RequestQueue::Put RequestQueue::put(Request request) {
 
 RequestQueue::Wait RequestQueue::wait(DequeuePoint point, int interrupt, Deadline deadline, const sigset_t* signals) {
     const auto isMeant = [point](const Entry& entry) { return isFreeAndDue(entry, point); };
-    while (true) {
+    for (;;) {
         {
-            std::lock_guard lock(mutex_);
-            if (closed_) {
+            const std::lock_guard lock(mutex_);
+            if (intake_ == Intake::Closed) {
                 return Wait::Closed;
             }
             if (std::any_of(entries_.begin(), entries_.end(), isMeant)) {
                 return Wait::Due;
+            }
+            if (intake_ == Intake::Ended) {
+                return Wait::Closed;
             }
             if (std::exchange(interruptWait_, false)) {
                 return Wait::Interrupted;
@@ -125,7 +129,7 @@ RequestQueue::Wait RequestQueue::wait(DequeuePoint point, int interrupt, Deadlin
 
 template <class Predicate>
 std::optional<Request> RequestQueue::takeFirst(Predicate isMeant) {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     const auto entry = std::find_if(entries_.begin(), entries_.end(), isMeant);
     if (entry == entries_.end()) {
         return std::nullopt;
@@ -141,7 +145,7 @@ std::optional<Request> RequestQueue::take(DequeuePoint point) {
 }
 
 std::vector<Request> RequestQueue::takeBatch(unsigned number, DequeuePoint point) {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     std::vector<Request> again;
     for (Entry& entry : entries_) {
         if (isFreeAndDue(entry, point)) {
@@ -160,7 +164,7 @@ std::optional<Request> RequestQueue::takeOfBatch(unsigned number) {
 }
 
 std::vector<Request> RequestQueue::closeBatch(unsigned number) {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     std::vector<Request> left;
     for (Entry& entry : entries_) {
         if (entry.batch == number) {
@@ -177,7 +181,7 @@ std::optional<Request> RequestQueue::remove(const foundation::msg_svc::exchange:
 }
 
 std::vector<Request> RequestQueue::takeAll() {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     std::vector<Request> requests;
     requests.reserve(entries_.size());
     for (Entry& entry : entries_) {
@@ -190,16 +194,24 @@ std::vector<Request> RequestQueue::takeAll() {
 
 void RequestQueue::interruptWait() {
     {
-        std::lock_guard lock(mutex_);
+        const std::lock_guard lock(mutex_);
         interruptWait_ = true;
     }
     changed_.raise();
 }
 
+void RequestQueue::end() {
+    leave(Intake::Ended);
+}
+
 void RequestQueue::close() {
+    leave(Intake::Closed);
+}
+
+void RequestQueue::leave(Intake intake) {
     {
-        std::lock_guard lock(mutex_);
-        closed_ = true;
+        const std::lock_guard lock(mutex_);
+        intake_ = std::max(intake_, intake);
     }
     changed_.raise();
 }

@@ -47,12 +47,12 @@ class RequestQueue {
         Taken,
         TooMany,   ///< `count` requests wait already
         TooLarge,  ///< with this one the waiting requests would hold more than `bytes`
-        Closed,    ///< close() has been called
+        Closed,    ///< end() or close() has been called
     };
 
     enum class Wait {
         Due,          ///< take() has something to give
-        Closed,       ///< close() has been called
+        Closed,       ///< nothing is due, and after end() nothing will be; or close() has been called
         Interrupted,  ///< a signal was delivered to this thread, `interrupt` is readable, or interruptWait() was called
         TimedOut,     ///< the deadline has passed
     };
@@ -97,10 +97,15 @@ class RequestQueue {
     /// Takes out everything, due or not, in order.
     std::vector<Request> takeAll();
 
-    /// Refuses what comes from now on and ends waits.
+    /// Nothing more will come: refuses what comes from now on. What waits is still given when it is due.
+    void end();
+
+    /// Nothing more is to be taken: refuses what comes from now on and ends waits, whatever is due.
     void close();
 
   private:
+    enum class Intake { Open, Ended, Closed };
+
     struct Entry {
         Request request;
         std::size_t bytes;
@@ -110,6 +115,7 @@ class RequestQueue {
     static bool isFreeAndDue(const Entry& entry, DequeuePoint point) noexcept;
     template <class Predicate>
     std::optional<Request> takeFirst(Predicate isMeant);
+    void leave(Intake intake);
 
     const Bounds bounds_;
     // Readable when something may have changed for wait(), so that the wait can watch another descriptor as well.
@@ -117,7 +123,7 @@ class RequestQueue {
     std::mutex mutex_;
     std::deque<Entry> entries_;
     std::size_t bytes_ = 0;
-    bool closed_ = false;
+    Intake intake_ = Intake::Open;
     bool interruptWait_ = false;
 };
 

@@ -43,15 +43,56 @@ TEST(SessionEndTest, GoodbyeAtIdleEndsInTheShutdownEvent) {
     EXPECT_EQ(engine.process.stderrText(), "");
 }
 
-TEST(SessionEndTest, GoodbyeLetsTheRunningRequestEndAndDiscardsTheRest) {
+TEST(SessionEndTest, GoodbyeLetsAllThatCameBeforeItRun) {
     EngineSession engine;
     Gate gate;
     const IDType running = engine.client.enqueue("print('on')\n" + gate.wait() + "\nprint('done')");
     engine.client.awaitText("on");
-    const IDType waiting = engine.client.enqueue("print('never')");
+    const IDType waiting = engine.client.enqueue("print('runs too')");
     engine.client.session().sayGoodbye();
     gate.open();
     EXPECT_EQ(engine.client.await(running).output(), "on\ndone\n");
+    const Evaluation result = engine.client.await(waiting);
+    EXPECT_EQ(result.output(), "runs too\n");
+    EXPECT_FALSE(result.error);
+    expectShutdown(engine);
+}
+
+TEST(SessionEndTest, RequestsAndAGoodbyeThatComeTogetherAreAllAnswered) {
+    EngineSession engine;
+    std::vector<IDType> ids;
+    for (int i = 0; i < 100; ++i) {
+        ids.push_back(engine.client.enqueue("print(" + std::to_string(i) + ")"));
+    }
+    engine.client.session().sayGoodbye();
+    for (int i = 0; i < 100; ++i) {
+        EXPECT_EQ(engine.client.await(ids[static_cast<std::size_t>(i)]).output(), std::to_string(i) + "\n");
+    }
+    expectShutdown(engine);
+}
+
+TEST(SessionEndTest, WhatNothingTakesAfterAGoodbyeIsDiscarded) {
+    EngineSession engine;
+    EvalOptions atDebugPrompt;
+    atDebugPrompt.mode = krutil::cmddistributor::WhenToDequeue::DEQUEUE_AT_DEBUG_PROMPT;
+    const IDType never = engine.client.enqueue("print('never')", atDebugPrompt);
+    const IDType later = engine.client.enqueue("print('later')");
+    engine.client.session().sayGoodbye();
+    EXPECT_EQ(engine.client.await(later).output(), "later\n");
+    const Evaluation result = engine.client.await(never);
+    EXPECT_THAT(result.kinds(), ElementsAre("IIPDiscardedEvent", "LastIIPEvent"));
+    expectDiscarded(result, kSessionEnded);
+    expectShutdown(engine);
+}
+
+TEST(SessionEndTest, SystemExitAfterAGoodbyeDiscardsWhatWaits) {
+    EngineSession engine;
+    Gate gate;
+    const IDType running = engine.client.enqueue(gate.wait() + "\nraise SystemExit");
+    const IDType waiting = engine.client.enqueue("print('never')");
+    engine.client.session().sayGoodbye();
+    gate.open();
+    EXPECT_FALSE(engine.client.await(running).error);
     expectDiscarded(engine.client.await(waiting), kSessionEnded);
     expectShutdown(engine);
 }

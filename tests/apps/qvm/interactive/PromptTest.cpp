@@ -247,6 +247,68 @@ TEST_F(EnginePromptTest, GoodbyeClosesPrompts) {
     EXPECT_EQ(engine_.process.wait(), 0);
 }
 
+TEST_F(EnginePromptTest, GoodbyeLetsAnOpenPromptTakeItsAnswersFirst) {
+    const IDType id = stopped("def f():\n    v = 1\n    breakpoint()\n    return v\nprint(f())");
+    const IDType change = client().enqueue("v = 2", at(DEQUEUE_AT_DEBUG_PROMPT));
+    const IDType leave = client().enqueue("import qvm; qvm.dbcont()", at(DEQUEUE_AT_PROMPT));
+    const IDType after = client().enqueue("print('at idle')", at(DEQUEUE_AT_PROMPT));
+    EXPECT_EQ(client().goodbye().reason, session::SessionEnd::Reason::Finished);
+    EXPECT_FALSE(client().await(change).error);
+    EXPECT_FALSE(client().await(leave).error);
+    EXPECT_EQ(client().await(id).output(), "2\n");
+    EXPECT_EQ(client().await(after).output(), "at idle\n");
+    EXPECT_EQ(engine_.process.wait(), 0);
+}
+
+TEST_F(EnginePromptTest, PromptsThatOpenAfterAGoodbyeTakeTheirAnswersAndThenClose) {
+    Gate gate;
+    const IDType id = client().enqueue("import qvm\n" + gate.wait() +
+                                       "\nprint([input(), input()])\n"
+                                       "qvm.pause()\n"
+                                       "try: input()\nexcept EOFError as e: print(e)\n"
+                                       "qvm.keyboard()\nprint('not reached')");
+    const IDType first = client().enqueue("one", at(DEQUEUE_AT_PROMPT));
+    const IDType second = client().enqueue("two", at(DEQUEUE_AT_NON_DEBUG_PROMPT));
+    const IDType idle = client().enqueue("print('idle')");
+    client().session().sayGoodbye();
+    gate.open();
+    const Evaluation result = client().await(id);
+    EXPECT_EQ(result.output(), "['one', 'two']\nEOF when reading a line\n");
+    ASSERT_TRUE(result.error);
+    EXPECT_EQ(result.error->getExecutionStatus(), inEXECUTION_DBQUIT);
+    EXPECT_FALSE(client().await(first).error);
+    EXPECT_FALSE(client().await(second).error);
+    EXPECT_EQ(client().await(idle).output(), "idle\n");
+    EXPECT_EQ(client().awaitEnd().reason, session::SessionEnd::Reason::Finished);
+    EXPECT_EQ(engine_.process.wait(), 0);
+}
+
+TEST_F(EnginePromptTest, PauseAtAGoodbyeTakesItsAnswerFirst) {
+    const IDType id = stopped("import qvm\nqvm.pause()\nprint('on')");
+    const IDType meanwhile = client().enqueue("print('meanwhile')", at(DEQUEUE_AT_PPE));
+    EXPECT_EQ(client().goodbye().reason, session::SessionEnd::Reason::Finished);
+    EXPECT_EQ(client().await(meanwhile).output(), "meanwhile\n");
+    EXPECT_EQ(client().await(id).output(), "on\n");
+}
+
+TEST_F(EnginePromptTest, AnswerToAPauseThatIsOverFeedsNoInput) {
+    const IDType id = stopped("import qvm\nqvm.pause(0.001)\nprint([input()])");
+    client().awaitEvent([&](const Happening& each) {
+        const auto* const loop = dynamic_cast<const DebugLoopEvent*>(each.event.get());
+        return loop != nullptr && loop->getLoopState() == DebugLoopEvent::ENTER &&
+               loop->getWhichDebugLoop() == InputRequester::mnINPUT_PROMPT;
+    });
+    const IDType stray = client().enqueue("", at(DEQUEUE_AT_PAUSE));
+    // Messages are taken in order, so the answer to this one shows that the stray one waits.
+    EXPECT_EQ(client().cancel(stray, false), cmddistributor::IIPCancelReply::SUCCESSFUL_CANCEL);
+    const IDType late = client().enqueue("", at(DEQUEUE_AT_PAUSE));
+    command("meant for input");
+    EXPECT_EQ(client().await(id).output(), "['meant for input']\n");
+    const Evaluation taken = client().await(late);
+    EXPECT_FALSE(taken.error);
+    EXPECT_THAT(taken.kinds(), ElementsAre("IIPStartedEvent", "IIPCompletedEvent", "LastIIPEvent"));
+}
+
 TEST_F(EnginePromptTest, LostClientEndsTheEngineAtAPrompt) {
     stopped("input()");
     client().session().close(std::chrono::milliseconds(0));

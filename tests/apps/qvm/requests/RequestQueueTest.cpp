@@ -180,6 +180,43 @@ TEST(RequestQueueTest, ClosedQueueRefusesAndStillGivesBackWhatItHas) {
     EXPECT_TRUE(queue.takeAll().empty());
 }
 
+TEST(RequestQueueTest, EndedQueueRefusesAndGivesWhatIsDueBeforeItSaysSo) {
+    RequestQueue queue({});
+    queue.put(numbered(1, DEQUEUE_AT_DEBUG_PROMPT));
+    queue.put(numbered(2));
+    queue.end();
+    EXPECT_EQ(queue.put(numbered(3)), RequestQueue::Put::Closed);
+    EXPECT_EQ(queue.wait(DequeuePoint::Idle), RequestQueue::Wait::Due);
+    EXPECT_EQ(queue.take(DequeuePoint::Idle)->id().lo(), 2U);
+    EXPECT_EQ(queue.wait(DequeuePoint::Idle), RequestQueue::Wait::Closed);
+    EXPECT_EQ(queue.wait(DequeuePoint::DebugPrompt), RequestQueue::Wait::Due);
+}
+
+TEST(RequestQueueTest, BatchThatIsRequeuedAfterTheEndIsDueAgain) {
+    RequestQueue queue({});
+    queue.put(numbered(1, DEQUEUE_AT_PROMPT));
+    queue.takeBatch(1, DequeuePoint::Prompt);
+    queue.end();
+    EXPECT_EQ(queue.wait(DequeuePoint::Prompt), RequestQueue::Wait::Closed);
+    queue.closeBatch(1);
+    EXPECT_EQ(queue.wait(DequeuePoint::Idle), RequestQueue::Wait::Due);
+}
+
+TEST(RequestQueueTest, ClosedQueueStaysClosed) {
+    RequestQueue queue({});
+    queue.put(numbered(1));
+    queue.close();
+    queue.end();
+    EXPECT_EQ(queue.wait(DequeuePoint::Idle), RequestQueue::Wait::Closed);
+}
+
+TEST(RequestQueueTest, WaitEndsWhenNothingMoreWillCome) {
+    RequestQueue queue({});
+    auto waited = std::async(std::launch::async, [&] { return queue.wait(DequeuePoint::Idle); });
+    queue.end();
+    EXPECT_EQ(waited.get(), RequestQueue::Wait::Closed);
+}
+
 TEST(RequestQueueTest, WaitEndsWhenADueRequestComes) {
     RequestQueue queue({});
     auto waited = std::async(std::launch::async, [&] { return queue.wait(DequeuePoint::DebugPrompt); });
