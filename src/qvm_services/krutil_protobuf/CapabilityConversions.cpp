@@ -1,6 +1,8 @@
 #include "CapabilityConversions.hpp"
 
+#include <array>
 #include <boost/bimap.hpp>
+#include <cstddef>
 #include <stdexcept>
 
 #include "krutil.protobuf.Capability.pb.h"
@@ -10,18 +12,22 @@ namespace {
 
 using CapabilityMap = boost::bimap<::capabilities::Capability, protobuf::Capability>;
 
+// Indexed by the host's number: a platform calls its capabilities what it likes.
+constexpr std::array wireValues{protobuf::InteractiveCommandLine,
+                                protobuf::Swing,
+                                protobuf::ComplexSwing,
+                                protobuf::LocalClient,
+                                protobuf::WebWindow,
+                                protobuf::ModalDialogs,
+                                protobuf::Debugging};
+
 // Left the host's value, right the wire's.
 const CapabilityMap& capabilityMap() {
     static const CapabilityMap map = [] {
-        using ::capabilities::Capability;
         CapabilityMap pairs;
-        pairs.insert({Capability::InteractiveCommandLine, protobuf::InteractiveCommandLine});
-        pairs.insert({Capability::Swing, protobuf::Swing});
-        pairs.insert({Capability::ComplexSwing, protobuf::ComplexSwing});
-        pairs.insert({Capability::LocalClient, protobuf::LocalClient});
-        pairs.insert({Capability::WebWindow, protobuf::WebWindow});
-        pairs.insert({Capability::ModalDialogs, protobuf::ModalDialogs});
-        pairs.insert({Capability::Debugging, protobuf::Debugging});
+        for (std::size_t number = 0; number < wireValues.size(); ++number) {
+            pairs.insert({static_cast<::capabilities::Capability>(number), wireValues[number]});
+        }
         return pairs;
     }();
     return map;

@@ -9,7 +9,7 @@ namespace krutil::protobuf_serializer {
 
 class IIPCancelMessageSerializer final
     : public TaggedSerializer<IIPCancelMessageSerializer, MessageFamily, ::cmddistributor::IIPCancelMessage,
-                              protobuf::IIPCancelMessage, FrameType::Control> {
+                              protobuf::IIPCancelMessage, controlFrame> {
   public:
     IIPCancelMessageSerializer();
 

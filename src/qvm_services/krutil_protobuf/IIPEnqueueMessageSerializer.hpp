@@ -10,7 +10,7 @@ namespace krutil::protobuf_serializer {
 /// The request is written first, by the serializer of its dynamic type, and referred to by frame index.
 class IIPEnqueueMessageSerializer final
     : public TaggedSerializer<IIPEnqueueMessageSerializer, MessageFamily, ::cmddistributor::IIPEnqueueMessage,
-                              protobuf::IIPEnqueueMessage, FrameType::Control> {
+                              protobuf::IIPEnqueueMessage, controlFrame> {
   public:
     IIPEnqueueMessageSerializer();
 

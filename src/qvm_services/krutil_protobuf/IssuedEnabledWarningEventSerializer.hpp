@@ -10,7 +10,7 @@ namespace krutil::protobuf_serializer {
 class IssuedEnabledWarningEventSerializer final
     : public TaggedSerializer<IssuedEnabledWarningEventSerializer, EventFamily,
                               korvel::lang::diagnostic::IssuedEnabledWarningEvent, protobuf::IssuedEnabledWarningEvent,
-                              FrameType::Control> {
+                              controlFrame> {
   public:
     IssuedEnabledWarningEventSerializer();
 

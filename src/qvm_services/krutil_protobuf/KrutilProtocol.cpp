@@ -80,6 +80,9 @@ constexpr MakeSerializer serializers[] = {
 
 constexpr std::pair<unsigned int, unsigned int> unknownVersion{0xFFFF, 0xFFFF};
 
+// Both peers must settle on a value. The number is settled; what a platform calls it is not.
+constexpr auto required = static_cast<FeatureHandling>(3);
+
 std::once_flag registered;
 
 }  // namespace
@@ -89,8 +92,8 @@ std::string KrutilProtocol::protocolName = "krutil";
 const std::pair<unsigned int, unsigned int> KrutilProtocol::protocolVersion{1, 0};
 
 std::vector<FeatureRequest> KrutilProtocol::supportedFeatures{
-    {"ZEROCOPY", "enable", FeatureHandling::Required},
-    {"ZEROCOPY", "disable", FeatureHandling::Required},
+    {"ZEROCOPY", "enable", required},
+    {"ZEROCOPY", "disable", required},
 };
 
 void KrutilProtocol::init() {

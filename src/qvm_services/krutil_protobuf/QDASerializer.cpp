@@ -54,14 +54,14 @@ FrameIndex QDASerializer::serialize(const korveldata::Array& array, StreamID str
             frameIndex = writer->getNextFrameIndex();
         }
     }
-    return writeTaggedFrame(*proto, name(), streamID, frameIndex, stream, FrameType::Object);
+    return writeTaggedFrame(*proto, name(), streamID, frameIndex, stream, objectFrame);
 }
 
 korveldata::Array QDASerializer::deserialize(FrameIndex frameIndex, const std::unique_ptr<Message>& message,
                                              const std::shared_ptr<const Registry>& /*registry*/,
                                              const SerializationContext& /*context*/) const {
     auto proto = korveldata::protobuf::createKORVEL_Array();
-    readTaggedFrame(frameIndex, message, *proto, FrameType::Object);
+    readTaggedFrame(frameIndex, message, *proto, objectFrame);
     korveldata::ArrayFactory factory;
     std::shared_ptr<detail::QDADataFrameReader> reader;
     if (zeroCopyAllowed) {

@@ -23,6 +23,11 @@ using foundation::vantor::carrier::framing::FrameIndex;
 using foundation::vantor::carrier::framing::FrameType;
 using foundation::vantor::carrier::framing::StreamID;
 
+/// The two types of tagged frames: of objects that steer the receiver (enqueue, cancel, enabled warnings), and of any
+/// other object. Their numbers are settled; what a platform calls them is not.
+inline constexpr auto controlFrame = static_cast<FrameType>(27);
+inline constexpr auto objectFrame = static_cast<FrameType>(29);
+
 namespace detail {
 
 /// A buffer for a message of `byteSize` bytes, allocated exactly once. Throws std::length_error "Unsupported Protobuf

@@ -21,7 +21,7 @@ namespace krutil::protobuf_serializer {
 /// content take no parameter on the way out.
 ///
 /// Immutable after construction; any number of threads may use one object.
-template <class Derived, class Family, class Object, class ProtoMessage, FrameType Type = FrameType::Object>
+template <class Derived, class Family, class Object, class ProtoMessage, FrameType Type = objectFrame>
 class TaggedSerializer;
 
 template <class Derived, class T, class Ptr, class Ret, class Object, class ProtoMessage, FrameType Type>
