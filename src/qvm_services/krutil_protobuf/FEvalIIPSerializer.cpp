@@ -2,6 +2,7 @@
 
 #include <boost/make_shared.hpp>
 #include <boost/variant/get.hpp>
+#include <cstdint>
 
 #include "FieldConversions.hpp"
 #include "IIPSerializer.hpp"
@@ -36,7 +37,7 @@ const std::vector<foundation::korveldata::Array>& argumentsOf(const ::cmddistrib
     }
 }
 
-void assertSet(contextmgr::QvmID id, const char* expression, int line) {
+void assertSet(std::uint64_t id, const char* expression, int line) {
     if (id == 0 && foundation::core::diag::assertionsEnabled()) {
         fail(expression, line);
     }

@@ -17,8 +17,8 @@ protobuf::SinkTraits toProtobuf(const io::SinkTraits& traits) {
 }
 
 io::SinkTraits fromProtobuf(const protobuf::SinkTraits& proto) {
-    return {false,           proto.supportshotlinks(), proto.needsformattingfordisplay(), proto.usediary(),
-            proto.useecho(), proto.uselogging()};
+    return io::SinkTraits(false, proto.supportshotlinks(), proto.needsformattingfordisplay(), proto.usediary(),
+                          proto.useecho(), proto.uselogging());
 }
 
 protobuf::IqmStreamID IIPSerializer::toProtobuf(::cmddistributor::IqmStreamID streamID) {

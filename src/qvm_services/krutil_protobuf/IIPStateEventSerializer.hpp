@@ -11,6 +11,19 @@
 
 namespace krutil::protobuf_serializer {
 
+/// The eight kinds; a platform need not have names for them. The last event is a completed event besides.
+using ::cmddistributor::DefaultIIPStateEvent;
+using ::cmddistributor::IIPStateEvent;
+using ::cmddistributor::IIPStateEventTypes;
+using StartedEvent = DefaultIIPStateEvent<&IIPStateEventTypes::getStartedEventType, IIPStateEvent>;
+using SuspendedEvent = DefaultIIPStateEvent<&IIPStateEventTypes::getSuspendedEventType, IIPStateEvent>;
+using ResumedEvent = DefaultIIPStateEvent<&IIPStateEventTypes::getResumedEventType, IIPStateEvent>;
+using DiscardedEvent = DefaultIIPStateEvent<&IIPStateEventTypes::getDiscardedEventType, IIPStateEvent>;
+using RequeuedEvent = DefaultIIPStateEvent<&IIPStateEventTypes::getRequeuedEventType, IIPStateEvent>;
+using ReactivatedEvent = DefaultIIPStateEvent<&IIPStateEventTypes::getReactivatedEventType, IIPStateEvent>;
+using CompletedEvent = DefaultIIPStateEvent<&IIPStateEventTypes::getCompletedEventType, IIPStateEvent>;
+using LastEvent = DefaultIIPStateEvent<&IIPStateEventTypes::getLastEventType, CompletedEvent>;
+
 /// The registered name of the kind with this number. Throws std::out_of_range for a number above 7.
 std::string stateEventName(std::size_t type);
 
@@ -18,21 +31,21 @@ std::string stateEventName(std::size_t type);
 template <class EventT>
 inline constexpr protobuf::IIPStateEventType stateEventType = protobuf::IIPStateEventType(-1);
 template <>
-inline constexpr auto stateEventType<::cmddistributor::IIPStartedEvent> = protobuf::IIPStartedEvent;
+inline constexpr auto stateEventType<StartedEvent> = protobuf::IIPStartedEvent;
 template <>
-inline constexpr auto stateEventType<::cmddistributor::IIPSuspendedEvent> = protobuf::IIPSuspendedEvent;
+inline constexpr auto stateEventType<SuspendedEvent> = protobuf::IIPSuspendedEvent;
 template <>
-inline constexpr auto stateEventType<::cmddistributor::IIPResumedEvent> = protobuf::IIPResumedEvent;
+inline constexpr auto stateEventType<ResumedEvent> = protobuf::IIPResumedEvent;
 template <>
-inline constexpr auto stateEventType<::cmddistributor::IIPDiscardedEvent> = protobuf::IIPDiscardedEvent;
+inline constexpr auto stateEventType<DiscardedEvent> = protobuf::IIPDiscardedEvent;
 template <>
-inline constexpr auto stateEventType<::cmddistributor::IIPRequeuedEvent> = protobuf::IIPRequeuedEvent;
+inline constexpr auto stateEventType<RequeuedEvent> = protobuf::IIPRequeuedEvent;
 template <>
-inline constexpr auto stateEventType<::cmddistributor::IIPReactivatedEvent> = protobuf::IIPReactivatedEvent;
+inline constexpr auto stateEventType<ReactivatedEvent> = protobuf::IIPReactivatedEvent;
 template <>
-inline constexpr auto stateEventType<::cmddistributor::IIPCompletedEvent> = protobuf::IIPCompletedEvent;
+inline constexpr auto stateEventType<CompletedEvent> = protobuf::IIPCompletedEvent;
 template <>
-inline constexpr auto stateEventType<::cmddistributor::detail::LastIIPEvent> = protobuf::LastIIPEvent;
+inline constexpr auto stateEventType<LastEvent> = protobuf::LastIIPEvent;
 
 /// Handles events of exactly the class `EventT`. The number on the wire is the serializer's own on the way out and is
 /// ignored on the way in: the frame's tag has settled the kind.

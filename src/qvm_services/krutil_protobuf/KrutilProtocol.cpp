@@ -51,14 +51,14 @@ constexpr MakeSerializer serializers[] = {
     // serializer                                                          // registered name                                   family   frame type
     make<QVMShutdownEventSerializer>,                                      // krutil:QVMShutdownEvent                           event    29
     make<DebugLoopEventSerializer>,                                        // krutil:DebugLoopEvent                             event    29
-    make<IIPStateEventSerializer<::cmddistributor::IIPStartedEvent>>,      // krutil:IIPStartedEvent                            event    29
-    make<IIPStateEventSerializer<::cmddistributor::IIPSuspendedEvent>>,    // krutil:IIPSuspendedEvent                          event    29
-    make<IIPStateEventSerializer<::cmddistributor::IIPResumedEvent>>,      // krutil:IIPResumedEvent                            event    29
-    make<IIPStateEventSerializer<::cmddistributor::IIPDiscardedEvent>>,    // krutil:IIPDiscardedEvent                          event    29
-    make<IIPStateEventSerializer<::cmddistributor::IIPRequeuedEvent>>,     // krutil:IIPRequeuedEvent                           event    29
-    make<IIPStateEventSerializer<::cmddistributor::IIPReactivatedEvent>>,  // krutil:IIPReactivatedEvent                        event    29
-    make<IIPStateEventSerializer<::cmddistributor::IIPCompletedEvent>>,    // krutil:IIPCompletedEvent                          event    29
-    make<IIPStateEventSerializer<::cmddistributor::detail::LastIIPEvent>>, // krutil:detail::LastIIPEvent                       event    29
+    make<IIPStateEventSerializer<StartedEvent>>,                           // krutil:IIPStartedEvent                            event    29
+    make<IIPStateEventSerializer<SuspendedEvent>>,                         // krutil:IIPSuspendedEvent                          event    29
+    make<IIPStateEventSerializer<ResumedEvent>>,                           // krutil:IIPResumedEvent                            event    29
+    make<IIPStateEventSerializer<DiscardedEvent>>,                         // krutil:IIPDiscardedEvent                          event    29
+    make<IIPStateEventSerializer<RequeuedEvent>>,                          // krutil:IIPRequeuedEvent                           event    29
+    make<IIPStateEventSerializer<ReactivatedEvent>>,                       // krutil:IIPReactivatedEvent                        event    29
+    make<IIPStateEventSerializer<CompletedEvent>>,                         // krutil:IIPCompletedEvent                          event    29
+    make<IIPStateEventSerializer<LastEvent>>,                              // krutil:detail::LastIIPEvent                       event    29
     make<TextBaseEventSerializer>,                                         // krutil:TextBaseEvent                              event    29
     make<SinkTextEventSerializer>,                                         // krutil:SinkTextEvent                              event    29
     make<IIPCancelMessageSerializer>,                                      // krutil:IIPCancelMessage                           message  27

@@ -9,7 +9,6 @@ namespace krutil::protobuf_serializer::detail {
 
 using foundation::vantor::carrier::framing::DataFrame;
 using foundation::vantor::carrier::framing::Frame;
-using foundation::vantor::carrier::framing::FrameBuffer;
 using foundation::vantor::carrier::framing::FrameIndex;
 using foundation::vantor::carrier::framing::StreamID;
 
@@ -22,7 +21,7 @@ unsigned long QDADataFrameWriter::write(std::unique_ptr<char[], std::function<vo
                                         unsigned long size, int elementType) {
     // Moving keeps a plain function inside the deleter a plain function, which a reader in this process can unwrap.
     std::unique_ptr<Frame> frame = std::make_unique<DataFrame>(
-        frameTypeOfElements(elementType), streamID_, FrameBuffer(std::move(buffer), size), true, nextFrameIndex_);
+        frameTypeOfElements(elementType), streamID_, std::make_pair(std::move(buffer), size), true, nextFrameIndex_);
     stream_->append(frame);
     return nextFrameIndex_++;
 }

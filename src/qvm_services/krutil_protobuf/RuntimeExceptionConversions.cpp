@@ -61,7 +61,8 @@ protobuf::RuntimeException toProtobuf(const ::cmddistributor::RuntimeException& 
     }
     std::u16string text = utf8_to_ustring(proto.msgtext());
     const cmddistributor::inExecutionStatus status = fromProtobuf(proto.status());
-    return {status, std::move(text), proto.msgid(), proto.functionname(), std::move(frames), std::move(causes), false};
+    return ::cmddistributor::RuntimeException(status, std::move(text), proto.msgid(), proto.functionname(),
+                                              std::move(frames), std::move(causes), false);
 }
 
 }  // namespace krutil::protobuf_serializer

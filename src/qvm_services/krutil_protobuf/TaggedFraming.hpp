@@ -7,8 +7,10 @@
 #include <google/protobuf/io/zero_copy_stream_impl_lite.h>
 
 #include <boost/numeric/conversion/cast.hpp>
+#include <functional>
 #include <memory>
 #include <string>
+#include <utility>
 
 #include "foundation/msg_svc/transport/layers/message/Message.hpp"
 #include "foundation/msg_svc/transport/layers/message/MessageStream.hpp"
@@ -18,10 +20,12 @@ namespace krutil::protobuf_serializer {
 
 using foundation::msg_svc::transport::layers::message::Message;
 using foundation::msg_svc::transport::layers::message::MessageStream;
-using foundation::vantor::carrier::framing::FrameBuffer;
 using foundation::vantor::carrier::framing::FrameIndex;
 using foundation::vantor::carrier::framing::FrameType;
 using foundation::vantor::carrier::framing::StreamID;
+
+/// The bytes of a frame, what releases them, and their length in bytes.
+using FrameBuffer = std::pair<std::unique_ptr<char[], std::function<void(char*)>>, unsigned long>;
 
 /// The two types of tagged frames: of objects that steer the receiver (enqueue, cancel, enabled warnings), and of any
 /// other object. Their numbers are settled; what a platform calls them is not.

@@ -1,5 +1,9 @@
 #include "WarningConversions.hpp"
 
+#include <boost/variant.hpp>
+#include <string>
+#include <vector>
+
 #include "FieldConversions.hpp"
 
 namespace krutil::protobuf_serializer {
@@ -27,7 +31,7 @@ protobuf::PrintfArgument WarningConversions::toProtobuf(const korvel::lang::Prin
 
 korvel::lang::PrintfArgument WarningConversions::fromProtobuf(const protobuf::PrintfArgument& proto) {
     using korvel::lang::PrintfArgument;
-    using Value = PrintfArgument::Value;
+    using Value = boost::variant<int, unsigned int, long, unsigned long, double, std::u16string>;
     // The casts name the alternative: the wire's 64-bit types may be long or long long, the variant's are long.
     switch (proto.Value_case()) {
         case protobuf::PrintfArgument::kI32:
@@ -45,7 +49,7 @@ korvel::lang::PrintfArgument WarningConversions::fromProtobuf(const protobuf::Pr
         case protobuf::PrintfArgument::VALUE_NOT_SET:
             break;
     }
-    return PrintfArgument();
+    return PrintfArgument(Value());
 }
 
 protobuf::WarningStackFrame WarningConversions::toProtobuf(const korvel::lang::StackFrame& frame) {
@@ -87,10 +91,9 @@ korvel::lang::diagnostic::Warning WarningConversions::fromProtobuf(const protobu
     for (const auto& frame : proto.stack()) {
         stack.push_back(fromProtobuf(frame));
     }
-    return {proto.identifier(),   utf8_to_ustring(proto.format()),
-            std::move(arguments), utf8_to_ustring(proto.message()),
-            std::move(stack),     proto.wasdisabled(),
-            proto.datenum()};
+    return korvel::lang::diagnostic::Warning(proto.identifier(), utf8_to_ustring(proto.format()), std::move(arguments),
+                                             utf8_to_ustring(proto.message()), std::move(stack), proto.wasdisabled(),
+                                             proto.datenum());
 }
 
 protobuf::IssuedWarningEvent WarningConversions::toProtobuf(const foundation::msg_svc::exchange::IDType& id,
