@@ -9,15 +9,11 @@
 #include <vector>
 
 #include "KrutilProtocol.hpp"
+#include "apps/common/UnknownNumbers.hpp"
 #include "foundation/msg_svc/eventmgr/BaseEvent.hpp"
 #include "foundation/msg_svc/transport/layers/message/Message.hpp"
 #include "foundation/msg_svc/transport/layers/serialization/SerializerAPI.hpp"
 #include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
-#include "krutil.protobuf.FEvalResult.pb.h"
-#include "krutil.protobuf.IIPResult.pb.h"
-#include "krutil.protobuf.PrintableErrorEvent.pb.h"
-#include "krutil.protobuf.SinkTextEvent.pb.h"
-#include "krutil.protobuf.TextBaseEvent.pb.h"
 
 namespace apps {
 namespace {
@@ -30,6 +26,7 @@ using foundation::vantor::carrier::framing::Frame;
 using foundation::vantor::carrier::framing::FrameBuffer;
 using foundation::vantor::carrier::framing::FrameType;
 using foundation::vantor::carrier::framing::TaggedFrame;
+using namespace apps_test;
 
 std::unique_ptr<TaggedFrame> frameOf(const std::string& tag, const std::string& content) {
     FrameBuffer buffer(FrameBuffer::first_type(new char[content.size() + 1], std::default_delete<char[]>()),
@@ -48,72 +45,24 @@ std::string verdict(const std::string& tag, const std::string& content) {
     }
 }
 
-template <class EnumT>
-EnumT number(int value) {
-    return static_cast<EnumT>(value);
-}
-
-template <class TextT>
-std::string text(int stream) {
-    TextT message;
-    message.mutable_id();
-    message.set_stream(number<proto::StreamType>(stream));
-    message.set_text("some text");
-    return message.SerializeAsString();
-}
-
-// An error whose innermost cause, so many levels down, has the status.
-proto::RuntimeException error(int depth, int status) {
-    proto::RuntimeException exception;
-    exception.set_status(number<proto::ExecutionStatus>(depth == 0 ? status : 2));
-    exception.set_msgtext("text");
-    if (depth > 0) {
-        exception.add_causes()->set_status(number<proto::ExecutionStatus>(1));
-        *exception.add_causes() = error(depth - 1, status);
-    }
-    return exception;
-}
-
-std::string result(int depth, int status) {
-    proto::IIPResult message;
-    message.mutable_id();
-    *message.mutable_exception() = error(depth, status);
-    return message.SerializeAsString();
-}
-
-std::string callResult(int depth, int status) {
-    proto::FEvalResult message;
-    message.mutable_iipresult()->mutable_id();
-    *message.mutable_iipresult()->mutable_exception() = error(depth, status);
-    return message.SerializeAsString();
-}
-
-std::string printable(int depth, int status) {
-    proto::PrintableErrorEvent message;
-    message.mutable_id();
-    *message.mutable_except() = error(depth, status);
-    message.set_text("text");
-    return message.SerializeAsString();
-}
-
 struct ErrorMessage {
     const char* tag;
     std::string (*make)(int depth, int status);
 };
 
 const std::vector<ErrorMessage> errorMessages{
-    {"krutil:IIPResult", result}, {"krutil:FEvalResult", callResult}, {"krutil:PrintableErrorEvent", printable}};
+    {"krutil:IIPResult", result}, {"krutil:FEvalResult", callResult}, {"krutil:PrintableErrorEvent", printableError}};
 
 TEST(PrecheckTest, StreamsOfTextsOutsideTheirRangeAreRefused) {
     for (const int stream : {0, 1, 2}) {
-        EXPECT_EQ(verdict("krutil:TextBaseEvent", text<proto::TextBaseEvent>(stream)), "");
-        EXPECT_EQ(verdict("krutil:SinkTextEvent", text<proto::SinkTextEvent>(stream)), "");
+        EXPECT_EQ(verdict("krutil:TextBaseEvent", textEvent<proto::TextBaseEvent>(stream)), "");
+        EXPECT_EQ(verdict("krutil:SinkTextEvent", textEvent<proto::SinkTextEvent>(stream)), "");
     }
     for (const int stream : {-1, 3, 2'147'483'647, -2'147'483'647 - 1}) {
         const std::string expected = R"(": expected a stream from 0 to 2, got )" + std::to_string(stream);
-        EXPECT_EQ(verdict("krutil:TextBaseEvent", text<proto::TextBaseEvent>(stream)),
+        EXPECT_EQ(verdict("krutil:TextBaseEvent", textEvent<proto::TextBaseEvent>(stream)),
                   R"(frame "krutil:TextBaseEvent)" + expected);
-        EXPECT_EQ(verdict("krutil:SinkTextEvent", text<proto::SinkTextEvent>(stream)),
+        EXPECT_EQ(verdict("krutil:SinkTextEvent", textEvent<proto::SinkTextEvent>(stream)),
                   R"(frame "krutil:SinkTextEvent)" + expected);
     }
 }
@@ -142,8 +91,8 @@ TEST(PrecheckTest, WhatLiesBelowTheParsersDepthIsNotSeenByTheSerializersEither) 
 
 TEST(PrecheckTest, FramesOfOtherTypesAndEmptyOnesPass) {
     // The number that would be a bad stream of a text.
-    EXPECT_EQ(verdict("krutil:IIPReply", text<proto::TextBaseEvent>(7)), "");
-    EXPECT_EQ(verdict("unknown", text<proto::TextBaseEvent>(7)), "");
+    EXPECT_EQ(verdict("krutil:IIPReply", textEvent<proto::TextBaseEvent>(7)), "");
+    EXPECT_EQ(verdict("unknown", textEvent<proto::TextBaseEvent>(7)), "");
     for (const char* tag : {"krutil:TextBaseEvent", "krutil:SinkTextEvent", "krutil:IIPResult", "krutil:FEvalResult",
                             "krutil:PrintableErrorEvent"}) {
         EXPECT_EQ(verdict(tag, ""), "");
@@ -190,16 +139,18 @@ class PrecheckAgainstSerializersTest : public ::testing::Test {
 };
 
 TEST_F(PrecheckAgainstSerializersTest, CutTextEventsAreJudgedAsTheyAreRead) {
-    checkEachCut("krutil:TextBaseEvent", text<proto::TextBaseEvent>(7), "Unsupported krutil::protobuf::StreamType");
-    checkEachCut("krutil:SinkTextEvent", text<proto::SinkTextEvent>(-7), "Unsupported krutil::protobuf::StreamType");
+    checkEachCut("krutil:TextBaseEvent", textEvent<proto::TextBaseEvent>(7),
+                 "Unsupported krutil::protobuf::StreamType");
+    checkEachCut("krutil:SinkTextEvent", textEvent<proto::SinkTextEvent>(-7),
+                 "Unsupported krutil::protobuf::StreamType");
 }
 
 TEST_F(PrecheckAgainstSerializersTest, CutErrorsAreJudgedAsTheyAreRead) {
-    checkEachCut("krutil:PrintableErrorEvent", printable(3, 9), "Unsupported protobuf::ExecutionStatus value");
+    checkEachCut("krutil:PrintableErrorEvent", printableError(3, 9), "Unsupported protobuf::ExecutionStatus value");
 }
 
 TEST_F(PrecheckAgainstSerializersTest, ErrorsBelowTheParsersDepthAreRead) {
-    read("krutil:PrintableErrorEvent", printable(150, 99));
+    read("krutil:PrintableErrorEvent", printableError(150, 99));
 }
 
 }  // namespace

@@ -8,15 +8,12 @@
 #include <unistd.h>
 
 #include "KrutilProtocol.hpp"
+#include "apps/common/UnknownNumbers.hpp"
 #include "apps/qvm/fixture/EngineFixture.hpp"
 #include "foundation/msg_svc/transport/layers/session/FrameHeader.hpp"
 #include "krutil.protobuf.EvalIIP.pb.h"
 #include "krutil.protobuf.FEvalIIP.pb.h"
-#include "krutil.protobuf.FEvalResult.pb.h"
 #include "krutil.protobuf.IIPEnqueueMessage.pb.h"
-#include "krutil.protobuf.IIPResult.pb.h"
-#include "krutil.protobuf.PrintableErrorEvent.pb.h"
-#include "krutil.protobuf.SinkTextEvent.pb.h"
 #include "krutil.protobuf.TextBaseEvent.pb.h"
 #include "support/TemporaryDirectory.hpp"
 
@@ -24,6 +21,7 @@ namespace qvm_test {
 namespace {
 
 namespace proto = krutil::protobuf;
+using namespace apps_test;
 using session::framing::FrameType;
 using testing::ElementsAre;
 
@@ -147,47 +145,6 @@ Outcome outcomeOf(const Parts& parts, std::vector<std::string> options) {
     return outcome;
 }
 
-template <class EnumT>
-EnumT number(int value) {
-    return static_cast<EnumT>(value);
-}
-
-proto::RuntimeException error(int depth, int status) {
-    proto::RuntimeException exception;
-    exception.set_status(number<proto::ExecutionStatus>(depth == 0 ? status : 2));
-    if (depth > 0) {
-        *exception.add_causes() = error(depth - 1, status);
-    }
-    return exception;
-}
-
-template <class TextT>
-std::string text(int stream) {
-    TextT message;
-    message.set_stream(number<proto::StreamType>(stream));
-    return message.SerializeAsString();
-}
-
-std::string result(int depth, int status) {
-    proto::IIPResult message;
-    message.mutable_id();
-    *message.mutable_exception() = error(depth, status);
-    return message.SerializeAsString();
-}
-
-std::string callResult(int depth, int status) {
-    proto::FEvalResult message;
-    message.mutable_iipresult()->mutable_id();
-    *message.mutable_iipresult()->mutable_exception() = error(depth, status);
-    return message.SerializeAsString();
-}
-
-std::string printableError(int depth, int status) {
-    proto::PrintableErrorEvent message;
-    *message.mutable_except() = error(depth, status);
-    return message.SerializeAsString();
-}
-
 // A frame with a number that ends a process, what the check says to it, and the same frame with a known number.
 struct Stowaway {
     Part bad;
@@ -201,10 +158,10 @@ std::vector<Stowaway> stowaways() {
                          const std::string& good) {
         all.push_back({{tag, bad}, "frame \"" + tag + "\": expected " + what, {tag, good}});
     };
-    add("krutil:TextBaseEvent", text<proto::TextBaseEvent>(3), "a stream from 0 to 2, got 3",
-        text<proto::TextBaseEvent>(2));
-    add("krutil:SinkTextEvent", text<proto::SinkTextEvent>(-1), "a stream from 0 to 2, got -1",
-        text<proto::SinkTextEvent>(2));
+    add("krutil:TextBaseEvent", textEvent<proto::TextBaseEvent>(3), "a stream from 0 to 2, got 3",
+        textEvent<proto::TextBaseEvent>(2));
+    add("krutil:SinkTextEvent", textEvent<proto::SinkTextEvent>(-1), "a stream from 0 to 2, got -1",
+        textEvent<proto::SinkTextEvent>(2));
     for (const int depth : {0, 30}) {
         add("krutil:IIPResult", result(depth, 6), "a status from 0 to 5, got 6", result(depth, 5));
         add("krutil:FEvalResult", callResult(depth, -1), "a status from 0 to 5, got -1", callResult(depth, 5));
@@ -320,7 +277,9 @@ TEST(EnginePrecheckTest, RequestForAStreamThatIsNoneIsServedEitherWay) {
 
 // The parser reads the first byte of a number that is cut after it.
 TEST(EnginePrecheckTest, CutContentIsJudgedByWhatIsReadOfIt) {
-    const std::string whole = text<proto::TextBaseEvent>(300);
+    proto::TextBaseEvent message;
+    message.set_stream(number<proto::StreamType>(300));
+    const std::string whole = message.SerializeAsString();
     ASSERT_EQ(whole.size(), 3U);
     for (std::size_t length = 0; length < whole.size(); ++length) {
         const Parts parts{{"krutil:TextBaseEvent", whole.substr(0, length)}, evaluation(), enqueue(2)};
