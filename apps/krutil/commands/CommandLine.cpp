@@ -102,7 +102,8 @@ CLI::App* addEval(CLI::App& app, Options& options, EvalOptions& eval) {
     command
         ->add_option_function<std::string>(
             "--type", [&eval](const std::string& name) { eval.type = types.at(name); },
-            "How the code is read: block (statements; the value of a trailing expression is shown), script (a program) "
+            "How the code is read: block (statements; the value of a trailing expression is shown), script (a whole "
+            "file) "
             "or conventional (one statement)")
         ->check(CLI::IsMember(&types).description(""))
         ->type_name("TYPE")
@@ -129,18 +130,18 @@ CLI::App* addEval(CLI::App& app, Options& options, EvalOptions& eval) {
 
 constexpr const char* promptHelp = R"(Prompts:
   Code that reads a line, pauses or stops at breakpoint() asks for it here if standard input is a
-  terminal. At debug> and keyboard> code is evaluated where the program stands; :c goes on, :q (or
+  terminal. At debug> and keyboard> code is evaluated where the code stands; :c goes on, :q (or
   Ctrl-D) quits. Ctrl-C cancels; a second one within two seconds ends the engine.)";
 
 void addRun(CLI::App& app, Options& options, RunOptions& run) {
-    auto* command = app.add_subcommand("run", "Run a Python program from a file");
-    command->add_option("FILE", run.file, "The program, a file of this machine; the engine gets its text")
+    auto* command = app.add_subcommand("run", "Run a Python script from a file");
+    command->add_option("FILE", run.file, "The script, a file of this machine; the engine gets its text")
         ->required()
         ->type_name("");
     command
         ->add_option(
             "ARG", run.arguments,
-            "What the program finds in sys.argv after its name; put -- before the first one if any begins with a dash")
+            "What the script finds in sys.argv after its name; put -- before the first one if any begins with a dash")
         ->type_name("");
     command
         ->add_flag("--sparingly", run.sparingly, "Let the engine send output in large pieces instead of line by line")
@@ -170,17 +171,23 @@ constexpr const char* argumentForms = R"(Arguments:
 After -- an argument may begin with a dash; a negative number may at any place.)";
 
 // What begins and ends with a bracket is taken apart at its commas by the parser of the command line, unless there is a
-// space before it, which an array's literal may begin with.
-std::vector<std::string> withLiteralsKept(int argc, const char* const* argv) {
+// space before it, which an array's literal may begin with. The value of an option is no literal.
+std::vector<std::string> withLiteralsKept(const CLI::App& app, int argc, const char* const* argv) {
     std::vector<std::string> arguments(argv + std::min(argc, 1), argv + argc);
-    const auto takesValue = [](const std::string& argument) {
-        return argument == "-o" || argument == "--output" || argument == "--engine" || argument == "--connect" ||
-               argument == "--trace-to";
+    if (arguments.empty() || arguments[0] != "call") {
+        return arguments;
+    }
+    const CLI::App& call = *app.get_subcommand(arguments[0]);
+    const auto takesValue = [&call](const std::string& argument) {
+        const CLI::Option* const option = argument.starts_with('-') ? call.get_option_no_throw(argument) : nullptr;
+        return option != nullptr && option->get_items_expected_max() > 0;
     };
-    for (std::size_t i = 1; i < arguments.size() && arguments[0] == "call"; ++i) {
-        if (arguments[i].starts_with('[') && !takesValue(arguments[i - 1])) {
+    bool options = true;
+    for (std::size_t i = 1; i < arguments.size(); ++i) {
+        if (arguments[i].starts_with('[') && !(options && takesValue(arguments[i - 1]))) {
             arguments[i].insert(0, 1, ' ');
         }
+        options = options && arguments[i] != "--";
     }
     return arguments;
 }
@@ -246,7 +253,7 @@ std::variant<Options, Finished> parseCommandLine(int argc, const char* const* ar
     addRun(app, options, run);
     addRepl(app, options, repl);
     try {
-        auto arguments = withLiteralsKept(argc, argv);
+        auto arguments = withLiteralsKept(app, argc, argv);
         std::reverse(arguments.begin(), arguments.end());
         app.parse(std::move(arguments));
     } catch (const CLI::ParseError& error) {

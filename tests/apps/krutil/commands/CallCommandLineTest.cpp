@@ -53,6 +53,8 @@ TEST(CallCommandLineTest, ListsAreNotTakenApart) {
     EXPECT_THAT(parseCall({"f", "[1,2]", "--no-zero-copy", "[[1],[2]]", "-o", "[a,b]", "[3]"}).arguments,
                 ElementsAre("[1,2]", "[[1],[2]]", "[3]"));
     EXPECT_THAT(parseCall({"f", "-o", "[a,b]"}).files, ElementsAre("[a,b]"));
+    EXPECT_THAT(parseCall({"f", "--sparingly", "[1,2]"}).arguments, ElementsAre("[1,2]"));
+    EXPECT_THAT(parseCall({"f", "--", "-o", "[3,4]"}).arguments, ElementsAre("-o", "[3,4]"));
 }
 
 TEST(CallCommandLineTest, OptionsMayStandBetweenArguments) {
