@@ -139,9 +139,9 @@ ExitCode runCommand(const Options& options, const ReplOptions& repl, Printer& pr
 }
 
 ExitCode runCommand(const Options& options, const RunOptions& run, Printer& printer, Terminal& terminal) {
-    const std::string program = readProgram(run);
+    const std::string script = readScript(run);
     AskingClient asking(options, printer, terminal, standardInputIsTerminal());
-    const ExitCode result = runProgramText(asking.client(), run, program);
+    const ExitCode result = runScript(asking.client(), run, script);
     finish(asking.client());
     return result;
 }

@@ -8,7 +8,7 @@
 namespace krutil_client {
 namespace {
 
-// A request of its own before the program, which may begin with statements that must be its first.
+// A request of its own before the script, which may begin with statements that must be its first.
 std::string argumentsCode(const RunOptions& options) {
     nlohmann::json list = nlohmann::json::array({options.file});
     for (const std::string& argument : options.arguments) {
@@ -30,10 +30,10 @@ EvalOptions evalOptions(const RunOptions& options) {
 
 }  // namespace
 
-std::string readProgram(const RunOptions& options) {
+std::string readScript(const RunOptions& options) {
     for (const std::string& argument : options.arguments) {
         if (firstInvalidUtf8(argument)) {
-            throw Failure(ExitCode::Usage, "an argument of the program is not valid UTF-8");
+            throw Failure(ExitCode::Usage, "an argument of the script is not valid UTF-8");
         }
     }
     if (firstInvalidUtf8(options.file)) {
@@ -42,8 +42,8 @@ std::string readProgram(const RunOptions& options) {
     return readCode(evalOptions(options));
 }
 
-ExitCode runProgramText(Client& client, const RunOptions& options, const std::string& text) {
-    // Only the program itself is timed.
+ExitCode runScript(Client& client, const RunOptions& options, const std::string& text) {
+    // Only the script itself is timed.
     const bool timing = client.timing();
     client.setTiming(false);
     if (const ExitCode result = evaluate(client, evalOptions(options), argumentsCode(options));

@@ -8,10 +8,10 @@
 
 namespace krutil_client {
 
-/// Reads the program's text: valid UTF-8, like its arguments. Throws Failure.
-std::string readProgram(const RunOptions& options);
+/// Reads the script's text: valid UTF-8, like its arguments. Throws Failure.
+std::string readScript(const RunOptions& options);
 
-/// Has the program run, with sys.argv as a program that Python itself runs has it, and shows what comes of it.
-ExitCode runProgramText(Client& client, const RunOptions& options, const std::string& text);
+/// Has the script run, with sys.argv as a script that Python itself runs has it, and shows what comes of it.
+ExitCode runScript(Client& client, const RunOptions& options, const std::string& text);
 
 }  // namespace krutil_client

@@ -301,10 +301,10 @@ void JsonPrinter::returned(const Returned& output) {
     print(object);
 }
 
-void JsonPrinter::replied(const Outcome& outcome) {
-    ordered_json object{{"event", "reply"}, {"request", toString(outcome.request)}, {"ok", outcome.error == nullptr}};
-    if (outcome.error != nullptr) {
-        object["error"] = errorObject(*outcome.error);
+void JsonPrinter::replied(const Replied& reply) {
+    ordered_json object{{"event", "reply"}, {"request", toString(reply.request)}, {"ok", reply.error == nullptr}};
+    if (reply.error != nullptr) {
+        object["error"] = errorObject(*reply.error);
     }
     print(object);
 }

@@ -64,11 +64,11 @@ void PersonPrinter::returned(const Returned& output) {
                                            : arrayHeading(output.array) + " -> " + output.file + "\n"));
 }
 
-void PersonPrinter::replied(const Outcome& outcome) {
-    if (outcome.error == nullptr || outcome.errorPrinted) {
+void PersonPrinter::replied(const Replied& reply) {
+    if (reply.error == nullptr || reply.errorPrinted) {
         return;
     }
-    switch (outcome.error->getExecutionStatus()) {
+    switch (reply.error->getExecutionStatus()) {
         case krutil::cmddistributor::inEXECUTION_CTRLC:
             err_.write("krutil: cancelled\n");
             break;
@@ -76,7 +76,7 @@ void PersonPrinter::replied(const Outcome& outcome) {
             err_.write("krutil: the debugger was left with quit\n");
             break;
         default:
-            complain(red, errorText(*outcome.error));
+            complain(red, errorText(*reply.error));
     }
 }
 

@@ -25,7 +25,7 @@ class PersonPrinter : public Printer {
     void connected(const foundation::msg_svc::transport::layers::session::Peer& peer,
                    const std::unordered_map<std::string, std::string>& features) override;
     void returned(const Returned& output) override;
-    void replied(const Outcome& outcome) override;
+    void replied(const Replied& reply) override;
     void failed(int exitCode, const std::string& sentence) override;
     void timed(const Timing& timing) override;
 

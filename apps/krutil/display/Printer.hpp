@@ -16,7 +16,7 @@
 namespace krutil_client {
 
 /// How a request ended.
-struct Outcome {
+struct Replied {
     foundation::msg_svc::exchange::IDType request;
     const cmddistributor::RuntimeException* error;  ///< null for success; valid during the call
     bool errorPrinted = false;                      ///< the engine has sent the text to print for the error
@@ -55,7 +55,7 @@ class Printer {
     virtual void returned(const Returned& output) = 0;
 
     /// The reply to a request has come.
-    virtual void replied(const Outcome& outcome) = 0;
+    virtual void replied(const Replied& reply) = 0;
 
     /// The program ends early, with this exit code. Standard error has the sentence already.
     virtual void failed(int exitCode, const std::string& sentence) = 0;

@@ -122,7 +122,7 @@ Client::Client(const ConnectionOptions& connection, const DisplayOptions& displa
             engineCapabilities_ = event.getQvmCapabilities();
         });
     printer_.subscribe(events_);
-    conversation_ = shakeHands(connection, interactive);
+    conversation_ = openConversation(connection, interactive);
     conversation_->watch(engine_.watch(), [this] {
         // The end of the stream follows, and is what ends a request; unless another process holds the stream.
         const bool idle = unanswered_.empty();
@@ -148,7 +148,7 @@ Client::~Client() {
     conversation_.reset();
 }
 
-std::unique_ptr<Conversation> Client::shakeHands(const ConnectionOptions& connection, bool interactive) {
+std::unique_ptr<Conversation> Client::openConversation(const ConnectionOptions& connection, bool interactive) {
     session::SessionConfig config;
     config.role = session::Role::Client;
     config.protocol = krutil::protobuf::KrutilProtocol::protocolName;

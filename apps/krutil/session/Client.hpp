@@ -74,7 +74,7 @@ class Client {
     std::string finish();
 
   private:
-    std::unique_ptr<Conversation> shakeHands(const ConnectionOptions& connection, bool interactive);
+    std::unique_ptr<Conversation> openConversation(const ConnectionOptions& connection, bool interactive);
     void say(const std::string& sentence);
     [[noreturn]] void fail(const Conversation::SessionEnd& end, const std::string& when);
     [[noreturn]] void failLost(const std::string& text, const std::string& when);

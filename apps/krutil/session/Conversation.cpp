@@ -23,7 +23,7 @@ constexpr std::size_t waitingBytes = 8U << 20;
 // Counted for whatever arrives, besides its text.
 constexpr std::size_t bytesOfAnything = 512;
 
-std::unique_ptr<session::Session> shakeHands(int stream, session::SessionConfig&& config) {
+std::unique_ptr<session::Session> openSession(int stream, session::SessionConfig&& config) {
     const Interrupt::ShutsDown interruptible(stream);
     return session::Session::open(stream, stream, std::move(config));
 }
@@ -32,7 +32,10 @@ std::unique_ptr<session::Session> shakeHands(int stream, session::SessionConfig&
 
 Conversation::Conversation(int stream, session::SessionConfig config, foundation::msg_svc::eventmgr::EventMgr& events,
                            Interrupt& interrupt)
-    : events_(events), interrupt_(interrupt), wake_("A conversation"), session_(shakeHands(stream, std::move(config))) {
+    : events_(events),
+      interrupt_(interrupt),
+      wake_("A conversation"),
+      session_(openSession(stream, std::move(config))) {
     session_->start(*this);
 }
 
