@@ -202,16 +202,20 @@ int depthOf(const RuntimeException& exception) {
     return exception.getCauses().empty() ? 0 : 1 + depthOf(exception.getCauses().front());
 }
 
-// The frame of a result whose exception stands in front of its identifier.
-std::string resultBytes(const wire::RuntimeException& exception) {
-    const std::string inner = exception.SerializeAsString();
-    wire::IIPResult id;
-    id.mutable_id()->set_lo(9);
+// A field of messages or texts, with the given key.
+std::string field(char key, const std::string& content) {
     std::string length;
-    for (std::size_t rest = inner.size(); rest != 0; rest >>= 7) {
+    for (std::size_t rest = content.size(); rest != 0; rest >>= 7) {
         length += static_cast<char>((rest & 0x7F) | (rest > 0x7F ? 0x80 : 0));
     }
-    return "\x12" + length + inner + id.SerializeAsString();
+    return key + length + content;
+}
+
+// The frame of a result whose exception stands in front of its identifier.
+std::string resultBytes(const wire::RuntimeException& exception) {
+    wire::IIPResult id;
+    id.mutable_id()->set_lo(9);
+    return field('\x12', exception.SerializeAsString()) + id.SerializeAsString();
 }
 
 std::unique_ptr<IIPResult> readResult(const std::string& bytes) {
@@ -232,6 +236,29 @@ TEST(NestingTest, At100LevelsTheParseStopsAndLaterFieldsAreLost) {
     EXPECT_EQ(errorText<std::logic_error>([] { readResult(resultBytes(nested(100))); }),
               "Required field is missing: protobuf::IIPResult.id");
     EXPECT_EQ(errorText<std::logic_error>([] { readResult(resultBytes(nested(5000))); }),
+              "Required field is missing: protobuf::IIPResult.id");
+}
+
+TEST(NestingTest, AStackBelowOrAMessageAboveTakesOneOfTheLevels) {
+    const auto withStack = [](int levels) {
+        wire::RuntimeException error = nested(levels);
+        wire::RuntimeException* innermost = &error;
+        while (innermost->causes_size() != 0) {
+            innermost = innermost->mutable_causes(0);
+        }
+        innermost->add_frames();
+        return error;
+    };
+    EXPECT_EQ(depthOf(*readResult(resultBytes(withStack(98)))->getException()), 98);
+    EXPECT_EQ(errorText<std::logic_error>([&] { readResult(resultBytes(withStack(99))); }),
+              "Required field is missing: protobuf::IIPResult.id");
+
+    const auto readCallResult = [](const wire::RuntimeException& error) {
+        const std::string bytes = field('\x0a', resultBytes(error));
+        return std::get<std::unique_ptr<IIPResult>>(transport::readObject("krutil:FEvalResult", bytes))->id;
+    };
+    EXPECT_EQ(readCallResult(nested(98)), IDType(0, 9));
+    EXPECT_EQ(errorText<std::logic_error>([&] { readCallResult(nested(99)); }),
               "Required field is missing: protobuf::IIPResult.id");
 }
 

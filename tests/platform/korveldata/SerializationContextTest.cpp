@@ -324,6 +324,13 @@ TEST_F(SerializationContextTest, ElementsThatNoMessageCanHoldAreRefusedBeforeThe
     EXPECT_EQ(frames->frames.at(5).size, 1ULL << 31);
 }
 
+// A session's limit for the message of an array is 64 MiB unless it is told otherwise.
+TEST_F(SerializationContextTest, DescriptionOfALongRowTakes15Bytes) {
+    constexpr std::uint64_t size = 64ULL << 20;
+    const Array array = factory.createArray(ElementType::Int8, {size - 15});
+    EXPECT_EQ(sendInline(array)->ByteSizeLong(), size);
+}
+
 TEST_F(SerializationContextTest, DataIDWithoutAReaderIsRefused) {
     SerializationContext context(factory, true, false, nullptr, nullptr);
     expectFormatError([&] { context.convertFromProtobuf(std::make_unique<KORVEL_Array>(framedMessage(5))); },

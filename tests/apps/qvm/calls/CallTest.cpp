@@ -223,6 +223,27 @@ TEST_F(EngineCallTest, ReplyIsWrittenBeforeTheNextRequestRuns) {
     EXPECT_EQ(difference(call("current", {}).at(0), "numpy.full(4 << 20, 2.0)"), "");
 }
 
+TEST(CallAtAPromptTest, FunctionIsLookedUpInTheSessionNotInTheStoppedFrame) {
+    EngineSession engine({}, {}, {capabilities::Capability::Debugging});
+    EngineClient& client = engine.client;
+    const IDType outer = client.enqueue(
+        "def name(): return 'of the session'\n"
+        "def stop():\n"
+        "    def name(): return 'of the frame'\n"
+        "    breakpoint()\n"
+        "stop()");
+    client.awaitLoop(outer, cmddistributor::DebugLoopEvent::ENTER);
+    EvalOptions atPrompt;
+    atPrompt.mode = krutil::cmddistributor::WhenToDequeue::DEQUEUE_AT_PROMPT;
+    EXPECT_EQ(client.eval("name()", atPrompt).shown(), "'of the frame'\n");
+    const std::vector<Array> outputs = outputsOf(client.await(client.enqueue(callOf("name", {}), atPrompt)));
+    ASSERT_EQ(outputs.size(), 1U);
+    EXPECT_EQ(std::string(outputs[0].data(), outputs[0].sizeInBytes()),
+              std::string(text(u"of the session").data(), text(u"of the session").sizeInBytes()));
+    client.eval("import qvm; qvm.dbcont()", atPrompt);
+    EXPECT_FALSE(client.await(outer).error);
+}
+
 TEST(CallAtAPromptTest, OutputIsWhatItWasThoughACancelLetsTheCodeGoOnBeforeItIsRead) {
     EngineSession engine({}, {}, {capabilities::Capability::Debugging});
     EngineClient& client = engine.client;

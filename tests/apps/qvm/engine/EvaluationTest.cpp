@@ -151,6 +151,11 @@ TEST_F(EvaluationTest, EchoComesFirst) {
     onErrors.err = kEcho;
     EXPECT_EQ(client().eval("2", onErrors).text("SinkTextEvent", StreamTypeEnum::ERROR_STREAM), ">>> 2\n");
     EXPECT_EQ(client().eval("", withOut(kEcho)).shown(), ">>> \n");
+    EvalOptions onBoth = withOut(kEcho);
+    onBoth.err = kEcho;
+    const Evaluation twice = client().eval("pass", onBoth);
+    EXPECT_EQ(twice.shown(), ">>> pass\n");
+    EXPECT_EQ(twice.text("SinkTextEvent", StreamTypeEnum::ERROR_STREAM), ">>> pass\n");
 }
 
 TEST_F(EvaluationTest, FormattedSinkGetsValuesLaidOut) {

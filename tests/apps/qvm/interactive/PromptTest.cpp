@@ -86,6 +86,16 @@ TEST_F(EnginePromptTest, AnswerOfSeveralLinesAnswersAsManyReads) {
     expectLoop(result, InputRequester::mnINPUT_PROMPT);
 }
 
+TEST_F(EnginePromptTest, LinesThatAreLeftOverAnswerLaterRequests) {
+    const IDType id = stopped("print([input()])");
+    command("a\nb\nc\n");
+    EXPECT_EQ(client().await(id).output(), "['a']\n");
+    EXPECT_EQ(client().eval("print([input(), input()])").output(), "['b', 'c']\n");
+    const IDType next = stopped("print([input()])");
+    command("d");
+    EXPECT_EQ(client().await(next).output(), "['d']\n");
+}
+
 TEST_F(EnginePromptTest, EndOfInputIsAnEOFError) {
     const IDType id = stopped("input()");
     EXPECT_FALSE(command("\x04").error);
@@ -157,6 +167,16 @@ TEST_F(EnginePromptTest, QuitEndsTheOuterRequest) {
 TEST_F(EnginePromptTest, WaysOutNeedAPrompt) {
     EXPECT_EQ(client().eval("import qvm\nqvm.dbcont()").errorText(), "no debug, keyboard or pause prompt is open");
     EXPECT_EQ(client().eval("qvm.dbquit()").errorId(), "RuntimeError");
+}
+
+TEST_F(EnginePromptTest, EitherWayOutEndsAPause) {
+    for (const char* const way : {"qvm.dbcont()", "qvm.dbquit()"}) {
+        const IDType id = stopped("import qvm\nqvm.pause()\nprint('on')");
+        EvalOptions atEvents;
+        atEvents.mode = DEQUEUE_AT_PPE;
+        EXPECT_FALSE(client().eval(way, atEvents).error) << way;
+        EXPECT_EQ(client().await(id).output(), "on\n") << way;
+    }
 }
 
 TEST_F(EnginePromptTest, WhatIsLeftOfABatchIsRequeuedAndReactivated) {
