@@ -30,7 +30,7 @@ TEST(EngineSignalTest, TerminationEndsAnEngineWithoutAShutdownEvent) {
 TEST(EngineSignalTest, CodeMayHandleTermination) {
     EngineSession engine;
     engine.client.eval("import signal\nsignal.signal(signal.SIGTERM, lambda *ignored: print('told'))");
-    const IDType id = engine.client.enqueue("print('running')\nwhile True: pass");
+    const IDType id = engine.client.enqueue("import time\nprint('running')\nwhile True: time.sleep(0.001)");
     engine.client.awaitText("running");
     engine.process.signal(SIGTERM);
     engine.client.awaitText("told");
