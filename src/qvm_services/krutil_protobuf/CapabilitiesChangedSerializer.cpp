@@ -5,9 +5,13 @@
 #include "CapabilityConversions.hpp"
 
 namespace krutil::protobuf_serializer {
+namespace {
 
-CapabilitiesChangedSerializer::CapabilitiesChangedSerializer()
-    : TaggedSerializer("krutil:capabilities_api:CapabilitiesChanged") {}
+const std::string registeredName = "krutil:capabilities_api:CapabilitiesChanged";
+
+}  // namespace
+
+CapabilitiesChangedSerializer::CapabilitiesChangedSerializer() : TaggedSerializer(registeredName) {}
 
 protobuf::CapabilitiesChanged CapabilitiesChangedSerializer::toProtobuf(
     const capabilities_api::CapabilitiesChanged& event) {

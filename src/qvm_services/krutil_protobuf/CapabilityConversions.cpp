@@ -3,6 +3,7 @@
 #include <array>
 #include <boost/bimap.hpp>
 #include <cstddef>
+#include <cstdint>
 #include <stdexcept>
 
 #include "krutil.protobuf.Capability.pb.h"
@@ -11,6 +12,9 @@ namespace krutil::protobuf_serializer {
 namespace {
 
 using CapabilityMap = boost::bimap<::capabilities::Capability, protobuf::Capability>;
+
+// The host's values are wider than the wire's; only those of the map travel.
+static_assert(sizeof(::capabilities::Capability) == sizeof(std::uint64_t));
 
 // Indexed by the host's number: a platform calls its capabilities what it likes.
 constexpr std::array wireValues{protobuf::InteractiveCommandLine,

@@ -7,6 +7,8 @@
 namespace krutil::protobuf_serializer {
 namespace {
 
+const std::string registeredName = "krutil:DebugLoopEvent";
+
 // The placeholder is a value of the wire's enumeration, but no state.
 bool isState(int number) {
     return number == protobuf::DebugLoopEvent::EXIT || number == protobuf::DebugLoopEvent::ENTER;
@@ -14,7 +16,7 @@ bool isState(int number) {
 
 }  // namespace
 
-DebugLoopEventSerializer::DebugLoopEventSerializer() : TaggedSerializer("krutil:DebugLoopEvent") {}
+DebugLoopEventSerializer::DebugLoopEventSerializer() : TaggedSerializer(registeredName) {}
 
 protobuf::DebugLoopEvent_State DebugLoopEventSerializer::toProtobuf(::cmddistributor::DebugLoopEvent::State state) {
     return sameNumberOrTerminate<protobuf::DebugLoopEvent_State>(
@@ -55,7 +57,7 @@ boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> DebugLoopEvent
     const auto id = IDTypeSerializer::fromProtobuf(proto.requestid());
     const auto state = fromProtobuf(proto.state());
     const auto whichLoop = fromProtobuf(proto.whichloop());
-    return boost::make_shared<::cmddistributor::DebugLoopEvent>(id, state, whichLoop);
+    return boost::make_shared<const ::cmddistributor::DebugLoopEvent>(id, state, whichLoop);
 }
 
 }  // namespace krutil::protobuf_serializer

@@ -6,8 +6,13 @@
 #include "IIPSerializer.hpp"
 
 namespace krutil::protobuf_serializer {
+namespace {
 
-EvalIIPSerializer::EvalIIPSerializer() : TaggedSerializer("krutil:EvalIIP") {}
+const std::string registeredName = "krutil:EvalIIP";
+
+}  // namespace
+
+EvalIIPSerializer::EvalIIPSerializer() : TaggedSerializer(registeredName) {}
 
 protobuf::CodeType EvalIIPSerializer::toProtobuf(::cmddistributor::CodeType codeType) {
     return sameNumberOrTerminate<protobuf::CodeType>(

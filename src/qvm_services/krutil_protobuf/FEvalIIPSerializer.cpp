@@ -15,6 +15,8 @@ using cmddistributor::EDIDataWrapper;
 
 namespace {
 
+const std::string registeredName = "krutil:FEvalIIP";
+
 [[noreturn]] void fail(const char* message, int line) {
     foundation::core::diag::terminate(
         message, "FEvalIIPSerializer", line,
@@ -45,7 +47,7 @@ void assertSet(std::uint64_t id, const char* expression, int line) {
 
 }  // namespace
 
-FEvalIIPSerializer::FEvalIIPSerializer() : TaggedSerializer("krutil:FEvalIIP") {}
+FEvalIIPSerializer::FEvalIIPSerializer() : TaggedSerializer(registeredName) {}
 
 protobuf::FEvalIIP FEvalIIPSerializer::toProtobuf(const ::cmddistributor::FEvalIIP& request, NestedWriter& nested) {
     protobuf::FEvalIIP proto;
@@ -71,7 +73,7 @@ boost::shared_ptr<const ::cmddistributor::IIP> FEvalIIPSerializer::fromProtobuf(
     require(proto.serverqvmid() != 0, "Invalid krutil::protobuf::FEvalIIP.serverQvmID field value of 0");
     auto data = ::cmddistributor::FEvalIIP::Data::makeServerSideData(std::move(arguments), proto.clientqvmid(),
                                                                      proto.serverqvmid(), true);
-    return boost::make_shared<::cmddistributor::FEvalIIP>(
+    return boost::make_shared<const ::cmddistributor::FEvalIIP>(
         core->getPluginType(), proto.functionname(), proto.nlhs(), std::move(data), core->getStreamID(),
         core->getOutTraits(), core->getErrTraits(), proto.clientqvmid(), proto.serverqvmid(), false);
 }

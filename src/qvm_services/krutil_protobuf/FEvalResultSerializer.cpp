@@ -10,7 +10,13 @@ namespace krutil::protobuf_serializer {
 
 using foundation::korveldata::Array;
 
-FEvalResultSerializer::FEvalResultSerializer() : TaggedSerializer("krutil:FEvalResult") {}
+namespace {
+
+const std::string registeredName = "krutil:FEvalResult";
+
+}  // namespace
+
+FEvalResultSerializer::FEvalResultSerializer() : TaggedSerializer(registeredName) {}
 
 protobuf::FEvalResult FEvalResultSerializer::toProtobuf(const ::cmddistributor::FEvalResult& result,
                                                         const WriteArrays& write) {

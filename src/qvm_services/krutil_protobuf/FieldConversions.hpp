@@ -4,7 +4,7 @@
 
 #include <stdexcept>
 #include <string>
-#include <utility>
+#include <type_traits>
 
 #include "foundation/core/diag/terminate.hpp"
 #include "msg_svc/protobuf/ustring.hpp"
@@ -35,10 +35,15 @@ struct FatalDiagnostic {
     const char* function;
 };
 
+/// Whether the number of an enumeration of type `Enum` is an int without loss: the numbers on the wire have 32 bits.
+template <class Enum>
+inline constexpr bool fitsIntoInt = std::is_enum_v<Enum> && sizeof(Enum) <= sizeof(int);
+
 /// The enumerations on both sides have the same numbers, so a conversion keeps the number and checks it. This one ends
 /// the process for a number outside the table: the failure of a value that this process itself made up.
 template <class To, class From>
 To sameNumberOrTerminate(From value, bool (*isKnown)(int), const FatalDiagnostic& diagnostic) {
+    static_assert(fitsIntoInt<From> && fitsIntoInt<To>);
     const auto number = static_cast<int>(value);
     if (!isKnown(number)) {
         foundation::core::diag::terminate(diagnostic.message, diagnostic.file, diagnostic.line, diagnostic.function);
@@ -50,6 +55,7 @@ To sameNumberOrTerminate(From value, bool (*isKnown)(int), const FatalDiagnostic
 /// failure of a value that a peer sent.
 template <class To, class From>
 To sameNumberOrThrow(From value, bool (*isKnown)(int), const char* prefix) {
+    static_assert(fitsIntoInt<From> && fitsIntoInt<To>);
     const auto number = static_cast<int>(value);
     if (!isKnown(number)) {
         throw std::logic_error(prefix + std::to_string(number));

@@ -5,8 +5,13 @@
 #include "FieldConversions.hpp"
 
 namespace krutil::protobuf_serializer {
+namespace {
 
-IIPCancelMessageSerializer::IIPCancelMessageSerializer() : TaggedSerializer("krutil:IIPCancelMessage") {}
+const std::string registeredName = "krutil:IIPCancelMessage";
+
+}  // namespace
+
+IIPCancelMessageSerializer::IIPCancelMessageSerializer() : TaggedSerializer(registeredName) {}
 
 protobuf::IIPCancelMessage IIPCancelMessageSerializer::toProtobuf(const ::cmddistributor::IIPCancelMessage& message) {
     protobuf::IIPCancelMessage proto;
@@ -19,8 +24,8 @@ boost::shared_ptr<const foundation::msg_svc::exchange::Message> IIPCancelMessage
     const protobuf::IIPCancelMessage& proto) {
     // The misspelling and the capital I are settled: peers and logs match the text.
     require(proto.has_iipid(), "Requied field is missing: protobuf::IIPCancelMessage.iipId");
-    return boost::make_shared<::cmddistributor::IIPCancelMessage>(IDTypeSerializer::fromProtobuf(proto.iipid()),
-                                                                  proto.evenifrunning());
+    return boost::make_shared<const ::cmddistributor::IIPCancelMessage>(IDTypeSerializer::fromProtobuf(proto.iipid()),
+                                                                        proto.evenifrunning());
 }
 
 }  // namespace krutil::protobuf_serializer

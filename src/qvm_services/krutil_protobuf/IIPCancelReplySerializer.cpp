@@ -6,7 +6,16 @@ namespace krutil::protobuf_serializer {
 
 using ::cmddistributor::IIPCancelReply;
 
-IIPCancelReplySerializer::IIPCancelReplySerializer() : TaggedSerializer("krutil:IIPCancelReply") {}
+namespace {
+
+// The serializer copies any number in both directions.
+static_assert(sizeof(IIPCancelReply::CancelStatus) == sizeof(protobuf::CancelStatus));
+
+const std::string registeredName = "krutil:IIPCancelReply";
+
+}  // namespace
+
+IIPCancelReplySerializer::IIPCancelReplySerializer() : TaggedSerializer(registeredName) {}
 
 protobuf::CancelStatus IIPCancelReplySerializer::toProtobuf(IIPCancelReply::CancelStatus status) {
     return sameNumberOrTerminate<protobuf::CancelStatus>(

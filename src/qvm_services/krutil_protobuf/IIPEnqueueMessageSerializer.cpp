@@ -6,8 +6,13 @@
 #include "FieldConversions.hpp"
 
 namespace krutil::protobuf_serializer {
+namespace {
 
-IIPEnqueueMessageSerializer::IIPEnqueueMessageSerializer() : TaggedSerializer("krutil:IIPEnqueueMessage") {}
+const std::string registeredName = "krutil:IIPEnqueueMessage";
+
+}  // namespace
+
+IIPEnqueueMessageSerializer::IIPEnqueueMessageSerializer() : TaggedSerializer(registeredName) {}
 
 protobuf::WhenToDequeue IIPEnqueueMessageSerializer::toProtobuf(cmddistributor::WhenToDequeue::WhenToDequeue mode) {
     return sameNumberOrTerminate<protobuf::WhenToDequeue>(

@@ -5,8 +5,13 @@
 #include "FieldConversions.hpp"
 
 namespace krutil::protobuf_serializer {
+namespace {
 
-IIPReplySerializer::IIPReplySerializer() : TaggedSerializer("krutil:IIPReply") {}
+const std::string registeredName = "krutil:IIPReply";
+
+}  // namespace
+
+IIPReplySerializer::IIPReplySerializer() : TaggedSerializer(registeredName) {}
 
 protobuf::IIPReply IIPReplySerializer::toProtobuf(const cmddistributor::IIPReply& reply, NestedWriter& nested) {
     protobuf::IIPReply proto;
@@ -24,7 +29,8 @@ boost::shared_ptr<const foundation::msg_svc::exchange::Reply> IIPReplySerializer
         result = nested.read<ResultFamily>(proto.resultid());
     }
     require(proto.has_id(), "Required field is missing: protobuf::IIPReply.id");
-    return boost::make_shared<cmddistributor::IIPReply>(IDTypeSerializer::fromProtobuf(proto.id()), std::move(result));
+    return boost::make_shared<const cmddistributor::IIPReply>(IDTypeSerializer::fromProtobuf(proto.id()),
+                                                              std::move(result));
 }
 
 }  // namespace krutil::protobuf_serializer

@@ -4,8 +4,13 @@
 #include "RuntimeExceptionConversions.hpp"
 
 namespace krutil::protobuf_serializer {
+namespace {
 
-IIPResultSerializer::IIPResultSerializer() : TaggedSerializer("krutil:IIPResult") {}
+const std::string registeredName = "krutil:IIPResult";
+
+}  // namespace
+
+IIPResultSerializer::IIPResultSerializer() : TaggedSerializer(registeredName) {}
 
 protobuf::IIPResult IIPResultSerializer::toProtobuf(const ::cmddistributor::IIPResult& result) {
     protobuf::IIPResult proto;

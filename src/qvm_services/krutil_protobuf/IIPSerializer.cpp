@@ -48,6 +48,7 @@ protobuf::IIP IIPSerializer::toProtobuf(const ::cmddistributor::IIP& iip) {
 
 boost::shared_ptr<const ::cmddistributor::IIP> IIPSerializer::fromProtobuf(const protobuf::IIP& proto) {
     // Unchecked on purpose: a stream number that only the peer knows does not stop the request.
+    static_assert(sizeof(::cmddistributor::IqmStreamID) == sizeof(protobuf::IqmStreamID));
     const auto streamID = static_cast<::cmddistributor::IqmStreamID>(proto.streamid());
     require(!proto.plugintype().empty(), "Required string field protobuf::IIP.pluginType is empty.");
     require(proto.has_outtraits(), "Required field protobuf::IIP.outTraits is missing.");

@@ -3,6 +3,7 @@
 
 #include <boost/make_shared.hpp>
 #include <string>
+#include <type_traits>
 
 #include "FieldConversions.hpp"
 #include "TaggedSerializer.hpp"
@@ -27,25 +28,28 @@ using LastEvent = DefaultIIPStateEvent<&IIPStateEventTypes::getLastEventType, Co
 /// The registered name of the kind with this number. Throws std::out_of_range for a number above 7.
 std::string stateEventName(std::size_t type);
 
-/// The number of each event class.
+template <protobuf::IIPStateEventType Number>
+using StateEventNumber = std::integral_constant<protobuf::IIPStateEventType, Number>;
+
+/// The number of each event class. Any other class has none, so a serializer of it does not compile.
 template <class EventT>
-inline constexpr protobuf::IIPStateEventType stateEventType = protobuf::IIPStateEventType(-1);
+struct StateEventType;
 template <>
-inline constexpr auto stateEventType<StartedEvent> = protobuf::IIPStartedEvent;
+struct StateEventType<StartedEvent> : StateEventNumber<protobuf::IIPStartedEvent> {};
 template <>
-inline constexpr auto stateEventType<SuspendedEvent> = protobuf::IIPSuspendedEvent;
+struct StateEventType<SuspendedEvent> : StateEventNumber<protobuf::IIPSuspendedEvent> {};
 template <>
-inline constexpr auto stateEventType<ResumedEvent> = protobuf::IIPResumedEvent;
+struct StateEventType<ResumedEvent> : StateEventNumber<protobuf::IIPResumedEvent> {};
 template <>
-inline constexpr auto stateEventType<DiscardedEvent> = protobuf::IIPDiscardedEvent;
+struct StateEventType<DiscardedEvent> : StateEventNumber<protobuf::IIPDiscardedEvent> {};
 template <>
-inline constexpr auto stateEventType<RequeuedEvent> = protobuf::IIPRequeuedEvent;
+struct StateEventType<RequeuedEvent> : StateEventNumber<protobuf::IIPRequeuedEvent> {};
 template <>
-inline constexpr auto stateEventType<ReactivatedEvent> = protobuf::IIPReactivatedEvent;
+struct StateEventType<ReactivatedEvent> : StateEventNumber<protobuf::IIPReactivatedEvent> {};
 template <>
-inline constexpr auto stateEventType<CompletedEvent> = protobuf::IIPCompletedEvent;
+struct StateEventType<CompletedEvent> : StateEventNumber<protobuf::IIPCompletedEvent> {};
 template <>
-inline constexpr auto stateEventType<LastEvent> = protobuf::LastIIPEvent;
+struct StateEventType<LastEvent> : StateEventNumber<protobuf::LastIIPEvent> {};
 
 /// Handles events of exactly the class `EventT`. The number on the wire is the serializer's own on the way out and is
 /// ignored on the way in: the frame's tag has settled the kind.
@@ -55,12 +59,12 @@ class IIPStateEventSerializer final
   public:
     IIPStateEventSerializer()
         : TaggedSerializer<IIPStateEventSerializer, EventFamily, EventT, protobuf::IIPStateEvent>(
-              stateEventName(static_cast<std::size_t>(stateEventType<EventT>))) {}
+              stateEventName(static_cast<std::size_t>(StateEventType<EventT>::value))) {}
 
     static protobuf::IIPStateEvent toProtobuf(const EventT& event) {
         protobuf::IIPStateEvent proto;
         *proto.mutable_id() = IDTypeSerializer::toProtobuf(event.getRequestId());
-        proto.set_type(stateEventType<EventT>);
+        proto.set_type(StateEventType<EventT>::value);
         return proto;
     }
 

@@ -1,28 +1,25 @@
 #include "IssuedEnabledWarningEventSerializer.hpp"
 
-#include <boost/make_shared.hpp>
-
-#include "FieldConversions.hpp"
-
 namespace krutil::protobuf_serializer {
 
 using korvel::lang::diagnostic::IssuedEnabledWarningEvent;
 
-IssuedEnabledWarningEventSerializer::IssuedEnabledWarningEventSerializer()
-    : TaggedSerializer("korvel:lang:diagnostic:IssuedEnabledWarningEvent") {}
+namespace {
+
+const std::string registeredName = "korvel:lang:diagnostic:IssuedEnabledWarningEvent";
+
+}  // namespace
+
+IssuedEnabledWarningEventSerializer::IssuedEnabledWarningEventSerializer() : TaggedSerializer(registeredName) {}
 
 protobuf::IssuedEnabledWarningEvent IssuedEnabledWarningEventSerializer::toProtobuf(
     const IssuedEnabledWarningEvent& event) {
-    protobuf::IssuedEnabledWarningEvent proto;
-    *proto.mutable_warningevent() = WarningConversions::eventToProtobuf(event);
-    return proto;
+    return WarningConversions::toProtobuf(event);
 }
 
 boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> IssuedEnabledWarningEventSerializer::fromProtobuf(
     const protobuf::IssuedEnabledWarningEvent& proto) {
-    const protobuf::IssuedWarningEvent& nested = proto.warningevent();
-    return boost::make_shared<IssuedEnabledWarningEvent>(IDTypeSerializer::fromProtobuf(nested.id()),
-                                                         WarningConversions::fromProtobuf(nested.warning()));
+    return WarningConversions::fromProtobuf(proto);
 }
 
 }  // namespace krutil::protobuf_serializer

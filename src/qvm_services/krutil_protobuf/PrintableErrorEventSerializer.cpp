@@ -6,8 +6,13 @@
 #include "RuntimeExceptionConversions.hpp"
 
 namespace krutil::protobuf_serializer {
+namespace {
 
-PrintableErrorEventSerializer::PrintableErrorEventSerializer() : TaggedSerializer("krutil:PrintableErrorEvent") {}
+const std::string registeredName = "krutil:PrintableErrorEvent";
+
+}  // namespace
+
+PrintableErrorEventSerializer::PrintableErrorEventSerializer() : TaggedSerializer(registeredName) {}
 
 protobuf::PrintableErrorEvent PrintableErrorEventSerializer::toProtobuf(const io::PrintableErrorEvent& event) {
     protobuf::PrintableErrorEvent proto;
@@ -21,8 +26,8 @@ boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> PrintableError
     const protobuf::PrintableErrorEvent& proto) {
     const auto id = IDTypeSerializer::fromProtobuf(proto.id());
     std::u16string text = utf8_to_ustring(proto.text());
-    return boost::make_shared<io::PrintableErrorEvent>(id, protobuf_serializer::fromProtobuf(proto.except()),
-                                                       std::move(text));
+    return boost::make_shared<const io::PrintableErrorEvent>(id, protobuf_serializer::fromProtobuf(proto.except()),
+                                                             std::move(text));
 }
 
 }  // namespace krutil::protobuf_serializer

@@ -14,6 +14,8 @@ namespace korveldata = foundation::korveldata;
 
 namespace {
 
+const std::string registeredName = "krutil:QDA";
+
 bool zeroCopyAllowed = true;
 std::once_flag environmentChecked;
 
@@ -27,7 +29,7 @@ void checkEnvironment() {
 }  // namespace
 
 QDASerializer::QDASerializer(const std::unordered_map<std::string, std::string>& features)
-    : ArrayFamily("krutil:QDA", typeid(korveldata::Array), {1U, 0U}), features_(features) {
+    : ArrayFamily(registeredName, typeid(korveldata::Array), {1U, 0U}), features_(features) {
     std::call_once(environmentChecked, checkEnvironment);
 }
 

@@ -3,8 +3,13 @@
 #include <boost/make_shared.hpp>
 
 namespace krutil::protobuf_serializer {
+namespace {
 
-QVMShutdownEventSerializer::QVMShutdownEventSerializer() : TaggedSerializer("krutil:QVMShutdownEvent") {}
+const std::string registeredName = "krutil:QVMShutdownEvent";
+
+}  // namespace
+
+QVMShutdownEventSerializer::QVMShutdownEventSerializer() : TaggedSerializer(registeredName) {}
 
 protobuf::QVMShutdownEvent QVMShutdownEventSerializer::toProtobuf() {
     return {};
@@ -12,7 +17,7 @@ protobuf::QVMShutdownEvent QVMShutdownEventSerializer::toProtobuf() {
 
 boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> QVMShutdownEventSerializer::fromProtobuf(
     const protobuf::QVMShutdownEvent& /*proto*/) {
-    return boost::make_shared<eventmgr::QVMShutdownEvent>();
+    return boost::make_shared<const eventmgr::QVMShutdownEvent>();
 }
 
 }  // namespace krutil::protobuf_serializer

@@ -1,7 +1,12 @@
 #include "SinkTextEventSerializer.hpp"
 
 namespace krutil::protobuf_serializer {
+namespace {
 
-SinkTextEventSerializer::SinkTextEventSerializer() : TextEventSerializer("krutil:SinkTextEvent") {}
+const std::string registeredName = "krutil:SinkTextEvent";
+
+}  // namespace
+
+SinkTextEventSerializer::SinkTextEventSerializer() : TextEventSerializer(registeredName) {}
 
 }  // namespace krutil::protobuf_serializer

@@ -1,7 +1,12 @@
 #include "TextBaseEventSerializer.hpp"
 
 namespace krutil::protobuf_serializer {
+namespace {
 
-TextBaseEventSerializer::TextBaseEventSerializer() : TextEventSerializer("krutil:TextBaseEvent") {}
+const std::string registeredName = "krutil:TextBaseEvent";
+
+}  // namespace
+
+TextBaseEventSerializer::TextBaseEventSerializer() : TextEventSerializer(registeredName) {}
 
 }  // namespace krutil::protobuf_serializer

@@ -25,7 +25,7 @@ class TextEventSerializer : public TaggedSerializer<Derived, EventFamily, EventT
     static boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> fromProtobuf(const ProtoMessage& proto) {
         const auto id = IDTypeSerializer::fromProtobuf(proto.id());
         const auto stream = StreamTypeSerializer::fromProtobuf(proto.stream());
-        return boost::make_shared<EventT>(id, stream, utf8_to_ustring(proto.text()));
+        return boost::make_shared<const EventT>(id, stream, utf8_to_ustring(proto.text()));
     }
 
   protected:

@@ -1,5 +1,6 @@
 #include "WarningConversions.hpp"
 
+#include <boost/make_shared.hpp>
 #include <boost/variant.hpp>
 #include <string>
 #include <vector>
@@ -20,6 +21,15 @@ struct SetValue : boost::static_visitor<> {
     void operator()(const std::u16string& value) const { proto.set_str(ustring_to_utf8(value)); }
     protobuf::PrintfArgument& proto;
 };
+
+// Both events become the same message; they have no base in common that has their two values.
+template <class EventT>
+protobuf::IssuedWarningEvent issuedWarning(const EventT& event) {
+    protobuf::IssuedWarningEvent proto;
+    *proto.mutable_id() = IDTypeSerializer::toProtobuf(event.getRequestId());
+    *proto.mutable_warning() = WarningConversions::toProtobuf(event.getWarning());
+    return proto;
+}
 
 }  // namespace
 
@@ -96,12 +106,28 @@ korvel::lang::diagnostic::Warning WarningConversions::fromProtobuf(const protobu
                                              proto.datenum());
 }
 
-protobuf::IssuedWarningEvent WarningConversions::toProtobuf(const foundation::msg_svc::exchange::IDType& id,
-                                                            const korvel::lang::diagnostic::Warning& warning) {
-    protobuf::IssuedWarningEvent proto;
-    *proto.mutable_id() = IDTypeSerializer::toProtobuf(id);
-    *proto.mutable_warning() = toProtobuf(warning);
+protobuf::IssuedWarningEvent WarningConversions::toProtobuf(const korvel::lang::diagnostic::IssuedWarningEvent& event) {
+    return issuedWarning(event);
+}
+
+boost::shared_ptr<const korvel::lang::diagnostic::IssuedWarningEvent> WarningConversions::fromProtobuf(
+    const protobuf::IssuedWarningEvent& proto) {
+    return boost::make_shared<const korvel::lang::diagnostic::IssuedWarningEvent>(
+        IDTypeSerializer::fromProtobuf(proto.id()), fromProtobuf(proto.warning()));
+}
+
+protobuf::IssuedEnabledWarningEvent WarningConversions::toProtobuf(
+    const korvel::lang::diagnostic::IssuedEnabledWarningEvent& event) {
+    protobuf::IssuedEnabledWarningEvent proto;
+    *proto.mutable_warningevent() = issuedWarning(event);
     return proto;
+}
+
+boost::shared_ptr<const korvel::lang::diagnostic::IssuedEnabledWarningEvent> WarningConversions::fromProtobuf(
+    const protobuf::IssuedEnabledWarningEvent& proto) {
+    const auto issued = fromProtobuf(proto.warningevent());
+    return boost::make_shared<const korvel::lang::diagnostic::IssuedEnabledWarningEvent>(issued->getRequestId(),
+                                                                                         issued->getWarning());
 }
 
 }  // namespace krutil::protobuf_serializer

@@ -1,6 +1,8 @@
 // Warnings, which both warning events carry.
 #pragma once
 
+#include <boost/shared_ptr.hpp>
+
 #include "korvel/lang/diagnostic/IssuedEnabledWarningEvent.hpp"
 #include "korvel/lang/diagnostic/IssuedWarningEvent.hpp"
 #include "krutil.protobuf.IssuedEnabledWarningEvent.pb.h"
@@ -25,15 +27,15 @@ class WarningConversions {
     static protobuf::Warning toProtobuf(const korvel::lang::diagnostic::Warning& warning);
     static korvel::lang::diagnostic::Warning fromProtobuf(const protobuf::Warning& proto);
 
-    /// The message that both events have in common; `EventT` is either.
-    template <class EventT>
-    static protobuf::IssuedWarningEvent eventToProtobuf(const EventT& event) {
-        return toProtobuf(event.getRequestId(), event.getWarning());
-    }
+    static protobuf::IssuedWarningEvent toProtobuf(const korvel::lang::diagnostic::IssuedWarningEvent& event);
+    static boost::shared_ptr<const korvel::lang::diagnostic::IssuedWarningEvent> fromProtobuf(
+        const protobuf::IssuedWarningEvent& proto);
 
-  private:
-    static protobuf::IssuedWarningEvent toProtobuf(const foundation::msg_svc::exchange::IDType& id,
-                                                   const korvel::lang::diagnostic::Warning& warning);
+    /// The message wraps the complete message of an issued warning, and the event is made of that one's values.
+    static protobuf::IssuedEnabledWarningEvent toProtobuf(
+        const korvel::lang::diagnostic::IssuedEnabledWarningEvent& event);
+    static boost::shared_ptr<const korvel::lang::diagnostic::IssuedEnabledWarningEvent> fromProtobuf(
+        const protobuf::IssuedEnabledWarningEvent& proto);
 };
 
 }  // namespace krutil::protobuf_serializer
