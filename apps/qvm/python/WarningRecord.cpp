@@ -78,7 +78,7 @@ Warning warningRecord(const PythonWarning& warning) {
     for (const py::handle& each : warning.stack) {
         stack.push_back(stackFrame(each));
     }
-    // The identifier's field takes bytes, and a peer stops reading at bytes that are not UTF-8.
+    // The identifier's field takes any bytes; a client shows them as UTF-8.
     return {msg_svc::protobuf::ustring_to_utf8(utf16Of(warning.identifier.ptr())),
             utf16Of(warning.format.ptr()),
             std::move(arguments),

@@ -212,6 +212,28 @@ TEST(WarningSerializerTest, TheTimeIsCopiedBitForBit) {
     }
 }
 
+// The messages are proto2, whose parser takes any bytes in a string field.
+TEST(WarningSerializerTest, AnIdentifierThatIsNoUtf8ArrivesIntactInBothEvents) {
+    const google::protobuf::LogSilencer silencer;
+    for (const std::string& identifier :
+         {std::string("\xFF"), std::string("a\xC3("), std::string("\xED\xA0\x80"), std::string("a\0\x80", 3)}) {
+        const Warning warning(identifier, u"f", {}, u"m", {{u"a", u"b", 3}}, true, 1);
+        const auto issued = IssuedWarningEventSerializer::toProtobuf(IssuedWarningEvent(IDType(1, 2), warning));
+        EXPECT_EQ(issued.warning().identifier(), identifier);
+        EXPECT_EQ(asEvent<IssuedWarningEvent>(
+                      readObject("korvel:lang:diagnostic:IssuedWarningEvent", issued.SerializeAsString()))
+                      .getWarning(),
+                  warning);
+        const auto enabled =
+            IssuedEnabledWarningEventSerializer::toProtobuf(IssuedEnabledWarningEvent(IDType(1, 2), warning));
+        EXPECT_EQ(
+            asEvent<IssuedEnabledWarningEvent>(readObject("korvel:lang:diagnostic:IssuedEnabledWarningEvent",
+                                                          enabled.SerializeAsString(), transport::FrameType::Control))
+                .getWarning(),
+            warning);
+    }
+}
+
 TEST(WarningSerializerTest, RequiredFieldsAreWrittenEvenWhenEmpty) {
     const wire::IssuedWarningEvent proto =
         IssuedWarningEventSerializer::toProtobuf(IssuedWarningEvent(IDType(), Warning("", u"", {}, u"", {}, false, 0)));

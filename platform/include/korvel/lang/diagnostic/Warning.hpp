@@ -16,7 +16,7 @@ class Warning {
     Warning(std::string identifier, std::u16string format, std::vector<PrintfArgument> arguments,
             std::u16string message, std::vector<StackFrame> stack, bool wasDisabled, double time);
 
-    /// Warning identifier, UTF-8.
+    /// Warning identifier, 8-bit text.
     const std::string& getIdentifier() const noexcept { return identifier_; }
     /// Format text before its arguments are put in.
     const std::u16string& getFormat() const noexcept { return format_; }
