@@ -37,14 +37,20 @@ class FEvalIIP : public IIP {
 
         const Arguments& arguments() const noexcept { return arguments_; }
         bool received() const noexcept { return received_; }
+        /// Engines that ask and that run the call; 0 on the side that asks.
+        krutil::contextmgr::QvmID clientQvmID() const noexcept { return clientQvmID_; }
+        krutil::contextmgr::QvmID serverQvmID() const noexcept { return serverQvmID_; }
 
         /// Moves the data form out and leaves no arguments. Throws boost::bad_get for the other form.
         std::vector<foundation::korveldata::Array> takeArrays();
 
       private:
-        Data(Arguments&& arguments, bool received);
+        Data(Arguments&& arguments, krutil::contextmgr::QvmID clientQvmID, krutil::contextmgr::QvmID serverQvmID,
+             bool received);
 
         Arguments arguments_;
+        krutil::contextmgr::QvmID clientQvmID_;
+        krutil::contextmgr::QvmID serverQvmID_;
         bool received_;
     };
 

@@ -35,16 +35,17 @@ namespace cmddistributor {
 using krutil::cmddistributor::EDIDataWrapper;
 using krutil::contextmgr::QvmID;
 
-FEvalIIP::Data::Data(Arguments&& arguments, bool received) : arguments_(std::move(arguments)), received_(received) {}
+FEvalIIP::Data::Data(Arguments&& arguments, QvmID clientQvmID, QvmID serverQvmID, bool received)
+    : arguments_(std::move(arguments)), clientQvmID_(clientQvmID), serverQvmID_(serverQvmID), received_(received) {}
 
 boost::shared_ptr<FEvalIIP::Data> FEvalIIP::Data::makeServerSideData(EDIDataWrapper&& arguments,
-                                                                     const QvmID& /*clientQvmID*/,
-                                                                     const QvmID& /*serverQvmID*/, bool received) {
-    return boost::shared_ptr<Data>(new Data(Arguments(std::move(arguments)), received));
+                                                                     const QvmID& clientQvmID, const QvmID& serverQvmID,
+                                                                     bool received) {
+    return boost::shared_ptr<Data>(new Data(Arguments(std::move(arguments)), clientQvmID, serverQvmID, received));
 }
 
 boost::shared_ptr<FEvalIIP::Data> FEvalIIP::Data::makeClientSideData(Arguments&& arguments) {
-    return boost::shared_ptr<Data>(new Data(std::move(arguments), false));
+    return boost::shared_ptr<Data>(new Data(std::move(arguments), 0, 0, false));
 }
 
 std::vector<foundation::korveldata::Array> FEvalIIP::Data::takeArrays() {

@@ -91,8 +91,11 @@ const std::map<std::string, std::vector<std::string>>& messages() {
     return expected;
 }
 
-const std::map<std::string, std::map<std::string, int>>& enums() {
-    static const std::map<std::string, std::map<std::string, int>> expected{
+// The values in the order of their declaration.
+using EnumValues = std::vector<std::pair<std::string, int>>;
+
+const std::map<std::string, EnumValues>& enums() {
+    static const std::map<std::string, EnumValues> expected{
         {"IIPStateEventType",
          {{"IIPStartedEvent", 0},
           {"IIPSuspendedEvent", 1},
@@ -133,8 +136,7 @@ const std::map<std::string, std::map<std::string, int>>& enums() {
           {"inCOMM_ERROR", 5}}},
         {"DebugLoopEvent.State", {{"PROTOBUF3_REQUIRED_ENUM_BASE", 0}, {"EXIT", 1}, {"ENTER", 2}}},
         {"InputRequester",
-         {{"mnNO_PROMPT", -1},
-          {"mnBASE_PROMPT", 0},
+         {{"mnBASE_PROMPT", 0},
           {"mnDEBUG_PROMPT", 1},
           {"mnINPUT_PROMPT", 2},
           {"mnKEYBOARD_PROMPT", 3},
@@ -145,7 +147,8 @@ const std::map<std::string, std::map<std::string, int>>& enums() {
           {"mnMORE_PROMPT", 8},
           {"mnEMERGENCY_EXIT_PROMPT", 9},
           {"mnTOLVARENS_DEBUG_PROMPT", 10},
-          {"mnTW_EQL_DEBUG_PROMPT", 11}}},
+          {"mnTW_EQL_DEBUG_PROMPT", 11},
+          {"mnNO_PROMPT", -1}}},
         {"CancelStatus",
          {{"UNABLE_TO_CANCEL_ALREADY_DONE", 0},
           {"UNABLE_TO_CANCEL_ALREADY_RUNNING", 1},
@@ -232,15 +235,15 @@ TEST(DescriptorPoolTest, EveryMessageIsFoundByItsFullNameWithItsFields) {
     }
 }
 
-TEST(DescriptorPoolTest, EveryEnumIsFoundByItsFullNameWithItsValues) {
+TEST(DescriptorPoolTest, EveryEnumIsFoundByItsFullNameWithItsValuesInTheirOrder) {
     for (const auto& [name, values] : enums()) {
         const EnumDescriptor* found = DescriptorPool::generated_pool()->FindEnumTypeByName("krutil.protobuf." + name);
         ASSERT_NE(found, nullptr) << name;
-        std::map<std::string, int> numbers;
+        EnumValues declared;
         for (int i = 0; i < found->value_count(); ++i) {
-            numbers[found->value(i)->name()] = found->value(i)->number();
+            declared.emplace_back(found->value(i)->name(), found->value(i)->number());
         }
-        EXPECT_EQ(numbers, values) << name;
+        EXPECT_EQ(declared, values) << name;
     }
 }
 

@@ -1,12 +1,22 @@
 #include "krutil_protobuf/serializers/AllocationRecorder.hpp"
 
 #include <algorithm>
+#include <cstddef>
+#include <cstdint>
 #include <cstdlib>
+#include <cstring>
 #include <new>
 
 namespace {
 
 thread_local AllocationRecorder* current = nullptr;
+
+// Stands before each allocation that is in use.
+struct alignas(std::max_align_t) Mark {
+    std::uint64_t value;
+};
+
+constexpr std::uint64_t inUse = 0x9E3779B97F4A7C15;
 
 }  // namespace
 
@@ -26,7 +36,8 @@ struct AllocationHooks {
                 recorder->lastArray_ = size;
             }
         }
-        return std::malloc(size != 0 ? size : 1);
+        void* memory = std::malloc(sizeof(Mark) + size);
+        return memory != nullptr ? new (memory) Mark{inUse} + 1 : nullptr;
     }
 
     static void* allocateOrThrow(std::size_t size, bool array) {
@@ -38,10 +49,15 @@ struct AllocationHooks {
     }
 
     static void release(void* memory) noexcept {
-        if (current != nullptr && memory != nullptr) {
+        if (memory == nullptr) {
+            return;
+        }
+        if (current != nullptr) {
             --current->outstanding_;
         }
-        std::free(memory);
+        Mark* mark = static_cast<Mark*>(memory) - 1;
+        mark->value = 0;
+        std::free(mark);
     }
 };
 
@@ -55,6 +71,12 @@ AllocationRecorder::~AllocationRecorder() {
 
 void AllocationRecorder::stop() noexcept {
     current = nullptr;
+}
+
+bool AllocationRecorder::beginsAt(const void* address) noexcept {
+    std::uint64_t value = 0;
+    std::memcpy(&value, static_cast<const char*>(address) - sizeof(Mark), sizeof(value));
+    return value == inUse;
 }
 
 void* operator new(std::size_t size) {

@@ -31,6 +31,11 @@ class AllocationRecorder {
     /// Allocations without their release, and releases of older ones counted down.
     long outstanding() const noexcept { return outstanding_; }
 
+    /// Whether an allocation of this program begins at `address`, recorded or not. An object of its own begins one; an
+    /// object that shares its memory with a reference count does not. `address` must be that of a whole object on the
+    /// heap.
+    static bool beginsAt(const void* address) noexcept;
+
     /// Whether the chosen allocation was reached and failed.
     bool failed() const noexcept { return failed_; }
 

@@ -104,6 +104,17 @@ TYPED_TEST(StateEventTest, AMessageWithoutIdentifierHasThatOfTheEmptyMessage) {
     EXPECT_EQ(dynamic_cast<const TypeParam&>(*event).getRequestId(), IDType());
 }
 
+// A class of the same template that is none of the eight has no number, and so no serializer.
+template <class Event>
+concept HasNumber = requires {
+    krutil::protobuf_serializer::StateEventType<Event>::value;
+};
+static_assert(HasNumber<cmddistributor::IIPStartedEvent>);
+static_assert(HasNumber<cmddistributor::LastIIPEvent>);
+static_assert(!HasNumber<cmddistributor::IIPStateEvent>);
+static_assert(!HasNumber<cmddistributor::DefaultIIPStateEvent<&cmddistributor::IIPStateEventTypes::getLastEventType,
+                                                              cmddistributor::IIPStateEvent>>);
+
 TEST(StateEventTypeTest, NumbersRunFromZeroInTheOrderOfTheKinds) {
     using namespace cmddistributor;
     const IDType id(1, 2);

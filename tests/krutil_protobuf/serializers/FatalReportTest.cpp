@@ -123,6 +123,13 @@ TEST_F(FatalReportDeathTest, LoopStatesAndLoopsOfThisProcess) {
     }
 }
 
+TEST_F(FatalReportDeathTest, TheStateOfALoopIsWrittenBeforeTheLoop) {
+    const cmddistributor::DebugLoopEvent event(foundation::msg_svc::exchange::IDType(),
+                                               static_cast<cmddistributor::DebugLoopEvent::State>(3),
+                                               static_cast<krutil::prompt::InputRequester>(12));
+    EXPECT_FATAL(DebugLoopEventSerializer::toProtobuf(event), loopStateOut);
+}
+
 TEST_F(FatalReportDeathTest, CheckedCancelStatuses) {
     using cmddistributor::IIPCancelReply;
     for (const int number : {4, 7, -1}) {

@@ -127,7 +127,7 @@ class ArraysTest : public testing::Test {
     SerializationContext context_;
 };
 
-// ---- The array routines ---------------------------------------------------------------------------------------------
+// ---- Nested arrays --------------------------------------------------------------------------------------------------
 
 class NestedArraysTest : public ArraysTest {
   protected:
@@ -165,6 +165,13 @@ TEST_F(NestedArraysTest, NoDataIDsAreNoArraysWhateverTheMessageHolds) {
 TEST_F(NestedArraysTest, ArraysAreReadInTheOrderOfTheirIDs) {
     const auto message = transport::makeMessage(framesOf({small(1), small(2), small(3)}));
     EXPECT_EQ(read(ids({3, 1, 2}), message), (std::vector<Array>{small(3), small(1), small(2)}));
+}
+
+TEST_F(NestedArraysTest, ADataIDOf0IsAnIndexLikeAnyOther) {
+    auto given = framesOf({small(1), small(2)});
+    given[0].index = 0;
+    EXPECT_EQ(read(ids({0, 2}), transport::makeMessage(given)), (std::vector<Array>{small(1), small(2)}));
+    EXPECT_EQ(read(ids({2, 0}), transport::makeMessage(given)), (std::vector<Array>{small(2), small(1)}));
 }
 
 TEST_F(NestedArraysTest, WithoutASerializerOfArraysWritingIsOutOfRangeEvenWithoutArrays) {
@@ -306,6 +313,24 @@ TEST_F(FEvalIIPTest, ThreeSmallArgumentsGivenIndex10) {
     EXPECT_EQ(argumentsOf(*read(received(), 13)), (std::vector<Array>{small(1), small(2), small(3)}));
 }
 
+TEST_F(FEvalIIPTest, AnArgumentGivenIndex0) {
+    EXPECT_EQ(write(call({small(1)}), 0), 2U);
+    EXPECT_EQ(dataIDs(written()), (std::vector<std::uint64_t>{0}));
+    EXPECT_EQ(argumentsOf(*read(received(), 1)), (std::vector<Array>{small(1)}));
+}
+
+// The arguments are written before the function is looked at.
+TEST_F(FEvalIIPTest, AFunctionGivenAsAnArrayThrowsAndItsArgumentsStayInTheStream) {
+    const auto request =
+        boost::make_shared<const FEvalIIP>("console", std::make_shared<Array>(small(7)), 2,
+                                           FEvalIIP::Data::makeClientSideData(EDIDataWrapper({large(), small(1)})),
+                                           IqmStreamID::ekIqmJavaStream, outTraits, errTraits, 3, 4, true);
+    EXPECT_THROW(write(request, 1), boost::bad_get);
+    EXPECT_EQ(indexes(frames()), (std::vector<FrameIndex>{1, 2, 3}));
+    EXPECT_EQ(transport::contentOf(*frames()[1]).tag, "krutil:QDA");
+    EXPECT_EQ(transport::contentOf(*frames()[2]).tag, "krutil:QDA");
+}
+
 TEST_F(FEvalIIPTest, DataFramesOfArgumentsStandBeforeTheirArrays) {
     EXPECT_EQ(write(call({large(), large(5000)}), 5), 10U);
     EXPECT_EQ(indexes(frames()), (std::vector<FrameIndex>{5, 6, 7, 8, 9}));
@@ -338,6 +363,8 @@ TEST_F(FEvalIIPTest, TheRebuiltRequestTakesFourValuesFromItsCore) {
     EXPECT_EQ(back->getQvmID(), 4U);
     EXPECT_FALSE(back->isLocal());
     EXPECT_TRUE(back->getData()->received());
+    EXPECT_EQ(back->getData()->clientQvmID(), 3U);
+    EXPECT_EQ(back->getData()->serverQvmID(), 4U);
 }
 
 TEST_F(FEvalIIPTest, OtherContentOfTheCoreIsReadAndLeftBehind) {
@@ -570,6 +597,12 @@ TEST_F(FEvalResultTest, TwoSmallOutputsGivenIndex3) {
     EXPECT_EQ(indexes(frames()), (std::vector<FrameIndex>{3, 4, 5}));
     EXPECT_EQ(dataIDs(written()), (std::vector<std::uint64_t>{3, 4}));
     EXPECT_EQ(arraysOf(*read(received(), 5)), (std::vector<Array>{small(1), small(2)}));
+}
+
+TEST_F(FEvalResultTest, AnOutputGivenIndex0) {
+    EXPECT_EQ(write(outputs({small(1)}), 0), 2U);
+    EXPECT_EQ(dataIDs(written()), (std::vector<std::uint64_t>{0}));
+    EXPECT_EQ(arraysOf(*read(received(), 1)), (std::vector<Array>{small(1)}));
 }
 
 TEST_F(FEvalResultTest, OutputsAreLentToTheirFramesAndReceivedInPlace) {

@@ -128,6 +128,9 @@ TEST_F(IIPEnqueueMessageTest, TheRequestIsWrittenFirstAndReferredToByItsIndex) {
     EXPECT_EQ(written[1].index, 1U);
     EXPECT_EQ(written[1].type, FrameType::Control);
     EXPECT_EQ(parsed<wire::IIPEnqueueMessage>(*stream_->frames[1]).iiphandle(), 0U);
+    // A handle of 0 is an index like any other.
+    const auto back = read(transport::makeMessage(written), 1);
+    EXPECT_EQ(dynamic_cast<const EvalIIP&>(*back->getIIP()).getCommand(), u"1");
 }
 
 TEST_F(IIPEnqueueMessageTest, TheHandleIsTheLastFrameOfARequestThatNeedsSeveral) {

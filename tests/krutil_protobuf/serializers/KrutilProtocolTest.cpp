@@ -10,8 +10,15 @@
 #include <cstring>
 #include <set>
 #include <stdexcept>
+#include <type_traits>
 
+#include "CapabilitiesChangedSerializer.hpp"
 #include "Families.hpp"
+#include "IIPEnqueueMessageSerializer.hpp"
+#include "QDASerializer.hpp"
+#include "QVMShutdownEventSerializer.hpp"
+#include "TextBaseEventSerializer.hpp"
+#include "krutil_protobuf/serializers/AllocationRecorder.hpp"
 #include "krutil_protobuf/support/TestTransport.hpp"
 
 namespace {
@@ -40,6 +47,7 @@ using foundation::msg_svc::transport::layers::session::FeatureHandling;
 using foundation::msg_svc::transport::layers::session::FeatureRequest;
 using krutil::protobuf::KrutilProtocol;
 using krutil::protobuf_serializer::EventFamily;
+using krutil::protobuf_serializer::QDASerializer;
 using transport::Registry;
 using transport::SerializerBase;
 using Version = std::pair<unsigned int, unsigned int>;
@@ -119,10 +127,58 @@ TEST(KrutilProtocolDeathTest, TheZeroCopyVariableIsReadOnceAndNotForOtherVersion
     EXPECT_EXIT(std::_Exit(checkReadsOfTheVariable()), testing::ExitedWithCode(0), "");
 }
 
+// The array serializer reads the variable when it is made.
+int checkSerializersAreMadeOneAtATime() {
+    const int before = zeroCopyReads;
+    const auto refusedAt = [](const char* name) {
+        const auto registry = std::make_shared<Registry>();
+        registry->insert(std::make_shared<OccupyingSerializer>(name));
+        try {
+            KrutilProtocol::protocolInitializer(registry, current, features);
+        } catch (const std::invalid_argument&) {
+            return true;
+        }
+        return false;
+    };
+    // Those before it in the table: it is not made.
+    if (!refusedAt("krutil:QVMShutdownEvent") || !refusedAt("krutil:FEvalResult") || zeroCopyReads != before) {
+        return 1;
+    }
+    return refusedAt("krutil:QDA") && zeroCopyReads == before + 1 ? 0 : 2;
+}
+
+TEST(KrutilProtocolDeathTest, ASerializerIsMadeWhenThoseBeforeItAreInserted) {
+    testing::FLAGS_gtest_death_test_style = "threadsafe";
+    EXPECT_EXIT(std::_Exit(checkSerializersAreMadeOneAtATime()), testing::ExitedWithCode(0), "");
+}
+
 TEST(KrutilProtocolTest, TheVersionIsReturned) {
     const auto registry = std::make_shared<Registry>();
     EXPECT_EQ(KrutilProtocol::protocolInitializer(registry, current, features), current);
     EXPECT_FALSE(registry->serializers().empty());
+}
+
+TEST(KrutilProtocolTest, TheArraySerializerGetsACopyOfTheSettledFeatures) {
+    const auto registry = std::make_shared<Registry>();
+    std::unordered_map<std::string, std::string> settled{{"ZEROCOPY", "disable"}, {"OTHER", "x"}};
+    const auto expected = settled;
+    KrutilProtocol::protocolInitializer(registry, current, settled);
+    settled.clear();
+    EXPECT_EQ(dynamic_cast<const QDASerializer&>(*registry->find("krutil:QDA")).features(), expected);
+}
+
+// A registered name is an object of the library, so making a serializer copies it, and makes no other string.
+TEST(KrutilProtocolTest, NamesOfSerializersExistBeforeTheSerializers) {
+    const auto allocations = []<class Serializer>(std::type_identity<Serializer>) {
+        const AllocationRecorder recorder;
+        const Serializer serializer;
+        return recorder.allocations();
+    };
+    using namespace krutil::protobuf_serializer;
+    EXPECT_EQ(allocations(std::type_identity<QVMShutdownEventSerializer>()), 1U);
+    EXPECT_EQ(allocations(std::type_identity<IIPEnqueueMessageSerializer>()), 1U);
+    EXPECT_EQ(allocations(std::type_identity<TextBaseEventSerializer>()), 1U);
+    EXPECT_EQ(allocations(std::type_identity<CapabilitiesChangedSerializer>()), 1U);
 }
 
 TEST(KrutilProtocolTest, EachRegistryGetsSerializersOfItsOwn) {

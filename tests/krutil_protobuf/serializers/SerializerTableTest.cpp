@@ -29,6 +29,7 @@
 #include "krutil/io/PrintableErrorEvent.hpp"
 #include "krutil/io/SinkTextEvent.hpp"
 #include "krutil/io/TextBaseEvent.hpp"
+#include "krutil_protobuf/serializers/AllocationRecorder.hpp"
 #include "krutil_protobuf/support/TestTransport.hpp"
 #include "samples/Samples.hpp"
 
@@ -267,6 +268,27 @@ TEST_P(SerializerTest, HandlesItsTypeAtVersionOneZero) {
 TEST_P(SerializerTest, SamplesComeBackEqual) {
     for (const samples::Sample& sample : set().samples) {
         EXPECT_EQ(describe(read(write(sample.object))), expected(sample.object)) << sample.name;
+    }
+}
+
+// Where an object begins that is shared; null for one that is not.
+struct SharedAddress {
+    const void* operator()(const foundation::korveldata::Array& /*value*/) const { return nullptr; }
+    const void* operator()(const std::unique_ptr<cmddistributor::IIPResult>& /*owned*/) const { return nullptr; }
+    template <class T>
+    const void* operator()(const boost::shared_ptr<T>& shared) const {
+        return dynamic_cast<const void*>(shared.get());
+    }
+};
+
+// An object that several share is made together with its reference count, in one allocation. One type is not: its
+// memory goes with its last owner, even if a weak reference stays.
+TEST_P(SerializerTest, SharedObjectsLieInOneAllocationWithTheirCount) {
+    for (const samples::Sample& sample : set().samples) {
+        const Object back = read(write(sample.object));
+        if (const void* address = std::visit(SharedAddress(), back)) {
+            EXPECT_EQ(AllocationRecorder::beginsAt(address), GetParam() == "krutil:IIPCancelReply") << sample.name;
+        }
     }
 }
 

@@ -151,6 +151,18 @@ TEST(TaggedFramingTest, AnEmptyMessageIsAFrameOfLengthZeroAndReadsBackEmpty) {
     EXPECT_EQ(parsed.ByteSizeLong(), 0U);
 }
 
+TEST(TaggedFramingTest, TheFrameOfAnEmptyMessageHasABufferOfLengthZero) {
+    const auto stream = std::make_shared<RecordingStream>();
+    AllocationRecorder recorder;
+    writeTaggedFrame(krutil::protobuf::QVMShutdownEvent(), "t", 7, 1, stream, FrameType::Object);
+    recorder.stop();
+    EXPECT_EQ(recorder.arrays(), 1U);
+    EXPECT_EQ(recorder.lastArray(), 0U);
+    const FrameBuffer buffer = stream->frames.at(0)->releaseBuffer();
+    EXPECT_NE(buffer.first, nullptr);
+    EXPECT_EQ(buffer.second, 0U);
+}
+
 TEST(TaggedFramingTest, TwoSerializersInSequenceUseConsecutiveIndexes) {
     const auto registry = transport::sessionRegistry();
     const auto stream = std::make_shared<RecordingStream>();
@@ -206,6 +218,17 @@ TEST(TaggedFramingTest, AsksForTheSizeOnceAndSerializesOnce) {
     write(proto, stream);
     EXPECT_EQ(proto.sizeCalls, 1);
     EXPECT_EQ(proto.writeCalls, 1);
+}
+
+TEST(TaggedFramingTest, WhatWasWrittenIsNotCheckedAgain) {
+    // More than there is room for: the stream over the buffer notes an error, which nobody asks for. And less.
+    for (const std::size_t written : {8U, 2U}) {
+        const auto stream = std::make_shared<RecordingStream>();
+        const OutgoingMessage proto{5, written};
+        EXPECT_EQ(write(proto, stream), 4U) << written;
+        ASSERT_EQ(stream->frames.size(), 1U) << written;
+        EXPECT_EQ(stream->frames[0]->size(), 5U) << written;
+    }
 }
 
 TEST(TaggedFramingTest, AllocatesOneBufferOfExactlyTheSizeAndSerializesIntoIt) {
