@@ -48,6 +48,19 @@ TEST(EngineSignalTest, InterruptEndsAnEngineThatHasNoSessionYet) {
     ::close(connection);
 }
 
+TEST(EngineSignalTest, InterruptThatIsIgnoredAtTheStartStaysIgnored) {
+    // As the client starts its engine.
+    const auto before = ::signal(SIGINT, SIG_IGN);
+    EngineSession engine;
+    ::signal(SIGINT, before);
+    const Evaluation result = engine.client.eval(
+        "import os, signal\n"
+        "os.kill(os.getpid(), signal.SIGINT)\n"
+        "print('on')");
+    EXPECT_FALSE(result.error);
+    EXPECT_EQ(result.output(), "on\n");
+}
+
 TEST(EngineSignalTest, BrokenPipesAreIgnored) {
     EngineSession engine;
     engine.client.eval("1");
