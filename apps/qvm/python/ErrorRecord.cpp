@@ -46,8 +46,7 @@ class Builder {
         take(kFixedBytes);
         std::string name = typeName(exception);
         std::u16string text = message(exception, name);
-        std::vector<StackFrame> frames = stack(exception);
-        std::string function = frames.empty() ? std::string() : frames.back().func;
+        Stack frames = stack(exception);
         std::vector<RuntimeException> causes;
         if (depth < bounds_.depth) {
             for (const py::object& cause : causesOf(exception)) {
@@ -60,11 +59,21 @@ class Builder {
             }
             causes.shrink_to_fit();
         }
-        return {status, std::move(text), std::move(name), std::move(function), std::move(frames), std::move(causes),
+        return {status,
+                std::move(text),
+                std::move(name),
+                std::move(frames.innermostFunction),
+                std::move(frames.entries),
+                std::move(causes),
                 false};
     }
 
   private:
+    struct Stack {
+        std::vector<StackFrame> entries;  // with a note where frames are left out
+        std::string innermostFunction;    // empty when that frame is among those
+    };
+
     std::size_t take(std::size_t bytes) noexcept {
         const std::size_t taken = std::min(bytes, left_);
         left_ -= taken;
@@ -151,7 +160,7 @@ class Builder {
         return bounded(text.ptr(), bounds_.textBytes);
     }
 
-    std::vector<StackFrame> stack(PyObject* exception) {
+    Stack stack(PyObject* exception) {
         std::vector<PyTracebackObject*> entries;
         const py::object first = owned(PyException_GetTraceback(exception));
         for (auto* entry = reinterpret_cast<PyTracebackObject*>(first.ptr()); entry != nullptr;
@@ -175,11 +184,17 @@ class Builder {
             frames.push_back(frame(entries[i]));
         }
         const std::size_t missing = entries.size() - frames.size() - tail.size();
+        std::string function;
+        if (!tail.empty()) {
+            function = tail.front().func;
+        } else if (missing == 0 && !frames.empty()) {
+            function = frames.back().func;
+        }
         if (missing > 0) {
             frames.push_back({u"", "(" + std::to_string(missing) + " frames left out)", 0});
         }
         std::move(tail.rbegin(), tail.rend(), std::back_inserter(frames));
-        return frames;
+        return {std::move(frames), std::move(function)};
     }
 
     StackFrame frame(PyTracebackObject* entry) {

@@ -348,6 +348,17 @@ TEST(ErrorLimitTest, ErrorIsCutToWhatTheClientAccepts) {
     EXPECT_THAT(result.errorText(), StartsWith("xxx"));
 }
 
+TEST(ErrorLimitTest, ANoteAboutFramesIsNoFunction) {
+    session::Limits limits;
+    limits.taggedFrame = 4096;
+    EngineSession engine({}, limits);
+    // The text alone takes what an error may hold.
+    const Evaluation result = engine.client.eval("raise ValueError('x' * 100000)");
+    ASSERT_TRUE(result.error);
+    EXPECT_THAT(framesOf(*result.error), ElementsAre(":0 (1 frames left out)"));
+    EXPECT_EQ(result.error->getFunctionName(), "");
+}
+
 TEST(ErrorLimitTest, ResultThatCannotBeSentIsReplacedByOneThatSaysWhy) {
     session::Limits limits;
     limits.taggedFrame = 300;
