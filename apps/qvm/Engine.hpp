@@ -7,16 +7,11 @@
 // stack. docs/protocol.md tells the order of everything.
 #pragma once
 
-#include <condition_variable>
-#include <cstddef>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <thread>
-#include <vector>
 
-#include "cmddistributor/DebugLoopEvent.hpp"
 #include "cmddistributor/IIPCancelMessage.hpp"
 #include "cmddistributor/IIPEnqueueMessage.hpp"
 #include "cmddistributor/IIPResult.hpp"
@@ -28,8 +23,10 @@
 #include "qvm/process/OwnDescriptors.hpp"
 #include "qvm/python/EngineServices.hpp"
 #include "qvm/python/Interpreter.hpp"
+#include "qvm/requests/Announcer.hpp"
 #include "qvm/requests/Cancellation.hpp"
 #include "qvm/requests/Capabilities.hpp"
+#include "qvm/requests/Prompts.hpp"
 #include "qvm/requests/Request.hpp"
 #include "qvm/requests/RequestQueue.hpp"
 #include "qvm/requests/TextOutput.hpp"
@@ -46,7 +43,9 @@ enum class ExitCode : int {
 };
 
 /// See the head of this file.
-class Engine : private foundation::msg_svc::transport::layers::session::SessionHandler, private EngineServices {
+class Engine : private foundation::msg_svc::transport::layers::session::SessionHandler,
+               private EngineServices,
+               private PromptHost {
   public:
     /// `options` and `log` must outlive the object. Throws std::system_error when a file of the options cannot be
     /// opened.
@@ -67,8 +66,8 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
                  const boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent>& event) override;
     void onGoodbye() override;
     void onEnd(const SessionEnd& end) override;
-    void enqueue(framing::StreamID stream, const boost::shared_ptr<const cmddistributor::IIPEnqueueMessage>& message);
-    void cancel(framing::StreamID stream, const cmddistributor::IIPCancelMessage& message);
+    void enqueue(Announcer::Turn& turn, const Request& request);
+    void cancel(Announcer::Turn& turn, framing::StreamID stream, const cmddistributor::IIPCancelMessage& message);
 
     bool canUse(::capabilities::Capability capability) override;
     PromptEnd prompt(krutil::prompt::InputRequester loop, PyObject* frame,
@@ -82,69 +81,37 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
     bool repeatInterrupt() override;
     bool drainDescriptors() override;
 
-    // A prompt that holds up the request on top of the others.
-    struct Prompt {
-        const Request& outer;
-        DequeuePoint point;
-        PyObject* frame = nullptr;
-        std::u16string* text = nullptr;  // of the answer, at an input prompt
-        RequestQueue::Deadline deadline{};
-        std::optional<PromptEnd> end{};
-    };
+    bool interrupted() override;
+    void unlocked(const std::function<void()>& wait) override;
+    void settle() override;
 
+    bool open(int in, int out);
     void serve();
     void loop();
     std::optional<Request> next();
     bool handle(const Request& request, PyObject* frame);
-    std::unique_ptr<cmddistributor::IIPResult> runCode(const Request& request, PyObject* frame, bool& exit);
-    bool refused(const Request& request);
-    PromptEnd hold(Prompt& prompt, krutil::prompt::InputRequester loop);
-    PromptEnd attend(Prompt& prompt);
-    void answer(Prompt& prompt, const Request& request);
-    bool interrupted();
+    Interpreter::Ending runCode(const Request& request, PyObject* frame);
     void checkDescriptors();
-    void settle();
-    const Request* current() const noexcept;
-    void echo(const Request& request);
-    void refuse(const Request& request, const std::string& why, Session::Urgency urgency);
-    void discard(const Request& request, cmddistributor::RuntimeException error, Session::Urgency urgency);
-    void reply(const Request& request, std::unique_ptr<cmddistributor::IIPResult> result, Session::Urgency urgency);
-    bool publish(framing::StreamID stream,
-                 const boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent>& event,
-                 Session::Urgency urgency = Session::Urgency::Output) noexcept;
-    void emitText(const TextTarget& target, std::u16string text) noexcept;
-    RecordBounds recordBounds() const noexcept;
-
-    template <class EventT>
-    void raise(const Request& request, Session::Urgency urgency = Session::Urgency::Output) noexcept;
-    template <class EventT>
-    bool raiseWarning(const korvel::lang::diagnostic::Warning& warning);
+    const Request* requestOfThisThread() const noexcept;
+    void echo(const cmddistributor::EvalIIP& evaluation);
 
     const Options& options_;
     Log& log_;
+    const std::thread::id mainThread_ = std::this_thread::get_id();
+    ExitCode exitCode_ = ExitCode::Ok;  // of the I/O thread, until close() has joined it
     AppendFile diary_;
     RequestQueue queue_;
+    Cancellation cancellation_;
+    Capabilities capabilities_;
+
+    // Of one session, in the order in which they are made.
     std::unique_ptr<Session> session_;
+    std::unique_ptr<Announcer> announcer_;
     std::unique_ptr<TextOutput> output_;
+    std::unique_ptr<Prompts> prompts_;
     std::unique_ptr<OutputCapture> capture_;
     std::unique_ptr<Interpreter> python_;
     std::optional<OwnDescriptors> descriptors_;
-
-    const std::thread::id mainThread_ = std::this_thread::get_id();
-    Cancellation cancellation_;
-    Capabilities capabilities_;
-    // Of the main thread. Each prompt holds up a request of the stack; the topmost may run or be held up.
-    std::vector<const Request*> running_;
-    std::vector<Prompt*> prompts_;
-
-    // Guards the members below. While it is held, each request is either in the queue, or among the running ones, or
-    // has ended; so a cancel finds it.
-    std::mutex exchangeMutex_;
-    std::condition_variable exchangeChanged_;
-    bool shutdownSent_ = false;  // nothing may follow the shutdown event
-    bool leaving_ = false;       // the thread of run() is done with Python
-    bool sessionOver_ = false;   // and its descriptors are closed
-    ExitCode exitCode_ = ExitCode::Ok;
 };
 
 }  // namespace qvm

@@ -23,15 +23,14 @@ namespace qvm {
 namespace {
 
 using capabilities::Capability;
-using foundation::msg_svc::transport::layers::session::Session;
 using krutil::prompt::InputRequester;
 
 TextOutput* output = nullptr;
-Session* session = nullptr;
+Announcer* announcer = nullptr;
 EngineServices* services = nullptr;
 
 // Code points that are taken out of one long text at a time, with a look at the session's room after each.
-constexpr std::size_t kPiecePoints = 16'384;
+constexpr std::size_t piecePoints = 16'384;
 
 [[noreturn]] void raise(PyObject* type, const char* text = "") {
     PyErr_SetString(type, text);
@@ -44,7 +43,7 @@ void waitForRoom() {
     bool room = false;
     {
         py::gil_scoped_release unlocked;
-        room = session->waitForRoom(interrupt);
+        room = announcer->waitForRoom(interrupt);
     }
     if (!room && services->takeInterrupt()) {
         raise(PyExc_KeyboardInterrupt);
@@ -60,7 +59,7 @@ class PlainStream {
     void write(PyObject* text) {
         held_ += msg_svc::protobuf::ustring_to_utf8(utf16Of(text));
         const std::size_t lines = held_.rfind('\n') + 1;
-        const std::size_t ready = lines == 0 && held_.size() >= kHeldBytes ? held_.size() : lines;
+        const std::size_t ready = lines == 0 && held_.size() >= heldBytes ? held_.size() : lines;
         posix::writeFully(descriptor_, std::string_view(held_).substr(0, ready));
         held_.erase(0, ready);
     }
@@ -71,7 +70,7 @@ class PlainStream {
     }
 
   private:
-    static constexpr std::size_t kHeldBytes = 8192;
+    static constexpr std::size_t heldBytes = 8192;
 
     const int descriptor_;
     std::string held_;
@@ -95,8 +94,8 @@ std::size_t write(TextSource source, const py::object& text) {
     if (services->drainDescriptors()) {
         waitForRoom();
     }
-    for (std::size_t begin = 0; begin < length; begin += kPiecePoints) {
-        if (output->write(source, utf16Of(text.ptr(), begin, kPiecePoints))) {
+    for (std::size_t begin = 0; begin < length; begin += piecePoints) {
+        if (output->write(source, utf16Of(text.ptr(), begin, piecePoints))) {
             waitForRoom();
         }
     }
@@ -170,8 +169,8 @@ const char* pausePrompt(const std::optional<double>& seconds) {
     require(Capability::InteractiveCommandLine);
     std::optional<std::chrono::steady_clock::time_point> deadline;
     // What lies beyond a lifetime is no deadline, and would not fit either.
-    constexpr double kForever = 1e9;
-    if (seconds && *seconds < kForever) {
+    constexpr double forever = 1e9;
+    if (seconds && *seconds < forever) {
         deadline = std::chrono::steady_clock::now() + std::chrono::duration_cast<std::chrono::steady_clock::duration>(
                                                           std::chrono::duration<double>(*seconds > 0 ? *seconds : 0));
     }
@@ -185,9 +184,7 @@ py::object readLine() {
         return py::str("");
     }
     const PromptEnd end = services->readText(text);
-    if (end == PromptEnd::Raised) {
-        throw py::error_already_set();
-    }
+    nameOf(end);
     if (end != PromptEnd::Continued) {
         return py::str("");
     }
@@ -245,10 +242,10 @@ PYBIND11_EMBEDDED_MODULE(_qvm, module) {
     module.def("set_debugging", &setDebugging);
 }
 
-void installEngineModule(TextOutput& textOutput, Session& engineSession, EngineServices& engineServices) {
+void installEngineModule(TextOutput& textOutput, Announcer& engineAnnouncer, EngineServices& engineServices) {
     // The macro above has entered the module into Python's table when the program was loaded.
     output = &textOutput;
-    session = &engineSession;
+    announcer = &engineAnnouncer;
     services = &engineServices;
 }
 

@@ -1,15 +1,14 @@
 // The module _qvm: what the engine's Python code calls in the engine.
 #pragma once
 
-#include "foundation/msg_svc/transport/layers/session/Session.hpp"
 #include "qvm/python/EngineServices.hpp"
+#include "qvm/requests/Announcer.hpp"
 #include "qvm/requests/TextOutput.hpp"
 
 namespace qvm {
 
 /// Makes the module importable; call before Python is initialised. The objects must live as long as Python code may
 /// run, threads of that code included.
-void installEngineModule(TextOutput& output, foundation::msg_svc::transport::layers::session::Session& session,
-                         EngineServices& services);
+void installEngineModule(TextOutput& output, Announcer& announcer, EngineServices& services);
 
 }  // namespace qvm

@@ -10,21 +10,13 @@
 #include "capabilities/Capability.hpp"
 #include "korvel/lang/diagnostic/Warning.hpp"
 #include "krutil/prompt/InputRequester.hpp"
+#include "qvm/requests/Prompts.hpp"
 
 namespace qvm {
 
-/// How a prompt ended.
-enum class PromptEnd {
-    Continued,   ///< the code goes on: it was answered, or told to
-    Quit,        ///< the code is to be ended
-    Exit,        ///< the session is to be ended
-    EndOfInput,  ///< there will be no answer
-    Withdrawn,   ///< the client cannot be asked any more
-    Raised,      ///< a Python exception is set
-};
-
 /// Calls come from Python code and hold the interpreter lock; they never come in a forked child. prompt(), readText(),
-/// takeInterrupt() and repeatInterrupt() are for the main thread, the rest for any.
+/// takeInterrupt() and repeatInterrupt() are for the main thread, the rest for any. What they send may be more than the
+/// client reads: the caller waits for room afterwards.
 class EngineServices {
   public:
     virtual ~EngineServices() = default;

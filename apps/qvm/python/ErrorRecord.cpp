@@ -23,8 +23,8 @@ using cmddistributor::StackFrame;
 using krutil::cmddistributor::inExecutionStatus;
 
 // Bytes that a record or a frame costs besides its texts.
-constexpr std::size_t kFixedBytes = 32;
-constexpr std::size_t kNameBytes = 1024;
+constexpr std::size_t fixedBytes = 32;
+constexpr std::size_t nameBytes = 1024;
 
 py::object owned(PyObject* object) {
     return py::reinterpret_steal<py::object>(object);
@@ -38,19 +38,20 @@ std::size_t utf8Length(Py_UCS4 point) noexcept {
 // Builds one record and its causes. The members are what all levels share.
 class Builder {
   public:
-    Builder(const RecordBounds& bounds, bool& interrupted)
-        : bounds_(bounds), left_(bounds.totalBytes), interrupted_(interrupted) {}
+    Builder(const RecordBounds& bounds, ErrorWords words) : bounds_(bounds), left_(bounds.totalBytes), words_(words) {}
+
+    bool interrupted() const noexcept { return interrupted_; }
 
     RuntimeException build(PyObject* exception, inExecutionStatus status, std::size_t depth) {
         seen_.insert(exception);
-        take(kFixedBytes);
+        take(fixedBytes);
         std::string name = typeName(exception);
         std::u16string text = message(exception, name);
         Stack frames = stack(exception);
         std::vector<RuntimeException> causes;
         if (depth < bounds_.depth) {
             for (const py::object& cause : causesOf(exception)) {
-                if (left_ < kFixedBytes || seen_.size() >= bounds_.records) {
+                if (left_ < fixedBytes || seen_.size() >= bounds_.records) {
                     break;
                 }
                 if (seen_.count(cause.ptr()) == 0) {
@@ -121,17 +122,17 @@ class Builder {
             PyObject* const module = PyDict_GetItemString(type->tp_dict, "__module__");
             if (module != nullptr && PyUnicode_Check(module) &&
                 PyUnicode_CompareWithASCIIString(module, "builtins") != 0) {
-                prefix = boundedUtf8(module, kNameBytes) + ".";
+                prefix = boundedUtf8(module, nameBytes) + ".";
             }
-            return prefix + boundedUtf8(name.ptr(), kNameBytes);
+            return prefix + boundedUtf8(name.ptr(), nameBytes);
         }
         // The name of a type written in C is dotted already, without the builtin ones' module.
         const py::object dotted = owned(PyUnicode_FromString(type->tp_name));
         if (!dotted) {
             PyErr_Clear();
-            return boundedUtf8(name.ptr(), kNameBytes);
+            return boundedUtf8(name.ptr(), nameBytes);
         }
-        return boundedUtf8(dotted.ptr(), kNameBytes);
+        return boundedUtf8(dotted.ptr(), nameBytes);
     }
 
     // The text where it is what the exception was made with; null where only code can tell.
@@ -149,9 +150,12 @@ class Builder {
     }
 
     std::u16string message(PyObject* exception, const std::string& name) {
-        const py::object text = interrupted_ ? plainText(exception) : owned(PyObject_Str(exception));
+        const py::object text = words_ == ErrorWords::ByCode ? owned(PyObject_Str(exception)) : plainText(exception);
         if (!text) {
-            interrupted_ = interrupted_ || PyErr_ExceptionMatches(PyExc_KeyboardInterrupt) != 0;
+            if (words_ == ErrorWords::ByCode && PyErr_ExceptionMatches(PyExc_KeyboardInterrupt) != 0) {
+                interrupted_ = true;
+                words_ = ErrorWords::WithoutCode;
+            }
             PyErr_Clear();
             const std::string unprintable = "<unprintable " + name + " object>";
             take(unprintable.size());
@@ -167,7 +171,7 @@ class Builder {
              entry = entry->tb_next) {
             const py::object code = owned(reinterpret_cast<PyObject*>(PyFrame_GetCode(entry->tb_frame)));
             PyObject* const file = reinterpret_cast<PyCodeObject*>(code.ptr())->co_filename;
-            if (PyUnicode_CompareWithASCIIString(file, kEngineFile) != 0) {
+            if (PyUnicode_CompareWithASCIIString(file, engineFile) != 0) {
                 entries.push_back(entry);
             }
         }
@@ -177,10 +181,10 @@ class Builder {
         const std::size_t head = kept == entries.size() ? kept : kept / 2;
         // The innermost frames tell most, so they are the first to be given room.
         std::vector<StackFrame> tail;
-        for (std::size_t i = 0; i < kept - head && left_ >= kFixedBytes; ++i) {
+        for (std::size_t i = 0; i < kept - head && left_ >= fixedBytes; ++i) {
             tail.push_back(frame(entries[entries.size() - 1 - i]));
         }
-        for (std::size_t i = 0; i < head && left_ >= kFixedBytes; ++i) {
+        for (std::size_t i = 0; i < head && left_ >= fixedBytes; ++i) {
             frames.push_back(frame(entries[i]));
         }
         const std::size_t missing = entries.size() - frames.size() - tail.size();
@@ -198,12 +202,12 @@ class Builder {
     }
 
     StackFrame frame(PyTracebackObject* entry) {
-        take(kFixedBytes);
+        take(fixedBytes);
         const py::object object = owned(reinterpret_cast<PyObject*>(PyFrame_GetCode(entry->tb_frame)));
         auto* const code = reinterpret_cast<PyCodeObject*>(object.ptr());
         // The traceback's own line number is filled in only when it is first asked for.
         const int line = PyCode_Addr2Line(code, entry->tb_lasti);
-        return {bounded(code->co_filename, kNameBytes), boundedUtf8(code->co_name, kNameBytes),
+        return {bounded(code->co_filename, nameBytes), boundedUtf8(code->co_name, nameBytes),
                 static_cast<double>(std::max(line, 0))};
     }
 
@@ -229,14 +233,16 @@ class Builder {
     const RecordBounds bounds_;
     std::size_t left_;
     std::unordered_set<PyObject*> seen_;
-    bool& interrupted_;
+    ErrorWords words_;
+    bool interrupted_ = false;
 };
 
 }  // namespace
 
-RuntimeException errorRecord(PyObject* exception, inExecutionStatus status, const RecordBounds& bounds,
-                             bool& interrupted) {
-    return Builder(bounds, interrupted).build(exception, status, 1);
+ErrorRecord errorRecord(PyObject* exception, inExecutionStatus status, const RecordBounds& bounds, ErrorWords words) {
+    Builder builder(bounds, words);
+    RuntimeException record = builder.build(exception, status, 1);
+    return {std::move(record), builder.interrupted()};
 }
 
 inExecutionStatus statusOf(PyObject* exception) noexcept {

@@ -35,7 +35,7 @@ py::object owned(PyObject* object) {
 // code that looks at its caller fails.
 py::object callerIn(const py::dict& session) {
     const py::object code =
-        owned(Py_CompileString("lambda function, arguments: function(*arguments)", kEngineFile, Py_eval_input));
+        owned(Py_CompileString("lambda function, arguments: function(*arguments)", engineFile, Py_eval_input));
     return owned(PyEval_EvalCode(code.ptr(), session.ptr(), session.ptr()));
 }
 

@@ -197,13 +197,23 @@ struct Interpreter::State {
     ReleaseQueue releases;
 };
 
-Interpreter::Interpreter(RecordBounds bounds) : bounds_(bounds) {
+namespace {
+
+RecordBounds recordBounds(const MessageBounds& bounds) {
+    RecordBounds result;
+    result.totalBytes = bounds.errorBytes;
+    return result;
+}
+
+}  // namespace
+
+Interpreter::Interpreter(const MessageBounds& bounds)
+    : bounds_(recordBounds(bounds)), printedCharacters_(bounds.printedCharacters) {
     startPython();
     try {
         state_ = std::make_unique<State>();
         state_->globals = py::module_::import("__main__").attr("__dict__");
-        const auto code =
-            py::reinterpret_steal<py::object>(Py_CompileString(kModuleSource, kEngineFile, Py_file_input));
+        const auto code = py::reinterpret_steal<py::object>(Py_CompileString(moduleSource, engineFile, Py_file_input));
         if (!code) {
             throw py::error_already_set();
         }
@@ -243,7 +253,7 @@ Interpreter::~Interpreter() {
     left = state_.release();
 }
 
-Interpreter::Outcome Interpreter::evaluate(const cmddistributor::EvalIIP& request, PyObject* frame) {
+Interpreter::Ending Interpreter::evaluate(const cmddistributor::EvalIIP& request, PyObject* frame) {
     const Namespace names = frame == nullptr ? Namespace(state_->globals) : Namespace(frame);
     names.forgetWarnings();
     const std::string file = "<eval-" + std::to_string(++evaluations_) + ">";
@@ -280,9 +290,8 @@ Interpreter::Outcome Interpreter::evaluate(const cmddistributor::EvalIIP& reques
     return {};
 }
 
-Interpreter::CallOutcome Interpreter::call(const cmddistributor::FEvalIIP& request, Outputs outputs) {
+Interpreter::Ending Interpreter::call(const cmddistributor::FEvalIIP& request, Outputs outputs) {
     Namespace(state_->globals).forgetWarnings();
-    CallOutcome outcome;
     try {
         const std::string& name = request.getFunctionName();
         const py::object function = findFunction(name, state_->globals);
@@ -290,13 +299,15 @@ Interpreter::CallOutcome Interpreter::call(const cmddistributor::FEvalIIP& reque
         if (inForkedChild()) {
             endForkedChild({});
         }
-        outcome.outputs = outputsOf(value, name, request.getNlhs(), state_->releases);
+        Ending ending;
+        ending.outputs = outputsOf(value, name, request.getNlhs(), state_->releases);
         if (outputs == Outputs::Copied) {
-            for (foundation::korveldata::Array& array : outcome.outputs) {
+            for (foundation::korveldata::Array& array : *ending.outputs) {
                 // Gives an array over memory of another owner elements of its own.
                 array.mutableData();
             }
         }
+        return ending;
     } catch (py::error_already_set& error) {
         error.restore();
     } catch (const std::bad_alloc&) {
@@ -304,10 +315,7 @@ Interpreter::CallOutcome Interpreter::call(const cmddistributor::FEvalIIP& reque
     } catch (const std::exception& error) {
         PyErr_SetString(PyExc_RuntimeError, error.what());
     }
-    if (PyErr_Occurred() != nullptr) {
-        static_cast<Outcome&>(outcome) = failure(inRUNTIME_ERROR);
-    }
-    return outcome;
+    return failure(inRUNTIME_ERROR);
 }
 
 void Interpreter::dropReleased() noexcept {
@@ -318,57 +326,60 @@ int Interpreter::releasedDescriptor() const noexcept {
     return state_->releases.descriptor();
 }
 
-Interpreter::Outcome Interpreter::failure(inExecutionStatus status) {
+Interpreter::Ending Interpreter::failure(inExecutionStatus status) {
     const py::object exception = takeException();
     if (inForkedChild()) {
         endForkedChild(exception);
     }
-    Outcome outcome;
-    bool interrupted = isA(exception, PyExc_KeyboardInterrupt);
-    if (interrupted) {
-        outcome.error = errorRecord(exception.ptr(), statusOf(exception.ptr()), bounds_, interrupted);
-        return outcome;
+    Ending ending;
+    if (isA(exception, PyExc_KeyboardInterrupt)) {
+        ending.error = errorRecord(exception.ptr(), inEXECUTION_CTRLC, bounds_, ErrorWords::WithoutCode).exception;
+        return ending;
     }
+    bool interrupted = false;
     if (isA(exception, PyExc_SystemExit)) {
-        outcome.exit = true;
+        ending.exit = true;
         if (exitStatus(exception) != 0) {
-            RuntimeException record = errorRecord(exception.ptr(), inRUNTIME_ERROR, bounds_, interrupted);
-            outcome.error =
-                RuntimeException(inRUNTIME_ERROR, record.GetUnicodeMessageTxt(), "SystemExit", record.getFunctionName(),
-                                 record.getStackFrames(), record.getCauses(), false);
+            const ErrorRecord record = errorRecord(exception.ptr(), inRUNTIME_ERROR, bounds_);
+            const RuntimeException& error = record.exception;
+            interrupted = record.interrupted;
+            ending.error = RuntimeException(inRUNTIME_ERROR, error.GetUnicodeMessageTxt(), "SystemExit",
+                                            error.getFunctionName(), error.getStackFrames(), error.getCauses(), false);
         }
-    } else if (isA(exception, state_->debuggerQuit.ptr())) {
-        outcome.error = errorRecord(exception.ptr(), inEXECUTION_DBQUIT, bounds_, interrupted);
     } else {
-        outcome.error = errorRecord(exception.ptr(), status, bounds_, interrupted);
-        if (!interrupted) {
-            outcome.printed = printedText(exception.ptr(), *outcome.error, interrupted);
+        const bool quit = isA(exception, state_->debuggerQuit.ptr());
+        ErrorRecord record = errorRecord(exception.ptr(), quit ? inEXECUTION_DBQUIT : status, bounds_);
+        interrupted = record.interrupted;
+        if (!quit && !interrupted) {
+            Printed printed = printedText(exception.ptr(), record.exception);
+            interrupted = printed.interrupted;
+            ending.printed = std::move(printed.text);
         }
+        ending.error = std::move(record.exception);
     }
     if (interrupted) {
-        outcome.error =
+        ending.error =
             RuntimeException(inEXECUTION_CTRLC, u"The request was interrupted while its error was formatted.",
-                             "KeyboardInterrupt", "", {}, {*outcome.error}, false);
-        outcome.printed.clear();
+                             "KeyboardInterrupt", "", {}, {*ending.error}, false);
+        ending.printed.clear();
     }
-    return outcome;
+    return ending;
 }
 
-std::u16string Interpreter::printedText(PyObject* exception, const RuntimeException& record, bool& interrupted) const {
-    // A character is at most four bytes on the wire, and the record takes up to half of what a message may hold.
-    const auto text = py::reinterpret_steal<py::object>(PyObject_CallFunction(
-        state_->formatError.ptr(), "On", exception, static_cast<Py_ssize_t>(bounds_.totalBytes / 8)));
+Interpreter::Printed Interpreter::printedText(PyObject* exception, const RuntimeException& record) const {
+    const auto text = py::reinterpret_steal<py::object>(
+        PyObject_CallFunction(state_->formatError.ptr(), "On", exception, static_cast<Py_ssize_t>(printedCharacters_)));
     if (text && PyUnicode_Check(text.ptr())) {
-        return utf16Of(text.ptr());
+        return {utf16Of(text.ptr())};
     }
     // Types of running code can make formatting fail.
-    interrupted = !text && PyErr_ExceptionMatches(PyExc_KeyboardInterrupt) != 0;
+    const bool interrupted = !text && PyErr_ExceptionMatches(PyExc_KeyboardInterrupt) != 0;
     PyErr_Clear();
     std::u16string plain = msg_svc::protobuf::utf8_to_ustring(record.GetID());
     if (!record.GetUnicodeMessageTxt().empty()) {
         plain += u": " + record.GetUnicodeMessageTxt();
     }
-    return plain + u"\n";
+    return {plain + u"\n", interrupted};
 }
 
 void Interpreter::handleSignals() noexcept {

@@ -8,6 +8,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -16,6 +17,7 @@
 #include "cmddistributor/RuntimeException.hpp"
 #include "foundation/korveldata/Array.hpp"
 #include "qvm/python/ErrorRecord.hpp"
+#include "qvm/requests/MessageBounds.hpp"
 
 namespace qvm {
 
@@ -24,23 +26,19 @@ namespace qvm {
 /// unlocked(), and all members are for that thread.
 class Interpreter {
   public:
-    /// How an evaluation ended.
-    struct Outcome {
-        boost::optional<cmddistributor::RuntimeException> error;
-        std::u16string printed;  ///< the error as Python prints it; empty for none and for ends that are no failures
-        bool exit = false;       ///< the code asked for the end of the session
-    };
-
-    /// How a function call ended.
-    struct CallOutcome : Outcome {
-        std::vector<foundation::korveldata::Array> outputs;  ///< none after an error
+    /// How an evaluation or a call ended.
+    struct Ending {
+        boost::optional<cmddistributor::RuntimeException> error{};
+        std::u16string printed{};  ///< the error as Python prints it; empty for none and for ends that are no failures
+        bool exit = false;         ///< the code asked for the end of the session
+        std::optional<std::vector<foundation::korveldata::Array>> outputs{};  ///< of a call that succeeded
     };
 
     /// What becomes of the memory of a call's outputs.
     enum class Outputs { Shared, Copied };
 
     /// Starts Python. The module _qvm must have been installed. Throws std::runtime_error with Python's reason.
-    explicit Interpreter(RecordBounds bounds);
+    explicit Interpreter(const MessageBounds& bounds);
 
     /// Leaves Python as it is, because threads of running code may still be in it: the process is about to end. Builds
     /// with a sanitizer finalise it where they can, so that leaks show.
@@ -52,13 +50,13 @@ class Interpreter {
     /// included. An interrupt that comes while its error is put into words is the error then. In a process that the
     /// text has forked it does not return. `frame` is one that stands still, whose variables the text sees and assigns;
     /// null for the namespace of the session. Evaluations nest.
-    Outcome evaluate(const cmddistributor::EvalIIP& request, PyObject* frame = nullptr);
+    Ending evaluate(const cmddistributor::EvalIIP& request, PyObject* frame = nullptr);
 
     /// Calls the function that the request names with the arrays that it carries, which are taken out of it, and
     /// returns as many outputs as it asks for; see FunctionCall.hpp. Unless they are to be copied, the outputs share
     /// memory with Python: it comes back through dropReleased(), and nothing that could write to it should run before
     /// they are sent. Everything else is as for evaluate().
-    CallOutcome call(const cmddistributor::FEvalIIP& request, Outputs outputs);
+    Ending call(const cmddistributor::FEvalIIP& request, Outputs outputs);
 
     /// Drops Python's share in the memory of outputs that are not used any more, on whatever thread they ended.
     void dropReleased() noexcept;
@@ -79,12 +77,18 @@ class Interpreter {
   private:
     struct State;
 
-    // The outcome of the Python exception that is set.
-    Outcome failure(krutil::cmddistributor::inExecutionStatus status);
-    std::u16string printedText(PyObject* exception, const cmddistributor::RuntimeException& record,
-                               bool& interrupted) const;
+    // Text, or that the code that was to give it has been interrupted.
+    struct Printed {
+        std::u16string text;
+        bool interrupted = false;
+    };
+
+    // The ending by the Python exception that is set.
+    Ending failure(krutil::cmddistributor::inExecutionStatus status);
+    Printed printedText(PyObject* exception, const cmddistributor::RuntimeException& record) const;
 
     const RecordBounds bounds_;
+    const std::size_t printedCharacters_;
     std::unique_ptr<State> state_;
     std::uint64_t evaluations_ = 0;
 };

@@ -18,7 +18,7 @@ using korvel::lang::StackFrame;
 using korvel::lang::diagnostic::Warning;
 
 // The first of January 1970.
-constexpr double kUnixEpochDay = 719529.0;
+constexpr double unixEpochDay = 719529.0;
 
 PrintfArgument integerArgument(const py::handle& value) {
     int overflow = 0;
@@ -54,19 +54,11 @@ StackFrame stackFrame(const py::handle& value) {
     return {utf16Of(file.ptr()), utf16Of(function.ptr()), parts[2].cast<unsigned int>()};
 }
 
-std::u16string cut(const std::u16string& text, std::size_t units) {
-    if (text.size() <= units) {
-        return text;
-    }
-    // A surrogate that loses its other half is replaced when the text is written.
-    return text.substr(0, units) + u"...";
-}
-
 }  // namespace
 
 double dateNumber() {
     using Days = std::chrono::duration<double, std::ratio<86'400>>;
-    return kUnixEpochDay + Days(std::chrono::system_clock::now().time_since_epoch()).count();
+    return unixEpochDay + Days(std::chrono::system_clock::now().time_since_epoch()).count();
 }
 
 Warning warningRecord(const PythonWarning& warning) {
@@ -86,17 +78,6 @@ Warning warningRecord(const PythonWarning& warning) {
             std::move(stack),
             warning.wasDisabled,
             dateNumber()};
-}
-
-Warning shortened(const Warning& warning, std::size_t units) {
-    const std::u16string identifier = msg_svc::protobuf::utf8_to_ustring(warning.getIdentifier());
-    return {msg_svc::protobuf::ustring_to_utf8(cut(identifier, units / 4)),
-            cut(warning.getFormat(), units / 4),
-            {},
-            cut(warning.getMessage(), units / 2),
-            {},
-            warning.getWasDisabled(),
-            warning.getTime()};
 }
 
 }  // namespace qvm

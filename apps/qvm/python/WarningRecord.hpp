@@ -24,9 +24,6 @@ struct PythonWarning {
 /// text when none does. Throws py::error_already_set or py::cast_error for parts of other types.
 korvel::lang::diagnostic::Warning warningRecord(const PythonWarning& warning);
 
-/// The same warning in at most about `units` UTF-16 units, without its arguments and its stack.
-korvel::lang::diagnostic::Warning shortened(const korvel::lang::diagnostic::Warning& warning, std::size_t units);
-
 /// Now as a date number: days since year 0, in UTC.
 double dateNumber();
 

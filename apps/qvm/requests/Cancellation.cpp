@@ -12,7 +12,7 @@ namespace {
 
 // A signal that falls between the thread's last look and its next system call does not end that call, so it is sent
 // again and again until the interrupt is taken.
-constexpr long kRepeatNanoseconds = 10'000'000;
+constexpr long repeatNanoseconds = 10'000'000;
 
 }  // namespace
 
@@ -35,36 +35,36 @@ Cancellation::~Cancellation() {
 }
 
 void Cancellation::begin(const IDType& id) {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     running_.push_back({id});
     update();
 }
 
 bool Cancellation::end() {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     const bool never = running_.back().interrupt;
     running_.pop_back();
     update();
     return never;
 }
 
-Cancellation::Outcome Cancellation::cancel(const IDType& id, bool evenIfRunning) {
-    std::lock_guard lock(mutex_);
+Cancellation::Effect Cancellation::cancel(const IDType& id, bool evenIfRunning) {
+    const std::lock_guard lock(mutex_);
     const auto found =
         std::find_if(running_.begin(), running_.end(), [&id](const Running& each) { return each.id == id; });
     if (found == running_.end()) {
-        return Outcome::NotRunning;
+        return Effect::NotRunning;
     }
     if (!evenIfRunning) {
-        return Outcome::Running;
+        return Effect::LeftRunning;
     }
     std::for_each(found, running_.end(), [](Running& each) { each.interrupt = true; });
     update();
-    return Outcome::Interrupted;
+    return Effect::Interrupted;
 }
 
 bool Cancellation::takeInterrupt() {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     if (running_.empty() || !running_.back().interrupt) {
         return false;
     }
@@ -75,7 +75,7 @@ bool Cancellation::takeInterrupt() {
 }
 
 bool Cancellation::repeatInterrupt() {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     if (running_.empty() || !running_.back().given) {
         return false;
     }
@@ -95,7 +95,7 @@ void Cancellation::update() noexcept {
     if (wanted) {
         wanted_.raise();
         times.it_value.tv_nsec = 1;
-        times.it_interval.tv_nsec = kRepeatNanoseconds;
+        times.it_interval.tv_nsec = repeatNanoseconds;
     } else {
         wanted_.clear();
     }

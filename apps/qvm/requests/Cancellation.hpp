@@ -43,14 +43,15 @@ class Cancellation {
     /// The request that began last has ended. Returns whether it was cancelled and its interrupt never taken.
     bool end();
 
-    enum class Outcome {
+    /// What a cancel does to a request.
+    enum class Effect {
         NotRunning,   ///< no such request runs
-        Running,      ///< it runs, and nothing was done
+        LeftRunning,  ///< it runs, and nothing was done
         Interrupted,  ///< it is told to stop
     };
 
     /// Interrupts `id` if it runs and `evenIfRunning` holds.
-    Outcome cancel(const IDType& id, bool evenIfRunning);
+    Effect cancel(const IDType& id, bool evenIfRunning);
 
     /// Whether the request that began last is to be interrupted; each interrupt is given once.
     bool takeInterrupt();

@@ -1,36 +1,50 @@
 #include "qvm/requests/Request.hpp"
 
-#include "cmddistributor/EvalIIP.hpp"
-#include "cmddistributor/FEvalIIP.hpp"
+#include <stdexcept>
+#include <utility>
 
 namespace qvm {
 namespace {
 
 // Objects, their control blocks and the queue's own entry.
-constexpr std::size_t kFixedBytes = 512;
-constexpr std::size_t kArrayBytes = 256;
+constexpr std::size_t fixedBytes = 512;
+constexpr std::size_t arrayBytes = 256;
 
-std::size_t memoryOfArguments(const cmddistributor::FEvalIIP& call) {
-    std::size_t bytes = 0;
-    if (const auto* data = boost::get<krutil::cmddistributor::EDIDataWrapper>(&call.getInputArguments())) {
+std::size_t memoryOfTask(const cmddistributor::EvalIIP* evaluation) {
+    return evaluation->getCommand().size() * sizeof(char16_t);
+}
+
+std::size_t memoryOfTask(const cmddistributor::FEvalIIP* call) {
+    std::size_t bytes = call->getFunctionName().size();
+    if (const auto* data = boost::get<krutil::cmddistributor::EDIDataWrapper>(&call->getInputArguments())) {
         for (const foundation::korveldata::Array& array : data->arrays()) {
-            bytes += kArrayBytes + array.sizeInBytes();
+            bytes += arrayBytes + array.sizeInBytes();
         }
     }
     return bytes;
 }
 
+Request::Task taskOf(const cmddistributor::IIP* iip) {
+    if (const auto* const evaluation = dynamic_cast<const cmddistributor::EvalIIP*>(iip)) {
+        return evaluation;
+    }
+    if (const auto* const call = dynamic_cast<const cmddistributor::FEvalIIP*>(iip)) {
+        return call;
+    }
+    throw std::invalid_argument("a request: expected code to evaluate or a function to call, got another kind");
+}
+
 }  // namespace
 
+Request arrivedRequest(framing::StreamID stream, boost::shared_ptr<const cmddistributor::IIPEnqueueMessage> message) {
+    const Request::Task task = taskOf(message->getIIP().get());
+    return {stream, std::move(message), task};
+}
+
 std::size_t memoryOf(const Request& request) {
-    std::size_t bytes = kFixedBytes + request.message->getDynamicName().size() * sizeof(char16_t) +
-                        request.message->getIIP()->getPluginType().size();
-    if (const auto* eval = dynamic_cast<const cmddistributor::EvalIIP*>(request.message->getIIP().get())) {
-        bytes += eval->getCommand().size() * sizeof(char16_t);
-    } else if (const auto* call = dynamic_cast<const cmddistributor::FEvalIIP*>(request.message->getIIP().get())) {
-        bytes += call->getFunctionName().size() + memoryOfArguments(*call);
-    }
-    return bytes;
+    return fixedBytes + request.message->getDynamicName().size() * sizeof(char16_t) +
+           request.message->getIIP()->getPluginType().size() +
+           std::visit([](const auto* task) { return memoryOfTask(task); }, request.task);
 }
 
 }  // namespace qvm

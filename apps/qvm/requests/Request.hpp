@@ -3,7 +3,10 @@
 
 #include <boost/shared_ptr.hpp>
 #include <cstddef>
+#include <variant>
 
+#include "cmddistributor/EvalIIP.hpp"
+#include "cmddistributor/FEvalIIP.hpp"
 #include "cmddistributor/IIPEnqueueMessage.hpp"
 #include "foundation/vantor/carrier/framing/Frame.hpp"
 
@@ -13,12 +16,20 @@ namespace framing = foundation::vantor::carrier::framing;
 
 /// A value; copies share the message.
 struct Request {
+    /// Code to evaluate, or a function to call. Points into the message.
+    using Task = std::variant<const cmddistributor::EvalIIP*, const cmddistributor::FEvalIIP*>;
+
     framing::StreamID stream = 0;  ///< of the enqueue message; the request's events and its reply travel on it too
     boost::shared_ptr<const cmddistributor::IIPEnqueueMessage> message;
+    Task task;
     bool requeued = false;  ///< a prompt had taken it and closed before its turn
 
     const foundation::msg_svc::exchange::IDType& id() const noexcept { return message->getID(); }
 };
+
+/// The request that a message from the client brings. Throws std::invalid_argument when the message asks for something
+/// else than an evaluation or a call.
+Request arrivedRequest(framing::StreamID stream, boost::shared_ptr<const cmddistributor::IIPEnqueueMessage> message);
 
 /// Memory that a waiting request holds, in bytes, roughly: what its peer decides counts, plus a fixed share for the
 /// rest.

@@ -24,10 +24,10 @@ struct RequestParts {
 inline qvm::Request makeRequest(const RequestParts& parts = {}) {
     const auto iip = boost::make_shared<const cmddistributor::EvalIIP>(
         "python", parts.streams, nullptr, parts.out, parts.err, parts.code, cmddistributor::CodeType::CodeBlockType);
-    return {static_cast<qvm::framing::StreamID>(parts.number),
-            boost::make_shared<const cmddistributor::IIPEnqueueMessage>(
-                iip, foundation::msg_svc::exchange::IDType(0, parts.number), 0, boost::none, nullptr, parts.mode, u"",
-                capabilities::CapabilityList(), nullptr, parts.flushSparingly)};
+    return qvm::arrivedRequest(static_cast<qvm::framing::StreamID>(parts.number),
+                               boost::make_shared<const cmddistributor::IIPEnqueueMessage>(
+                                   iip, foundation::msg_svc::exchange::IDType(0, parts.number), 0, boost::none, nullptr,
+                                   parts.mode, u"", capabilities::CapabilityList(), nullptr, parts.flushSparingly));
 }
 
 }  // namespace qvm_test
