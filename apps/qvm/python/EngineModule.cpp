@@ -37,7 +37,8 @@ constexpr std::size_t piecePoints = 16'384;
     throw py::error_already_set();
 }
 
-// Lets other threads run while the client catches up. An interrupt ends the wait.
+// Whatever Python code makes the engine send, it waits here before it goes on, and lets other threads run until the
+// client has caught up. An interrupt ends the wait.
 void waitForRoom() {
     const int interrupt = services->interruptDescriptor();
     bool room = false;
@@ -151,6 +152,16 @@ const char* nameOf(PromptEnd end) {
     throw py::error_already_set();
 }
 
+// A prompt that opens and closes by itself sends events all the same. An interrupt must not replace the end of the
+// session.
+const char* closed(PromptEnd end) {
+    const char* const name = nameOf(end);
+    if (end != PromptEnd::Exit) {
+        waitForRoom();
+    }
+    return name;
+}
+
 void require(Capability capability) {
     if (!canUse(capability)) {
         raise(PyExc_RuntimeError, "the client cannot be asked here");
@@ -162,7 +173,7 @@ const char* commandPrompt(InputRequester loop, const py::object& frame) {
         raise(PyExc_TypeError, "a frame is required");
     }
     require(loop == InputRequester::mnDEBUG_PROMPT ? Capability::Debugging : Capability::InteractiveCommandLine);
-    return nameOf(services->prompt(loop, frame.ptr(), std::nullopt));
+    return closed(services->prompt(loop, frame.ptr(), std::nullopt));
 }
 
 const char* pausePrompt(const std::optional<double>& seconds) {
@@ -174,7 +185,7 @@ const char* pausePrompt(const std::optional<double>& seconds) {
         deadline = std::chrono::steady_clock::now() + std::chrono::duration_cast<std::chrono::steady_clock::duration>(
                                                           std::chrono::duration<double>(*seconds > 0 ? *seconds : 0));
     }
-    return nameOf(services->prompt(InputRequester::mnPAUSE_PROMPT, nullptr, deadline));
+    return closed(services->prompt(InputRequester::mnPAUSE_PROMPT, nullptr, deadline));
 }
 
 // The answer with a newline at its end; empty at the end of input.
@@ -184,7 +195,7 @@ py::object readLine() {
         return py::str("");
     }
     const PromptEnd end = services->readText(text);
-    nameOf(end);
+    closed(end);
     if (end != PromptEnd::Continued) {
         return py::str("");
     }
@@ -207,11 +218,13 @@ void leavePrompt(bool quit) {
 void issueWarning(const py::str& identifier, const py::str& format, const py::list& arguments, const py::str& message,
                   const py::list& stack, bool wasDisabled) {
     services->issueWarning(warningRecord({identifier, format, arguments, message, stack, wasDisabled}));
+    waitForRoom();
 }
 
 void setDebugging(bool on) {
     if (!inForkedChild()) {
         services->setDebugging(on);
+        waitForRoom();
     }
 }
 

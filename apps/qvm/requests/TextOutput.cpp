@@ -28,7 +28,7 @@ TextOutput::TextOutput(Settings settings, Emit emit)
 
 TextOutput::~TextOutput() {
     {
-        std::lock_guard lock(mutex_);
+        const std::lock_guard lock(mutex_);
         handOn();
         ending_ = true;
     }
@@ -37,7 +37,7 @@ TextOutput::~TextOutput() {
 }
 
 void TextOutput::begin(const Request& request) {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     handOn();
     running_.push_back(request);
 }
@@ -48,7 +48,7 @@ void TextOutput::suspend() {
 
 void TextOutput::end() {
     // Under one lock, so that no other thread adds text to the request after this.
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     handOn();
     running_.pop_back();
 }
@@ -60,14 +60,15 @@ bool TextOutput::write(TextSource source, std::u16string_view text) {
     bool wake = false;
     bool handedOn = false;
     {
-        std::lock_guard lock(mutex_);
+        const std::lock_guard lock(mutex_);
         const std::optional<TextTarget> target = route(source);
         if (!target) {
             return false;
         }
+        handedOn = std::exchange(handedOnLate_, false);
         // One piece is held for all targets, so that the order between them is the order of writing.
         if (!held_.empty() && !(target_ == *target)) {
-            handedOn = handOn();
+            handedOn = handOn() || handedOn;
         }
         const bool sparing = target->stream != 0 && running_.back().message->getOkToFlushSparingly();
         wake = held_.empty();
@@ -78,7 +79,7 @@ bool TextOutput::write(TextSource source, std::u16string_view text) {
         held_ += text;
         const bool lineEnds = !sparing && text.find(u'\n') != std::u16string_view::npos;
         if (lineEnds || held_.size() >= settings_.flushUnits) {
-            handedOn = handOn();
+            handedOn = handOn() || handedOn;
             wake = false;
         }
     }
@@ -89,12 +90,12 @@ bool TextOutput::write(TextSource source, std::u16string_view text) {
 }
 
 bool TextOutput::flush() {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     return handOn();
 }
 
 krutil::io::SinkTraits TextOutput::outputTraits() const {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     const bool none = running_.empty() || !running_.back().message;
     return none ? krutil::io::SinkTraits() : running_.back().message->getIIP()->getOutTraits();
 }
@@ -155,7 +156,7 @@ void TextOutput::runTimer() {
             changed_.wait(lock);
         } else if (changed_.wait_until(lock, due_) == std::cv_status::timeout && !held_.empty() &&
                    Clock::now() >= due_) {
-            handOn();
+            handedOnLate_ = handOn();
         }
     }
 }

@@ -80,7 +80,8 @@ class TextOutput {
     /// that comes meanwhile belongs to none.
     void suspend();
 
-    /// Takes well-formed UTF-16 text. Returns whether any text was handed on.
+    /// Takes well-formed UTF-16 text. Returns whether any text was handed on, by this call or by the thread of this
+    /// object since the last call.
     bool write(TextSource source, std::u16string_view text);
 
     /// Hands on what is held back; returns whether that was anything.
@@ -105,7 +106,8 @@ class TextOutput {
     std::vector<Request> running_;  // one without a message stands for a prompt
     TextTarget target_;
     std::u16string held_;
-    Clock::time_point due_;  // of the held text, when there is any
+    Clock::time_point due_;      // of the held text, when there is any
+    bool handedOnLate_ = false;  // by the timer, and no write() has told so yet
     bool ending_ = false;
     std::thread timer_;
 };

@@ -92,6 +92,20 @@ TEST_F(TextOutputTest, TimeHandsOnWithoutANewline) {
     EXPECT_THAT(texts(), ElementsAre(u"slow", u"again"));
 }
 
+TEST_F(TextOutputTest, NextWriteTellsOfTextThatTheTimeHandedOn) {
+    make({8192, 32768, std::chrono::milliseconds(1), kNever});
+    EXPECT_FALSE(output_->write(TextSource::Output, u"slow"));
+    awaitPieces(1);
+    // Another flush comes after the timer has let go of the text.
+    EXPECT_FALSE(output_->flush());
+    RequestParts parts;
+    parts.flushSparingly = true;
+    output_->begin(makeRequest(parts));
+    EXPECT_TRUE(output_->write(TextSource::Output, u"held"));
+    EXPECT_FALSE(output_->write(TextSource::Output, u"held too"));
+    output_->end();
+}
+
 TEST_F(TextOutputTest, FlushHandsOn) {
     output_->write(TextSource::Output, u"now");
     EXPECT_TRUE(output_->flush());
