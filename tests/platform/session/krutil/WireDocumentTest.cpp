@@ -1,7 +1,6 @@
 // The example of docs/session-wire.md is what the programs write.
 
 #include <boost/make_shared.hpp>
-#include <fstream>
 #include <future>
 #include <iomanip>
 #include <sstream>
@@ -10,34 +9,13 @@
 #include "cmddistributor/EvalIIP.hpp"
 #include "cmddistributor/IIPEnqueueMessage.hpp"
 #include "platform/session/support/TestSessions.hpp"
+#include "support/HexBlocks.hpp"
 
 namespace testing_sessions {
 namespace {
 
 using exchange::IDType;
 using krutil::io::SinkTraits;
-
-// The bytes of each block of the document that is marked "hex": what stands before a semicolon on its lines.
-std::vector<std::string> blocksOf(const std::string& path) {
-    std::ifstream file(path);
-    EXPECT_TRUE(file) << path;
-    std::vector<std::string> blocks;
-    bool inside = false;
-    for (std::string line; std::getline(file, line);) {
-        if (line.starts_with("```")) {
-            inside = line == "```hex";
-            if (inside) {
-                blocks.emplace_back();
-            }
-        } else if (inside) {
-            std::istringstream digits(line.substr(0, line.find(';')));
-            for (std::string pair; digits >> pair;) {
-                blocks.back() += static_cast<char>(std::stoi(pair, nullptr, 16));
-            }
-        }
-    }
-    return blocks;
-}
 
 std::string hex(const std::string& bytes) {
     std::ostringstream text;
@@ -50,7 +28,7 @@ std::string hex(const std::string& bytes) {
 
 TEST(WireDocumentTest, ExampleIsWhatAClientAndAnEngineWrite) {
     krutil::protobuf::KrutilProtocol::init();
-    const std::vector<std::string> blocks = blocksOf(KRUTIL_WIRE_DOCUMENT);
+    const std::vector<std::string> blocks = test_support::hexBlocksOf(KRUTIL_WIRE_DOCUMENT);
     std::size_t next = 0;
     const auto compare = [&](const std::string& what, const std::string& bytes) {
         const std::string documented = next < blocks.size() ? blocks[next] : "";
