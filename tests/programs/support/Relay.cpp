@@ -10,6 +10,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <chrono>
+#include <cstring>
 #include <system_error>
 #include <vector>
 
@@ -91,6 +92,22 @@ void Relay::hold(Way way) {
     ::eventfd_write(direction(way).wake, 1);
 }
 
+void Relay::record() {
+    const std::lock_guard lock(mutex_);
+    recording_ = true;
+}
+
+std::string Relay::recorded(Way way) {
+    const std::lock_guard lock(mutex_);
+    return direction(way).recorded;
+}
+
+void Relay::holdAfterFrame(Way way, const std::string& tag) {
+    const std::lock_guard lock(mutex_);
+    direction(way).lastTag = tag;
+    direction(way).lookFrom = direction(way).recorded.size();
+}
+
 void Relay::waitUntilHeld(Way way) {
     std::unique_lock lock(mutex_);
     const Direction& each = direction(way);
@@ -140,6 +157,24 @@ std::size_t Relay::allowed(Way way) {
     return each.limit > each.passed ? std::min<std::uint64_t>(each.limit - each.passed, piece_) : 0;
 }
 
+// How many of the bytes that wait may pass, now that they are known.
+std::size_t Relay::look(Way way, std::string_view waiting) {
+    const std::lock_guard lock(mutex_);
+    Direction& each = direction(way);
+    if (!each.lastTag.empty()) {
+        const std::string known = each.recorded + std::string(waiting);
+        // The size of the content stands before the tag.
+        std::uint64_t content = 0;
+        const auto tag = known.find(each.lastTag, each.lookFrom + sizeof content);
+        if (tag != std::string::npos) {
+            std::memcpy(&content, known.data() + tag - sizeof content, sizeof content);
+            each.limit = each.passed + tag + each.lastTag.size() + content - each.recorded.size();
+            each.lastTag.clear();
+        }
+    }
+    return each.limit > each.passed ? std::min<std::uint64_t>(each.limit - each.passed, waiting.size()) : 0;
+}
+
 void Relay::pass(Way way, int from, int to) {
     std::vector<char> buffer(1U << 16);
     for (;;) {
@@ -161,7 +196,19 @@ void Relay::pass(Way way, int from, int to) {
         if (watched[1].revents == 0) {
             continue;
         }
-        const auto got = most > 0 ? ::recv(from, buffer.data(), most, 0) : 0;
+        auto got = most > 0 ? ::recv(from, buffer.data(), most, MSG_PEEK) : 0;
+        if (got > 0) {
+            const std::size_t may = look(way, {buffer.data(), static_cast<std::size_t>(got)});
+            if (may == 0) {
+                continue;
+            }
+            got = ::recv(from, buffer.data(), may, 0);
+            // Before anybody can act on it.
+            const std::lock_guard lock(mutex_);
+            if (recording_ && got > 0) {
+                direction(way).recorded.append(buffer.data(), static_cast<std::size_t>(got));
+            }
+        }
         if (got <= 0 || !sendAll(to, buffer.data(), static_cast<std::size_t>(got))) {
             cut();
             return;

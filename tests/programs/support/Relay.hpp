@@ -7,6 +7,7 @@
 #include <cstdint>
 #include <mutex>
 #include <string>
+#include <string_view>
 #include <thread>
 
 namespace programs_test {
@@ -37,6 +38,15 @@ class Relay {
     /// Passes nothing more.
     void hold(Way way);
 
+    /// Keeps what passes from now on. For sessions of little text.
+    void record();
+
+    /// What has passed since record().
+    std::string recorded(Way way);
+
+    /// Passes all up to the end of the next tagged frame with this tag, and holds back the rest. After record().
+    void holdAfterFrame(Way way, const std::string& tag);
+
     /// Waits until all that may pass has; fails the test after a minute.
     void waitUntilHeld(Way way);
 
@@ -50,13 +60,17 @@ class Relay {
     struct Direction {
         std::uint64_t limit = ~std::uint64_t{0};
         std::uint64_t passed = 0;
-        int wake = -1;  ///< an eventfd, for a change of the limit and for the cut
+        std::string recorded{};
+        std::string lastTag{};     ///< of the frame that is the last one to pass; empty for none
+        std::size_t lookFrom = 0;  ///< in what was recorded, for that frame
+        int wake = -1;             ///< an eventfd, for a change of the limit and for the cut
     };
 
     Direction& direction(Way way) { return directions_[static_cast<std::size_t>(way)]; }
     void acceptAndPass();
     void pass(Way way, int from, int to);
     std::size_t allowed(Way way);
+    std::size_t look(Way way, std::string_view waiting);
 
     const std::string path_;
     const std::string enginePath_;
@@ -69,6 +83,7 @@ class Relay {
     int client_ = -1;
     int engine_ = -1;
     bool cut_ = false;
+    bool recording_ = false;
 
     std::thread thread_;
 };
