@@ -68,12 +68,6 @@ std::unique_ptr<Printer> makePrinter(const DisplayOptions& options, Output& out,
     return std::make_unique<PersonPrinter>(out, err, PersonStyle{options.warningStack, wantsColor(options.color, err)});
 }
 
-void finish(Client& client) {
-    if (const std::string note = client.finish(); !note.empty()) {
-        std::cerr << "krutil: " << note << std::endl;
-    }
-}
-
 // A client that asks the person at standard input, if there is one, what the engine wants to know.
 class AskingClient {
   public:
@@ -87,12 +81,27 @@ class AskingClient {
           edits_(interactive && terminal.out.hasCursor() && !options.display.json),
           reader_(STDIN_FILENO, client_.conversation(),
                   options.display.json || !terminal.out.isTerminal() ? terminal.err : terminal.out),
-          prompts_(client_, reading(LineEditor::For::Input), reading(LineEditor::For::Code)) {}
+          prompts_(std::in_place, client_, reading(LineEditor::For::Input), reading(LineEditor::For::Code),
+                   options.display.json ? terminal.err : terminal.out) {}
 
     Client& client() noexcept { return client_; }
 
     /// How code is read. The object must outlive what is returned.
-    Prompts::Read readingCode() { return reading(LineEditor::For::Code); }
+    Prompts::Read readingCode() {
+        return [this](const std::string& prompt, const std::function<bool()>& done) {
+            return prompts_->readCode(prompt, done);
+        };
+    }
+
+    /// Ends the session as Client::finish() does. Who leaves at once is asked nothing more.
+    void finish(Leave leave) {
+        if (leave == Leave::AtOnce) {
+            prompts_.reset();
+        }
+        if (const std::string note = client_.finish(leave); !note.empty()) {
+            std::cerr << "krutil: " << note << std::endl;
+        }
+    }
 
   private:
     Prompts::Read reading(LineEditor::For what) {
@@ -114,52 +123,58 @@ class AskingClient {
     const bool edits_;
     LineReader reader_;
     std::optional<LineEditor> editor_;
-    Prompts prompts_;
+    std::optional<Prompts> prompts_;
 };
 
 bool standardInputIsTerminal() {
     return ::isatty(STDIN_FILENO) == 1;
 }
 
+// Does a command's work in the session, and ends that in good order.
+ExitCode inSession(AskingClient& asking, const std::function<ExitCode()>& work) {
+    ExitCode result{};
+    try {
+        result = work();
+    } catch (const Failure& failure) {
+        // What this end cannot send or store is no fault of the session.
+        if (failure.code() == ExitCode::Usage) {
+            asking.finish(Leave::AtOnce);
+        }
+        throw;
+    } catch (const Cancelled&) {
+        asking.finish(Leave::AtOnce);
+        throw;
+    }
+    asking.finish(Leave::WhenAnswered);
+    return result;
+}
+
 ExitCode runCommand(const Options& options, const EvalOptions& eval, Printer& printer, Terminal& terminal) {
     const std::string code = readCode(eval);
     AskingClient asking(options, printer, terminal, !eval.fromStandardInput && standardInputIsTerminal());
-    const ExitCode result = evaluate(asking.client(), eval, code);
-    finish(asking.client());
-    return result;
+    return inSession(asking, [&] { return evaluate(asking.client(), eval, code); });
 }
 
 ExitCode runCommand(const Options& options, const ReplOptions& repl, Printer& printer, Terminal& terminal) {
     const bool person = standardInputIsTerminal();
     AskingClient asking(options, printer, terminal, person, repl.noHistory ? std::string() : defaultHistoryFile());
-    const ExitCode result = readAndEvaluate(asking.client(), repl, asking.readingCode(), person,
-                                            options.display.json ? terminal.err : terminal.out, terminal.interrupt);
-    finish(asking.client());
-    return result;
+    return inSession(asking, [&] {
+        return readAndEvaluate(asking.client(), repl, asking.readingCode(), person,
+                               options.display.json ? terminal.err : terminal.out, terminal.interrupt);
+    });
 }
 
 ExitCode runCommand(const Options& options, const RunOptions& run, Printer& printer, Terminal& terminal) {
     const std::string script = readScript(run);
     AskingClient asking(options, printer, terminal, standardInputIsTerminal());
-    const ExitCode result = runScript(asking.client(), run, script);
-    finish(asking.client());
-    return result;
+    return inSession(asking, [&] { return runScript(asking.client(), run, script); });
 }
 
 ExitCode runCommand(const Options& options, const CallOptions& call, Printer& printer, Terminal& terminal) {
     PreparedCall prepared = prepareCall(call);
     AskingClient asking(options, printer, terminal, standardInputIsTerminal());
-    try {
-        const ExitCode result = callFunction(asking.client(), call, std::move(prepared), printer, terminal.err);
-        finish(asking.client());
-        return result;
-    } catch (const Failure& failure) {
-        // What this end cannot send or store is no fault of the session, which ends in good order.
-        if (failure.code() == ExitCode::Usage) {
-            finish(asking.client());
-        }
-        throw;
-    }
+    return inSession(asking,
+                     [&] { return callFunction(asking.client(), call, std::move(prepared), printer, terminal.err); });
 }
 
 ExitCode runReporting(const Options& options) {

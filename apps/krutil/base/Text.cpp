@@ -22,6 +22,19 @@ std::optional<std::size_t> firstInvalidUtf8(const std::string& text) {
                                     text.begin());
 }
 
+std::string nameOfCode(const std::string& code) {
+    constexpr std::size_t longest = 60;
+    std::string name = code.substr(0, code.find('\n'));
+    if (name.size() > longest) {
+        name.resize(longest);
+        while (firstInvalidUtf8(name)) {
+            name.pop_back();
+        }
+        name += "...";
+    }
+    return name;
+}
+
 std::string toUtf8(std::wstring_view text) {
     std::mbstate_t state{};
     std::string result;

@@ -18,6 +18,9 @@ std::optional<std::size_t> firstInvalidUtf8(const std::string& text);
 std::string toUtf8(std::wstring_view text);
 std::wstring toWide(std::string_view text);
 
+/// What a list of requests calls a piece of code: the beginning of its first line.
+std::string nameOfCode(const std::string& code);
+
 /// "output", "error" or "generic".
 std::string_view streamName(krutil::io::StreamTypeEnum stream);
 

@@ -187,8 +187,7 @@ ExitCode callFunction(Client& client, const CallOptions& options, PreparedCall c
     Answer answer;
     {
         const TransferDisplay display(client, err, toSend);
-        answer = client.request(iip, krutil::cmddistributor::WhenToDequeue::DEQUEUE_AT_IDLE, options.function,
-                                options.sparingly);
+        answer = client.request({.iip = iip, .name = options.function, .sparingly = options.sparingly});
     }
     if (answer.exitCode != ExitCode::Ok) {
         return answer.exitCode;

@@ -4,16 +4,12 @@
 #include <unistd.h>
 
 #include <array>
-#include <boost/make_shared.hpp>
 #include <cerrno>
 #include <cstring>
 #include <string>
-#include <string_view>
 
-#include "cmddistributor/EvalIIP.hpp"
 #include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "krutil/base/Text.hpp"
-#include "msg_svc/protobuf/ustring.hpp"
 
 namespace krutil_client {
 namespace {
@@ -34,23 +30,6 @@ std::string readAll(int fd, const std::string& name) {
             throw Failure(ExitCode::Usage, "cannot read " + name + ": " + std::strerror(errno));
         }
     }
-}
-
-// What a list of requests shows: the file's name, or the beginning of the code's first line.
-std::string displayName(const EvalOptions& options, const std::string& code) {
-    if (options.fromFile) {
-        return options.source;
-    }
-    constexpr std::size_t longest = 60;
-    std::string name = code.substr(0, code.find('\n'));
-    if (name.size() > longest) {
-        name.resize(longest);
-        while (firstInvalidUtf8(name)) {
-            name.pop_back();
-        }
-        name += "...";
-    }
-    return name;
 }
 
 }  // namespace
@@ -77,11 +56,11 @@ std::string readCode(const EvalOptions& options) {
 }
 
 ExitCode evaluate(Client& client, const EvalOptions& options, const std::string& code) {
-    const auto iip = boost::make_shared<const cmddistributor::EvalIIP>(
-        "python", cmddistributor::IqmStreamID::ekIqmCmdWinStream, nullptr, client.outTraits(options.sink),
-        client.errTraits(options.sink), msg_svc::protobuf::utf8_to_ustring(code), options.type);
-    const auto when = krutil::cmddistributor::WhenToDequeue::DEQUEUE_AT_IDLE;
-    return client.request(iip, when, displayName(options, code), options.sparingly).exitCode;
+    const std::string name = options.fromFile ? options.source : nameOfCode(code);
+    return client
+        .request(
+            {.iip = client.evaluation(code, options.type, options.sink), .name = name, .sparingly = options.sparingly})
+        .exitCode;
 }
 
 }  // namespace krutil_client

@@ -7,6 +7,7 @@
 
 #include "krutil/commands/EvalCommand.hpp"
 #include "krutil/terminal/PythonInput.hpp"
+#include "krutil/terminal/QueueCommand.hpp"
 
 namespace krutil_client {
 namespace {
@@ -14,10 +15,13 @@ namespace {
 constexpr const char* helpText = R"(Python code is evaluated on the engine. A block ends with an empty line.
   :timing on|off      say how long each request took
   :debugger on|off    whether breakpoint() stops here
+  :queue              list what runs and what waits on the engine, and what each end can do
+  :queue cancel N     cancel the request with this number in the list
   :help               this text
   :quit               leave, as Ctrl-D does
 Ctrl-C drops what has been typed, or cancels what runs; a second one within two seconds ends the engine.
-At debug> and keyboard>, :c goes on and :q (or Ctrl-D) quits.
+At debug> and keyboard>, :c goes on and :q (or Ctrl-D) quits. Lines that are pasted there are sent at once; what :c
+leaves behind of them runs at the next prompt or when the code has ended.
 )";
 
 // Ctrl-C drops a line, as long as this lives.
@@ -71,7 +75,7 @@ bool obey(Client& client, const std::string& line, Output& out) {
         client.setDebugging(command == ":debugger on");
     } else if (command == ":help") {
         out.write(helpText);
-    } else {
+    } else if (!obeyQueueCommand(client, command, out)) {
         out.write("There is no command '" + command + "'; :help lists them.\n");
     }
     return true;

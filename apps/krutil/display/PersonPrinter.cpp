@@ -65,7 +65,7 @@ void PersonPrinter::returned(const Returned& output) {
 }
 
 void PersonPrinter::replied(const Replied& reply) {
-    if (reply.error == nullptr || reply.errorPrinted) {
+    if (reply.error == nullptr || reply.told) {
         return;
     }
     switch (reply.error->getExecutionStatus()) {

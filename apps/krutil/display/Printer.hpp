@@ -19,7 +19,7 @@ namespace krutil_client {
 struct Replied {
     foundation::msg_svc::exchange::IDType request;
     const cmddistributor::RuntimeException* error;  ///< null for success; valid during the call
-    bool errorPrinted = false;                      ///< the engine has sent the text to print for the error
+    bool told = false;  ///< a person needs no text for the error: the engine has sent one, or nobody waits for it
 };
 
 /// An output of a function that was called. The references are valid during the call only.

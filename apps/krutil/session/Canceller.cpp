@@ -10,12 +10,12 @@ namespace krutil_client {
 
 using cmddistributor::IIPCancelReply;
 
-Canceller::Canceller(Conversation& conversation, EngineProcess& engine, Interrupt& interrupt,
-                     const foundation::msg_svc::exchange::IDType& request, Say say)
+Canceller::Canceller(Conversation& conversation, EngineProcess& engine, Interrupt& interrupt, Requests requests,
+                     Say say)
     : conversation_(conversation),
       engine_(engine),
       interrupt_(interrupt),
-      request_(request),
+      requests_(std::move(requests)),
       say_(std::move(say)),
       actionBefore_(interrupt.setAction([this] { interrupted(); })) {}
 
@@ -47,13 +47,17 @@ void Canceller::interrupted() {
                                                  : "cancelled; the connection was closed, which ends the session");
     }
     asked_ = now;
-    conversation_.send(boost::make_shared<const cmddistributor::IIPCancelMessage>(request_, true),
-                       [this, alive = alive_](const Conversation::Reply& reply) {
-                           const auto cancel = boost::dynamic_pointer_cast<const IIPCancelReply>(reply);
-                           if (*alive && cancel) {
-                               answered(cancel->getStatus());
-                           }
-                       });
+    // The last one first: those that wait must not begin when the one that runs ends.
+    const auto requests = requests_();
+    for (auto request = requests.rbegin(); request != requests.rend(); ++request) {
+        conversation_.send(boost::make_shared<const cmddistributor::IIPCancelMessage>(*request, true),
+                           [this, alive = alive_](const Conversation::Reply& reply) {
+                               const auto cancel = boost::dynamic_pointer_cast<const IIPCancelReply>(reply);
+                               if (*alive && cancel) {
+                                   answered(cancel->getStatus());
+                               }
+                           });
+    }
 }
 
 void Canceller::answered(IIPCancelReply::CancelStatus status) {

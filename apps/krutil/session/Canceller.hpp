@@ -1,4 +1,4 @@
-// What Ctrl-C does while a request runs.
+// What Ctrl-C does while requests are under way.
 #pragma once
 
 #include <chrono>
@@ -6,6 +6,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "cmddistributor/IIPCancelReply.hpp"
 #include "foundation/msg_svc/exchange/IDType.hpp"
@@ -15,7 +16,7 @@
 
 namespace krutil_client {
 
-/// While an object lives, the first Ctrl-C asks the engine to cancel a request, even if it runs, and a second one
+/// While an object lives, the first Ctrl-C asks the engine to cancel requests, even those that run, and a second one
 /// within two seconds ends the engine: a child is killed, a connection is closed, which ends the process that serves
 /// it. Objects nest, for requests within requests; the innermost counts. Main thread only.
 class Canceller {
@@ -29,9 +30,11 @@ class Canceller {
     /// How long an engine that was told to stop may take before the person is told that it has not.
     static constexpr std::chrono::milliseconds patience{1'500};
 
+    /// The requests that a Ctrl-C is about, in the order in which they were sent; asked when it comes.
+    using Requests = std::function<std::vector<foundation::msg_svc::exchange::IDType>()>;
+
     /// All must outlive the object.
-    Canceller(Conversation& conversation, EngineProcess& engine, Interrupt& interrupt,
-              const foundation::msg_svc::exchange::IDType& request, Say say);
+    Canceller(Conversation& conversation, EngineProcess& engine, Interrupt& interrupt, Requests requests, Say say);
     ~Canceller();
     Canceller(const Canceller&) = delete;
     Canceller& operator=(const Canceller&) = delete;
@@ -47,7 +50,7 @@ class Canceller {
     Conversation& conversation_;
     EngineProcess& engine_;
     Interrupt& interrupt_;
-    const foundation::msg_svc::exchange::IDType request_;
+    const Requests requests_;
     const Say say_;
     std::function<void()> actionBefore_;
     std::optional<Conversation::Clock::time_point> asked_;

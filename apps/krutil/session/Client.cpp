@@ -9,14 +9,15 @@
 #include <utility>
 
 #include "KrutilProtocol.hpp"
+#include "cmddistributor/EvalIIP.hpp"
+#include "cmddistributor/IIPCancelMessage.hpp"
+#include "cmddistributor/IIPCancelReply.hpp"
 #include "cmddistributor/IIPEnqueueMessage.hpp"
 #include "common/Build.hpp"
 #include "common/Precheck.hpp"
 #include "krutil/capabilities_api/CapabilitiesChanged.hpp"
-#include "krutil/io/PrintableErrorEvent.hpp"
 #include "krutil/io/SinkTextEvent.hpp"
 #include "krutil/io/TextBaseEvent.hpp"
-#include "krutil/session/Canceller.hpp"
 #include "msg_svc/protobuf/ustring.hpp"
 
 namespace krutil_client {
@@ -59,43 +60,6 @@ capabilities::CapabilityList capabilitiesHere(const ConnectionOptions& options, 
     return list;
 }
 
-// Whether the engine has sent the text to print for a request's error, as long as this lives.
-class ErrorPrinted {
-  public:
-    ErrorPrinted(foundation::msg_svc::eventmgr::EventMgr& events, const foundation::msg_svc::exchange::IDType& request)
-        : events_(events),
-          subscription_(events.subscribe<krutil::io::PrintableErrorEvent>(
-              [this, request](const krutil::io::PrintableErrorEvent& event) {
-                  printed_ = printed_ || event.getRequestId() == request;
-              })) {}
-    ~ErrorPrinted() { events_.unsubscribe(subscription_); }
-    ErrorPrinted(const ErrorPrinted&) = delete;
-    ErrorPrinted& operator=(const ErrorPrinted&) = delete;
-
-    bool printed() const noexcept { return printed_; }
-
-  private:
-    foundation::msg_svc::eventmgr::EventMgr& events_;
-    bool printed_ = false;
-    foundation::msg_svc::eventmgr::EventMgr::Subscription subscription_;
-};
-
-// A request among the unanswered ones, as long as this lives.
-class Unanswered {
-  public:
-    using IDType = foundation::msg_svc::exchange::IDType;
-
-    Unanswered(std::vector<IDType>& requests, const IDType& request) : requests_(requests) {
-        requests_.push_back(request);
-    }
-    ~Unanswered() { requests_.pop_back(); }
-    Unanswered(const Unanswered&) = delete;
-    Unanswered& operator=(const Unanswered&) = delete;
-
-  private:
-    std::vector<IDType>& requests_;
-};
-
 }  // namespace
 
 Client::Client(const ConnectionOptions& connection, const DisplayOptions& display, Printer& printer, const Output& out,
@@ -125,10 +89,10 @@ Client::Client(const ConnectionOptions& connection, const DisplayOptions& displa
     conversation_ = openConversation(connection, interactive);
     conversation_->watch(engine_.watch(), [this] {
         // The end of the stream follows, and is what ends a request; unless another process holds the stream.
-        const bool idle = unanswered_.empty();
+        const bool idle = requests_.unanswered().empty();
         try {
             if (conversation_->runUntil(Conversation::Clock::now() + patienceForStream,
-                                        [this, idle] { return !idle && unanswered_.empty(); })) {
+                                        [this, idle] { return !idle && requests_.unanswered().empty(); })) {
                 return;
             }
         } catch (const SessionOver&) {
@@ -191,55 +155,107 @@ krutil::io::SinkTraits Client::errTraits(const SinkOptions& options) const {
     return {false, options.hotlinks && err_.isTerminal(), err_.isTerminal(), options.diary, options.echo, options.log};
 }
 
-Answer Client::request(const boost::shared_ptr<const cmddistributor::IIP>& iip,
-                       krutil::cmddistributor::WhenToDequeue::WhenToDequeue when, const std::string& name,
-                       bool sparingly) {
-    const auto id = foundation::msg_svc::exchange::IDType::random();
+boost::shared_ptr<const cmddistributor::IIP> Client::evaluation(const std::string& code, cmddistributor::CodeType type,
+                                                                const SinkOptions& options) const {
+    return boost::make_shared<const cmddistributor::EvalIIP>("python", cmddistributor::IqmStreamID::ekIqmCmdWinStream,
+                                                             nullptr, outTraits(options), errTraits(options),
+                                                             msg_svc::protobuf::utf8_to_ustring(code), type);
+}
+
+Client::Sent Client::send(const NewRequest& request) {
+    const auto sent = std::make_shared<SentRequest>();
+    sent->id = foundation::msg_svc::exchange::IDType::random();
+    sent->name = request.name;
     const auto message = boost::make_shared<const cmddistributor::IIPEnqueueMessage>(
-        iip, id, krutil::contextmgr::QcrID{0}, boost::none, nullptr, when, msg_svc::protobuf::utf8_to_ustring(name),
-        capabilities::CapabilityList{}, nullptr, sparingly);
+        request.iip, sent->id, krutil::contextmgr::QcrID{0}, boost::none, nullptr, request.when,
+        msg_svc::protobuf::utf8_to_ustring(request.name), capabilities::CapabilityList{}, nullptr, request.sparingly);
+    // Requests at prompts are a part of the one that they hold up.
+    const bool timed = timing_ && request.when == krutil::cmddistributor::WhenToDequeue::DEQUEUE_AT_IDLE;
     Timing timing;
-    if (timing_) {
+    if (timed) {
         timing.ready = std::exchange(ready_, std::nullopt);
+        firstText_.reset();
     }
-    firstText_.reset();
-    const auto sent = Conversation::Clock::now();
-    const ErrorPrinted errorPrinted(events_, id);
-    // Shared with the action, which may be called after this call has ended with an exception.
-    const auto answer = std::make_shared<Conversation::Reply>();
+    const auto begin = Conversation::Clock::now();
     try {
-        const Unanswered unanswered(unanswered_, id);
-        Canceller canceller(*conversation_, engine_, interrupt_, id,
-                            [this](const std::string& sentence) { say(sentence); });
-        conversation_->send(message, [answer](const Conversation::Reply& reply) { *answer = reply; });
-        canceller.run([&answer] { return *answer != nullptr; });
-    } catch (const SessionOver& over) {
-        fail(over.end(), "before it answered");
+        conversation_->send(message, [this, sent, timed, timing, begin](const Conversation::Reply& reply) {
+            Timing whole = timing;
+            whole.answered = Conversation::Clock::now() - begin;
+            if (firstText_) {
+                whole.firstOutput = *firstText_ - begin;
+            }
+            answered(*sent, reply);
+            if (timed) {
+                printer_.timed(whole);
+            }
+        });
     } catch (const session::LimitExceeded& error) {
         throw Failure(ExitCode::Usage, error.what());
     }
-    timing.answered = Conversation::Clock::now() - sent;
-    if (firstText_) {
-        timing.firstOutput = *firstText_ - sent;
-    }
+    requests_.add(sent);
+    return sent;
+}
 
-    const auto reply = boost::dynamic_pointer_cast<const krutil::cmddistributor::IIPReply>(*answer);
-    if (!reply || (reply->getResult() && reply->getResult()->id != id)) {
+void Client::answered(SentRequest& request, const Conversation::Reply& answer) {
+    const auto reply = boost::dynamic_pointer_cast<const krutil::cmddistributor::IIPReply>(answer);
+    if (!reply || (reply->getResult() && reply->getResult()->id != request.id)) {
         violated(!reply ? "the engine answered a request with something that is no answer to it"
                         : "the engine answered a request with the result of another one");
     }
     const auto* error =
         reply->getResult() && reply->getResult()->getException() ? &*reply->getResult()->getException() : nullptr;
-    printer_.replied({id, error, errorPrinted.printed()});
-    // Requests at prompts are a part of the one that they hold up.
-    if (timing_ && unanswered_.empty()) {
-        printer_.timed(timing);
+    const bool cancelled = error != nullptr && error->getExecutionStatus() == krutil::cmddistributor::inEXECUTION_CTRLC;
+    requests_.remove(request);
+    request.answer = {error == nullptr ? ExitCode::Ok : cancelled ? ExitCode::Cancelled : ExitCode::CodeError, reply};
+    printer_.replied({request.id, error, request.errorPrinted || request.withdrawn});
+}
+
+void Client::wait(const std::vector<Sent>& requests, const std::function<bool()>& done) {
+    try {
+        cancelling(requests).run(done);
+    } catch (const SessionOver& over) {
+        fail(over.end(), "before it answered");
     }
-    if (error == nullptr) {
-        return {ExitCode::Ok, reply};
+}
+
+Answer Client::request(const NewRequest& request) {
+    const Sent sent = send(request);
+    wait({sent}, [&sent] { return sent->answer.has_value(); });
+    return *sent->answer;
+}
+
+Canceller Client::cancelling(std::vector<Sent> requests) {
+    const auto unanswered = [requests = std::move(requests)] {
+        std::vector<foundation::msg_svc::exchange::IDType> ids;
+        for (const Sent& request : requests) {
+            if (!request->answer) {
+                ids.push_back(request->id);
+            }
+        }
+        return ids;
+    };
+    return Canceller(*conversation_, engine_, interrupt_, unanswered,
+                     [this](const std::string& sentence) { say(sentence); });
+}
+
+void Client::cancel(const Sent& request) {
+    using cmddistributor::IIPCancelReply;
+    conversation_->send(
+        boost::make_shared<const cmddistributor::IIPCancelMessage>(request->id, true),
+        [this, request](const Conversation::Reply& reply) {
+            const auto* const cancel = dynamic_cast<const IIPCancelReply*>(reply.get());
+            if (cancel != nullptr && cancel->getStatus() == IIPCancelReply::UNABLE_TO_CANCEL_ALREADY_RUNNING) {
+                say("the engine does not interrupt request " + std::to_string(request->number));
+            }
+        });
+}
+
+void Client::withdraw(const Sent& request) {
+    if (const auto listed = requests_.find(request->id)) {
+        listed->withdrawn = true;
+        conversation_->send(boost::make_shared<const cmddistributor::IIPCancelMessage>(request->id, false),
+                            [](const Conversation::Reply&) {});
     }
-    const bool cancelled = error->getExecutionStatus() == krutil::cmddistributor::inEXECUTION_CTRLC;
-    return {cancelled ? ExitCode::Cancelled : ExitCode::CodeError, reply};
 }
 
 void Client::setDebugging(bool on) {
@@ -263,7 +279,30 @@ void Client::violated(const std::string& text) {
     throw Failure(ExitCode::Violation, text);
 }
 
-std::string Client::finish() {
+void Client::awaitAnswers(Leave leave, Conversation::Clock::time_point deadline) {
+    const auto none = [this] { return requests_.unanswered().empty(); };
+    const std::vector<Sent> left(requests_.unanswered().begin(), requests_.unanswered().end());
+    if (leave == Leave::WhenAnswered) {
+        const auto waited = std::count_if(left.begin(), left.end(), [](const Sent& each) { return !each->withdrawn; });
+        if (waited > 0) {
+            say("waits for " + std::to_string(waited) + (waited == 1 ? " request" : " requests") +
+                "; Ctrl-C cancels what is left");
+        }
+        wait(left, none);
+        return;
+    }
+    for (auto request = left.rbegin(); request != left.rend(); ++request) {
+        cancel(*request);
+    }
+    try {
+        conversation_->runUntil(deadline, none);
+    } catch (const SessionOver&) {
+        // There is nothing left to cancel.
+    }
+}
+
+std::string Client::finish(Leave leave) {
+    awaitAnswers(leave, Conversation::Clock::now() + patienceForGoodbye);
     conversation_->watch(-1, nullptr);
     const auto deadline = Conversation::Clock::now() + patienceForGoodbye;
     std::optional<Conversation::SessionEnd> ended;

@@ -2,30 +2,40 @@
 #pragma once
 
 #include <boost/shared_ptr.hpp>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "cmddistributor/CodeType.hpp"
 #include "cmddistributor/IIP.hpp"
 #include "foundation/msg_svc/eventmgr/EventMgr.hpp"
-#include "krutil/base/ExitCode.hpp"
 #include "krutil/base/Interrupt.hpp"
 #include "krutil/base/Options.hpp"
 #include "krutil/base/Output.hpp"
-#include "krutil/cmddistributor/IIPReply.hpp"
 #include "krutil/cmddistributor/WhenToDequeue.hpp"
 #include "krutil/display/Printer.hpp"
+#include "krutil/session/Canceller.hpp"
 #include "krutil/session/Conversation.hpp"
 #include "krutil/session/EngineProcess.hpp"
+#include "krutil/session/RequestList.hpp"
 #include "krutil/session/Tracer.hpp"
 
 namespace krutil_client {
 
-/// What came of a request.
-struct Answer {
-    ExitCode exitCode;  ///< Ok, CodeError or Cancelled
-    boost::shared_ptr<const krutil::cmddistributor::IIPReply> reply;
+/// A request to be sent.
+struct NewRequest {
+    boost::shared_ptr<const cmddistributor::IIP> iip;
+    std::string name;  ///< for lists of requests; UTF-8
+    krutil::cmddistributor::WhenToDequeue::WhenToDequeue when = krutil::cmddistributor::WhenToDequeue::DEQUEUE_AT_IDLE;
+    bool sparingly = false;
+};
+
+/// What becomes of requests without an answer when the client leaves.
+enum class Leave {
+    WhenAnswered,  ///< they are waited for
+    AtOnce,        ///< they are cancelled
 };
 
 /// Starts or reaches the engine, sends requests, and ends in good order. Failures of the engine or the session come out
@@ -48,13 +58,41 @@ class Client {
     krutil::io::SinkTraits outTraits(const SinkOptions& options) const;
     krutil::io::SinkTraits errTraits(const SinkOptions& options) const;
 
-    /// Sends a request and shows what comes, up to how it ended; what else the reply holds is the caller's to show.
-    /// `name` is UTF-8. Throws Failure and what printing and Ctrl-C throw.
-    Answer request(const boost::shared_ptr<const cmddistributor::IIP>& iip,
-                   krutil::cmddistributor::WhenToDequeue::WhenToDequeue when, const std::string& name, bool sparingly);
+    /// A request to evaluate `code`, which is UTF-8.
+    boost::shared_ptr<const cmddistributor::IIP> evaluation(const std::string& code, cmddistributor::CodeType type,
+                                                            const SinkOptions& options) const;
 
-    /// The requests that have not been answered, the innermost one last: requests nest at prompts.
-    const std::vector<foundation::msg_svc::exchange::IDType>& unanswered() const noexcept { return unanswered_; }
+    using Sent = std::shared_ptr<const SentRequest>;
+
+    /// Sends a request. What comes of it is shown whenever the program waits, up to how it ended; what else the reply
+    /// holds is the caller's to show. Throws Failure: Usage for one that is larger than the engine accepts.
+    Sent send(const NewRequest& request);
+
+    /// Delivers until `done` returns true. Ctrl-C cancels those of `requests` that have no answer. Throws Failure and
+    /// what printing and Ctrl-C throw.
+    void wait(const std::vector<Sent>& requests, const std::function<bool()>& done);
+
+    /// Sends a request and waits for its answer. Throws what both throw.
+    Answer request(const NewRequest& request);
+
+    /// While the object lives, Ctrl-C cancels those of `requests` that have no answer.
+    Canceller cancelling(std::vector<Sent> requests);
+
+    /// Asks the engine to cancel a request, even if it runs. A person is told if it does not.
+    void cancel(const Sent& request);
+
+    /// Takes back a request that came too late, unless the engine has begun it: nobody waits for its answer.
+    void withdraw(const Sent& request);
+
+    /// The requests without an answer.
+    const RequestList& requests() const noexcept { return requests_; }
+
+    /// What the two ends can do, as far as they have said.
+    const capabilities::CapabilityList& capabilities() const noexcept { return capabilities_; }
+    const capabilities::CapabilityList& engineCapabilities() const noexcept { return engineCapabilities_; }
+
+    /// Shows a sentence to the person.
+    void say(const std::string& sentence);
 
     /// Whether requests from now on are timed.
     void setTiming(bool on) noexcept { timing_ = on; }
@@ -69,13 +107,17 @@ class Client {
     /// Ends the session because the engine broke the protocol: throws a Failure with `text`.
     [[noreturn]] void violated(const std::string& text);
 
-    /// Says goodbye, waits until the engine has gone, and ends one that does not go. Returns what a person should know
-    /// about how it went, empty when all is well. Throws Failure when the engine broke the protocol meanwhile.
-    std::string finish();
+    /// Ends the session in good order. All cancels precede the goodbye, and nothing follows it. Requests that are to be
+    /// answered are waited for as long as they take; after that, and for those that are cancelled, an engine that takes
+    /// longer than some seconds to go is ended. Returns what a person should know about how it went, empty when all is
+    /// well. Throws Failure when an answer does not come or the engine breaks the protocol meanwhile, and what Ctrl-C
+    /// throws.
+    std::string finish(Leave leave = Leave::WhenAnswered);
 
   private:
     std::unique_ptr<Conversation> openConversation(const ConnectionOptions& connection, bool interactive);
-    void say(const std::string& sentence);
+    void answered(SentRequest& request, const Conversation::Reply& answer);
+    void awaitAnswers(Leave leave, Conversation::Clock::time_point deadline);
     [[noreturn]] void fail(const Conversation::SessionEnd& end, const std::string& when);
     [[noreturn]] void failLost(const std::string& text, const std::string& when);
 
@@ -89,7 +131,7 @@ class Client {
     std::optional<Timing::Duration> ready_;  ///< until the first request has told it
     foundation::msg_svc::eventmgr::EventMgr events_;
     std::optional<Conversation::Clock::time_point> firstText_;
-    std::vector<foundation::msg_svc::exchange::IDType> unanswered_;
+    RequestList requests_{events_};
     capabilities::CapabilityList capabilities_;
     capabilities::CapabilityList engineCapabilities_;
     std::unique_ptr<Tracer> tracer_;

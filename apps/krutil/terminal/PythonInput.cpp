@@ -1,12 +1,14 @@
 #include "krutil/terminal/PythonInput.hpp"
 
 #include <algorithm>
+#include <array>
 #include <cstddef>
 
 namespace krutil_client {
 namespace {
 
 constexpr std::string_view space = " \t\r\f";
+constexpr std::string_view blank = " \t\r\f\n";
 
 // Goes through code as Python's tokenizer does, as far as lines matter.
 class Scanner {
@@ -38,6 +40,13 @@ class Scanner {
 
     bool block() const { return block_; }
 
+    // Where a line begins that goes on with none before it: outside of brackets and strings.
+    struct Start {
+        std::size_t at;
+        bool inHead;  // the line before begins a block, or decorates what comes
+    };
+    const std::vector<Start>& starts() const { return starts_; }
+
   private:
     void passCharacter(char c) {
         ++at_;
@@ -47,9 +56,10 @@ class Scanner {
             depth_ = std::max(depth_ - 1, 0);
         } else if (c == '\n' && depth_ == 0) {
             endLine();
+            starts_.push_back({at_, inHead_});
             return;
         } else if (c == '@' && last_ == '\0') {
-            block_ = true;
+            decorator_ = true;
         }
         if (c != '\n' && space.find(c) == std::string_view::npos) {
             last_ = c;
@@ -57,7 +67,11 @@ class Scanner {
     }
 
     void endLine() {
-        block_ = block_ || (depth_ == 0 && last_ == ':');
+        if (last_ != '\0') {
+            inHead_ = decorator_ || (depth_ == 0 && last_ == ':');
+            block_ = block_ || inHead_;
+        }
+        decorator_ = false;
         last_ = '\0';
     }
 
@@ -92,7 +106,31 @@ class Scanner {
     int depth_ = 0;
     char last_ = '\0';  // the last character of the line that counts
     bool block_ = false;
+    bool decorator_ = false;  // the line is one
+    bool inHead_ = false;     // the last line that counts begins a block, or decorates what comes
+    std::vector<Start> starts_;
 };
+
+// The first line of `text`.
+std::string_view lineOf(std::string_view text) {
+    return text.substr(0, text.find('\n'));
+}
+
+// Whether a line has more than a comment.
+bool hasCode(std::string_view line) {
+    const auto first = line.find_first_not_of(blank);
+    return first != std::string_view::npos && line[first] != '#';
+}
+
+// Whether a line, outside of brackets, strings and blocks' heads, begins a statement instead of going on with one.
+bool beginsStatement(std::string_view line) {
+    if (line.empty() || line[0] == '#' || space.find(line[0]) != std::string_view::npos) {
+        return false;
+    }
+    constexpr std::array<std::string_view, 4> goOn{"else", "elif", "except", "finally"};
+    const std::string_view word = line.substr(0, line.find_first_not_of("abcdefghijklmnopqrstuvwxyz"));
+    return std::find(goOn.begin(), goOn.end(), word) == goOn.end();
+}
 
 }  // namespace
 
@@ -105,6 +143,31 @@ bool needsMoreLines(std::string_view code) {
     const std::string_view lastLine = newline == std::string_view::npos ? code : code.substr(newline + 1);
     return scanner.block() &&
            (newline == std::string_view::npos || lastLine.find_first_not_of(space) != std::string_view::npos);
+}
+
+std::vector<std::string> piecesOf(std::string_view code) {
+    Scanner scanner(code);
+    scanner.openAtEnd();
+    std::vector<std::string> pieces;
+    std::size_t begin = 0;
+    bool begun = hasCode(lineOf(code));
+    for (const auto& start : scanner.starts()) {
+        const std::string_view line = lineOf(code.substr(start.at));
+        const bool afterCommand = begun && code[begin] == ':';
+        if (begun && !afterCommand && (start.inHead || !beginsStatement(line))) {
+            continue;
+        }
+        if (begun) {
+            const std::string_view piece = code.substr(begin, start.at - begin);
+            pieces.emplace_back(piece.substr(0, piece.find_last_not_of(blank) + 1));
+        }
+        begin = start.at;
+        begun = hasCode(line);
+    }
+    if (begun) {
+        pieces.emplace_back(code.substr(begin));
+    }
+    return pieces;
 }
 
 }  // namespace krutil_client

@@ -1,7 +1,9 @@
-// When the lines that a person has typed are worth evaluating.
+// Lines of Python that a person has typed or pasted: where code is complete, and where statements begin.
 #pragma once
 
+#include <string>
 #include <string_view>
+#include <vector>
 
 namespace krutil_client {
 
@@ -10,5 +12,10 @@ namespace krutil_client {
 /// a colon, or a decorator) and no empty line has ended it. An estimate for Python's grammar; what is wrong is for the
 /// engine to say.
 bool needsMoreLines(std::string_view code);
+
+/// The statements of `code`, each with all its lines; comments and empty lines between them belong to the one before. A
+/// line that begins with a colon, where a statement may begin, is a piece of its own. The last piece keeps the empty
+/// lines at its end. None for code without any. As much an estimate as needsMoreLines().
+std::vector<std::string> piecesOf(std::string_view code);
 
 }  // namespace krutil_client

@@ -54,10 +54,8 @@ class ClientCancelTest : public ::testing::Test, protected CaughtOutput {
         ConnectionOptions connection;
         connection.socket = peer.path();
         client.emplace(connection, DisplayOptions{}, printer, out, err, interrupt, false);
-        const auto iip = boost::make_shared<const cmddistributor::EvalIIP>(
-            "python", cmddistributor::IqmStreamID::ekIqmCmdWinStream, nullptr, krutil::io::SinkTraits{},
-            krutil::io::SinkTraits{}, u"1", cmddistributor::CodeType::CodeBlockType);
-        return client->request(iip, krutil::cmddistributor::WhenToDequeue::DEQUEUE_AT_IDLE, "", false);
+        return client->request(
+            {.iip = client->evaluation("1", cmddistributor::CodeType::CodeBlockType, {}), .name = ""});
     }
 
     static void cancelReply(ScriptedEngine& peer, ScriptedEngine::StreamID stream,
@@ -122,10 +120,12 @@ TEST_F(ClientCancelTest, AnEngineThatDoesNotStopIsTalkedAbout) {
         client.emplace(connection, DisplayOptions{}, printer, out, err, interrupt, false);
         bool said = false;
         std::string sentence;
-        Canceller canceller(client->conversation(), client->engine(), interrupt, request, [&](const std::string& text) {
-            sentence = text;
-            said = true;
-        });
+        Canceller canceller(
+            client->conversation(), client->engine(), interrupt, [this] { return std::vector{request}; },
+            [&](const std::string& text) {
+                sentence = text;
+                said = true;
+            });
         const auto begin = Conversation::Clock::now();
         pressCtrlC();
         canceller.run([&said] { return said; });

@@ -1,9 +1,13 @@
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include "krutil/terminal/PythonInput.hpp"
 
 namespace krutil_client {
 namespace {
+
+using ::testing::ElementsAre;
+using ::testing::IsEmpty;
 
 TEST(PythonInputTest, CompleteLinesNeedNoMore) {
     for (const char* code : {"", "x", "x = 1", "print(')')", "a[1:2]", "d = {1: 2}", "# (", "'(' # :", "x = '\\''",
@@ -38,6 +42,34 @@ TEST(PythonInputTest, ABlockGoesOnUntilAnEmptyLine) {
 TEST(PythonInputTest, AStringThatALineCannotHoldIsTheEnginesToRefuse) {
     EXPECT_FALSE(needsMoreLines("x = 'a"));
     EXPECT_FALSE(needsMoreLines("x = 'a\ny"));
+}
+
+TEST(PythonInputTest, PiecesAreStatementsWithAllTheirLines) {
+    EXPECT_THAT(piecesOf(""), IsEmpty());
+    EXPECT_THAT(piecesOf(" \n# only a comment\n"), IsEmpty());
+    EXPECT_THAT(piecesOf("a = 1"), ElementsAre("a = 1"));
+    EXPECT_THAT(piecesOf("a = 1\nb = 2\n"), ElementsAre("a = 1", "b = 2\n"));
+    EXPECT_THAT(piecesOf("\n# why\na = 1\n\n# why not\nb = 2"), ElementsAre("a = 1\n\n# why not", "b = 2"));
+    EXPECT_THAT(piecesOf("    a = 1\nb = 2"), ElementsAre("    a = 1", "b = 2"));
+    EXPECT_THAT(piecesOf("f(a,\nb)\ng(\"\"\"\nx\n\"\"\")\nh = \\\n1"),
+                ElementsAre("f(a,\nb)", "g(\"\"\"\nx\n\"\"\")", "h = \\\n1"));
+}
+
+TEST(PythonInputTest, BlocksStayWhole) {
+    EXPECT_THAT(piecesOf("def f():\n    a = 1\n\n# a comment\n    return a\nf()"),
+                ElementsAre("def f():\n    a = 1\n\n# a comment\n    return a", "f()"));
+    EXPECT_THAT(piecesOf("if a:\n  b\nelif c:\n  d\nelse:\n  e\nelsewhere = 1"),
+                ElementsAre("if a:\n  b\nelif c:\n  d\nelse:\n  e", "elsewhere = 1"));
+    EXPECT_THAT(piecesOf("try:\n  a\nexcept E:\n  b\nfinally:\n  c\nd"),
+                ElementsAre("try:\n  a\nexcept E:\n  b\nfinally:\n  c", "d"));
+    EXPECT_THAT(piecesOf("@one\n@two\ndef f(): pass\nf()"), ElementsAre("@one\n@two\ndef f(): pass", "f()"));
+}
+
+TEST(PythonInputTest, CommandsArePiecesOfTheirOwn) {
+    EXPECT_THAT(piecesOf(":c"), ElementsAre(":c"));
+    EXPECT_THAT(piecesOf("# why\n:c\n  \na"), ElementsAre(":c", "a"));
+    EXPECT_THAT(piecesOf("def f():\n  a\n:c\n:q\n  b"), ElementsAre("def f():\n  a", ":c", ":q", "  b"));
+    EXPECT_THAT(piecesOf("f(\n:c\n)"), ElementsAre("f(\n:c\n)"));
 }
 
 }  // namespace

@@ -4,6 +4,7 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <stdlib.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -61,6 +62,13 @@ class Happening {
     }
 
     void happen() const { ASSERT_EQ(::write(pipe_.get(), "\n", 1), 1); }
+
+    /// Waits until code has written something to the file itself.
+    void await() const {
+        constexpr int patience = 60'000;
+        pollfd watched{pipe_.get(), POLLIN, 0};
+        ASSERT_EQ(::poll(&watched, 1, patience), 1) << "nothing was written to " << file_;
+    }
 
   private:
     std::filesystem::path file_;
