@@ -4,7 +4,8 @@ program, from its upper rooms to its lower ones.
     includes.py ROOT
 
 Looks at the #include lines themselves and finds each included file as the compiler would: beside the including file,
-then in the include directories of the rooms.
+then in the include directories of the rooms. The page for hosts with a platform of their own must name each header that
+the product includes from the platform, and no other.
 """
 
 import fnmatch
@@ -17,6 +18,10 @@ import checkout
 PRODUCT = "src/qvm_services/krutil_protobuf"
 INCLUDE_DIRECTORIES = ["platform/include", "platform/src", PRODUCT, "apps"]
 INCLUDE = re.compile(r'^[ \t]*#[ \t]*include[ \t]*([<"])([^>"]+)[>"]', re.MULTILINE)
+
+# The headers that a platform of one's own must have, a row of a table for each.
+PORTING = "docs/porting.md"
+NEEDED = re.compile(r"^\| `([\w/]+\.hpp)` \|", re.MULTILINE)
 
 # Pseudo rooms for what exists in the build tree only.
 GENERATED = {"krutil.protobuf.*.pb.h": "product/generated", "*.pb.h": "platform/generated"}
@@ -106,8 +111,18 @@ def resolve(root, including, bracket, name):
     return None if bracket == "<" else ("nowhere", name)
 
 
+def check_porting(root, places):
+    """Findings about the page; places has each header of the platform that the product includes, and a place where."""
+    listed = NEEDED.findall(checkout.read(root, PORTING))
+    findings = [f"{places[name]}: {PORTING} does not list {name}" for name in sorted(set(places) - set(listed))]
+    findings += [f"{PORTING}: the product does not include {name}" for name in listed if name not in places]
+    findings += [f"{PORTING}: {name} twice" for name in sorted(set(listed)) if listed.count(name) > 1]
+    return findings
+
+
 def check(root):
     findings = []
+    platform = {}
     for path in checkout.files(root, ".hpp", ".cpp"):
         allowed = ALLOWED.get(room(path))
         if allowed is None:
@@ -126,7 +141,12 @@ def check(root):
                 findings.append(f"{place}: {target[1]} is the reference host's own; other platforms do not have it")
             else:
                 findings += check_programs(place, path, target[1])
-    return findings
+                if room(path).startswith("product") and target[0] == "platform/include":
+                    platform.setdefault(match[2], place)
+    for name in sorted(HOST_ONLY):
+        if not os.path.isfile(os.path.join(root, "platform/include", name)):
+            findings.append(f"tests/repository/includes.py: HOST_ONLY names {name}, which does not exist")
+    return findings + check_porting(root, platform)
 
 
 if __name__ == "__main__":

@@ -16,11 +16,13 @@ class Planted(unittest.TestCase):
         self.addCleanup(directory.cleanup)
         self.root = directory.name
         self.write("platform/include/io/Text.hpp", "// Text.\n#pragma once\nnamespace io {\n}\n")
-        self.write("platform/include/foundation/core/diag/AssertionSwitch.hpp", "// Switch.\n")
+        for name in includes.HOST_ONLY:
+            self.write(f"platform/include/{name}", "// The host's own.\n")
         self.write("platform/src/io/Detail.hpp", '#include "io/Text.hpp"\n')
         self.write(f"{includes.PRODUCT}/KrutilProtocol.hpp", '#include "io/Text.hpp"\n')
         self.write(f"{includes.PRODUCT}/Framing.hpp", "// Framing.\n")
         self.write("apps/common/Build.hpp", "// Build.\n")
+        self.write(includes.PORTING, "| `io/Text.hpp` | texts |\n")
 
     def write(self, path, text):
         file = os.path.join(self.root, path)
@@ -66,6 +68,21 @@ class IncludesTest(Planted):
     def test_product_includes_what_only_the_reference_host_has(self):
         line = '#include "foundation/core/diag/AssertionSwitch.hpp"'
         self.expect(f"{includes.PRODUCT}/A.cpp", line, "reference host's own")
+
+    def test_product_includes_what_the_page_for_platforms_does_not_list(self):
+        self.write("platform/include/io/Word.hpp", "// Word.\n")
+        self.expect(f"{includes.PRODUCT}/A.cpp", '#include "io/Word.hpp"', "docs/porting.md does not list io/Word.hpp")
+
+    def test_page_for_platforms_lists_what_the_product_does_not_include(self):
+        self.write(includes.PORTING, "| `io/Text.hpp` | texts |\n| `io/Word.hpp` | words |\n| `io/Text.hpp` | texts |\n")
+        self.assertEqual(includes.check(self.root), ["docs/porting.md: the product does not include io/Word.hpp",
+                                                     "docs/porting.md: io/Text.hpp twice"])
+
+    def test_header_of_the_reference_host_that_is_gone(self):
+        name = sorted(includes.HOST_ONLY)[0]
+        os.remove(os.path.join(self.root, "platform/include", name))
+        self.assertEqual(includes.check(self.root),
+                         [f"tests/repository/includes.py: HOST_ONLY names {name}, which does not exist"])
 
     def test_product_includes_apps(self):
         self.expect(f"{includes.PRODUCT}/A.cpp", "#include <common/Build.hpp>", "of apps")
