@@ -424,6 +424,13 @@ TEST_F(QDASerializerTest, AnOutOfLineBufferStandsBeforeTheTaggedFrame) {
     EXPECT_EQ(parsed<KORVEL_Array>(tagged).dataid(), 5U);
 }
 
+TEST_F(QDASerializerTest, ADataFrameOfIndex0IsFoundLikeAnyOther) {
+    const Array array = bytes(outOfLineThreshold);
+    EXPECT_EQ(write(array, 0), 2U);
+    EXPECT_EQ(parsed<KORVEL_Array>(*frames().at(1)).dataid(), 0U);
+    EXPECT_EQ(read(handOver(std::move(frames())), 1), array);
+}
+
 TEST_F(QDASerializerTest, OutOfLineBuffersOfEveryElementTypeHaveTheirFrameType) {
     for (int code = 1; code <= 23; ++code) {
         if (code == 3) {

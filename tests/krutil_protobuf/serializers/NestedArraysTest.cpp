@@ -12,7 +12,6 @@
 namespace {
 
 using arrays::ArraysTest;
-using arrays::dataIDs;
 using arrays::indexes;
 using arrays::large;
 using arrays::small;
