@@ -8,6 +8,7 @@
 
 #include "EvalIIPSerializer.hpp"
 #include "IIPSerializer.hpp"
+#include "krutil_protobuf/serializers/AllocationRecorder.hpp"
 #include "krutil_protobuf/support/TestTransport.hpp"
 
 namespace {
@@ -61,6 +62,11 @@ TEST(IIPTest, StreamAndPlugInTypeAndBothTraitsRoundTripWithoutTheUntransmittedFl
     EXPECT_EQ(back->getPluginType(), "x");
     expectTransmittedTraits(back->getOutTraits(), outTraits);
     expectTransmittedTraits(back->getErrTraits(), errTraits);
+}
+
+TEST(IIPTest, ARebuiltCoreLiesInOneAllocationWithItsCount) {
+    const auto back = IIPSerializer::fromProtobuf(IIPSerializer::toProtobuf(request(u"")));
+    EXPECT_FALSE(AllocationRecorder::beginsAt(dynamic_cast<const void*>(back.get())));
 }
 
 TEST(IIPTest, EachTraitHasItsOwnField) {

@@ -137,7 +137,7 @@ TEST_F(FEvalIIPTest, AFunctionGivenAsAnArrayThrowsAndItsArgumentsStayInTheStream
                                            FEvalIIP::Data::makeClientSideData(EDIDataWrapper({large(), small(1)})),
                                            IqmStreamID::ekIqmJavaStream, outTraits, errTraits, 3, 4, true);
     EXPECT_THROW(write(request, 1), boost::bad_get);
-    EXPECT_EQ(indexes(frames()), (std::vector<FrameIndex>{1, 2, 3}));
+    ASSERT_EQ(indexes(frames()), (std::vector<FrameIndex>{1, 2, 3}));
     EXPECT_EQ(transport::contentOf(*frames()[1]).tag, "krutil:QDA");
     EXPECT_EQ(transport::contentOf(*frames()[2]).tag, "krutil:QDA");
 }
