@@ -26,16 +26,33 @@ class TerminalQueueTest : public TerminalReplTest {
     // An expression that waits until it happens.
     static std::string waiting(const std::filesystem::path& file) { return "open('" + file.string() + "').readline()"; }
 
-    // Begins with an engine whose queue refuses one large line, and pastes `lines` at a debugger's prompt, before such
-    // a line. The first of them waits. Its answer is there before those lines are begun, so all of them are one batch.
+    // Pastes `lines` at a debugger's prompt, so that the prompt takes them as one batch: while they come, something
+    // else keeps the engine from taking any, and that they are there is seen by a last, large line that is refused.
     void pasteAtOnce(const std::string& lines) {
+        const Happening busy(directory / "busy");
+        const Happening free(directory / "free");
         begin(
             {"repl", "--trace-to", trace.string(), "--engine", "'" KRUTIL_ENGINE "' --stdio --max-queued-bytes 20000"});
+        // A call that does not give up Python's lock.
+        evaluate(first.thread("__import__('ctypes').PyDLL(None).system(b'echo > " + (directory / "busy").string() +
+                              "; read line < " + (directory / "free").string() + "')"));
         evaluate("breakpoint()", "", "debug> ");
-        terminal->type(
-            pasted("line = " + waiting(directory / "first") + "\r" + lines + "'" + std::string(12000, 'a') + "'"));
-        terminal->expect("The engine's queue is full: with this request, those that wait would hold more than 20000");
         first.happen();
+        busy.await();
+        terminal->type(pasted(lines + "'" + std::string(12000, 'a') + "'"));
+        terminal->expect("The engine's queue is full: with this request, those that wait would hold more than 20000");
+        free.happen();
+    }
+
+    // Begins, and has a line left behind that asks a question, up to where the answer is typed.
+    void beginWithQuestionLeftBehind() {
+        const std::string question = "'hi ' + input('name? ')";
+        begin();
+        evaluate("breakpoint()", "", "debug> ");
+        terminal->type(pasted("x = 1\r:c\r" + question));
+        terminal->expect("krutil: runs now: " + question + "\r\n");
+        terminal->expect("name? ");
+        terminal->expect(editing);
     }
 
     std::size_t traced(const std::string& name) const {
@@ -121,11 +138,7 @@ TEST_F(TerminalQueueTest, CtrlCCancelsAllPastedLines) {
 }
 
 TEST_F(TerminalQueueTest, ALineThatWasLeftBehindMayAsk) {
-    begin();
-    evaluate("breakpoint()", "", "debug> ");
-    terminal->type(pasted("x = 1\r:c\r'hi ' + input('name? ')"));
-    terminal->expect("name? ");
-    terminal->expect(editing);
+    beginWithQuestionLeftBehind();
     terminal->type("Ada\r");
     terminal->expect("'hi Ada'\r\n");
     expectPrompt();
@@ -134,11 +147,7 @@ TEST_F(TerminalQueueTest, ALineThatWasLeftBehindMayAsk) {
 }
 
 TEST_F(TerminalQueueTest, CtrlCAtTheQuestionOfALineThatWasLeftBehindCancelsIt) {
-    begin();
-    evaluate("breakpoint()", "", "debug> ");
-    terminal->type(pasted("x = 1\r:c\r'hi ' + input('name? ')"));
-    terminal->expect("name? ");
-    terminal->expect(editing);
+    beginWithQuestionLeftBehind();
     terminal->type("\x03");
     terminal->expect("krutil: cancelled\r\n");
     expectPrompt();
