@@ -28,10 +28,10 @@ namespace {
 namespace posix = foundation::core::posix;
 
 // How long sessions have to end after they were told to.
-constexpr std::chrono::seconds kSessionPatience{2};
+constexpr std::chrono::seconds sessionPatience{2};
 
 // How long a client waits that could not be accepted, until that is tried again. The end of a session shortens it.
-constexpr int kAcceptPauseMilliseconds = 1000;
+constexpr int acceptPauseMilliseconds = 1000;
 
 [[noreturn]] void fail(const std::string& what) {
     throw std::runtime_error(what);
@@ -174,11 +174,11 @@ void Listener::bindSocket() {
 
 ExitCode Listener::run() {
     log_.say("serving " + options_.listen);
-    while (true) {
+    for (;;) {
         // The socket stays readable while clients wait, so it is not watched while none can be accepted.
         const bool paused = failedAccepts_ > 0;
         std::array<pollfd, 2> watched{{{signals_, POLLIN, 0}, {paused ? -1 : socket_, POLLIN, 0}}};
-        if (::poll(watched.data(), watched.size(), paused ? kAcceptPauseMilliseconds : -1) < 0 && errno != EINTR) {
+        if (::poll(watched.data(), watched.size(), paused ? acceptPauseMilliseconds : -1) < 0 && errno != EINTR) {
             failWithErrno("Cannot wait for clients");
         }
         signalfd_siginfo signal{};
@@ -248,7 +248,7 @@ void Listener::accept() {
 
 void Listener::reap() {
     int status = 0;
-    while (true) {
+    for (;;) {
         const pid_t child = ::waitpid(-1, &status, WNOHANG);
         if (child <= 0) {
             return;
@@ -271,9 +271,9 @@ void Listener::endSessions() {
         ::sigaddset(&signals, SIGCHLD);
         return signals;
     }();
-    const auto deadline = std::chrono::steady_clock::now() + kSessionPatience;
+    const auto deadline = std::chrono::steady_clock::now() + sessionPatience;
     const auto reapQuietly = [this] {
-        while (true) {
+        for (;;) {
             const pid_t child = ::waitpid(-1, nullptr, WNOHANG);
             if (child <= 0) {
                 return;

@@ -10,7 +10,7 @@
 namespace qvm {
 namespace {
 
-constexpr int kUsageError = 2;
+constexpr int usageError = 2;
 
 }  // namespace
 
@@ -82,7 +82,7 @@ Options parseOptions(int argc, const char* const* argv) {
         }
     } catch (const CLI::ParseError& error) {
         const int status = app.exit(error);
-        std::exit(status == 0 ? EXIT_SUCCESS : kUsageError);
+        std::exit(status == 0 ? EXIT_SUCCESS : usageError);
     }
     options.handshakeTimeout = std::chrono::milliseconds(static_cast<long>(timeoutSeconds * 1000.0));
     return options;

@@ -14,6 +14,7 @@
 #include <utility>
 
 #include "msg_svc/protobuf/ustring.hpp"
+#include "qvm/process/StandardDescriptors.hpp"
 
 #if defined(KRUTIL_SANITIZED)
 #include <sanitizer/common_interface_defs.h>
@@ -22,11 +23,8 @@
 namespace qvm {
 namespace {
 
-// Programs that run code dup onto low numbers; private descriptors stay clear of them.
-constexpr int kPrivateFrom = 100;
-
 // Read at a time, so that one busy writer does not keep the other descriptor waiting.
-constexpr std::size_t kPieceBytes = 16'384;
+constexpr std::size_t pieceBytes = 16'384;
 
 std::atomic<OutputCapture*> current{nullptr};
 
@@ -113,8 +111,8 @@ void OutputCapture::redirect(Source& source) {
     if (::pipe2(ends.data(), O_CLOEXEC) != 0) {
         fail("Capturing output needs a pipe");
     }
-    source.before = ::fcntl(source.descriptor, F_DUPFD_CLOEXEC, kPrivateFrom);
-    source.pipe = ::fcntl(ends[0], F_DUPFD_CLOEXEC, kPrivateFrom);
+    source.before = ::fcntl(source.descriptor, F_DUPFD_CLOEXEC, firstPrivateDescriptor);
+    source.pipe = ::fcntl(ends[0], F_DUPFD_CLOEXEC, firstPrivateDescriptor);
     ::close(ends[0]);
     const bool done = source.before >= 0 && source.pipe >= 0 && ::fcntl(source.pipe, F_SETFL, O_NONBLOCK) == 0 &&
                       ::dup2(ends[1], source.descriptor) >= 0;
@@ -144,7 +142,7 @@ bool OutputCapture::readAvailable(Source& source) {
     }
     // No more than was there at first, or a busy writer would keep this going.
     while (available > 0) {
-        std::array<char, kPieceBytes> bytes;
+        std::array<char, pieceBytes> bytes;
         const ssize_t count =
             ::read(source.pipe, bytes.data(), std::min(bytes.size(), static_cast<std::size_t>(available)));
         if (count < 0 && errno == EINTR) {
@@ -161,7 +159,7 @@ bool OutputCapture::readAvailable(Source& source) {
 }
 
 bool OutputCapture::drain() {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     bool emitted = false;
     for (Source& source : sources_) {
         emitted = readAvailable(source) || emitted;
@@ -173,7 +171,7 @@ void OutputCapture::finish() {
     std::fflush(stdout);
     std::fflush(stderr);
     drain();
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     for (Source& source : sources_) {
         if (const std::u16string rest = source.text.finish(); !rest.empty()) {
             emit_(source.descriptor, rest);
@@ -184,7 +182,7 @@ void OutputCapture::finish() {
 void OutputCapture::run() {
     std::array<pollfd, 3> watched{
         {{stop_.get(), POLLIN, 0}, {sources_[0].pipe, POLLIN, 0}, {sources_[1].pipe, POLLIN, 0}}};
-    while (true) {
+    for (;;) {
         if (::poll(watched.data(), watched.size(), -1) < 0 && errno != EINTR) {
             return;
         }

@@ -9,15 +9,12 @@
 namespace qvm {
 namespace {
 
-// Programs that run code dup onto low numbers; the protocol stays clear of them.
-constexpr int kPrivateFrom = 100;
-
 [[noreturn]] void fail(const char* what) {
     throw std::system_error(errno, std::generic_category(), what);
 }
 
 int moveAside(int descriptor, const char* name) {
-    const int moved = ::fcntl(descriptor, F_DUPFD_CLOEXEC, kPrivateFrom);
+    const int moved = ::fcntl(descriptor, F_DUPFD_CLOEXEC, firstPrivateDescriptor);
     if (moved < 0) {
         fail(name);
     }

@@ -3,6 +3,9 @@
 
 namespace qvm {
 
+/// Private descriptors have numbers from here on. Programs that run code dup onto low numbers.
+inline constexpr int firstPrivateDescriptor = 100;
+
 /// Makes sure that 0, 1 and 2 are open, so that nothing else lands on their numbers. Throws std::system_error.
 void holdStandardDescriptors();
 

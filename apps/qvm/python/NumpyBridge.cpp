@@ -32,7 +32,7 @@ struct Row {
     int number;
 };
 
-constexpr Row kTypes[] = {
+constexpr Row elementTypes[] = {
     {ElementType::Bool, 'b', Npy::NPY_BOOL_},
     {ElementType::Single, 'f', Npy::NPY_FLOAT_},
     {ElementType::Double, 'f', Npy::NPY_DOUBLE_},
@@ -49,9 +49,9 @@ constexpr Row kTypes[] = {
 };
 
 py::dtype dtypeOf(ElementType element) {
-    const auto* const row =
-        std::find_if(std::begin(kTypes), std::end(kTypes), [&](const Row& each) { return each.element == element; });
-    if (row == std::end(kTypes)) {
+    const auto* const row = std::find_if(std::begin(elementTypes), std::end(elementTypes),
+                                         [&](const Row& each) { return each.element == element; });
+    if (row == std::end(elementTypes)) {
         throw NotConvertible("has elements of type " + std::string(elementTypeName(element)) +
                              ", which NumPy does not have");
     }
@@ -60,10 +60,10 @@ py::dtype dtypeOf(ElementType element) {
 
 // By kind and size: C has several integer types of one size, and NumPy tells them apart.
 std::optional<ElementType> elementTypeOf(const py::dtype& dtype) {
-    const auto* const row = std::find_if(std::begin(kTypes), std::end(kTypes), [&](const Row& each) {
+    const auto* const row = std::find_if(std::begin(elementTypes), std::end(elementTypes), [&](const Row& each) {
         return each.kind == dtype.kind() && elementSize(each.element) == static_cast<std::size_t>(dtype.itemsize());
     });
-    return row == std::end(kTypes) ? std::nullopt : std::optional(row->element);
+    return row == std::end(elementTypes) ? std::nullopt : std::optional(row->element);
 }
 
 py::object textOf(const Array& array) {

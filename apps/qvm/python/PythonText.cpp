@@ -7,7 +7,7 @@
 namespace qvm {
 namespace {
 
-constexpr char16_t kReplacement = 0xFFFD;
+constexpr char16_t replacement = 0xFFFD;
 
 }  // namespace
 
@@ -25,7 +25,7 @@ std::u16string utf16Of(PyObject* text, std::size_t begin, std::size_t count) {
             units += static_cast<char16_t>(0xD800 + ((point - 0x10000) >> 10));
             units += static_cast<char16_t>(0xDC00 + ((point - 0x10000) & 0x3FF));
         } else if (point >= 0xD800 && point <= 0xDFFF) {
-            units += kReplacement;
+            units += replacement;
         } else {
             units += static_cast<char16_t>(point);
         }

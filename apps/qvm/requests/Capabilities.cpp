@@ -3,17 +3,17 @@
 namespace qvm {
 
 Capabilities::Lists Capabilities::lists() const {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     return {engine_.without(engine_.without(client_)), engine_, client_};
 }
 
 void Capabilities::setClient(const List& client) {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     client_ = client;
 }
 
 void Capabilities::setEngine(::capabilities::Capability capability, bool on) {
-    std::lock_guard lock(mutex_);
+    const std::lock_guard lock(mutex_);
     if (on) {
         engine_ |= capability;
     } else {
