@@ -320,17 +320,18 @@ void Engine::issueWarning(Warning warning) {
 }
 
 void Engine::setDebugging(bool on) {
+    const Request* const request = requestOfThisThread();
+    output_->flush();
+    // In one turn, so that the last event tells what holds, whichever threads change it.
+    Announcer::Turn turn = announcer_->turn();
     const Capabilities::Lists before = capabilities_.lists();
     capabilities_.setEngine(Capability::Debugging, on);
     const Capabilities::Lists now = capabilities_.lists();
-    if (now.engine == before.engine) {
-        return;
+    if (now.engine != before.engine) {
+        turn.publish(0, boost::make_shared<const CapabilitiesChanged>(
+                            before.inForce, now.engine, now.client,
+                            request != nullptr ? request->message->getCapabilities() : Capabilities::List()));
     }
-    const Request* const request = requestOfThisThread();
-    output_->flush();
-    announcer_->turn().publish(0, boost::make_shared<const CapabilitiesChanged>(
-                                      before.inForce, now.engine, now.client,
-                                      request != nullptr ? request->message->getCapabilities() : Capabilities::List()));
 }
 
 int Engine::interruptDescriptor() {
