@@ -88,7 +88,12 @@ void addSinkOptions(CLI::App& app, SinkOptions& options) {
     app.add_flag("--hotlinks", options.hotlinks, "Let a terminal show hyperlinks")->group("Request");
 }
 
-CLI::App* addEval(CLI::App& app, Options& options, EvalOptions& eval) {
+void addSparingly(CLI::App& app, bool& sparingly) {
+    app.add_flag("--sparingly", sparingly, "Let the engine send output in large pieces instead of line by line")
+        ->group("Request");
+}
+
+void addEval(CLI::App& app, Options& options, EvalOptions& eval) {
     auto* command = app.add_subcommand("eval", "Evaluate code and show what it prints");
     auto* code =
         command->add_option("CODE", eval.source, "The code, or - for standard input; after -- it may begin with a dash")
@@ -109,9 +114,7 @@ CLI::App* addEval(CLI::App& app, Options& options, EvalOptions& eval) {
         ->type_name("TYPE")
         ->default_str("block")
         ->group("Request");
-    command
-        ->add_flag("--sparingly", eval.sparingly, "Let the engine send output in large pieces instead of line by line")
-        ->group("Request");
+    addSparingly(*command, eval.sparingly);
     command->add_flag("--echo", eval.sink.echo, "Show the code before what it prints")->group("Request");
     addSinkOptions(*command, eval.sink);
     addDisplayOptions(*command, options.display);
@@ -125,13 +128,13 @@ CLI::App* addEval(CLI::App& app, Options& options, EvalOptions& eval) {
         eval.fromStandardInput = !eval.fromFile && eval.source == "-";
         options.command = eval;
     });
-    return command;
 }
 
 constexpr const char* promptHelp = R"(Prompts:
   Code that reads a line, pauses or stops at breakpoint() asks for it here if standard input is a
-  terminal. At debug> and keyboard> code is evaluated where the code stands; :c goes on, :q (or
-  Ctrl-D) quits. Ctrl-C cancels; a second one within two seconds ends the engine.)";
+  terminal. At debug> and keyboard> lines are evaluated where the code stands; :c goes on, :q (or
+  Ctrl-D) quits, :queue lists requests and :queue cancel N cancels one. Ctrl-C cancels; a second
+  one within two seconds ends the engine.)";
 
 void addRun(CLI::App& app, Options& options, RunOptions& run) {
     auto* command = app.add_subcommand("run", "Run a Python script from a file");
@@ -143,9 +146,7 @@ void addRun(CLI::App& app, Options& options, RunOptions& run) {
             "ARG", run.arguments,
             "What the script finds in sys.argv after its name; put -- before the first one if any begins with a dash")
         ->type_name("");
-    command
-        ->add_flag("--sparingly", run.sparingly, "Let the engine send output in large pieces instead of line by line")
-        ->group("Request");
+    addSparingly(*command, run.sparingly);
     addSinkOptions(*command, run.sink);
     addDisplayOptions(*command, options.display);
     addConnectionOptions(*command, options.connection);
@@ -210,9 +211,7 @@ void addCall(CLI::App& app, Options& options, CallOptions& call) {
         ->allow_extra_args(false)
         ->type_name("FILE")
         ->group("Request");
-    command
-        ->add_flag("--sparingly", call.sparingly, "Let the engine send output in large pieces instead of line by line")
-        ->group("Request");
+    addSparingly(*command, call.sparingly);
     addSinkOptions(*command, call.sink);
     addDisplayOptions(*command, options.display);
     addConnectionOptions(*command, options.connection);
