@@ -154,9 +154,12 @@ void Prompts::serveDeferred() {
     while (!deferred_.empty()) {
         const Deferred next = deferred_.front();
         deferred_.erase(deferred_.begin());
-        // Whatever Ctrl-C does to the line that was read, at the prompt it is for the request.
-        const Canceller canceller = client_.cancelling({client_.requests().find(next.request)});
-        serve(next.request, next.loop);
+        // An engine that has answered in spite of its prompt gets no answer to that.
+        if (const auto request = client_.requests().find(next.request)) {
+            // Whatever Ctrl-C does to the line that was read, at the prompt it is for the request.
+            const Canceller canceller = client_.cancelling({request});
+            serve(next.request, next.loop);
+        }
     }
 }
 
