@@ -3,6 +3,7 @@
 
 #include "TaggedSerializer.hpp"
 #include "WarningConversions.hpp"
+#include "krutil.protobuf.IssuedEnabledWarningEvent.pb.h"
 
 namespace krutil::protobuf_serializer {
 

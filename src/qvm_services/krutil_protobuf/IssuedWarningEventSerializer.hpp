@@ -3,6 +3,7 @@
 
 #include "TaggedSerializer.hpp"
 #include "WarningConversions.hpp"
+#include "krutil.protobuf.IssuedWarningEvent.pb.h"
 
 namespace krutil::protobuf_serializer {
 

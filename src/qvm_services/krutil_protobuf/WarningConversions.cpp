@@ -6,6 +6,11 @@
 #include <vector>
 
 #include "FieldConversions.hpp"
+#include "krutil.protobuf.IssuedEnabledWarningEvent.pb.h"
+#include "krutil.protobuf.IssuedWarningEvent.pb.h"
+#include "krutil.protobuf.PrintfArgument.pb.h"
+#include "krutil.protobuf.Warning.pb.h"
+#include "krutil.protobuf.WarningStackFrame.pb.h"
 
 namespace krutil::protobuf_serializer {
 namespace {

@@ -5,11 +5,14 @@
 
 #include "korvel/lang/diagnostic/IssuedEnabledWarningEvent.hpp"
 #include "korvel/lang/diagnostic/IssuedWarningEvent.hpp"
-#include "krutil.protobuf.IssuedEnabledWarningEvent.pb.h"
-#include "krutil.protobuf.IssuedWarningEvent.pb.h"
-#include "krutil.protobuf.PrintfArgument.pb.h"
-#include "krutil.protobuf.Warning.pb.h"
-#include "krutil.protobuf.WarningStackFrame.pb.h"
+
+namespace krutil::protobuf {
+class IssuedEnabledWarningEvent;
+class IssuedWarningEvent;
+class PrintfArgument;
+class Warning;
+class WarningStackFrame;
+}  // namespace krutil::protobuf
 
 namespace krutil::protobuf_serializer {
 

@@ -7,6 +7,7 @@
 #include <sstream>
 #include <unordered_set>
 
+#include "msg_svc.protobuf.IDType.pb.h"
 #include "msg_svc/protobuf_serializer/IDTypeSerializer.hpp"
 
 namespace foundation::msg_svc::exchange {

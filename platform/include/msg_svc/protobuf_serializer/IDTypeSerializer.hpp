@@ -2,7 +2,10 @@
 #pragma once
 
 #include "foundation/msg_svc/exchange/IDType.hpp"
-#include "msg_svc.protobuf.IDType.pb.h"
+
+namespace msg_svc::protobuf {
+class IDType;
+}  // namespace msg_svc::protobuf
 
 namespace msg_svc::protobuf_serializer {
 

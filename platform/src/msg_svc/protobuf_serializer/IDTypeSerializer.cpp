@@ -1,5 +1,7 @@
 #include "msg_svc/protobuf_serializer/IDTypeSerializer.hpp"
 
+#include "msg_svc.protobuf.IDType.pb.h"
+
 namespace msg_svc::protobuf_serializer {
 
 ::msg_svc::protobuf::IDType IDTypeSerializer::toProtobuf(const ::foundation::msg_svc::exchange::IDType& id) {
