@@ -114,7 +114,8 @@ def resolve(root, including, bracket, name):
 def check_porting(root, places):
     """Findings about the page; places has each header of the platform that the product includes, and a place where."""
     listed = NEEDED.findall(checkout.read(root, PORTING))
-    findings = [f"{places[name]}: {PORTING} does not list {name}" for name in sorted(set(places) - set(listed))]
+    findings = [f"{places[name]}: {PORTING} does not list {name}, so other platforms lack it"
+                for name in sorted(set(places) - set(listed))]
     findings += [f"{PORTING}: the product does not include {name}" for name in listed if name not in places]
     findings += [f"{PORTING}: {name} twice" for name in sorted(set(listed)) if listed.count(name) > 1]
     return findings
