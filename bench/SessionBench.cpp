@@ -129,6 +129,8 @@ class Ends {
     static std::unique_ptr<session::Session> open(int socket, session::Role role) {
         session::SessionConfig config;
         config.role = role;
+        config.protocol = krutil::protobuf::KrutilProtocol::protocolName;
+        config.version = krutil::protobuf::KrutilProtocol::protocolVersion;
         return session::Session::open(socket, ::dup(socket), std::move(config));
     }
 };

@@ -14,6 +14,7 @@
 #include "cmddistributor/IIPCancelReply.hpp"
 #include "cmddistributor/IIPStateEvent.hpp"
 #include "common/Build.hpp"
+#include "common/KrutilSession.hpp"
 #include "common/Precheck.hpp"
 #include "foundation/core/posix/SignalsBlocked.hpp"
 #include "krutil/capabilities_api/CapabilitiesChanged.hpp"
@@ -127,8 +128,7 @@ ExitCode Engine::run(int in, int out) {
 
 // Shakes hands. Returns false, and sets the exit code, when there is no session.
 bool Engine::open(int in, int out) {
-    SessionConfig config;
-    config.role = session_layer::Role::Engine;
+    SessionConfig config = apps::krutilSession(session_layer::Role::Engine);
     config.build = apps::buildString("krutil-qvm");
     config.limits = options_.limits;
     config.capabilities = capabilities_.lists().engine;

@@ -32,8 +32,8 @@
 #include <string>
 #include <vector>
 
-#include "KrutilProtocol.hpp"
 #include "cmddistributor/IIPEnqueueMessage.hpp"
+#include "common/KrutilSession.hpp"
 #include "foundation/msg_svc/transport/layers/session/FrameHeader.hpp"
 #include "foundation/msg_svc/transport/layers/session/ProtocolRegistry.hpp"
 #include "foundation/msg_svc/transport/layers/session/Session.hpp"
@@ -237,10 +237,8 @@ class FirstRequest : public session::SessionHandler {
 };
 
 int play(const std::string& name, const Scene& scene) {
-    krutil::protobuf::KrutilProtocol::init();
     const int raw = ::fcntl(STDOUT_FILENO, F_DUPFD_CLOEXEC, 3);
-    session::SessionConfig config;
-    config.role = session::Role::Engine;
+    session::SessionConfig config = apps::krutilSession(session::Role::Engine);
     config.build = "fake engine";
     FirstRequest handler;
     auto request = handler.future();
@@ -283,6 +281,7 @@ int offerAnotherVersion() {
         });
     session::SessionConfig config;
     config.role = session::Role::Engine;
+    config.protocol = "krutil";
     config.version = {2, 7};
     config.build = "fake engine";
     try {

@@ -8,12 +8,12 @@
 #include <stdexcept>
 #include <utility>
 
-#include "KrutilProtocol.hpp"
 #include "cmddistributor/EvalIIP.hpp"
 #include "cmddistributor/IIPCancelMessage.hpp"
 #include "cmddistributor/IIPCancelReply.hpp"
 #include "cmddistributor/IIPEnqueueMessage.hpp"
 #include "common/Build.hpp"
+#include "common/KrutilSession.hpp"
 #include "common/Precheck.hpp"
 #include "krutil/capabilities_api/CapabilitiesChanged.hpp"
 #include "krutil/io/SinkTextEvent.hpp"
@@ -113,10 +113,7 @@ Client::~Client() {
 }
 
 std::unique_ptr<Conversation> Client::openConversation(const ConnectionOptions& connection, bool interactive) {
-    session::SessionConfig config;
-    config.role = session::Role::Client;
-    config.protocol = krutil::protobuf::KrutilProtocol::protocolName;
-    config.version = krutil::protobuf::KrutilProtocol::protocolVersion;
+    session::SessionConfig config = apps::krutilSession(session::Role::Client);
     config.build = apps::buildString("krutil");
     config.limits = connection.limits;
     capabilities_ = capabilitiesHere(connection, interactive);

@@ -10,10 +10,10 @@
 #include <numeric>
 #include <vector>
 
-#include "KrutilProtocol.hpp"
 #include "cmddistributor/FEvalIIP.hpp"
 #include "cmddistributor/FEvalResult.hpp"
 #include "cmddistributor/IIPEnqueueMessage.hpp"
+#include "common/KrutilSession.hpp"
 #include "foundation/korveldata/ArrayFactory.hpp"
 #include "foundation/vantor/carrier/framing/DataFrame.hpp"
 #include "krutil/arrays/NpyFile.hpp"
@@ -33,17 +33,11 @@ using foundation::korveldata::ArrayFactory;
 using foundation::korveldata::ElementType;
 using foundation::korveldata::MemoryOrder;
 
-session::SessionConfig configOf(session::Role role) {
-    session::SessionConfig config;
-    config.role = role;
-    return config;
-}
-
 // Answers each call with its arguments.
 class EchoingEngine : public session::SessionHandler {
   public:
     explicit EchoingEngine(int stream)
-        : session_(session::Session::open(stream, stream, configOf(session::Role::Engine))) {
+        : session_(session::Session::open(stream, stream, apps::krutilSession(session::Role::Engine))) {
         session_->start(*this);
     }
 
@@ -65,13 +59,12 @@ class EchoingEngine : public session::SessionHandler {
 class CallTransferTest : public ::testing::Test {
   protected:
     CallTransferTest() {
-        krutil::protobuf::KrutilProtocol::init();
         int ends[2];
         if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0) {
             throw std::runtime_error("socketpair");
         }
         auto engine = std::async(std::launch::async, [end = ends[1]] { return std::make_unique<EchoingEngine>(end); });
-        auto config = configOf(session::Role::Client);
+        auto config = apps::krutilSession(session::Role::Client);
         config.trace = [this](const session::FrameTrace& trace) {
             if (trace.outgoing && dynamic_cast<const framing::DataFrame*>(&trace.frame) != nullptr) {
                 sent.push_back(trace.frame.data());

@@ -18,9 +18,9 @@
 #include <thread>
 #include <utility>
 
-#include "KrutilProtocol.hpp"
 #include "cmddistributor/EvalIIP.hpp"
 #include "cmddistributor/IIPEnqueueMessage.hpp"
+#include "common/KrutilSession.hpp"
 #include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "foundation/msg_svc/transport/layers/session/Session.hpp"
 #include "krutil/cmddistributor/IIPReply.hpp"
@@ -40,7 +40,6 @@ class ScriptedEngine : private foundation::msg_svc::transport::layers::session::
         std::function<void(ScriptedEngine&, StreamID, const foundation::msg_svc::exchange::Message& message)>;
 
     explicit ScriptedEngine(Action action) : action_(std::move(action)) {
-        krutil::protobuf::KrutilProtocol::init();
         sockaddr_un address{};
         address.sun_family = AF_UNIX;
         path_.copy(address.sun_path, sizeof address.sun_path - 1);
@@ -91,9 +90,8 @@ class ScriptedEngine : private foundation::msg_svc::transport::layers::session::
         if (stream < 0) {
             return;
         }
-        foundation::msg_svc::transport::layers::session::SessionConfig config;
-        config.role = foundation::msg_svc::transport::layers::session::Role::Engine;
-        session_ = foundation::msg_svc::transport::layers::session::Session::open(stream, stream, std::move(config));
+        namespace session = foundation::msg_svc::transport::layers::session;
+        session_ = session::Session::open(stream, stream, apps::krutilSession(session::Role::Engine));
         clientCapabilities_ = session_->peer().capabilities;
         session_->start(*this);
         std::unique_lock lock(mutex_);

@@ -13,10 +13,10 @@
 #include <optional>
 #include <thread>
 
-#include "KrutilProtocol.hpp"
 #include "cmddistributor/EvalIIP.hpp"
 #include "cmddistributor/IIPEnqueueMessage.hpp"
 #include "cmddistributor/IIPStateEvent.hpp"
+#include "common/KrutilSession.hpp"
 #include "krutil/base/ExitCode.hpp"
 #include "krutil/base/Interrupt.hpp"
 #include "krutil/cmddistributor/IIPReply.hpp"
@@ -42,9 +42,7 @@ class TestEngine : public session::SessionHandler {
     explicit TestEngine(Action action) : action_(std::move(action)) {}
 
     void open(int stream) {
-        session::SessionConfig config;
-        config.role = session::Role::Engine;
-        session_ = session::Session::open(stream, stream, std::move(config));
+        session_ = session::Session::open(stream, stream, apps::krutilSession(session::Role::Engine));
         session_->start(*this);
     }
 
@@ -98,12 +96,11 @@ exchange::IDType idOf(const Conversation::Reply& reply) {
 class ConversationTest : public ::testing::Test {
   protected:
     void begin(TestEngine::Action action) {
-        krutil::protobuf::KrutilProtocol::init();
         int ends[2];
         ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends), 0);
         engine.emplace(std::move(action));
         std::thread opening([this, &ends] { engine->open(ends[1]); });
-        conversation.emplace(ends[0], session::SessionConfig{}, events, interrupt);
+        conversation.emplace(ends[0], apps::krutilSession(session::Role::Client), events, interrupt);
         opening.join();
         events.subscribe<TextBaseEvent>([this](const TextBaseEvent& event) { texts.push_back(event.getText()); });
     }

@@ -7,9 +7,9 @@
 #include <poll.h>
 #include <unistd.h>
 
-#include "KrutilProtocol.hpp"
 #include "apps/common/UnknownNumbers.hpp"
 #include "apps/qvm/fixture/EngineFixture.hpp"
+#include "common/KrutilSession.hpp"
 #include "foundation/msg_svc/transport/layers/session/FrameHeader.hpp"
 #include "krutil.protobuf.EvalIIP.pb.h"
 #include "krutil.protobuf.FEvalIIP.pb.h"
@@ -53,9 +53,7 @@ void PrintTo(const Outcome& outcome, std::ostream* out) {
 class ByteClient {
   public:
     explicit ByteClient(int connection) : bytes_(::fcntl(connection, F_DUPFD_CLOEXEC, 3)) {
-        proto::KrutilProtocol::init();
-        session::SessionConfig config;
-        config.role = session::Role::Client;
+        session::SessionConfig config = apps::krutilSession(session::Role::Client);
         config.build = "engine test";
         // Never started, so it leaves all frames to this object.
         session_ = session::Session::open(connection, connection, std::move(config));

@@ -4,8 +4,8 @@
 #include <signal.h>
 #include <unistd.h>
 
-#include "KrutilProtocol.hpp"
 #include "apps/qvm/fixture/EngineFixture.hpp"
+#include "common/KrutilSession.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 namespace qvm_test {
@@ -214,9 +214,8 @@ TEST(SessionEndTest, SilentClientIsGivenUp) {
 }
 
 TEST(SessionEndTest, WrongVersionIsRefused) {
-    krutil::protobuf::KrutilProtocol::init();
     EngineProcess engine({"--stdio"});
-    session::SessionConfig config;
+    session::SessionConfig config = apps::krutilSession(session::Role::Client);
     config.version = {2, 0};
     const int connection = engine.connection();
     EXPECT_THROW(session::Session::open(connection, connection, std::move(config)), session::HandshakeRefused);

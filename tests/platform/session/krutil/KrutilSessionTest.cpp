@@ -60,6 +60,8 @@ SessionConfig krutilConfig(Role role) {
     SessionConfig config = configOf(role);
     config.protocol = krutil::protobuf::KrutilProtocol::protocolName;
     config.version = krutil::protobuf::KrutilProtocol::protocolVersion;
+    config.shutdownEvent = typeid(krutil::eventmgr::QVMShutdownEvent);
+    config.clientEvents = {typeid(krutil::capabilities_api::CapabilitiesChanged)};
     return config;
 }
 
@@ -112,10 +114,12 @@ TEST_F(KrutilSessionTest, RequestRunsFromItsQueueToItsReply) {
     client->send(client->newStreamID(), enqueue(u"print(1+1)"));
     EXPECT_THAT(clientSaw.waitForLines(5), ElementsAre("event 1 started", "event 1 2\n", "event 1 completed",
                                                        "event 1 last", "reply 1 " + toString(IDType(1, 2))));
-    client->send(0, capabilityChange());
+    client->send(0, boost::make_shared<const krutil::capabilities_api::CapabilitiesChanged>(
+                        capabilities::CapabilityList(), capabilities::CapabilityList(), capabilities::CapabilityList(),
+                        capabilities::CapabilityList()));
     client->sayGoodbye();
     EXPECT_THAT(engineSaw.waitForLines(3), ElementsAre("enqueue 1 print(1+1)", "event 0 capabilities", "goodbye"));
-    engine->send(0, shutdownEvent());
+    engine->send(0, boost::make_shared<const krutil::eventmgr::QVMShutdownEvent>());
     engine->close();
     EXPECT_EQ(clientSaw.waitForEnd().reason, Reason::Finished);
     EXPECT_EQ(engineSaw.waitForEnd().reason, Reason::Finished);

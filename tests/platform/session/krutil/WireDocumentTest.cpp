@@ -8,6 +8,7 @@
 #include "KrutilProtocol.hpp"
 #include "cmddistributor/EvalIIP.hpp"
 #include "cmddistributor/IIPEnqueueMessage.hpp"
+#include "krutil/eventmgr/QVMShutdownEvent.hpp"
 #include "platform/session/support/TestSessions.hpp"
 #include "support/HexBlocks.hpp"
 
@@ -38,6 +39,7 @@ TEST(WireDocumentTest, ExampleIsWhatAClientAndAnEngineWrite) {
     const auto open = [](Role role, Ends& ends) {
         SessionConfig config = configOf(role);
         config.protocol = "krutil";
+        config.shutdownEvent = typeid(krutil::eventmgr::QVMShutdownEvent);
         config.build = role == Role::Client ? "krutil 0.1.0" : "krutil-qvm 0.1.0";
         config.capabilities = {capabilities::Capability::LocalClient};
         ends = socketPair();
@@ -89,7 +91,7 @@ TEST(WireDocumentTest, ExampleIsWhatAClientAndAnEngineWrite) {
     const auto real = opening.get();
     Recorder engineSaw;
     real->start(engineSaw);
-    real->send(0, shutdownEvent());
+    real->send(0, boost::make_shared<const krutil::eventmgr::QVMShutdownEvent>());
     real->close();
     compare("the shutdown event", peer.readAll());
     EXPECT_EQ(next, blocks.size()) << "blocks of the document";

@@ -71,6 +71,15 @@ void ByteEnd::write(const std::string& bytes) {
     }
 }
 
+std::size_t ByteEnd::writeSome(const std::string& bytes) {
+    pollfd polled{out_, POLLOUT, 0};
+    if (::poll(&polled, 1, 50) <= 0) {
+        return 0;
+    }
+    const ssize_t count = ::send(out_, bytes.data(), bytes.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
+    return count < 0 ? 0 : static_cast<std::size_t>(count);
+}
+
 std::string ByteEnd::read(std::size_t count) {
     std::string bytes;
     std::array<char, 65536> some{};

@@ -18,6 +18,8 @@ class ByteEnd {
     ByteEnd& operator=(const ByteEnd&) = delete;
 
     void write(const std::string& bytes);
+    /// Writes what the stream takes within a short while; returns how much that is. Only for sockets.
+    std::size_t writeSome(const std::string& bytes);
     std::string read(std::size_t count);
     /// All that comes until the stream ends.
     std::string readAll();

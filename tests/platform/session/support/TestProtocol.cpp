@@ -9,8 +9,6 @@
 #include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
 #include "foundation/vantor/carrier/framing/DataFrame.hpp"
 #include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
-#include "krutil/capabilities_api/CapabilitiesChanged.hpp"
-#include "krutil/eventmgr/QVMShutdownEvent.hpp"
 
 namespace testing_protocol {
 namespace {
@@ -79,11 +77,8 @@ class TextSerializer : public SerializerAPI<Family, boost::shared_ptr<const Fami
         if (text == "fail oddly") {
             throw 42;
         }
-        if constexpr (std::is_same_v<Type, krutil::eventmgr::QVMShutdownEvent>) {
+        if constexpr (std::is_default_constructible_v<Type>) {
             return boost::make_shared<const Type>();
-        } else if constexpr (std::is_same_v<Type, krutil::capabilities_api::CapabilitiesChanged>) {
-            return boost::make_shared<const Type>(capabilities::CapabilityList(), capabilities::CapabilityList(),
-                                                  capabilities::CapabilityList(), capabilities::CapabilityList());
         } else {
             const auto object = boost::make_shared<Type>(text);
             if constexpr (requires { object->received; }) {
@@ -138,11 +133,8 @@ session::ProtocolVersion initialize(const std::shared_ptr<Registry>& registry, c
     registry->insert(std::make_shared<const TextSerializer<exchange::Message, Question>>(questionTag));
     registry->insert(std::make_shared<const TextSerializer<exchange::Reply, Answer>>(answerTag));
     registry->insert(std::make_shared<const TextSerializer<eventmgr::BaseEvent, Notice>>(noticeTag));
-    registry->insert(
-        std::make_shared<const TextSerializer<eventmgr::BaseEvent, krutil::eventmgr::QVMShutdownEvent>>(shutdownTag));
-    registry->insert(
-        std::make_shared<const TextSerializer<eventmgr::BaseEvent, krutil::capabilities_api::CapabilitiesChanged>>(
-            capabilitiesTag));
+    registry->insert(std::make_shared<const TextSerializer<eventmgr::BaseEvent, Shutdown>>(shutdownTag));
+    registry->insert(std::make_shared<const TextSerializer<eventmgr::BaseEvent, CapabilityNews>>(capabilitiesTag));
     registry->insert(std::make_shared<const ReferredSerializer<PartOfAQuestion>>(partTag));
     registry->insert(std::make_shared<const ReferredSerializer<foundation::korveldata::Array>>(arrayTag));
     return version;

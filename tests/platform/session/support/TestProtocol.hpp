@@ -1,5 +1,5 @@
-// A small protocol for tests of the session layer: a question with bulk bytes, its answer, notices, and the two events
-// that mean something to a session.
+// A small protocol for tests of the session layer: a question with bulk bytes, its answer, notices, an event that
+// clients may send as well, and one that ends the session. None of its types is the product's.
 #pragma once
 
 #include <atomic>
@@ -52,6 +52,12 @@ class Notice : public eventmgr::BaseEvent {
     explicit Notice(std::string noticeText) : text(std::move(noticeText)) {}
     std::string text;
 };
+
+/// The last message of an engine.
+class Shutdown : public eventmgr::BaseEvent {};
+
+/// What clients may send as well.
+class CapabilityNews : public eventmgr::BaseEvent {};
 
 /// No serializer is registered for it.
 class Stranger : public exchange::Message {};

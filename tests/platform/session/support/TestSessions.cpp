@@ -9,9 +9,6 @@
 #include <chrono>
 #include <future>
 
-#include "krutil/capabilities_api/CapabilitiesChanged.hpp"
-#include "krutil/eventmgr/QVMShutdownEvent.hpp"
-
 namespace testing_sessions {
 namespace {
 
@@ -66,7 +63,7 @@ void Recorder::onEvent(framing::StreamID stream, const boost::shared_ptr<const e
     std::string text = "capabilities";
     if (const auto* const note = dynamic_cast<const Notice*>(event.get())) {
         text = note->text;
-    } else if (dynamic_cast<const krutil::eventmgr::QVMShutdownEvent*>(event.get()) != nullptr) {
+    } else if (dynamic_cast<const Shutdown*>(event.get()) != nullptr) {
         text = "shutdown";
     }
     keep("event " + std::to_string(stream) + " " + text);
@@ -127,6 +124,9 @@ SessionConfig configOf(Role role) {
     SessionConfig config;
     config.role = role;
     config.protocol = "test";
+    config.version = {1, 0};
+    config.shutdownEvent = typeid(Shutdown);
+    config.clientEvents = {typeid(CapabilityNews)};
     config.build = role == Role::Client ? "test client 1" : "test engine 1";
     config.handshakeTimeout = std::chrono::seconds(30);
     return config;
@@ -145,13 +145,11 @@ boost::shared_ptr<const eventmgr::BaseEvent> notice(const std::string& text) {
 }
 
 boost::shared_ptr<const eventmgr::BaseEvent> shutdownEvent() {
-    return boost::make_shared<const krutil::eventmgr::QVMShutdownEvent>();
+    return boost::make_shared<const Shutdown>();
 }
 
 boost::shared_ptr<const eventmgr::BaseEvent> capabilityChange() {
-    return boost::make_shared<const krutil::capabilities_api::CapabilitiesChanged>(
-        capabilities::CapabilityList(), capabilities::CapabilityList(), capabilities::CapabilityList(),
-        capabilities::CapabilityList());
+    return boost::make_shared<const CapabilityNews>();
 }
 
 SessionPair::SessionPair(SessionConfig clientConfig, SessionConfig engineConfig, Ends ends) {

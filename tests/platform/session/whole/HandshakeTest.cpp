@@ -202,6 +202,59 @@ TEST_F(FeatureTest, EveryMismatchIsListed) {
               "client accepts \"1\", the engine \"2\"");
 }
 
+// What the process cannot do of what its protocol lists.
+
+class UnusableFeatureTest : public HandshakeTest {
+  protected:
+    // Both ends list "on" and "off", in this order; each may be unable to work with some of it.
+    static Outcome settle(const std::vector<session::UnusableFeature>& client,
+                          const std::vector<session::UnusableFeature>& engine) {
+        const Registered protocol("switch", {required("X", "on"), required("X", "off"), optional("Y", "on")});
+        SessionConfig clientConfig = configOf(Role::Client);
+        SessionConfig engineConfig = configOf(Role::Engine);
+        clientConfig.protocol = engineConfig.protocol = "switch";
+        clientConfig.unusableFeatures = client;
+        engineConfig.unusableFeatures = engine;
+        return openBoth(clientConfig, engineConfig);
+    }
+};
+
+TEST_F(UnusableFeatureTest, ValueThatIsNotOfferedIsNotSettled) {
+    const Outcome outcome = settle({{"X", "on", false, "X_OFF is set"}}, {});
+    EXPECT_EQ(outcome.client->features().at("X"), "off");
+    EXPECT_EQ(outcome.engine->features().at("X"), "off");
+    EXPECT_EQ(outcome.engine->features().at("Y"), "on") << "another feature with that value";
+}
+
+TEST_F(UnusableFeatureTest, ValueThatIsOfferedAllTheSameDoesNoHarmUntilItIsSettled) {
+    const Outcome outcome = settle({{"X", "off", true, "has it on"}}, {{"X", "off", true, "has it on"}});
+    EXPECT_EQ(outcome.client->features().at("X"), "on");
+    EXPECT_EQ(outcome.engine->features().at("X"), "on");
+}
+
+TEST_F(UnusableFeatureTest, SettledValueThatAnEndCannotWorkWithIsRefusedByThatEnd) {
+    const Outcome outcome = settle({{"X", "on", false, "X_OFF is set"}}, {{"X", "off", true, "has it on"}});
+    EXPECT_EQ(outcome.engineText,
+              "the session is refused: feature \"X\": \"off\" is all that both ends accept, but the engine has it on");
+    EXPECT_EQ(outcome.clientText,
+              "the session is refused by the engine: feature \"X\": \"off\" is all that both ends accept, but the "
+              "engine has it on");
+}
+
+TEST_F(UnusableFeatureTest, RefusalOfAFeatureTellsWhatWasNotOfferedAndWhy) {
+    const Outcome outcome = settle({{"X", "on", false, "X_OFF is set"}}, {{"X", "off", false, "X_ON is set"}});
+    EXPECT_EQ(outcome.clientText,
+              "the session is refused: feature \"X\": the client accepts \"off\", the engine \"on\"; X_OFF is set for "
+              "the client, so it does not accept \"on\" for \"X\"; the engine says: feature \"X\": the client accepts "
+              "\"off\", the engine \"on\"; X_ON is set for the engine, so it does not accept \"off\" for \"X\"");
+}
+
+TEST_F(UnusableFeatureTest, ValuesThatTheProtocolDoesNotListAreNotMentioned) {
+    const Outcome outcome = settle({{"X", "on", false, "X_OFF is set"}, {"X", "none", false, "X_NONE is set"}},
+                                   {{"X", "off", false, "no"}});
+    EXPECT_EQ(outcome.clientText.find("X_NONE"), std::string::npos) << outcome.clientText;
+}
+
 TEST_F(FeatureTest, InitializerGetsTheSettledValues) {
     std::mutex mutex;
     std::vector<std::unordered_map<std::string, std::string>> seen;

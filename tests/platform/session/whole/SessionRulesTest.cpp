@@ -199,7 +199,7 @@ TEST_F(SessionRulesTest, SenderRefusesWhatThePeerWouldRefuse) {
     EXPECT_EQ(logic([&] { pair.client->send(0, question("q")); }),
               "Session::send: a new exchange needs a stream ID that is not 0 and not in use, got 0");
     EXPECT_EQ(logic([&] { pair.client->send(0, notice("n")); }),
-              "Session::send: a client sends no events but capability changes, got testing_protocol::Notice");
+              "Session::send: a client does not send events of the type testing_protocol::Notice");
     EXPECT_EQ(logic([&] { pair.client->send(1, capabilityChange()); }),
               "Session::send: an event needs the stream ID 0, got 1");
     pair.engineSaw.waitForLines(1);

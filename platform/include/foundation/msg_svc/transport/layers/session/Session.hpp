@@ -7,69 +7,20 @@
 
 #include <boost/shared_ptr.hpp>
 #include <chrono>
-#include <cstddef>
 #include <cstdint>
-#include <functional>
 #include <memory>
 #include <string>
-#include <string_view>
 #include <unordered_map>
 
-#include "capabilities/CapabilityList.hpp"
 #include "foundation/msg_svc/eventmgr/BaseEvent.hpp"
 #include "foundation/msg_svc/exchange/Message.hpp"
 #include "foundation/msg_svc/exchange/Reply.hpp"
 #include "foundation/msg_svc/transport/layers/serialization/Registry.hpp"
-#include "foundation/msg_svc/transport/layers/session/Limits.hpp"
-#include "foundation/msg_svc/transport/layers/session/ProtocolRegistry.hpp"
+#include "foundation/msg_svc/transport/layers/session/SessionConfig.hpp"
 #include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
-#include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
+#include "foundation/vantor/carrier/framing/Frame.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
-
-namespace framing = ::foundation::vantor::carrier::framing;
-
-/// Which end of the session this is. A client begins exchanges; an engine answers them and raises events.
-enum class Role { Client, Engine };
-
-/// One frame on its way, as a trace sees it. Valid during the call only.
-struct FrameTrace {
-    bool outgoing;
-    bool last;                    ///< the last frame of its message
-    const framing::Frame& frame;  ///< a TaggedFrame or a DataFrame, content included
-};
-
-/// How this end presents itself and what it accepts.
-struct SessionConfig {
-    Role role = Role::Client;
-    std::string protocol = "krutil";  ///< looked up in the ProtocolRegistry
-    ProtocolVersion version{1, 0};
-    std::string build;  ///< free text that names this program and its version to the peer
-    Limits limits;
-    ::capabilities::CapabilityList capabilities;
-    std::chrono::milliseconds handshakeTimeout{10'000};
-
-    /// Bytes of unwritten output above which waitForRoom() waits.
-    std::size_t roomBytes = 1U << 20;
-
-    /// Messages posted with Urgency::Answer that may be waiting to be written; one more closes the session, because the
-    /// peer asks without reading.
-    std::size_t maxPendingAnswers = 1024;
-
-    /// Called with every frame, on the thread that sends or receives it. Empty for no trace.
-    std::function<void(const FrameTrace&)> trace;
-
-    /// Called with each received tagged frame before its serializer; may throw ProtocolViolation to close the session.
-    /// Empty for no check.
-    std::function<void(const framing::TaggedFrame&)> check;
-};
-
-/// What the handshake told about the other end.
-struct Peer {
-    std::string build;
-    Limits limits;
-    ::capabilities::CapabilityList capabilities;
-};
 
 /// How far the bytes of a session have come.
 struct Traffic {
@@ -145,7 +96,7 @@ class Session {
     /// What a message is to the sender.
     enum class Urgency {
         Output,  ///< the sender applies back-pressure with waitForRoom() or waitUntilWritten()
-        Answer,  ///< posted by a thread that must not wait; bounded by SessionConfig::maxPendingAnswers
+        Answer,  ///< posted by the handler, which must not wait; see SessionConfig::maxPendingAnswers
     };
 
     /// Serializes an object and hands it to the stream: written at once as far as the stream takes it, the rest by the
@@ -161,7 +112,9 @@ class Session {
               Urgency urgency = Urgency::Output);
 
     /// Waits until no more than roomBytes are unwritten, the session is over, or `interrupt` (a descriptor, -1 for
-    /// none) becomes readable; returns false in the last case only. Not from the I/O thread.
+    /// none) becomes readable; returns false in the last case only. Returns at once, without a system call, when there
+    /// is room. Whoever causes output waits here before it sends, and holds no lock meanwhile: then what is unwritten
+    /// exceeds roomBytes by one message of each thread at most. Not from the I/O thread.
     bool waitForRoom(int interrupt = -1);
 
     /// The same until everything that was handed over before the call is written, whatever is sent meanwhile.

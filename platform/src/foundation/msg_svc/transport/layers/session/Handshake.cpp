@@ -1,21 +1,18 @@
 #include "foundation/msg_svc/transport/layers/session/Handshake.hpp"
 
-#include <poll.h>
-#include <unistd.h>
-
 #include <algorithm>
 #include <array>
-#include <cerrno>
-#include <cstdlib>
 #include <map>
 #include <set>
 #include <stdexcept>
 #include <string_view>
-#include <system_error>
 #include <vector>
 
+#include "foundation/korveldata/Array.hpp"
+#include "foundation/msg_svc/transport/layers/session/HandshakeStream.hpp"
 #include "foundation/msg_svc/transport/layers/session/LittleEndian.hpp"
 #include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
+#include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
 #include "msg_svc.protobuf.SessionHandshake.pb.h"
 
 namespace foundation::msg_svc::transport::layers::session {
@@ -24,7 +21,6 @@ namespace {
 using ::msg_svc::protobuf::SessionFeature;
 using ::msg_svc::protobuf::SessionHello;
 using ::msg_svc::protobuf::SessionVerdict;
-using Clock = std::chrono::steady_clock;
 
 // Everything from here to the end of the verdict stays as it is whatever the layout version: it is how two versions
 // tell each other that they differ.
@@ -39,101 +35,11 @@ constexpr std::size_t longestRefusal = 16'384;
 // How long an end that refuses waits to hear the same from its peer.
 constexpr std::chrono::milliseconds refusalPatience{1'000};
 
-std::string errorText(int error) {
-    return std::generic_category().message(error);
-}
-
-// Both directions at once: each end sends its hello without waiting for the other's, so neither may insist on writing
-// before it reads.
-class HandshakeStream {
-  public:
-    HandshakeStream(int in, int out, std::chrono::milliseconds timeout)
-        : in_(in), out_(out), timeout_(timeout), deadline_(Clock::now() + timeout) {}
-
-    void send(const std::string& bytes) { unsent_ += bytes; }
-
-    void limitTo(std::chrono::milliseconds patience) { deadline_ = std::min(deadline_, Clock::now() + patience); }
-
-    // Reads exactly `size` bytes to `target`; `check` sees the number that have come, each time some have.
-    template <class Check>
-    void receive(char* target, std::size_t size, const std::string& what, Check check) {
-        for (std::size_t have = 0; have < size;) {
-            const std::string progress =
-                std::to_string(have) + " of " + std::to_string(size) + " bytes of " + what + " had arrived";
-            wait(true, progress);
-            const ssize_t count = ::read(in_, target + have, size - have);
-            if (count > 0) {
-                have += static_cast<std::size_t>(count);
-                check(have);
-            } else if (count == 0 || errno == ECONNRESET) {
-                throw StreamLost("the peer closed the stream during the handshake: " + progress);
-            } else if (errno != EINTR && errno != EAGAIN && errno != EWOULDBLOCK) {
-                throw StreamLost("cannot read from the stream during the handshake: " + errorText(errno) + "; " +
-                                 progress);
-            }
-        }
-    }
-
-    // What else has arrived already, for a message that shows it.
-    std::string peek(std::size_t most) const {
-        std::string bytes(most, '\0');
-        const ssize_t count = ::read(in_, bytes.data(), bytes.size());
-        bytes.resize(count > 0 ? static_cast<std::size_t>(count) : 0);
-        return bytes;
-    }
-
-    void flush() {
-        while (!unsent_.empty() && writeError_ == 0) {
-            wait(false, std::to_string(unsent_.size()) + " bytes are unwritten");
-        }
-        if (writeError_ != 0) {
-            throw StreamLost("cannot write to the stream during the handshake: " + errorText(writeError_));
-        }
-    }
-
-  private:
-    // Waits for something to read (or, without `reading`, to write) and writes what can be written meanwhile.
-    void wait(bool reading, const std::string& progress) {
-        for (;;) {
-            const bool writing = !unsent_.empty() && writeError_ == 0;
-            std::array<pollfd, 2> polled{pollfd{reading ? in_ : -1, POLLIN, 0},
-                                         pollfd{writing ? out_ : -1, POLLOUT, 0}};
-            const auto left =
-                std::max<Clock::rep>(0, std::chrono::ceil<std::chrono::milliseconds>(deadline_ - Clock::now()).count());
-            const int ready =
-                ::poll(polled.data(), polled.size(), static_cast<int>(std::min<Clock::rep>(left, 60'000)));
-            if (ready < 0 && errno != EINTR) {
-                throw StreamLost("cannot wait for the stream during the handshake: " + errorText(errno));
-            }
-            if (ready == 0 && Clock::now() >= deadline_) {
-                throw StreamLost("the handshake timed out after " + std::to_string(timeout_.count()) +
-                                 " milliseconds: " + progress);
-            }
-            if (ready > 0 && polled[1].revents != 0) {
-                writeSome();
-            }
-            if (ready > 0 && (!reading || polled[0].revents != 0)) {
-                return;
-            }
-        }
-    }
-
-    void writeSome() {
-        const ssize_t count = ::write(out_, unsent_.data(), unsent_.size());
-        if (count >= 0) {
-            unsent_.erase(0, static_cast<std::size_t>(count));
-        } else if (errno != EINTR && errno != EAGAIN && errno != EWOULDBLOCK) {
-            // The peer may have said why before it closed its end, so reading goes on.
-            writeError_ = errno;
-        }
-    }
-
-    int in_;
-    int out_;
-    std::chrono::milliseconds timeout_;
-    Clock::time_point deadline_;
-    std::string unsent_;
-    int writeError_ = 0;
+// What both ends compute from the two hellos.
+struct Agreement {
+    std::map<std::string, std::string> features;
+    std::vector<std::string> mismatches;  // sentences
+    std::set<std::string> unsettled;      // names of features among the mismatches
 };
 
 // One end as both see it.
@@ -143,30 +49,12 @@ struct End {
     const SessionHello* hello;
 };
 
-constexpr std::string_view zeroCopyFeature = "ZEROCOPY";
-
-// Zero-copy transfer switched off for this process; asked once, as the protocol's own serializer asks once.
-bool zeroCopyDisabled() {
-    static const bool disabled = [] {
-        const char* const value = std::getenv("QX_DISABLE_ZEROCOPY");
-        return value != nullptr && *value != '\0';
-    }();
-    return disabled;
-}
-
-bool isStruck(const FeatureRequest& request) {
-    return request.name() == zeroCopyFeature && request.value() == "enable" && zeroCopyDisabled();
-}
-
-// Whether bulk bytes travel beside their messages is decided for the process, whatever its sessions settle. So a
-// session that settled otherwise could not work, and is refused.
-void checkZeroCopy(const std::map<std::string, std::string>& settled, const std::string& ownName,
-                   std::vector<std::string>& mismatches) {
-    const auto found = settled.find(std::string(zeroCopyFeature));
-    if (found != settled.end() && found->second == "disable" && !zeroCopyDisabled()) {
-        mismatches.push_back("feature \"ZEROCOPY\": \"disable\" is all that both ends accept, but " + ownName +
-                             " has zero copy switched on; set QX_DISABLE_ZEROCOPY for both ends or for neither");
-    }
+// Why the process cannot work with a value of a feature; null for one that it can work with.
+const UnusableFeature* unusable(const SessionConfig& config, const std::string& name, const std::string& value) {
+    const auto found =
+        std::find_if(config.unusableFeatures.begin(), config.unusableFeatures.end(),
+                     [&](const UnusableFeature& feature) { return feature.name == name && feature.value == value; });
+    return found == config.unusableFeatures.end() ? nullptr : &*found;
 }
 
 SessionHello ownHello(const SessionConfig& config, const std::vector<FeatureRequest>& features) {
@@ -176,7 +64,8 @@ SessionHello ownHello(const SessionConfig& config, const std::vector<FeatureRequ
     hello.set_versionmajor(config.version.first);
     hello.set_versionminor(config.version.second);
     for (const FeatureRequest& request : features) {
-        if (!isStruck(request)) {
+        const UnusableFeature* const useless = unusable(config, request.name(), request.value());
+        if (useless == nullptr || useless->offered) {
             SessionFeature& feature = *hello.add_features();
             feature.set_name(request.name());
             feature.set_value(request.value());
@@ -220,7 +109,7 @@ void receiveBody(HandshakeStream& stream, std::uint32_t size, const std::string&
         throw ProtocolViolation("length of " + what + ": expected at most 65536 bytes, got " + std::to_string(size));
     }
     std::string body(size, '\0');
-    stream.receive(body.data(), body.size(), what, [](std::size_t) {});
+    stream.receive(body.data(), body.size(), what);
     if (!message.ParseFromString(body)) {
         throw ProtocolViolation(what + ": its " + std::to_string(size) + " bytes are not a message of its type");
     }
@@ -279,9 +168,8 @@ std::string valuesText(const Offer& offer) {
     return offer.values.empty() ? "no value" : offer.values.size() > most ? text + ", ..." : text;
 }
 
-// Both ends run this over the same two hellos and come to the same map. The client's order decides.
-std::map<std::string, std::string> settleFeatures(const End& client, const End& engine,
-                                                  std::vector<std::string>& mismatches) {
+// The client's order decides.
+void settleFeatures(const End& client, const End& engine, Agreement& agreement) {
     const Offers clientOffers = offersOf(*client.hello);
     const Offers engineOffers = offersOf(*engine.hello);
     std::vector<std::string> names = clientOffers.names;
@@ -292,7 +180,6 @@ std::map<std::string, std::string> settleFeatures(const End& client, const End& 
         const auto found = offers.byName.find(name);
         return found == offers.byName.end() ? nothing : found->second;
     };
-    std::map<std::string, std::string> settled;
     for (const std::string& name : names) {
         const Offer& wanted = offer(clientOffers, name);
         const Offer& possible = offer(engineOffers, name);
@@ -300,13 +187,13 @@ std::map<std::string, std::string> settleFeatures(const End& client, const End& 
         const auto common = std::find_if(wanted.values.begin(), wanted.values.end(),
                                          [&](const std::string& value) { return accepted.contains(value); });
         if (common != wanted.values.end()) {
-            settled.emplace(name, *common);
+            agreement.features.emplace(name, *common);
         } else if (wanted.required || possible.required) {
-            mismatches.push_back("feature " + quoted(name) + ": " + client.name + " accepts " + valuesText(wanted) +
-                                 ", " + engine.name + " " + valuesText(possible));
+            agreement.mismatches.push_back("feature " + quoted(name) + ": " + client.name + " accepts " +
+                                           valuesText(wanted) + ", " + engine.name + " " + valuesText(possible));
+            agreement.unsettled.insert(name);
         }
     }
-    return settled;
 }
 
 std::string protocolText(const SessionHello& hello) {
@@ -324,16 +211,37 @@ std::string roleText(const SessionHello& hello) {
                                           : "unknown (" + std::to_string(role) + ")";
 }
 
-std::map<std::string, std::string> settle(const End& client, const End& engine, std::vector<std::string>& mismatches) {
+// Both ends run this over the same two hellos and come to the same result.
+void settle(const End& client, const End& engine, Agreement& agreement) {
     const auto compare = [&](const std::string& what, const std::string& atClient, const std::string& atEngine) {
         if (atClient != atEngine) {
-            mismatches.push_back(what + ": " + client.name + " has " + atClient + ", " + engine.name + " " + atEngine);
+            agreement.mismatches.push_back(what + ": " + client.name + " has " + atClient + ", " + engine.name + " " +
+                                           atEngine);
         }
     };
     compare("layout version", std::to_string(client.layout), std::to_string(engine.layout));
     compare("protocol", protocolText(*client.hello), protocolText(*engine.hello));
     compare("protocol version", versionText(*client.hello), versionText(*engine.hello));
-    return settleFeatures(client, engine, mismatches);
+    settleFeatures(client, engine, agreement);
+}
+
+// What only this end knows: a value that the process cannot work with is settled, or was missing in the offer.
+void checkUsable(const SessionConfig& config, const std::vector<FeatureRequest>& listed, const std::string& ownName,
+                 Agreement& agreement) {
+    for (const FeatureRequest& request : listed) {
+        const UnusableFeature* const useless = unusable(config, request.name(), request.value());
+        if (useless == nullptr) {
+            continue;
+        }
+        const auto settled = agreement.features.find(request.name());
+        if (settled != agreement.features.end() && settled->second == request.value()) {
+            agreement.mismatches.push_back("feature " + quoted(request.name()) + ": " + quoted(request.value()) +
+                                           " is all that both ends accept, but " + ownName + " " + useless->reason);
+        } else if (!useless->offered && agreement.unsettled.contains(request.name())) {
+            agreement.mismatches.push_back(useless->reason + " for " + ownName + ", so it does not accept " +
+                                           quoted(request.value()) + " for " + quoted(request.name()));
+        }
+    }
 }
 
 std::string join(const std::vector<std::string>& mismatches) {
@@ -379,15 +287,23 @@ std::shared_ptr<const serialization::Registry> setUp(const ProtocolRegistry::Pro
     return registry;
 }
 
-SessionVerdict makeVerdict(const std::map<std::string, std::string>& settled,
-                           const std::vector<std::string>& mismatches) {
+// Tag of the frames to which the limit of array messages applies; empty for a protocol without arrays.
+std::string tagOfArrays(const serialization::Registry& registry) {
+    try {
+        return registry.find(std::type_index(typeid(korveldata::Array)))->name();
+    } catch (const std::out_of_range&) {
+        return {};
+    }
+}
+
+SessionVerdict makeVerdict(const Agreement& agreement) {
     SessionVerdict verdict;
-    verdict.set_accepted(mismatches.empty());
-    if (!mismatches.empty()) {
-        verdict.set_refusal(join(mismatches));
+    verdict.set_accepted(agreement.mismatches.empty());
+    if (!agreement.mismatches.empty()) {
+        verdict.set_refusal(join(agreement.mismatches));
         return verdict;
     }
-    for (const auto& [name, value] : settled) {
+    for (const auto& [name, value] : agreement.features) {
         SessionFeature& feature = *verdict.add_features();
         feature.set_name(name);
         feature.set_value(value);
@@ -397,7 +313,7 @@ SessionVerdict makeVerdict(const std::map<std::string, std::string>& settled,
 
 SessionVerdict receiveVerdict(HandshakeStream& stream) {
     std::array<char, 4> length{};
-    stream.receive(length.data(), length.size(), "the peer's verdict", [](std::size_t) {});
+    stream.receive(length.data(), length.size(), "the peer's verdict");
     SessionVerdict verdict;
     receiveBody(stream, loadLittleEndian<std::uint32_t>(length.data()), "the peer's verdict", verdict);
     return verdict;
@@ -431,32 +347,27 @@ Settlement shakeHands(int in, int out, const SessionConfig& config) {
     SessionHello peer;
     const std::uint32_t peerLayout = receiveHello(stream, peer);
 
-    std::vector<std::string> mismatches;
+    Agreement agreement;
     End ownEnd{"this end", layoutVersion, &own};
     End peerEnd{"the other end", peerLayout, &peer};
     const int rolePair = own.role() + peer.role();
     if (own.role() == peer.role() || rolePair != SessionHello::CLIENT + SessionHello::ENGINE) {
-        mismatches.push_back("role: a session needs a client and an engine, this end is " + roleText(own) +
-                             ", the other end is " + roleText(peer));
+        agreement.mismatches.push_back("role: a session needs a client and an engine, this end is " + roleText(own) +
+                                       ", the other end is " + roleText(peer));
     } else {
         ownEnd.name = config.role == Role::Client ? "the client" : "the engine";
         peerEnd.name = config.role == Role::Client ? "the engine" : "the client";
     }
     const bool ownIsClient = config.role == Role::Client;
-    const auto settled = settle(ownIsClient ? ownEnd : peerEnd, ownIsClient ? peerEnd : ownEnd, mismatches);
-    checkZeroCopy(settled, ownEnd.name, mismatches);
-    const auto aboutZeroCopy = [](const std::string& mismatch) { return mismatch.starts_with("feature \"ZEROCOPY\""); };
-    if (std::any_of(features.begin(), features.end(), isStruck) &&
-        std::any_of(mismatches.begin(), mismatches.end(), aboutZeroCopy)) {
-        mismatches.push_back("QX_DISABLE_ZEROCOPY is set for " + ownEnd.name +
-                             ", so it does not accept \"enable\" for \"ZEROCOPY\"");
-    }
-    Settlement settlement{peerOf(peer), {settled.begin(), settled.end()}, nullptr};
-    if (mismatches.empty()) {
-        settlement.registry = setUp(protocol, config, ownEnd.name, settlement.features, mismatches);
+    settle(ownIsClient ? ownEnd : peerEnd, ownIsClient ? peerEnd : ownEnd, agreement);
+    checkUsable(config, features, ownEnd.name, agreement);
+    Settlement settlement{peerOf(peer), {agreement.features.begin(), agreement.features.end()}, nullptr, {}};
+    if (agreement.mismatches.empty()) {
+        settlement.registry = setUp(protocol, config, ownEnd.name, settlement.features, agreement.mismatches);
+        settlement.arrayTag = tagOfArrays(*settlement.registry);
     }
 
-    const SessionVerdict verdict = makeVerdict(settled, mismatches);
+    const SessionVerdict verdict = makeVerdict(agreement);
     stream.send(packVerdict(verdict));
     if (!verdict.accepted()) {
         refuse(stream, verdict.refusal(), peerEnd.name);
@@ -470,7 +381,7 @@ Settlement shakeHands(int in, int out, const SessionConfig& config) {
     for (const SessionFeature& feature : peerVerdict.features()) {
         peerSettled.emplace(feature.name(), feature.value());
     }
-    if (peerSettled != settled) {
+    if (peerSettled != agreement.features) {
         throw HandshakeRefused("the session is refused: " + peerEnd.name + " settled on other feature values than " +
                                ownEnd.name);
     }

@@ -5,7 +5,8 @@
 #include <string>
 #include <unordered_map>
 
-#include "foundation/msg_svc/transport/layers/session/Session.hpp"
+#include "foundation/msg_svc/transport/layers/serialization/Registry.hpp"
+#include "foundation/msg_svc/transport/layers/session/SessionConfig.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 
@@ -14,6 +15,7 @@ struct Settlement {
     Peer peer;
     std::unordered_map<std::string, std::string> features;
     std::shared_ptr<const serialization::Registry> registry;
+    std::string arrayTag;  ///< tag to which Limits::arrayMessage applies; empty for a protocol without arrays
 };
 
 /// Exchanges hellos and verdicts over two non-blocking descriptors, which stay the caller's; reads not one byte more.

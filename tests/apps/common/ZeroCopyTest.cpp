@@ -3,6 +3,7 @@
 #include <cstdlib>
 #include <future>
 
+#include "common/KrutilSession.hpp"
 #include "platform/session/support/TestSessions.hpp"
 #include "platform/session/support/WireBytes.hpp"
 
@@ -35,17 +36,13 @@ std::string settledOf(const std::unordered_map<std::string, std::string>& featur
     return found == features.end() ? "nothing" : found->second;
 }
 
-const std::vector<session::FeatureRequest> bothValues{{"ZEROCOPY", "enable", FeatureHandling::Required},
-                                                      {"ZEROCOPY", "disable", FeatureHandling::Required}};
-
 // What this process offers.
 std::string offered() {
-    const Registered protocol("test", bothValues);
     const Ends ends = socketPair();
     wire::ByteEnd peer(ends.otherIn, ends.otherOut);
     auto opening = std::async(std::launch::async, [&] {
         try {
-            Session::open(ends.in, ends.out, configOf(Role::Client));
+            Session::open(ends.in, ends.out, apps::krutilSession(Role::Client));
         } catch (const session::SessionError&) {
         }
     });
@@ -56,24 +53,24 @@ std::string offered() {
 
 // What two ends of this process settle on.
 std::string settled() {
-    const Registered protocol("test", bothValues);
-    const SessionPair pair;
+    const SessionPair pair(apps::krutilSession(Role::Client), apps::krutilSession(Role::Engine));
     return settledOf(pair.client->features()) + " " + settledOf(pair.engine->features());
 }
 
 // How this process, as a client, takes an engine that offers these values and gives this verdict.
 std::string against(const std::vector<std::string>& values, const SessionVerdict& verdict) {
-    const Registered protocol("test", bothValues);
     const Ends ends = socketPair();
     wire::ByteEnd peer(ends.otherIn, ends.otherOut);
     auto opening = std::async(std::launch::async, [&]() -> std::string {
         try {
-            return "settled on " + settledOf(Session::open(ends.in, ends.out, configOf(Role::Client))->features());
+            return "settled on " +
+                   settledOf(Session::open(ends.in, ends.out, apps::krutilSession(Role::Client))->features());
         } catch (const HandshakeRefused& refused) {
             return refused.what();
         }
     });
     SessionHello hello = wire::hello(SessionHello::ENGINE);
+    hello.set_protocol("krutil");
     for (const std::string& value : values) {
         auto& feature = *hello.add_features();
         feature.set_name("ZEROCOPY");
@@ -155,8 +152,11 @@ TEST_F(ZeroCopyDeathTest, PeerThatCannotSwitchItOffIsRefusedWithTheReason) {
 TEST_F(ZeroCopyDeathTest, OtherFeaturesKeepTheirValues) {
     EXPECT_EXIT(
         ::setenv(variable, "1", 1); {
-            const Registered protocol("test", {{"OTHER", "enable", FeatureHandling::Required}});
-            const SessionPair pair;
+            const Registered protocol("other", {{"OTHER", "enable", FeatureHandling::Required}});
+            SessionConfig client = apps::krutilSession(Role::Client);
+            SessionConfig engine = apps::krutilSession(Role::Engine);
+            client.protocol = engine.protocol = "other";
+            const SessionPair pair(client, engine);
             report(pair.client->features().at("OTHER"));
         },
                                     testing::ExitedWithCode(0), "enable");

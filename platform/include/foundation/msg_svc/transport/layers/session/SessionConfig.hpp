@@ -1,0 +1,89 @@
+// What an end of a session is told before it begins, and what it learns about the other end.
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <functional>
+#include <optional>
+#include <string>
+#include <typeindex>
+#include <vector>
+
+#include "capabilities/CapabilityList.hpp"
+#include "foundation/msg_svc/transport/layers/session/Limits.hpp"
+#include "foundation/msg_svc/transport/layers/session/ProtocolRegistry.hpp"
+#include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
+
+namespace foundation::msg_svc::transport::layers::session {
+
+namespace framing = ::foundation::vantor::carrier::framing;
+
+/// Which end of the session this is. A client begins exchanges; an engine answers them and raises events.
+enum class Role { Client, Engine };
+
+/// One frame on its way, as a trace sees it. Valid during the call only.
+struct FrameTrace {
+    bool outgoing;
+    bool last;                    ///< the last frame of its message
+    const framing::Frame& frame;  ///< a TaggedFrame or a DataFrame, content included
+};
+
+/// A value of one of the protocol's features that this process cannot work with, though the protocol lists it.
+struct UnusableFeature {
+    std::string name;
+    std::string value;
+
+    /// Whether the value is offered to the peer all the same. A session that settles on it is refused.
+    bool offered = false;
+
+    /// Why, for the refusal. With `offered` it completes "... is all that both ends accept, but the client (has it
+    /// switched off)", without it begins "(IT_IS_OFF is set) for the client, so it does not accept ...".
+    std::string reason;
+
+    bool operator==(const UnusableFeature&) const = default;
+};
+
+/// How this end presents itself, what it accepts, and what a session needs to know about its protocol. Both ends of a
+/// session are given the same `shutdownEvent` and `clientEvents`.
+struct SessionConfig {
+    Role role = Role::Client;
+    std::string protocol;  ///< looked up in the ProtocolRegistry
+    ProtocolVersion version{0, 0};
+    std::string build;  ///< free text that names this program and its version to the peer
+
+    /// The event that is the last message of an engine. Without one a client takes every end of its stream for a loss.
+    std::optional<std::type_index> shutdownEvent;
+
+    /// The events that a client may send as well. All others come from engines only.
+    std::vector<std::type_index> clientEvents;
+
+    /// What this process cannot do of what the protocol lists, decided before any session.
+    std::vector<UnusableFeature> unusableFeatures;
+
+    Limits limits;
+    ::capabilities::CapabilityList capabilities;
+    std::chrono::milliseconds handshakeTimeout{10'000};
+
+    /// Bytes of unwritten output above which waitForRoom() waits.
+    std::size_t roomBytes = 1U << 20;
+
+    /// Messages posted with Urgency::Answer that may be waiting to be written, 1 or more. When so many wait, the peer
+    /// asks without reading, and nothing more is read from it until it has read some.
+    std::size_t maxPendingAnswers = 1024;
+
+    /// Called with every frame, on the thread that sends or receives it. Empty for no trace.
+    std::function<void(const FrameTrace&)> trace;
+
+    /// Called with each received tagged frame before its serializer; may throw ProtocolViolation to close the session.
+    /// Empty for no check.
+    std::function<void(const framing::TaggedFrame&)> check;
+};
+
+/// What the handshake told about the other end.
+struct Peer {
+    std::string build;
+    Limits limits;
+    ::capabilities::CapabilityList capabilities;
+};
+
+}  // namespace foundation::msg_svc::transport::layers::session

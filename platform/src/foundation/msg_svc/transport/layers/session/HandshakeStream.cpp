@@ -1,0 +1,99 @@
+#include "foundation/msg_svc/transport/layers/session/HandshakeStream.hpp"
+
+#include <poll.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <system_error>
+
+#include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
+
+namespace foundation::msg_svc::transport::layers::session {
+namespace {
+
+std::string errorText(int error) {
+    return std::generic_category().message(error);
+}
+
+}  // namespace
+
+HandshakeStream::HandshakeStream(int in, int out, std::chrono::milliseconds timeout)
+    : in_(in), out_(out), timeout_(timeout), deadline_(Clock::now() + timeout) {}
+
+void HandshakeStream::limitTo(std::chrono::milliseconds patience) {
+    deadline_ = std::min(deadline_, Clock::now() + patience);
+}
+
+void HandshakeStream::receive(char* target, std::size_t size, const std::string& what,
+                              const std::function<void(std::size_t)>& check) {
+    for (std::size_t have = 0; have < size;) {
+        const std::string progress =
+            std::to_string(have) + " of " + std::to_string(size) + " bytes of " + what + " had arrived";
+        wait(true, progress);
+        const ssize_t count = ::read(in_, target + have, size - have);
+        if (count > 0) {
+            have += static_cast<std::size_t>(count);
+            if (check) {
+                check(have);
+            }
+        } else if (count == 0 || errno == ECONNRESET) {
+            throw StreamLost("the peer closed the stream during the handshake: " + progress);
+        } else if (errno != EINTR && errno != EAGAIN && errno != EWOULDBLOCK) {
+            throw StreamLost("cannot read from the stream during the handshake: " + errorText(errno) + "; " + progress);
+        }
+    }
+}
+
+std::string HandshakeStream::peek(std::size_t most) const {
+    std::string bytes(most, '\0');
+    const ssize_t count = ::read(in_, bytes.data(), bytes.size());
+    bytes.resize(count > 0 ? static_cast<std::size_t>(count) : 0);
+    return bytes;
+}
+
+void HandshakeStream::flush() {
+    while (!unsent_.empty() && writeError_ == 0) {
+        wait(false, std::to_string(unsent_.size()) + " bytes are unwritten");
+    }
+    if (writeError_ != 0) {
+        throw StreamLost("cannot write to the stream during the handshake: " + errorText(writeError_));
+    }
+}
+
+// Waits for something to read (or, without `reading`, to write) and writes what can be written meanwhile.
+void HandshakeStream::wait(bool reading, const std::string& progress) {
+    for (;;) {
+        const bool writing = !unsent_.empty() && writeError_ == 0;
+        std::array<pollfd, 2> polled{pollfd{reading ? in_ : -1, POLLIN, 0}, pollfd{writing ? out_ : -1, POLLOUT, 0}};
+        const auto left =
+            std::max<Clock::rep>(0, std::chrono::ceil<std::chrono::milliseconds>(deadline_ - Clock::now()).count());
+        const int ready = ::poll(polled.data(), polled.size(), static_cast<int>(std::min<Clock::rep>(left, 60'000)));
+        if (ready < 0 && errno != EINTR) {
+            throw StreamLost("cannot wait for the stream during the handshake: " + errorText(errno));
+        }
+        if (ready == 0 && Clock::now() >= deadline_) {
+            throw StreamLost("the handshake timed out after " + std::to_string(timeout_.count()) +
+                             " milliseconds: " + progress);
+        }
+        if (ready > 0 && polled[1].revents != 0) {
+            writeSome();
+        }
+        if (ready > 0 && (!reading || polled[0].revents != 0)) {
+            return;
+        }
+    }
+}
+
+void HandshakeStream::writeSome() {
+    const ssize_t count = ::write(out_, unsent_.data(), unsent_.size());
+    if (count >= 0) {
+        unsent_.erase(0, static_cast<std::size_t>(count));
+    } else if (errno != EINTR && errno != EAGAIN && errno != EWOULDBLOCK) {
+        // The peer may have said why before it closed its end, so reading goes on.
+        writeError_ = errno;
+    }
+}
+
+}  // namespace foundation::msg_svc::transport::layers::session

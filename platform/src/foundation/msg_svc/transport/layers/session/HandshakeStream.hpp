@@ -1,0 +1,50 @@
+// The byte stream of a handshake.
+#pragma once
+
+#include <chrono>
+#include <cstddef>
+#include <functional>
+#include <string>
+
+namespace foundation::msg_svc::transport::layers::session {
+
+/// Reads and writes both directions at once, within one time limit: each end sends its first message without waiting
+/// for the other's, so neither may insist on writing before it reads. One thread; the descriptors are non-blocking and
+/// stay the caller's.
+class HandshakeStream {
+  public:
+    HandshakeStream(int in, int out, std::chrono::milliseconds timeout);
+
+    /// Hands bytes over; they are written while receive() and flush() wait.
+    void send(const std::string& bytes) { unsent_ += bytes; }
+
+    /// Shortens what is left of the time limit to `patience`.
+    void limitTo(std::chrono::milliseconds patience);
+
+    /// Reads exactly `size` bytes to `target`. `check` gets the number that are there, each time some have come, and
+    /// may throw; empty for none. `what` names the bytes in errors. Throws StreamLost for an end of the stream, an
+    /// error and the time limit.
+    void receive(char* target, std::size_t size, const std::string& what,
+                 const std::function<void(std::size_t)>& check = nullptr);
+
+    /// What else is there already, for a message that shows it.
+    std::string peek(std::size_t most) const;
+
+    /// Returns when everything is written. Throws StreamLost.
+    void flush();
+
+  private:
+    using Clock = std::chrono::steady_clock;
+
+    void wait(bool reading, const std::string& progress);
+    void writeSome();
+
+    int in_;
+    int out_;
+    std::chrono::milliseconds timeout_;
+    Clock::time_point deadline_;
+    std::string unsent_;
+    int writeError_ = 0;
+};
+
+}  // namespace foundation::msg_svc::transport::layers::session

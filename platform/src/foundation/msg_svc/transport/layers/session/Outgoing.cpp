@@ -1,0 +1,211 @@
+#include "foundation/msg_svc/transport/layers/session/Outgoing.hpp"
+
+#include <poll.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <system_error>
+#include <utility>
+
+namespace foundation::msg_svc::transport::layers::session {
+
+Outgoing::Outgoing(asio::io_context& io, core::posix::OwnedDescriptor& descriptor, std::size_t roomBytes, Owner& owner)
+    : io_(io), stream_(io), owner_(owner), roomBytes_(roomBytes), descriptor_(descriptor.get()) {
+    stream_.assign(descriptor.get());
+    descriptor.release();
+    updateEvents();
+}
+
+std::vector<OutgoingPieces> Outgoing::push(OutgoingPieces&& message) {
+    std::vector<OutgoingPieces> done;
+    const std::lock_guard lock(mutex_);
+    if (!isOpen()) {
+        return done;
+    }
+    const std::size_t bytes = message.bytes();
+    const bool answer = message.answer();
+    queue_.push(std::move(message));
+    const int error = queue_.size() == 1 ? queue_.writeOnce(descriptor_, done) : 0;
+    if (error != 0 && error != EAGAIN) {
+        state_ = State::Failed;
+        asio::post(io_, [this, error] { fail(error); });
+    }
+    if (!queue_.empty()) {
+        queue_.back().detachUnshareable();
+        unwritten_ += bytes;
+        answersOwed_ += answer ? 1 : 0;
+        updateEvents();
+        if (!writerAwake_ && isOpen()) {
+            writerAwake_ = true;
+            asio::post(io_, [this] { armWrite(); });
+        }
+    }
+    return done;
+}
+
+bool Outgoing::waitUntilWritten(int interrupt) {
+    {
+        // Other threads may go on sending, which must not prolong the wait.
+        const std::lock_guard lock(mutex_);
+        awaited_ = unwritten_;
+        updateEvents();
+    }
+    return waitFor(allWritten_, interrupt);
+}
+
+bool Outgoing::waitFor(const LevelEvent& event, int interrupt) {
+    while (!event.holds()) {
+        std::array<pollfd, 2> polled{pollfd{event.descriptor(), POLLIN, 0}, pollfd{interrupt, POLLIN, 0}};
+        if (::poll(polled.data(), polled.size(), -1) < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            throw std::system_error(errno, std::generic_category(), "Session: waiting for the stream");
+        }
+        if (polled[0].revents == 0 && polled[1].revents != 0) {
+            return false;
+        }
+    }
+    return true;
+}
+
+std::uint64_t Outgoing::written() const {
+    const std::lock_guard lock(mutex_);
+    return queue_.written();
+}
+
+bool Outgoing::isDrained() const {
+    const std::lock_guard lock(mutex_);
+    return queue_.empty() && !hasFailed();
+}
+
+void Outgoing::updateEvents() {
+    const bool over = state_ == State::Finishing || state_ == State::Closed;
+    room_.set(over || unwritten_ <= roomBytes_);
+    allWritten_.set(over || awaited_ == 0);
+}
+
+// Only when the frames are gone do their bytes stop counting: whoever waits for the stream finds the buffers released.
+void Outgoing::drop(std::vector<OutgoingPieces>& messages) {
+    if (messages.empty()) {
+        return;
+    }
+    std::size_t bytes = 0;
+    std::size_t answers = 0;
+    for (const OutgoingPieces& message : messages) {
+        bytes += message.bytes();
+        answers += message.answer() ? 1 : 0;
+    }
+    messages.clear();
+    const std::lock_guard lock(mutex_);
+    unwritten_ -= bytes;
+    // Messages are written in the order in which they were handed over, so the awaited ones are the first.
+    awaited_ -= std::min(awaited_, bytes);
+    answersOwed_ -= answers;
+    updateEvents();
+}
+
+void Outgoing::armWrite() {
+    stream_.async_wait(asio::posix::stream_descriptor::wait_write, [this](const ErrorCode& error) {
+        if (error == asio::error::operation_aborted || state_ == State::Closed) {
+            return;
+        }
+        if (error) {
+            fail(error.value());
+        } else {
+            flush();
+        }
+    });
+}
+
+void Outgoing::flush() {
+    std::vector<OutgoingPieces> done;
+    int error = 0;
+    bool all = false;
+    {
+        const std::lock_guard lock(mutex_);
+        if (!queue_.empty()) {
+            error = queue_.writeOnce(descriptor_, done);
+        }
+        all = queue_.empty();
+        writerAwake_ = !all;
+    }
+    drop(done);
+    if (error != 0 && error != EAGAIN) {
+        fail(error);
+        return;
+    }
+    if (!all) {
+        armWrite();
+    }
+    owner_.onWritten(all);
+}
+
+void Outgoing::fail(int error) {
+    std::vector<OutgoingPieces> dropped;
+    {
+        const std::lock_guard lock(mutex_);
+        if (state_ == State::Closed) {
+            return;
+        }
+        state_ = State::Failed;
+        dropped = queue_.takeAll(false);
+    }
+    drop(dropped);
+    owner_.onWriteFailed(error);
+}
+
+bool Outgoing::finish(std::optional<OutgoingPieces> lastWord) {
+    std::vector<OutgoingPieces> dropped;
+    bool left = false;
+    {
+        const std::lock_guard lock(mutex_);
+        const bool telling = lastWord && !hasFailed();
+        dropped = queue_.takeAll(telling);
+        if (telling) {
+            unwritten_ += lastWord->bytes();
+            queue_.push(std::move(*lastWord));
+        }
+        if (!hasFailed()) {
+            state_ = State::Finishing;
+        }
+        left = !queue_.empty();
+        updateEvents();
+    }
+    drop(dropped);
+    return left;
+}
+
+void Outgoing::awaitHangUp() {
+    stream_.async_wait(asio::posix::stream_descriptor::wait_error, [this](const ErrorCode& error) {
+        if (error != asio::error::operation_aborted && state_ != State::Closed) {
+            owner_.onHangUp();
+        }
+    });
+}
+
+void Outgoing::close() {
+    std::vector<OutgoingPieces> dropped;
+    {
+        const std::lock_guard lock(mutex_);
+        state_ = State::Closed;
+        dropped = queue_.takeAll(false);
+        descriptor_ = -1;
+        updateEvents();
+    }
+    drop(dropped);
+    ErrorCode ignored;
+    stream_.close(ignored);
+}
+
+void Outgoing::abandonInChild() noexcept {
+    if (const int descriptor = descriptor_.exchange(-1); descriptor >= 0) {
+        ::close(descriptor);
+    }
+    ::close(room_.descriptor());
+    ::close(allWritten_.descriptor());
+}
+
+}  // namespace foundation::msg_svc::transport::layers::session

@@ -1,0 +1,111 @@
+// The way out of a session: what was handed over is written in order, at once as far as the stream takes it, the rest
+// by the I/O thread. Nobody waits for a write unless they ask to.
+#pragma once
+
+#include <atomic>
+#include <cstddef>
+#include <cstdint>
+#include <mutex>
+#include <optional>
+#include <vector>
+
+#include "foundation/core/posix/OwnedDescriptor.hpp"
+#include "foundation/msg_svc/transport/layers/session/Asio.hpp"
+#include "foundation/msg_svc/transport/layers/session/LevelEvent.hpp"
+#include "foundation/msg_svc/transport/layers/session/OutgoingQueue.hpp"
+
+namespace foundation::msg_svc::transport::layers::session {
+
+/// Owns the descriptor that a session writes to. Members may be called from any thread, but for those of the I/O
+/// thread.
+class Outgoing {
+  public:
+    /// Is told what becomes of the stream, on the I/O thread.
+    class Owner {
+      public:
+        /// Messages have been written. `all`: nothing is left to be written.
+        virtual void onWritten(bool all) = 0;
+        /// Writing has failed with this errno. Nothing can be written any more, and what was unwritten is dropped.
+        virtual void onWriteFailed(int error) = 0;
+        /// The peer has closed both directions of the stream; told once after awaitHangUp().
+        virtual void onHangUp() = 0;
+
+      protected:
+        ~Owner() = default;
+    };
+
+    /// Takes the descriptor over; it must be non-blocking. `roomBytes` is what may be unwritten while there is room.
+    Outgoing(asio::io_context& io, core::posix::OwnedDescriptor& descriptor, std::size_t roomBytes, Owner& owner);
+
+    /// Whether messages are taken. False after an error and after finish().
+    bool isOpen() const noexcept { return state_.load(std::memory_order_acquire) == State::Open; }
+
+    /// Writes a message, or puts it behind those that are unwritten. Returns what has been written at once, for the
+    /// caller to drop where it holds no lock: deleters of frames are their owners' code. A message that is not taken
+    /// stays the caller's.
+    [[nodiscard]] std::vector<OutgoingPieces> push(OutgoingPieces&& message);
+
+    /// Waits until no more than `roomBytes` are unwritten, nothing is taken any more, or `interrupt` (a descriptor, -1
+    /// for none) becomes readable; returns false in the last case only. Not from the I/O thread.
+    bool waitForRoom(int interrupt) const { return waitFor(room_, interrupt); }
+
+    /// The same until all is written that was handed over before the call.
+    bool waitUntilWritten(int interrupt);
+
+    /// Messages posted as answers that are unwritten.
+    std::size_t answersOwed() const noexcept { return answersOwed_.load(std::memory_order_relaxed); }
+
+    /// Bytes that the stream has taken.
+    std::uint64_t written() const;
+
+    /// Nothing is unwritten, and nothing was lost.
+    bool isDrained() const;
+    bool hasFailed() const noexcept { return state_.load(std::memory_order_acquire) == State::Failed; }
+
+    // I/O thread.
+
+    /// Takes nothing more, and drops what is unwritten but for a message that is written in part and, behind it,
+    /// `lastWord`, unless writing has failed. Returns whether something is left to be written.
+    bool finish(std::optional<OutgoingPieces> lastWord);
+
+    /// Writes as much as the stream takes now, and waits for the stream to take the rest.
+    void flush();
+
+    /// Has onHangUp() called when the peer has closed both directions.
+    void awaitHangUp();
+
+    /// Drops what is unwritten and closes the descriptor.
+    void close();
+
+    /// For a forked child: closes the descriptors with nothing but close(2).
+    void abandonInChild() noexcept;
+
+  private:
+    // Open -> Finishing -> Closed; Failed may come before each of the last two.
+    enum class State { Open, Finishing, Failed, Closed };
+
+    static bool waitFor(const LevelEvent& event, int interrupt);
+    void updateEvents();
+    void drop(std::vector<OutgoingPieces>& messages);
+    void armWrite();
+    void fail(int error);
+
+    asio::io_context& io_;
+    asio::posix::stream_descriptor stream_;
+    Owner& owner_;
+    const std::size_t roomBytes_;
+    LevelEvent room_;
+    LevelEvent allWritten_;
+    std::atomic<int> descriptor_;
+    // Changed with the mutex held.
+    std::atomic<State> state_{State::Open};
+    std::atomic<std::size_t> answersOwed_{0};
+
+    mutable std::mutex mutex_;
+    OutgoingQueue queue_;
+    std::size_t unwritten_ = 0;
+    std::size_t awaited_ = 0;  ///< of these, what was there when somebody began to wait for it
+    bool writerAwake_ = false;
+};
+
+}  // namespace foundation::msg_svc::transport::layers::session

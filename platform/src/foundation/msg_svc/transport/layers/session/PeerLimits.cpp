@@ -1,0 +1,48 @@
+#include "foundation/msg_svc/transport/layers/session/PeerLimits.hpp"
+
+#include <cstdint>
+#include <utility>
+
+#include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
+#include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
+#include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
+
+namespace foundation::msg_svc::transport::layers::session {
+
+PeerLimits::PeerLimits(const Limits& limits, std::string peerName, std::string arrayTag)
+    : limits_(limits), peerName_(std::move(peerName)), arrayTag_(std::move(arrayTag)) {}
+
+void PeerLimits::check(const std::vector<std::unique_ptr<framing::Frame>>& frames) const {
+    const auto refuse = [&](const char* limit, std::uint64_t accepted, std::uint64_t size, const std::string& what,
+                            const char* unit) {
+        const std::string& root = dynamic_cast<const framing::TaggedFrame&>(*frames.back()).tag();
+        throw LimitExceeded(quoted(root) + " is larger than " + peerName_ + " accepts: its limit \"" + limit +
+                            "\" is " + std::to_string(accepted) + " " + unit + ", " + what + " has " +
+                            std::to_string(size));
+    };
+    if (frames.size() > limits_.frames) {
+        refuse("frames", limits_.frames, frames.size(), "the message", "frames");
+    }
+    std::uint64_t total = 0;
+    for (const auto& frame : frames) {
+        total += frame->size();
+        if (const auto* const tagged = dynamic_cast<const framing::TaggedFrame*>(frame.get())) {
+            if (tagged->tag().size() > limits_.tag) {
+                refuse("tag", limits_.tag, tagged->tag().size(), "the tag of frame " + std::to_string(frame->index()),
+                       "bytes");
+            }
+            const bool array = tagged->tag() == arrayTag_;
+            const std::uint64_t accepted = array ? limits_.arrayMessage : limits_.taggedFrame;
+            if (frame->size() > accepted) {
+                refuse(array ? "arrayMessage" : "taggedFrame", accepted, frame->size(),
+                       "the content of frame " + std::to_string(frame->index()), "bytes");
+            }
+            total += tagged->tag().size();
+        }
+    }
+    if (total > limits_.message) {
+        refuse("message", limits_.message, total, "the message", "bytes");
+    }
+}
+
+}  // namespace foundation::msg_svc::transport::layers::session
