@@ -52,9 +52,14 @@ HOST_ONLY = {
     "foundation/core/posix/writeFully.hpp",
     "foundation/msg_svc/transport/layers/session/Limits.hpp",
     "foundation/msg_svc/transport/layers/session/Session.hpp",
+    "foundation/msg_svc/transport/layers/session/SessionConfig.hpp",
     "foundation/msg_svc/transport/layers/session/SessionError.hpp",
     "foundation/vantor/carrier/framing/BufferAllocator.hpp",
 }
+
+# The layer that serves any protocol, and the interfaces that only one of them is about.
+SESSION_LAYER = "foundation/msg_svc/transport/layers/session/"
+PROTOCOLS_OWN = "platform/include/krutil/"
 
 
 def room(path):
@@ -140,6 +145,8 @@ def check(root):
                 findings.append(f"{place}: {room(path)} must not include {target[1]} of {target[0]}")
             elif room(path).startswith("product") and match[2] in HOST_ONLY:
                 findings.append(f"{place}: {target[1]} is the reference host's own; other platforms do not have it")
+            elif SESSION_LAYER in path and target[1].startswith(PROTOCOLS_OWN):
+                findings.append(f"{place}: the session layer serves any protocol, and {target[1]} is of one")
             else:
                 findings += check_programs(place, path, target[1])
                 if room(path).startswith("product") and target[0] == "platform/include":

@@ -110,6 +110,16 @@ class IncludesTest(Planted):
     def test_room_that_is_not_listed(self):
         self.expect("apps/qvm/attic/A.cpp", '#include "common/Build.hpp"', "in no room of apps/qvm")
 
+    def test_session_layer_includes_what_one_protocol_is_about(self):
+        self.write("platform/include/krutil/io/Text.hpp", "// Text.\n")
+        line = '#include "krutil/io/Text.hpp"'
+        self.write("platform/src/foundation/korveldata/A.cpp", line + "\n")
+        self.expect(f"platform/src/{includes.SESSION_LAYER}A.cpp", line, "serves any protocol")
+
+    def test_session_layer_includes_what_one_protocol_is_about_in_an_interface(self):
+        self.write("platform/include/krutil/io/Text.hpp", "// Text.\n")
+        self.expect(f"platform/include/{includes.SESSION_LAYER}A.hpp", '#include "krutil/io/Text.hpp"', "any protocol")
+
     def test_included_file_that_is_nowhere(self):
         self.expect("apps/qvm/A.cpp", '#include "io/Missing.hpp"', "in no room")
 
