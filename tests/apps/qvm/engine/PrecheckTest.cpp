@@ -253,7 +253,9 @@ TEST(EnginePrecheckTest, WithoutItFramesInPlacesOfOthersAreRefusedForTheirType) 
     for (const Stowaway& each : stowaways()) {
         for (const Parts& parts : {Parts{each.bad, enqueue(1)}, Parts{each.bad, call(1), enqueue(2)}}) {
             EXPECT_EQ(outcomeOf(parts, checked), (Outcome{{}, each.refusal, 4, "krutil-qvm: " + each.refusal + "\n"}));
-            const std::string why = "cannot read \"krutil:IIPEnqueueMessage\": std::bad_cast";
+            const std::string reader = parts.size() == 2 ? "krutil:IIPEnqueueMessage" : "krutil:FEvalIIP";
+            const std::string why = "cannot read \"krutil:IIPEnqueueMessage\": frame 1: expected an object that \"" +
+                                    reader + "\" can refer to, got one with tag \"" + each.bad.tag + "\"";
             EXPECT_EQ(outcomeOf(parts, unchecked), (Outcome{{}, why, 4, "krutil-qvm: " + why + "\n"})) << each.bad.tag;
         }
     }
@@ -304,7 +306,9 @@ TEST_P(ListenerPrecheckTest, SessionThatIsClosedLeavesTheOthers) {
 
     const Outcome outcome = ByteClient(connectTo(path)).exchange({stowaways().front().bad, enqueue(1)});
     const std::string why = GetParam() ? "frame \"krutil:TextBaseEvent\": expected a stream from 0 to 2, got 3"
-                                       : "cannot read \"krutil:IIPEnqueueMessage\": std::bad_cast";
+                                       : "cannot read \"krutil:IIPEnqueueMessage\": frame 1: expected an object that "
+                                         "\"krutil:IIPEnqueueMessage\" can refer to, got one with tag "
+                                         "\"krutil:TextBaseEvent\"";
     EXPECT_EQ(outcome.abort, why);
     EXPECT_THAT(outcome.roots, ElementsAre());
     engine.awaitStderr("krutil-qvm: " + why + "\n");

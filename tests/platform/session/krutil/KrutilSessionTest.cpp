@@ -7,6 +7,8 @@
 #include "cmddistributor/EvalIIP.hpp"
 #include "cmddistributor/IIPEnqueueMessage.hpp"
 #include "cmddistributor/IIPStateEvent.hpp"
+#include "foundation.korveldata.protobuf.KORVEL_Array.pb.h"
+#include "foundation/korveldata/ElementType.hpp"
 #include "krutil/capabilities_api/CapabilitiesChanged.hpp"
 #include "krutil/cmddistributor/IIPReply.hpp"
 #include "krutil/eventmgr/QVMShutdownEvent.hpp"
@@ -178,10 +180,52 @@ TEST_F(KrutilSessionTest, RootsOfTheWrongDirectionAreRefused) {
 }
 
 TEST_F(KrutilSessionTest, MissingFieldsAndFramesCloseTheSessionWithTheSerializersReason) {
-    EXPECT_EQ(refusalOf(Role::Engine, wire::tagged(1, 1, true, "krutil:IIPEnqueueMessage", "", 29)).text,
-              "cannot read \"krutil:IIPEnqueueMessage\": std::bad_cast");
     EXPECT_TRUE(refusalOf(Role::Engine, wire::tagged(1, 1, true, "krutil:IIPCancelMessage", "", 27))
                     .text.starts_with("cannot read \"krutil:IIPCancelMessage\": Requied field is missing: "));
+}
+
+// Requests whose frames are not what they refer to. Field 1 of an enqueue message is the index of its request, field 2
+// of a call the indexes of its arrays; an array names its data frame.
+TEST_F(KrutilSessionTest, UnreadableMessagesAreExplainedByTheirFrames) {
+    const std::string enqueueTag = "krutil:IIPEnqueueMessage";
+    const auto refusal = [&](const std::string& before, std::uint64_t root, std::uint64_t handle, unsigned type = 27) {
+        const std::string content = "\x08" + std::string(1, static_cast<char>(handle));
+        const std::string text =
+            refusalOf(Role::Engine, before + wire::tagged(1, root, true, enqueueTag, content, type)).text;
+        const std::string start = "cannot read \"krutil:IIPEnqueueMessage\": ";
+        EXPECT_TRUE(text.starts_with(start)) << text;
+        return text.substr(start.size());
+    };
+    const auto tagged = [](std::uint64_t index, const std::string& tag, const std::string& content = "",
+                           unsigned type = 29) { return wire::tagged(1, index, false, tag, content, type); };
+
+    EXPECT_EQ(refusal("", 1, 0, 29), "frame 1: expected the frame type of \"krutil:IIPEnqueueMessage\", got 29");
+    EXPECT_EQ(refusal("", 1, 0), "frame 0: expected a frame, got none: the message has 1");
+    EXPECT_EQ(refusal("", 1, 9), "frame 9: expected a frame, got none: the message has 1");
+    EXPECT_EQ(refusal("", 1, 1), "frame 1: expected a frame, got none: it was read already");
+    EXPECT_EQ(refusal(wire::data(1, 1, false, "12345678"), 2, 1),
+              "frame 1: expected a tagged frame, got a data frame of type 4");
+    EXPECT_EQ(refusal(tagged(1, "krutil:IIPReply"), 2, 1),
+              "frame 1: expected an object that \"krutil:IIPEnqueueMessage\" can refer to, got one with tag "
+              "\"krutil:IIPReply\"");
+    EXPECT_EQ(refusal(tagged(1, "krutil:Nonsense\x1B"), 2, 1),
+              "frame 1: no serializer is registered for its tag \"krutil:Nonsense\\x1b\"");
+    EXPECT_EQ(refusal(tagged(1, "krutil:EvalIIP", "", 27), 2, 1),
+              "frame 1: expected the frame type of \"krutil:EvalIIP\", got 27");
+    const auto callOf = [](char array) { return std::string("\x22\x01") + array; };
+    EXPECT_EQ(refusal(tagged(1, "krutil:TextBaseEvent") + tagged(2, "krutil:FEvalIIP", callOf(1)), 3, 2),
+              "frame 1: expected an object that \"krutil:FEvalIIP\" can refer to, got one with tag "
+              "\"krutil:TextBaseEvent\"");
+    foundation::korveldata::protobuf::KORVEL_Array array;
+    array.set_elementtype(static_cast<int>(foundation::korveldata::ElementType::Double));
+    array.add_dimensions(1);
+    array.set_dataid(1);
+    EXPECT_EQ(refusal(tagged(1, "krutil:EvalIIP") + tagged(2, "krutil:QDA", array.SerializeAsString()) +
+                          tagged(3, "krutil:FEvalIIP", callOf(2)),
+                      4, 3),
+              "frame 1: expected a data frame, got a tagged frame with tag \"krutil:EvalIIP\"");
+    // What says in words what is wrong says it itself.
+    EXPECT_EQ(refusal(tagged(1, "krutil:FEvalIIP"), 2, 1), "Required field missing: protobuf::FEvalIIP.iip");
 }
 
 TEST_F(KrutilSessionTest, ArraysHaveALimitOfTheirOwn) {

@@ -30,6 +30,7 @@ Incoming::Incoming(asio::io_context& io, core::posix::OwnedDescriptor& descripto
       owner_(owner),
       stream_(io),
       reader_(config.limits, arrayTag),
+      arrayTag_(arrayTag),
       descriptor_(descriptor.get()) {
     stream_.assign(descriptor.get());
     descriptor.release();
@@ -218,8 +219,9 @@ void Incoming::takeMessage(Frames frames) {
 // Objects.
 
 template <class T>
-boost::shared_ptr<const T> Incoming::rebuild(const RootSerializer<T>& serializer, Frames frames) const {
+boost::shared_ptr<const T> Incoming::rebuild(const RootSerializer<T>& serializer, Frames frames) {
     const framing::FrameIndex root = frames.size();
+    notes_.take(frames);
     // Indexes of a message start at 1.
     frames.insert(frames.begin(), nullptr);
     const auto message = std::make_unique<message::Message>(std::move(frames));
@@ -230,7 +232,7 @@ boost::shared_ptr<const T> Incoming::rebuild(const RootSerializer<T>& serializer
     try {
         object = serializer.deserialize(root, message, registry_, serialization::SerializationContext());
     } catch (const std::exception& error) {
-        refuse(error.what());
+        refuse(notes_.explain(error, *registry_, arrayTag_));
     } catch (...) {
         refuse("exception of an unknown type");
     }

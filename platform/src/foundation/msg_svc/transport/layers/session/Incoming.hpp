@@ -17,6 +17,7 @@
 #include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "foundation/msg_svc/transport/layers/session/Asio.hpp"
 #include "foundation/msg_svc/transport/layers/session/Exchanges.hpp"
+#include "foundation/msg_svc/transport/layers/session/FrameNotes.hpp"
 #include "foundation/msg_svc/transport/layers/session/MessageReader.hpp"
 #include "foundation/msg_svc/transport/layers/session/ObjectWriter.hpp"
 #include "foundation/msg_svc/transport/layers/session/Outgoing.hpp"
@@ -90,7 +91,7 @@ class Incoming {
     void take(MessageReader::Item item);
     void takeMessage(Frames frames);
     template <class T>
-    boost::shared_ptr<const T> rebuild(const RootSerializer<T>& serializer, Frames frames) const;
+    boost::shared_ptr<const T> rebuild(const RootSerializer<T>& serializer, Frames frames);
 
     const SessionConfig& config_;
     const std::shared_ptr<const serialization::Registry> registry_;
@@ -99,6 +100,8 @@ class Incoming {
     Owner& owner_;
     asio::posix::stream_descriptor stream_;
     MessageReader reader_;
+    FrameNotes notes_;
+    const std::string arrayTag_;
     SessionHandler* handler_ = nullptr;
     State state_ = State::Waiting;
 
