@@ -219,6 +219,7 @@ TEST_F(KrutilSessionTest, UnreadableMessagesAreExplainedByTheirFrames) {
     foundation::korveldata::protobuf::KORVEL_Array array;
     array.set_elementtype(static_cast<int>(foundation::korveldata::ElementType::Double));
     array.add_dimensions(1);
+    array.set_order(foundation::korveldata::protobuf::KORVEL_Array::ROW_MAJOR);
     array.set_dataid(1);
     EXPECT_EQ(refusal(tagged(1, "krutil:EvalIIP") + tagged(2, "krutil:QDA", array.SerializeAsString()) +
                           tagged(3, "krutil:FEvalIIP", callOf(2)),

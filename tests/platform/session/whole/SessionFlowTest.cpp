@@ -127,7 +127,7 @@ class HeldBackTest : public SessionFlowTest {
   protected:
     static constexpr std::size_t bound = 5;
 
-    HeldBackTest() : end_(config()) {
+    explicit HeldBackTest(Ends ends = socketPair()) : end_(config(), ends) {
         end_.saw.answerWith([this](framing::StreamID stream, const Question&) {
             end_.session->send(stream, answer("a"), Session::Urgency::Answer);
         });
@@ -183,6 +183,20 @@ TEST_F(HeldBackTest, PeerThatReadsAgainIsAnsweredInFull) {
 }
 
 TEST_F(HeldBackTest, PeerThatHangsUpIsNoticed) {
+    end_.peer->close();
+    const SessionEnd ended = end_.saw.waitForEnd();
+    EXPECT_EQ(ended.reason, Reason::Lost);
+    EXPECT_EQ(ended.text,
+              "the stream ended between two messages, without the client's goodbye; writing to it had failed: Broken "
+              "pipe");
+}
+
+class HeldBackOverPipesTest : public HeldBackTest {
+  protected:
+    HeldBackOverPipesTest() : HeldBackTest(pipes()) {}
+};
+
+TEST_F(HeldBackOverPipesTest, PeerThatHangsUpIsNoticed) {
     end_.peer->close();
     const SessionEnd ended = end_.saw.waitForEnd();
     EXPECT_EQ(ended.reason, Reason::Lost);
@@ -280,6 +294,18 @@ TEST_F(SessionFlowTest, ClientThatClosesAfterTheShutdownEventIsFinished) {
     end.saw.waitForLines(1);
     end.session->close();
     EXPECT_EQ(end.saw.waitForEnd().reason, Reason::Finished);
+}
+
+TEST_F(SessionFlowTest, WithoutAShutdownEventNothingIsTheLastMessage) {
+    SessionConfig config = configOf(Role::Client);
+    config.shutdownEvent.reset();
+    SessionWithBytes end(config);
+    end.peer->write(wire::tagged(0, 1, true, shutdownTag, "") + wire::tagged(0, 1, true, noticeTag, "more"));
+    end.peer->close();
+    EXPECT_EQ(end.saw.waitForEnd().reason, Reason::Lost);
+    EXPECT_THAT(end.saw.lines(),
+                ElementsAre("event 0 shutdown", "event 0 more",
+                            "end: lost: the stream ended between two messages, before the engine's shutdown event"));
 }
 
 TEST_F(SessionFlowTest, EngineGoesOnSendingAfterTheClientsGoodbyeAndEndOfStream) {
