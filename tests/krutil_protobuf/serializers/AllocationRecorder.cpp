@@ -36,7 +36,7 @@ struct AllocationHooks {
                 recorder->lastArray_ = size;
             }
         }
-        void* memory = std::malloc(sizeof(Mark) + size);
+        void* memory = std::malloc(sizeof(Mark) + std::max<std::size_t>(size, 1));
         return memory != nullptr ? new (memory) Mark{inUse} + 1 : nullptr;
     }
 
