@@ -14,13 +14,13 @@ namespace {
 using testing::ExitedWithCode;
 using testing::HasSubstr;
 
-constexpr const char* kVariable = "QX_DISABLE_ZEROCOPY";
+constexpr const char* variable = "QX_DISABLE_ZEROCOPY";
 
 void setVariable(const char* value) {
     if (value == nullptr) {
-        ::unsetenv(kVariable);
+        ::unsetenv(variable);
     } else {
-        ::setenv(kVariable, value, 1);
+        ::setenv(variable, value, 1);
     }
 }
 
@@ -31,7 +31,7 @@ std::string account(EngineProcess& process) {
     limits.arrayMessage = 100'000;
     EngineClient client(process.connection(), limits);
     std::string text = client.session().features().at("ZEROCOPY");
-    for (const std::uint64_t size : {0, 1, 2047, 2048, 99'000}) {
+    for (const std::uint64_t size : {0UL, 1UL, 2047UL, 2048UL, 99'000UL}) {
         const Array sent = bytes(size);
         const std::vector<Array> got = call(client, "numpy.asarray", {sent});
         if (got.size() != 1 || !(got[0] == sent)) {

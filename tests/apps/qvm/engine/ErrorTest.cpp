@@ -22,7 +22,7 @@ using testing::HasSubstr;
 using testing::Not;
 using testing::StartsWith;
 
-constexpr char kReplacement[] = "\xEF\xBF\xBD";
+constexpr char replacement[] = "\xEF\xBF\xBD";
 
 // "file:line function", outermost first.
 std::vector<std::string> framesOf(const RuntimeException& error) {
@@ -262,11 +262,11 @@ TEST_F(ErrorTest, NamesAndTextsAreAlwaysWellFormed) {
         "def f(): raise T('x\\udfff')\n"
         "f.__code__ = f.__code__.replace(co_name='n\\udcff', co_filename='file\\udcfe')\n"
         "f()");
-    EXPECT_EQ(error.GetID(), std::string("m") + kReplacement + ".T" + kReplacement);
-    EXPECT_EQ(textOf(error), std::string("x") + kReplacement);
-    EXPECT_EQ(error.getFunctionName(), std::string("n") + kReplacement);
+    EXPECT_EQ(error.GetID(), std::string("m") + replacement + ".T" + replacement);
+    EXPECT_EQ(textOf(error), std::string("x") + replacement);
+    EXPECT_EQ(error.getFunctionName(), std::string("n") + replacement);
     EXPECT_THAT(framesOf(error),
-                ElementsAre("<eval-1>:6 <module>", std::string("file") + kReplacement + ":4 n" + kReplacement));
+                ElementsAre("<eval-1>:6 <module>", std::string("file") + replacement + ":4 n" + replacement));
 }
 
 TEST_F(ErrorTest, HugeTextIsCut) {

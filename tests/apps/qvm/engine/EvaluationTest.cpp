@@ -17,11 +17,11 @@ using krutil::io::SinkTraits;
 using testing::ElementsAre;
 using testing::HasSubstr;
 
-const SinkTraits kLinks(false, true, false, false, false, false);
-const SinkTraits kFormatted(false, false, true, false, false, false);
-const SinkTraits kDiary(false, false, false, true, false, false);
-const SinkTraits kEcho(false, false, false, false, true, false);
-const SinkTraits kLogging(false, false, false, false, false, true);
+const SinkTraits links(false, true, false, false, false, false);
+const SinkTraits formatted(false, false, true, false, false, false);
+const SinkTraits diary(false, false, false, true, false, false);
+const SinkTraits echo(false, false, false, false, true, false);
+const SinkTraits logging(false, false, false, false, false, true);
 
 EvalOptions withType(CodeType codeType) {
     EvalOptions options;
@@ -41,7 +41,7 @@ EvalOptions withStreams(int streams) {
     return options;
 }
 
-constexpr char kPrintOnThread[] =
+constexpr char printOnThread[] =
     "import threading\n"
     "thread = threading.Thread(target=lambda: print('from the thread'))\n"
     "thread.start()\n"
@@ -144,15 +144,15 @@ TEST_F(EvaluationTest, DisplayHookOfTheCodeIsUsed) {
 }
 
 TEST_F(EvaluationTest, EchoComesFirst) {
-    const Evaluation result = client().eval("x = 1\nx", withOut(kEcho));
+    const Evaluation result = client().eval("x = 1\nx", withOut(echo));
     EXPECT_EQ(result.shown(), ">>> x = 1\n... x\n1\n");
     EXPECT_EQ(result.events[1].text, ">>> x = 1\n... x\n");
     EvalOptions onErrors;
-    onErrors.err = kEcho;
+    onErrors.err = echo;
     EXPECT_EQ(client().eval("2", onErrors).text("SinkTextEvent", StreamTypeEnum::ERROR_STREAM), ">>> 2\n");
-    EXPECT_EQ(client().eval("", withOut(kEcho)).shown(), ">>> \n");
-    EvalOptions onBoth = withOut(kEcho);
-    onBoth.err = kEcho;
+    EXPECT_EQ(client().eval("", withOut(echo)).shown(), ">>> \n");
+    EvalOptions onBoth = withOut(echo);
+    onBoth.err = echo;
     const Evaluation twice = client().eval("pass", onBoth);
     EXPECT_EQ(twice.shown(), ">>> pass\n");
     EXPECT_EQ(twice.text("SinkTextEvent", StreamTypeEnum::ERROR_STREAM), ">>> pass\n");
@@ -164,13 +164,13 @@ TEST_F(EvaluationTest, FormattedSinkGetsValuesLaidOut) {
     const std::string b(30, 'b');
     const std::string c(30, 'c');
     EXPECT_EQ(client().eval(code).shown(), "['" + a + "', '" + b + "', '" + c + "']\n");
-    EXPECT_EQ(client().eval(code, withOut(kFormatted)).shown(), "['" + a + "',\n '" + b + "',\n '" + c + "']\n");
+    EXPECT_EQ(client().eval(code, withOut(formatted)).shown(), "['" + a + "',\n '" + b + "',\n '" + c + "']\n");
 }
 
 TEST_F(EvaluationTest, LinkIsMarkupOnlyWhereTheSinkHasLinks) {
     const std::string code = "import qvm\nprint(qvm.link('here', 'https://example.org/a b\\x1b'))";
     EXPECT_EQ(client().eval(code).output(), "here\n");
-    EXPECT_EQ(client().eval(code, withOut(kLinks)).output(),
+    EXPECT_EQ(client().eval(code, withOut(links)).output(),
               "\x1b]8;;https://example.org/a%20b%1B\x1b\\here\x1b]8;;\x1b\\\n");
 }
 
@@ -183,7 +183,7 @@ TEST_F(EvaluationTest, NoStreamsMeansNoText) {
 TEST_F(EvaluationTest, UnknownStreamNumberActsAsTheCommandWindow) {
     for (const int number : {7, 999, 1001}) {
         client().replaceStream1000(number);
-        const Evaluation result = client().eval(std::string(kPrintOnThread) + "print('x')\n1", withStreams(1000));
+        const Evaluation result = client().eval(std::string(printOnThread) + "print('x')\n1", withStreams(1000));
         EXPECT_EQ(result.generic(), "") << number;
         EXPECT_EQ(result.output(), "x\n");
         EXPECT_EQ(result.shown(), "1\n");
@@ -191,7 +191,7 @@ TEST_F(EvaluationTest, UnknownStreamNumberActsAsTheCommandWindow) {
 }
 
 TEST_F(EvaluationTest, TextOfOtherThreadsIsGeneric) {
-    const Evaluation result = client().eval(kPrintOnThread);
+    const Evaluation result = client().eval(printOnThread);
     EXPECT_EQ(result.output(), "");
     const Happening text = client().awaitText("from the thread");
     EXPECT_EQ(text.type, StreamTypeEnum::GENERIC_STREAM);
@@ -201,7 +201,7 @@ TEST_F(EvaluationTest, TextOfOtherThreadsIsGeneric) {
 
 TEST_F(EvaluationTest, AllStreamsTakeTheTextOfOtherThreads) {
     for (const int streams : {-1, 1000}) {
-        const Evaluation result = client().eval(std::string(kPrintOnThread) + "print('own')", withStreams(streams));
+        const Evaluation result = client().eval(std::string(printOnThread) + "print('own')", withStreams(streams));
         EXPECT_EQ(result.generic(), "from the thread\n");
         EXPECT_EQ(result.output(), "own\n");
     }
@@ -335,8 +335,8 @@ TEST(SinkTest, DiaryAndLogGetTheTextOfSinksThatAskForIt) {
     test_support::TemporaryDirectory directory;
     EngineSession engine({"--diary", directory.file("diary"), "--log", directory.file("log")});
     EvalOptions options;
-    options.out = kDiary;
-    options.err = kLogging;
+    options.out = diary;
+    options.err = logging;
     engine.client.eval("import sys\nprint('to the diary')\nprint('to the log', file=sys.stderr)\n'\u03b1'", options);
     engine.client.eval("print('to neither')");
     options.streams = IqmStreamID::ekIqmNoStreams;

@@ -117,7 +117,7 @@ class ByteClient {
     bool read(char* target, std::size_t size) {
         while (size > 0) {
             pollfd watched{bytes_, POLLIN, 0};
-            if (::poll(&watched, 1, static_cast<int>(std::chrono::milliseconds(kPatience).count())) <= 0) {
+            if (::poll(&watched, 1, static_cast<int>(std::chrono::milliseconds(patience).count())) <= 0) {
                 throw std::runtime_error("Nothing came within the patience of a test");
             }
             const ssize_t count = ::read(bytes_, target, size);

@@ -17,7 +17,7 @@ using session::SessionEnd;
 using testing::ElementsAre;
 using testing::HasSubstr;
 
-constexpr char kSessionEnded[] = "The session ended before this request was started.";
+constexpr char sessionEnded[] = "The session ended before this request was started.";
 
 // The shutdown event is the last thing that came.
 void expectShutdown(EngineSession& engine) {
@@ -81,7 +81,7 @@ TEST(SessionEndTest, WhatNothingTakesAfterAGoodbyeIsDiscarded) {
     EXPECT_EQ(engine.client.await(later).output(), "later\n");
     const Evaluation result = engine.client.await(never);
     EXPECT_THAT(result.kinds(), ElementsAre("IIPDiscardedEvent", "LastIIPEvent"));
-    expectDiscarded(result, kSessionEnded);
+    expectDiscarded(result, sessionEnded);
     expectShutdown(engine);
 }
 
@@ -93,7 +93,7 @@ TEST(SessionEndTest, SystemExitAfterAGoodbyeDiscardsWhatWaits) {
     engine.client.session().sayGoodbye();
     gate.open();
     EXPECT_FALSE(engine.client.await(running).error);
-    expectDiscarded(engine.client.await(waiting), kSessionEnded);
+    expectDiscarded(engine.client.await(waiting), sessionEnded);
     expectShutdown(engine);
 }
 
@@ -133,7 +133,7 @@ TEST(SessionEndTest, SystemExitDiscardsWhatWaits) {
     engine.client.cancel(IDType::random(), false);
     gate.open();
     EXPECT_FALSE(engine.client.await(running).error);
-    expectDiscarded(engine.client.await(waiting), kSessionEnded);
+    expectDiscarded(engine.client.await(waiting), sessionEnded);
     expectShutdown(engine);
 }
 

@@ -58,9 +58,9 @@ Said parsed(const std::string& bytes) {
 class WireExampleTest : public testing::Test {
   protected:
     WireExampleTest() : connection_(engine_.connection()) {
-        timeval patience{};
-        patience.tv_sec = kPatience.count();
-        ::setsockopt(connection_, SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof(patience));
+        timeval limit{};
+        limit.tv_sec = patience.count();
+        ::setsockopt(connection_, SOL_SOCKET, SO_RCVTIMEO, &limit, sizeof(limit));
     }
     ~WireExampleTest() override { ::close(connection_); }
 

@@ -102,7 +102,7 @@ bool sleeps(pid_t process) {
 // Looks again and again until `holds`, as long as a test is patient.
 template <class Condition>
 bool comes(Condition holds) {
-    const auto deadline = std::chrono::steady_clock::now() + kPatience;
+    const auto deadline = std::chrono::steady_clock::now() + patience;
     while (!holds()) {
         if (std::chrono::steady_clock::now() > deadline) {
             return false;

@@ -44,7 +44,7 @@ class EngineCancelTest : public testing::Test {
     // Cancels running code, which has a second to end. A machine that is busy with other things may need longer now and
     // then, but not each time.
     void expectStops(const std::string& code) {
-        std::chrono::steady_clock::duration fastest = kPatience;
+        std::chrono::steady_clock::duration fastest = patience;
         for (int i = 0; i < 5 && fastest > std::chrono::seconds(1); ++i) {
             const IDType id = running(code);
             const auto begin = std::chrono::steady_clock::now();
@@ -93,7 +93,7 @@ TEST_F(InterruptedCodeTest, SlowTextOfAValueStops) {
 }
 
 // Body of a function that goes on for ever.
-constexpr const char* kEndless = "    print('ready\\n', end='')\n    while True: pass\n";
+constexpr const char* endless = "    print('ready\\n', end='')\n    while True: pass\n";
 
 TEST_F(InterruptedCodeTest, EndlessCodeStopsWhereverItIsCalledFrom) {
     const std::string endlessText = "class E(Exception):\n    def __str__(self): endless()\n";
@@ -127,7 +127,7 @@ TEST_F(InterruptedCodeTest, EndlessCodeStopsWhereverItIsCalledFrom) {
     };
     for (const auto& [place, code] : places) {
         SCOPED_TRACE(place);
-        const IDType id = startedBy(std::string("def endless():\n") + kEndless + code);
+        const IDType id = startedBy(std::string("def endless():\n") + endless + code);
         EXPECT_EQ(client().cancel(id), IIPCancelReply::PENDING_CANCEL);
         const Evaluation result = client().await(id);
         expectInterrupted(result);
@@ -172,7 +172,7 @@ TEST_F(EngineCancelTest, SessionEndsThoughTheTextOfItsLastErrorWasInterrupted) {
 
 TEST_F(EngineCancelTest, EndlessSearchForAFunctionStops) {
     client().eval("import types\nm = types.ModuleType('m')\nm.__getattr__ = lambda name: endless()\ndef endless():\n" +
-                  std::string(kEndless));
+                  std::string(endless));
     const IDType id = client().enqueue(callOf("m.function", {}));
     client().awaitText("ready");
     EXPECT_EQ(client().cancel(id), IIPCancelReply::PENDING_CANCEL);
@@ -272,9 +272,9 @@ TEST_F(InterruptedCodeTest, CleanupOfInterruptedCodeRuns) {
 
 TEST_F(EngineCancelTest, ThousandsOfCancelsReachNoOtherRequest) {
     // Each cancelled request is followed by one that must not notice.
-    constexpr int kRounds = 2000;
+    constexpr int rounds = 2000;
     int cancelled = 0;
-    for (int i = 0; i < kRounds; ++i) {
+    for (int i = 0; i < rounds; ++i) {
         const IDType meant = client().enqueue("sum(range(" + std::to_string(i % 500) + "))");
         const session::framing::StreamID cancel = client().startCancel(meant);
         const IDType next = client().enqueue(std::to_string(i));

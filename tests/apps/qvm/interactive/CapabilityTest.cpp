@@ -19,8 +19,8 @@ using testing::Contains;
 using testing::ElementsAre;
 using testing::Not;
 
-const CapabilityList kAsking{Capability::InteractiveCommandLine};
-const CapabilityList kBoth{Capability::InteractiveCommandLine, Capability::Debugging};
+const CapabilityList asking{Capability::InteractiveCommandLine};
+const CapabilityList both{Capability::InteractiveCommandLine, Capability::Debugging};
 
 EvalOptions needing(const CapabilityList& needed) {
     EvalOptions options;
@@ -36,17 +36,17 @@ EvalOptions atPrompt() {
 
 TEST(EngineCapabilityTest, EngineStatesItsOwnInTheHandshake) {
     EngineSession engine;
-    EXPECT_EQ(engine.client.session().peer().capabilities, kBoth);
+    EXPECT_EQ(engine.client.session().peer().capabilities, both);
 }
 
 TEST(EngineCapabilityTest, RequestThatNeedsMoreThanTheClientHasIsRefused) {
-    EngineSession engine({}, {}, kAsking);
-    const Evaluation result = engine.client.eval("print(1)", needing(kBoth));
+    EngineSession engine({}, {}, asking);
+    const Evaluation result = engine.client.eval("print(1)", needing(both));
     EXPECT_THAT(result.kinds(), ElementsAre("IIPDiscardedEvent", "LastIIPEvent"));
     ASSERT_TRUE(result.error);
     EXPECT_EQ(result.error->getExecutionStatus(), krutil::cmddistributor::inCOMM_ERROR);
     EXPECT_EQ(result.errorText(), "This request needs capabilities that the client does not have: Debugging.");
-    EXPECT_EQ(engine.client.eval("print(1)", needing(kAsking)).output(), "1\n");
+    EXPECT_EQ(engine.client.eval("print(1)", needing(asking)).output(), "1\n");
 }
 
 TEST(EngineCapabilityTest, RequestThatNeedsMoreThanEitherHasNamesBoth) {
@@ -60,9 +60,9 @@ TEST(EngineCapabilityTest, RequestThatNeedsMoreThanEitherHasNamesBoth) {
 
 TEST(EngineCapabilityTest, ChangeOfTheClientCounts) {
     EngineSession engine({}, {}, {});
-    EXPECT_TRUE(engine.client.eval("1", needing(kBoth)).discarded());
-    engine.client.changeCapabilities(kBoth);
-    EXPECT_FALSE(engine.client.eval("1", needing(kBoth)).discarded());
+    EXPECT_TRUE(engine.client.eval("1", needing(both)).discarded());
+    engine.client.changeCapabilities(both);
+    EXPECT_FALSE(engine.client.eval("1", needing(both)).discarded());
     const IDType id = engine.client.enqueue("print(input())");
     engine.client.awaitLoop(id, DebugLoopEvent::ENTER);
     engine.client.eval("now", atPrompt());
@@ -94,7 +94,7 @@ class WithdrawalTest : public testing::Test {
         return "none";
     }
 
-    EngineSession engine_{{}, {}, kBoth};
+    EngineSession engine_{{}, {}, both};
 };
 
 TEST_F(WithdrawalTest, InputPromptIsAtItsEnd) {
@@ -105,7 +105,7 @@ TEST_F(WithdrawalTest, InputPromptIsAtItsEnd) {
     EXPECT_THAT(result.kinds(),
                 ElementsAre("IIPStartedEvent", "TextBaseEvent", "IIPSuspendedEvent", "DebugLoopEvent", "DebugLoopEvent",
                             "IIPResumedEvent", "PrintableErrorEvent", "IIPCompletedEvent", "LastIIPEvent"));
-    client().changeCapabilities(kAsking);
+    client().changeCapabilities(asking);
     const IDType again = stopped("input('? ')");
     client().eval("line", atPrompt());
     EXPECT_EQ(client().await(again).shown(), "'line'\n");
@@ -121,7 +121,7 @@ TEST_F(WithdrawalTest, AnswerThatWasSentBeforeCounts) {
 
 TEST_F(WithdrawalTest, OtherCapabilitiesDoNotMatter) {
     const IDType id = stopped("print(input())");
-    client().changeCapabilities(kAsking);
+    client().changeCapabilities(asking);
     settle();
     EXPECT_FALSE(client().eval("still there", atPrompt()).error);
     EXPECT_EQ(client().await(id).output(), "still there\n");
@@ -129,7 +129,7 @@ TEST_F(WithdrawalTest, OtherCapabilitiesDoNotMatter) {
 
 TEST_F(WithdrawalTest, DebugPromptGoesOn) {
     const IDType id = stopped("breakpoint()\nprint('on')");
-    client().changeCapabilities(kAsking);
+    client().changeCapabilities(asking);
     const Evaluation result = client().await(id);
     EXPECT_FALSE(result.error);
     EXPECT_EQ(result.output(), "on\n");
@@ -167,7 +167,7 @@ TEST_F(WithdrawalTest, KeyboardAndPauseGoOn) {
     EXPECT_EQ(left.output(), "on\n");
     EXPECT_EQ(warningOf(left), "qvm.keyboard() goes on: the client cannot be asked any more");
 
-    client().changeCapabilities(kBoth);
+    client().changeCapabilities(both);
     const IDType pause = stopped("qvm.pause()\nprint('on')");
     client().changeCapabilities({});
     const Evaluation paused = client().await(pause);
@@ -188,7 +188,7 @@ TEST_F(WithdrawalTest, PauseLastsItsSecondsAllTheSame) {
 }
 
 TEST(EngineCapabilityTest, EngineSwitchesItsDebuggerAndSaysSo) {
-    EngineSession engine({}, {}, kBoth);
+    EngineSession engine({}, {}, both);
     const auto changes = [&engine] {
         std::vector<CapabilitiesChanged> found;
         for (const Happening& each : engine.client.background()) {
@@ -198,12 +198,12 @@ TEST(EngineCapabilityTest, EngineSwitchesItsDebuggerAndSaysSo) {
         }
         return found;
     };
-    EXPECT_FALSE(engine.client.eval("import qvm\nqvm.debugger(False)\nqvm.debugger(False)", needing(kAsking)).error);
+    EXPECT_FALSE(engine.client.eval("import qvm\nqvm.debugger(False)\nqvm.debugger(False)", needing(asking)).error);
     ASSERT_EQ(changes().size(), 1U);
-    EXPECT_EQ(changes()[0].getPreviousCapabilities(), kBoth);
-    EXPECT_EQ(changes()[0].getQvmCapabilities(), kAsking);
-    EXPECT_EQ(changes()[0].getClientCapabilities(), kBoth);
-    EXPECT_EQ(changes()[0].getRequestCapabilities(), kAsking);
+    EXPECT_EQ(changes()[0].getPreviousCapabilities(), both);
+    EXPECT_EQ(changes()[0].getQvmCapabilities(), asking);
+    EXPECT_EQ(changes()[0].getClientCapabilities(), both);
+    EXPECT_EQ(changes()[0].getRequestCapabilities(), asking);
 
     const Evaluation passed = engine.client.eval("breakpoint()");
     EXPECT_THAT(passed.kinds(), Contains("IssuedEnabledWarningEvent"));
@@ -211,8 +211,8 @@ TEST(EngineCapabilityTest, EngineSwitchesItsDebuggerAndSaysSo) {
 
     engine.client.eval("qvm.debugger()");
     ASSERT_EQ(changes().size(), 2U);
-    EXPECT_EQ(changes()[1].getPreviousCapabilities(), kAsking);
-    EXPECT_EQ(changes()[1].getQvmCapabilities(), kBoth);
+    EXPECT_EQ(changes()[1].getPreviousCapabilities(), asking);
+    EXPECT_EQ(changes()[1].getQvmCapabilities(), both);
     const IDType id = engine.client.enqueue("breakpoint()");
     engine.client.awaitLoop(id, DebugLoopEvent::ENTER);
     engine.client.eval("qvm.dbcont()", atPrompt());

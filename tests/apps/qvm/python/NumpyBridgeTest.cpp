@@ -73,7 +73,7 @@ struct Type {
     const char* dtype;
 };
 
-constexpr Type kTypes[] = {
+constexpr Type types[] = {
     {ElementType::Bool, "bool"},
     {ElementType::Single, "float32"},
     {ElementType::Double, "float64"},
@@ -90,7 +90,7 @@ constexpr Type kTypes[] = {
 };
 
 TEST_F(NumpyBridgeTest, ArgumentOfEveryTypeIsANumpyArrayOfTheSameMemory) {
-    for (const Type& type : kTypes) {
+    for (const Type& type : types) {
         SCOPED_TRACE(type.dtype);
         Array array = received(type.element, {2, 3});
         const void* const memory = array.data();
@@ -239,7 +239,7 @@ TEST_F(NumpyBridgeTest, RefusedArgumentIsReleased) {
 }
 
 TEST_F(NumpyBridgeTest, ResultOfEveryTypeIsNumpysOwnMemory) {
-    for (const Type& type : kTypes) {
+    for (const Type& type : types) {
         SCOPED_TRACE(type.dtype);
         run(std::string("r = (numpy.arange(6) % 2).astype('") + type.dtype + "').reshape(2, 3)");
         const Array array = result("r");

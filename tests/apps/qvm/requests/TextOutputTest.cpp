@@ -20,7 +20,7 @@ using qvm::TextTarget;
 using testing::ElementsAre;
 
 // Long enough that nothing is handed on because of the time.
-constexpr std::chrono::milliseconds kNever = std::chrono::hours(1);
+constexpr std::chrono::milliseconds never = std::chrono::hours(1);
 
 class TextOutputTest : public testing::Test {
   protected:
@@ -31,16 +31,16 @@ class TextOutputTest : public testing::Test {
 
     void make(TextOutput::Settings settings) {
         output_.emplace(settings, [this](const TextTarget& target, std::u16string text) {
-            std::lock_guard lock(mutex_);
+            const std::lock_guard lock(mutex_);
             pieces_.push_back({target, std::move(text)});
             arrived_.notify_all();
         });
     }
 
-    void SetUp() override { make({8192, 32768, kNever, kNever}); }
+    void SetUp() override { make({8192, 32768, never, never}); }
 
     std::vector<std::u16string> texts() {
-        std::lock_guard lock(mutex_);
+        const std::lock_guard lock(mutex_);
         std::vector<std::u16string> result;
         for (const Piece& piece : pieces_) {
             result.push_back(piece.text);
@@ -84,7 +84,7 @@ TEST_F(TextOutputTest, AmountHandsOnWithoutANewline) {
 }
 
 TEST_F(TextOutputTest, TimeHandsOnWithoutANewline) {
-    make({8192, 32768, std::chrono::milliseconds(1), kNever});
+    make({8192, 32768, std::chrono::milliseconds(1), never});
     output_->write(TextSource::Output, u"slow");
     awaitPieces(1);
     output_->write(TextSource::Output, u"again");
@@ -93,7 +93,7 @@ TEST_F(TextOutputTest, TimeHandsOnWithoutANewline) {
 }
 
 TEST_F(TextOutputTest, NextWriteTellsOfTextThatTheTimeHandedOn) {
-    make({8192, 32768, std::chrono::milliseconds(1), kNever});
+    make({8192, 32768, std::chrono::milliseconds(1), never});
     EXPECT_FALSE(output_->write(TextSource::Output, u"slow"));
     awaitPieces(1);
     // Another flush comes after the timer has let go of the text.
@@ -129,7 +129,7 @@ TEST_F(TextOutputTest, SparingRequestIsNotHandedOnByNewlines) {
 }
 
 TEST_F(TextOutputTest, SparingRequestIsHandedOnByItsOwnTime) {
-    make({8192, 32768, kNever, std::chrono::milliseconds(1)});
+    make({8192, 32768, never, std::chrono::milliseconds(1)});
     RequestParts parts;
     parts.flushSparingly = true;
     output_->begin(makeRequest(parts));
@@ -154,7 +154,7 @@ TEST_F(TextOutputTest, ChangeOfTargetKeepsTheOrderOfWriting) {
 }
 
 TEST_F(TextOutputTest, LongTextIsSplitBetweenCharacters) {
-    make({4, 5, kNever, kNever});
+    make({4, 5, never, never});
     // Units 4 and 5 are one character, which would lie across the first cut.
     output_->write(TextSource::Output, u"abcd\U0001F600efgh");
     EXPECT_THAT(texts(), ElementsAre(u"abcd", u"\U0001F600efg", u"h"));
@@ -239,11 +239,11 @@ TEST_F(TextOutputTest, NoTextOfOtherThreadsJoinsARequestAfterItsEnd) {
         output_->end();
         std::size_t count = 0;
         {
-            std::lock_guard lock(mutex_);
+            const std::lock_guard lock(mutex_);
             count = pieces_.size();
         }
         awaitPieces(count + 2);
-        std::lock_guard lock(mutex_);
+        const std::lock_guard lock(mutex_);
         for (std::size_t k = count; k < pieces_.size(); ++k) {
             EXPECT_EQ(pieces_[k].target.stream, 0U);
         }
