@@ -190,6 +190,9 @@ TEST_F(ListenerTest, SessionBeyondTheirNumberIsRefused) {
 }
 
 TEST_F(ListenerTest, ClientsWaitWhileThereIsNoDescriptorForThem) {
+#if defined(KRUTIL_SANITIZED)
+    GTEST_SKIP() << "the undefined-behaviour sanitizer needs a descriptor of the engine's to look at an object's type";
+#endif
     serve();
     const std::string descriptors = "/proc/" + std::to_string(engine_->pid()) + "/fd/";
     rlim_t free = 0;
