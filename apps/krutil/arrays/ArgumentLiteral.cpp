@@ -230,7 +230,7 @@ class Parser {
         }
         position_ += digits.size();
         const double signedNumber = negative ? -number : number;
-        if (digits.find_first_not_of("0123456789") != digits.npos || atImaginaryUnit()) {
+        if (digits.find_first_not_of("0123456789") != std::string_view::npos || atImaginaryUnit()) {
             return {Kind::Double, 0, signedNumber};
         }
         std::int64_t integer = 0;

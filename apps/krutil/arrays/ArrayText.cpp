@@ -293,7 +293,7 @@ std::string arrayText(const Array& array) {
     const std::string heading = arrayHeading(array) + ":";
     if (isText(array)) {
         const std::string text = msg_svc::protobuf::ustring_to_utf8(array.toText());
-        return heading + (text.find('\n') == text.npos ? " " : "\n") + text + "\n";
+        return heading + (text.find('\n') == std::string::npos ? " " : "\n") + text + "\n";
     }
     if (array.dimensions().empty()) {
         return heading + " " + elementText(array, 0) + "\n";

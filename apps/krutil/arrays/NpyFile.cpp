@@ -112,7 +112,7 @@ Description describe(const NpyHeader& header, const std::string& name) {
     const std::string& descr = header.descr;
     constexpr std::string_view orders = "<>|=";
     Description description;
-    const bool hasOrder = !descr.empty() && orders.find(descr[0]) != orders.npos;
+    const bool hasOrder = !descr.empty() && orders.find(descr[0]) != std::string_view::npos;
     const auto* const begin = descr.data() + (hasOrder ? 1 : 0);
     const auto* const end = descr.data() + descr.size();
     if (begin != end) {

@@ -104,8 +104,8 @@ class HeaderParser {
             failHere("no text in quotes");
         }
         const auto end = text_.find(quote, position_ + 1);
-        const auto content = text_.substr(position_ + 1, end == text_.npos ? 0 : end - position_ - 1);
-        if (end == text_.npos || content.find('\\') != content.npos) {
+        const auto content = text_.substr(position_ + 1, end == std::string_view::npos ? 0 : end - position_ - 1);
+        if (end == std::string_view::npos || content.find('\\') != std::string_view::npos) {
             failHere("a text that does not end or has escapes");
         }
         position_ = end + 1;

@@ -4,18 +4,19 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <clocale>
 #include <filesystem>
 #include <fstream>
 #include <string>
-#include <thread>
 #include <vector>
 
 #include "krutil/base/Text.hpp"
+#include "support/Pipe.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 namespace krutil_client {
@@ -27,6 +28,22 @@ using ::testing::SizeIs;
 class LineHistoryTest : public ::testing::Test {
   protected:
     LineHistoryTest() { std::setlocale(LC_CTYPE, "C.UTF-8"); }
+
+    // As two programs do it: the library of the editor is for one thread of a process.
+    template <class Action>
+    static pid_t inAnotherProcess(const Action& action) {
+        const pid_t child = ::fork();
+        if (child == 0) {
+            action();
+            ::_exit(0);
+        }
+        return child;
+    }
+
+    static int exitStatusOf(pid_t child) {
+        int status = 0;
+        return ::waitpid(child, &status, 0) == child && WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+    }
 
     // The newest one first.
     static std::vector<std::string> linesOf(const LineHistory& history) {
@@ -74,10 +91,10 @@ TEST_F(LineHistoryTest, TwoAtOnceLoseNoLineOfEachOther) {
             history.add((name + std::to_wstring(i) + L"\n").c_str());
         }
     };
-    std::thread first(write, L"first ");
-    std::thread second(write, L"second ");
-    first.join();
-    second.join();
+    const pid_t first = inAnotherProcess([&] { write(L"first "); });
+    const pid_t second = inAnotherProcess([&] { write(L"second "); });
+    EXPECT_EQ(exitStatusOf(first), 0);
+    EXPECT_EQ(exitStatusOf(second), 0);
     const auto lines = linesInFile();
     EXPECT_THAT(lines, SizeIs(2 * count));
     // Each one's own lines in order, whatever the other one did.
@@ -115,17 +132,20 @@ TEST_F(LineHistoryTest, CuttingLosesNoLineThatAnotherAddsMeanwhile) {
         other.add((L"before " + std::to_wstring(i) + L"\n").c_str());
     }
     constexpr int count = 300;
-    std::atomic<bool> done{false};
-    std::thread cutting([&] {
-        while (!done) {
+    test_support::Pipe done;
+    const pid_t cutting = inAnotherProcess([&] {
+        done.write.reset();
+        // Readable, because at its end, once the test closes its own side.
+        pollfd watched{done.read.get(), POLLIN, 0};
+        while (::poll(&watched, 1, 0) == 0) {
             const LineHistory cut(file);
         }
     });
     for (int i = 0; i < count; ++i) {
         other.add((L"meanwhile " + std::to_wstring(i) + L"\n").c_str());
     }
-    done = true;
-    cutting.join();
+    done.write.reset();
+    EXPECT_EQ(exitStatusOf(cutting), 0);
     auto lines = linesInFile();
     ASSERT_THAT(lines, SizeIs(LineHistory::lines));
     lines.resize(count);

@@ -143,7 +143,7 @@ TEST_F(InterruptedCodeTest, EndlessCodeStopsWhereverItIsCalledFrom) {
     }
 }
 
-TEST_F(EngineCancelTest, ErrorWhoseTextWasInterruptedIsTheCause) {
+TEST_F(InterruptedCodeTest, ErrorWhoseTextWasInterruptedIsTheCause) {
     const IDType id = client().enqueue(std::string("class E(Exception):\n    def __str__(self):\n    ") +
                                        "    print('ready\\n', end='')\n        while True: pass\n"
                                        "try: 1 / 0\nexcept ZeroDivisionError: raise E");
@@ -161,7 +161,7 @@ TEST_F(EngineCancelTest, ErrorWhoseTextWasInterruptedIsTheCause) {
     EXPECT_EQ(error.getCauses()[0].GetUnicodeMessageTxt(), u"division by zero");
 }
 
-TEST_F(EngineCancelTest, SessionEndsThoughTheTextOfItsLastErrorWasInterrupted) {
+TEST_F(InterruptedCodeTest, SessionEndsThoughTheTextOfItsLastErrorWasInterrupted) {
     const IDType id = startedBy(std::string("class E(SystemExit):\n    def __str__(self):\n    ") +
                                 "    print('ready\\n', end='')\n        while True: pass\nraise E(3)");
     client().cancel(id);
@@ -170,7 +170,7 @@ TEST_F(EngineCancelTest, SessionEndsThoughTheTextOfItsLastErrorWasInterrupted) {
     EXPECT_EQ(engine_.process.wait(), 0);
 }
 
-TEST_F(EngineCancelTest, EndlessSearchForAFunctionStops) {
+TEST_F(InterruptedCodeTest, EndlessSearchForAFunctionStops) {
     client().eval("import types\nm = types.ModuleType('m')\nm.__getattr__ = lambda name: endless()\ndef endless():\n" +
                   std::string(endless));
     const IDType id = client().enqueue(callOf("m.function", {}));
@@ -256,7 +256,7 @@ TEST_F(InterruptedCodeTest, SecondCancelInterruptsAgain) {
     expectInterrupted(client().await(id));
 }
 
-TEST_F(EngineCancelTest, OwnHandlerOfTheInterruptSignalDoesNotMatter) {
+TEST_F(InterruptedCodeTest, OwnHandlerOfTheInterruptSignalDoesNotMatter) {
     client().eval("import signal\nsignal.signal(signal.SIGINT, signal.SIG_IGN)");
     expectStops("while True: pass");
 }

@@ -203,7 +203,7 @@ TEST_F(InterruptedHostileCodeTest, TracersThatRaiseOrLoopAreCodeLikeAnyOther) {
     expectWholeSession();
 }
 
-TEST_F(HostileCodeTest, AsynchronousCodeStops) {
+TEST_F(InterruptedHostileCodeTest, AsynchronousCodeStops) {
     // Not a loop of short tasks: an interrupt between taking one from the event loop and running it loses the task, for
     // which the library then waits when it cleans up.
     for (const char* body : {"await asyncio.sleep(1000)", "while True: pass"}) {
