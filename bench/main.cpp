@@ -1,8 +1,14 @@
-// krutil_bench [--benchmark_filter=REGEX]... : every comparison, and a table of the ratios at the end. A ratio of 1
-// means that the library adds nothing to its baseline.
+// krutil_bench [--rows] [--benchmark_filter=REGEX]... : every comparison, one after the other, with the ratios of its
+// repetitions: the median and the quartiles. A ratio of 1 means that the library adds nothing to its baseline. With
+// --rows it prints a line of JSON for each instead, the seconds of both sides and each repetition.
 
+#include <algorithm>
 #include <cstdio>
+#include <cstring>
+#include <iostream>
 #include <map>
+#include <nlohmann/json.hpp>
+#include <regex>
 #include <string>
 #include <utility>
 #include <vector>
@@ -16,34 +22,59 @@ namespace {
 
 constexpr const char* baselineSuffix = "/baseline";
 
-// Prints what the console prints, and remembers the medians.
-class Ratios : public benchmark::ConsoleReporter {
+std::vector<std::string>& comparisons() {
+    static std::vector<std::string> names;
+    return names;
+}
+
+// Seconds of one iteration, by benchmark and repetition.
+class Times : public benchmark::BenchmarkReporter {
   public:
+    bool ReportContext(const Context& /*context*/) override { return true; }
     void ReportRuns(const std::vector<Run>& runs) override {
-        ConsoleReporter::ReportRuns(runs);
         for (const Run& run : runs) {
-            // A single repetition has no median; it is what a quick look at one comparison asks for.
-            const bool isMedian = run.run_type == Run::RT_Aggregate && run.aggregate_name == "median";
-            if (isMedian || (run.run_type == Run::RT_Iteration && run.repetitions <= 1)) {
+            if (run.run_type == Run::RT_Iteration) {
                 const bool wall = !run.run_name.time_type.empty();
-                times_[run.run_name.function_name] = wall ? run.GetAdjustedRealTime() : run.GetAdjustedCPUTime();
+                const double time = wall ? run.GetAdjustedRealTime() : run.GetAdjustedCPUTime();
+                seconds[run.run_name.function_name].push_back(time / benchmark::GetTimeUnitMultiplier(run.time_unit));
             }
         }
     }
 
-    void print() const {
-        std::printf("\n%-60s %8s\n", "median against its baseline", "ratio");
-        for (const auto& [name, time] : times_) {
-            const auto baseline = times_.find(name + baselineSuffix);
-            if (baseline != times_.end()) {
-                std::printf("%-60s %8.2f\n", name.c_str(), time / baseline->second);
-            }
-        }
-    }
-
-  private:
-    std::map<std::string, double> times_;
+    std::map<std::string, std::vector<double>> seconds;
 };
+
+double quantile(const std::vector<double>& sorted, double share) {
+    const double place = share * static_cast<double>(sorted.size() - 1);
+    const auto below = static_cast<std::size_t>(place);
+    const std::size_t above = std::min(below + 1, sorted.size() - 1);
+    return sorted[below] + (place - static_cast<double>(below)) * (sorted[above] - sorted[below]);
+}
+
+void printRatios(const std::string& name, const std::vector<double>& ours, const std::vector<double>& baseline) {
+    std::vector<double> ratios;
+    for (std::size_t i = 0; i < ours.size(); ++i) {
+        ratios.push_back(ours[i] / baseline[i]);
+    }
+    std::sort(ratios.begin(), ratios.end());
+    std::printf("%-70s %8.2f  (%.2f to %.2f)\n", name.c_str(), quantile(ratios, 0.5), quantile(ratios, 0.25),
+                quantile(ratios, 0.75));
+    std::fflush(stdout);
+}
+
+void printRow(const std::string& name, const std::vector<double>& ours, const std::vector<double>& baseline) {
+    const nlohmann::ordered_json row{
+        {"label", name},
+        {"size", nullptr},
+        {"times", {{{"name", "baseline"}, {"seconds", baseline}}, {{"name", "krutil"}, {"seconds", ours}}}}};
+    std::cout << row.dump() << std::endl;
+}
+
+// Matches exactly the two sides of a comparison.
+std::string filterFor(const std::string& name) {
+    static const std::regex special(R"([.^$|()\[\]{}*+?\\])");
+    return "^" + std::regex_replace(name, special, "\\$&") + "(/baseline)?(/real_time)?$";
+}
 
 }  // namespace
 
@@ -56,15 +87,23 @@ void compare(const std::string& name, Clock clock, Measurement ours, Measurement
     };
     add(name, std::move(ours));
     add(name + baselineSuffix, std::move(baseline));
+    comparisons().push_back(name);
 }
 
 }  // namespace bench
 
 int main(int argc, char** argv) {
-    // What the command line says comes later, and wins.
-    std::vector<std::string> defaults{"--benchmark_repetitions=5", "--benchmark_report_aggregates_only=true",
-                                      "--benchmark_min_time=0.05"};
+    // What the command line says comes later, and wins. The two sides of a comparison have their turns in random order,
+    // repetition by repetition.
+    std::vector<std::string> defaults{"--benchmark_repetitions=9", "--benchmark_min_time=0.02",
+                                      "--benchmark_enable_random_interleaving=true"};
     std::vector<char*> arguments(argv, argv + argc);
+    const auto rowsOption = std::find_if(arguments.begin(), arguments.end(),
+                                         [](const char* each) { return std::strcmp(each, "--rows") == 0; });
+    const bool rows = rowsOption != arguments.end();
+    if (rows) {
+        arguments.erase(rowsOption);
+    }
     for (std::string& each : defaults) {
         arguments.insert(arguments.begin() + 1, each.data());
     }
@@ -75,8 +114,15 @@ int main(int argc, char** argv) {
     }
     bench::addSerializerBenches();
     bench::addSessionBenches();
-    bench::Ratios reporter;
-    benchmark::RunSpecifiedBenchmarks(&reporter);
-    reporter.print();
+    const std::regex wanted(benchmark::GetBenchmarkFilter());
+    for (const std::string& name : bench::comparisons()) {
+        if (!std::regex_search(name, wanted)) {
+            continue;
+        }
+        bench::Times times;
+        benchmark::RunSpecifiedBenchmarks(&times, bench::filterFor(name));
+        (rows ? bench::printRow : bench::printRatios)(name, times.seconds[name],
+                                                      times.seconds[name + bench::baselineSuffix]);
+    }
     return 0;
 }

@@ -16,6 +16,17 @@ build_packages=(
     libcli11-dev nlohmann-json3-dev libedit-dev
 )
 test_packages=(libgtest-dev libgmock-dev libbenchmark-dev)
+# What draws the pictures of benchmarks.
+bench_packages=(python3-matplotlib)
+# What benchmarks compare with when they are asked to; nothing else needs these.
+peer_packages=(
+    libcapnp-dev capnproto
+    libflatbuffers-dev flatbuffers-compiler
+    libmsgpack-dev
+    libzmq3-dev
+    libgrpc++-dev protobuf-compiler-grpc
+    python3-ipykernel python3-jupyter-client
+)
 clang_packages=(clang libclang-rt-14-dev)
 tidy_packages=(clang-tidy)
 

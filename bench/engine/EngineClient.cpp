@@ -1,0 +1,158 @@
+#include "engine/EngineClient.hpp"
+
+#include <boost/make_shared.hpp>
+#include <boost/variant/get.hpp>
+#include <cstdint>
+#include <stdexcept>
+#include <utility>
+
+#include "cmddistributor/EvalIIP.hpp"
+#include "cmddistributor/FEvalIIP.hpp"
+#include "cmddistributor/FEvalResult.hpp"
+#include "cmddistributor/IIPEnqueueMessage.hpp"
+#include "cmddistributor/IIPResult.hpp"
+#include "common/KrutilSession.hpp"
+#include "krutil/cmddistributor/IIPReply.hpp"
+#include "krutil/io/TextBase.hpp"
+#include "msg_svc/protobuf/ustring.hpp"
+
+namespace bench {
+namespace {
+
+namespace exchange = foundation::msg_svc::exchange;
+using cmddistributor::IqmStreamID;
+using msg_svc::protobuf::ustring_to_utf8;
+using msg_svc::protobuf::utf8_to_ustring;
+
+krutil_client::EngineProcess startEngine(std::vector<std::string> arguments) {
+    arguments.insert(arguments.begin(), {KRUTIL_QVM, "--stdio"});
+    return krutil_client::EngineProcess::start(arguments);
+}
+
+}  // namespace
+
+EngineClient::EngineClient(krutil_client::EngineProcess engine, const session::Limits& limits, bool counting)
+    : engine_(std::move(engine)) {
+    session::SessionConfig config = apps::krutilSession(session::Role::Client);
+    config.build = "benchmark";
+    config.limits = limits;
+    if (counting) {
+        config.trace = [this](const session::FrameTrace& trace) {
+            constexpr std::size_t header = 24;
+            const auto* const tagged = dynamic_cast<const session::framing::TaggedFrame*>(&trace.frame);
+            (trace.outgoing ? there_ : back_) +=
+                header + (tagged != nullptr ? tagged->tag().size() : 0) + trace.frame.size();
+        };
+    }
+    const int stream = engine_.takeStream();
+    session_ = session::Session::open(stream, stream, std::move(config));
+    session_->start(*this);
+}
+
+EngineClient::EngineClient(const std::vector<std::string>& arguments, const session::Limits& limits, bool counting)
+    : EngineClient(startEngine(arguments), limits, counting) {}
+
+EngineClient::~EngineClient() {
+    session_->sayGoodbye();
+    over_.wait(false);
+}
+
+void EngineClient::send(const boost::shared_ptr<const cmddistributor::IIP>& request) {
+    ++sent_;
+    session_->send(session_->newStreamID(), boost::shared_ptr<const exchange::Message>(
+                                                boost::make_shared<const cmddistributor::IIPEnqueueMessage>(
+                                                    request, exchange::IDType(1, sent_), 0, boost::none, nullptr,
+                                                    krutil::cmddistributor::WhenToDequeue::DEQUEUE_AT_IDLE, u"",
+                                                    capabilities::CapabilityList(), nullptr, false)));
+}
+
+void EngineClient::send(const std::string& code) {
+    send(boost::make_shared<const cmddistributor::EvalIIP>(
+        "python", IqmStreamID::ekIqmCmdWinStream, nullptr, krutil::io::SinkTraits(), krutil::io::SinkTraits(),
+        utf8_to_ustring(code), cmddistributor::CodeType::CodeBlockType));
+}
+
+void EngineClient::awaitReplies() {
+    for (auto answered = answered_.load(); answered < sent_; answered = answered_.load()) {
+        if (over_) {
+            throw std::runtime_error("the session with the engine is over");
+        }
+        answered_.wait(answered);
+    }
+}
+
+void EngineClient::awaitAll() {
+    awaitReplies();
+    if (!failure_.empty()) {
+        throw std::runtime_error("a request failed with " + std::exchange(failure_, {}));
+    }
+}
+
+void EngineClient::evaluate(const std::string& code, const std::string& expected) {
+    text_.clear();
+    send(code);
+    awaitAll();
+    if (text_.size() != expected.size() || ustring_to_utf8(text_) != expected) {
+        throw std::runtime_error("evaluation: expected \"" + expected + "\", got \"" + ustring_to_utf8(text_) + "\"");
+    }
+}
+
+void EngineClient::fail(const std::string& code, const std::string& identifier) {
+    send(code);
+    awaitReplies();
+    if (std::exchange(failure_, {}) != identifier) {
+        throw std::runtime_error("evaluation: expected an error, " + identifier);
+    }
+}
+
+EngineClient::Arrays EngineClient::call(const std::string& function, Arrays arguments, unsigned long outputs) {
+    using cmddistributor::FEvalIIP;
+    send(boost::make_shared<const FEvalIIP>(
+        "python", FEvalIIP::Function(function), outputs,
+        FEvalIIP::Data::makeClientSideData(krutil::cmddistributor::EDIDataWrapper(std::move(arguments))),
+        IqmStreamID::ekIqmCmdWinStream, krutil::io::SinkTraits(), krutil::io::SinkTraits(), 1, 2, true));
+    awaitAll();
+    const auto reply = std::exchange(lastReply_, nullptr);
+    const auto* const result = dynamic_cast<const cmddistributor::FEvalResult*>(
+        dynamic_cast<const krutil::cmddistributor::IIPReply&>(*reply).getResult().get());
+    if (result == nullptr) {
+        throw std::runtime_error("call of " + function + ": no outputs");
+    }
+    return boost::get<Arrays>(result->getResults());
+}
+
+std::size_t EngineClient::takeTextSize() {
+    return std::exchange(text_, {}).size();
+}
+
+Bytes EngineClient::takeBytes() {
+    return {there_.exchange(0), back_.exchange(0)};
+}
+
+void EngineClient::onReply(session::framing::StreamID /*stream*/,
+                           const boost::shared_ptr<const exchange::Reply>& reply) {
+    const auto& result = dynamic_cast<const krutil::cmddistributor::IIPReply&>(*reply).getResult();
+    if (result && result->getException()) {
+        failure_ = result->getException()->GetID();
+    }
+    lastReply_ = reply;
+    ++answered_;
+    answered_.notify_one();
+}
+
+void EngineClient::onEvent(session::framing::StreamID /*stream*/,
+                           const boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent>& event) {
+    if (const auto* text = dynamic_cast<const krutil::io::TextBase*>(event.get())) {
+        text_ += text->getText();
+    }
+}
+
+void EngineClient::onEnd(const session::SessionEnd& /*end*/) {
+    over_ = true;
+    over_.notify_one();
+    // Whoever waits for an answer looks again.
+    ++answered_;
+    answered_.notify_one();
+}
+
+}  // namespace bench

@@ -1,0 +1,44 @@
+// krutil_bench_engine [QUESTION]: holds the contests of a question, or of all, and prints a line of JSON for each.
+
+#include <CLI/CLI.hpp>
+#include <cstring>
+#include <exception>
+#include <iostream>
+#include <map>
+
+#include "engine/Contest.hpp"
+#include "engine/Questions.hpp"
+#include "engine/RawPeer.hpp"
+
+int main(int argc, char** argv) {
+    if (argc == 2 && std::strcmp(argv[1], bench::rawPeerArgument) == 0) {
+        bench::serveRaw();
+        return 0;
+    }
+    std::map<std::string, std::function<void(const bench::Effort&)>> questions;
+    for (const bench::Question& question : bench::evaluationQuestions()) {
+        questions[question.name] = question.answer;
+    }
+    CLI::App app("Times work of a real engine beside its baseline, in turn");
+    std::string name;
+    bench::Effort effort;
+    app.add_option("QUESTION", name, "What to ask (default: everything)")->check(CLI::IsMember(questions));
+    app.add_option("--repetitions", effort.repetitions, "How often each contender has its turn")
+        ->check(CLI::PositiveNumber)
+        ->capture_default_str();
+    app.add_option("--batch", effort.batchSeconds, "Seconds of a turn")
+        ->check(CLI::PositiveNumber)
+        ->capture_default_str();
+    CLI11_PARSE(app, argc, argv);
+    try {
+        for (const auto& [each, answer] : questions) {
+            if (name.empty() || name == each) {
+                answer(effort);
+            }
+        }
+    } catch (const std::exception& error) {
+        std::cerr << "krutil_bench_engine " << name << ": " << error.what() << '\n';
+        return 1;
+    }
+    return 0;
+}
