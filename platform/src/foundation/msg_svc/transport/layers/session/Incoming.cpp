@@ -2,14 +2,16 @@
 
 #include <unistd.h>
 
-#include <algorithm>
+#include <cerrno>
 #include <stdexcept>
+#include <system_error>
 #include <utility>
 #include <variant>
 
 #include "foundation/msg_svc/transport/layers/message/Message.hpp"
 #include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
 #include "foundation/msg_svc/transport/layers/session/RefusalTexts.hpp"
+#include "foundation/msg_svc/transport/layers/session/StreamDescriptors.hpp"
 #include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
@@ -34,14 +36,13 @@ Incoming::Incoming(asio::io_context& io, core::posix::OwnedDescriptor& descripto
       descriptor_(descriptor.get()) {
     stream_.assign(descriptor.get());
     descriptor.release();
-    stream_.non_blocking(true);
 }
 
 void Incoming::start(SessionHandler& handler) {
     handler_ = &handler;
     if (state_ == State::Waiting) {
         state_ = State::Reading;
-        read();
+        awaitBytes();
     }
 }
 
@@ -49,7 +50,8 @@ void Incoming::resume() {
     if (state_ == State::HeldBack && !owesTooMuch()) {
         state_ = State::Reading;
         // Messages may be complete that were read before.
-        onRead({}, 0);
+        takeItems();
+        awaitBytes();
     }
 }
 
@@ -74,49 +76,58 @@ void Incoming::abandonInChild() noexcept {
 
 // Bytes.
 
-void Incoming::read() {
-    if (state_ == State::Reading) {
-        stream_.async_read_some(wantedPieces(),
-                                [this](const ErrorCode& error, std::size_t count) { onRead(error, count); });
+void Incoming::awaitBytes() {
+    if (state_ != State::Reading) {
+        return;
     }
-}
-
-// A fixed number of buffers, unused ones empty: no allocation for each read.
-std::array<asio::mutable_buffer, 3> Incoming::wantedPieces() {
-    std::array<asio::mutable_buffer, 3> buffers;
-    const auto wanted = reader_.buffers();
-    std::transform(wanted.begin(), wanted.end(), buffers.begin(),
-                   [](const iovec& piece) { return asio::mutable_buffer(piece.iov_base, piece.iov_len); });
-    return buffers;
+    stream_.async_wait(asio::posix::stream_descriptor::wait_read, [this](const ErrorCode& error) {
+        if (state_ != State::Reading || error == asio::error::operation_aborted) {
+            return;
+        }
+        // A file is always readable, and cannot be waited for.
+        if (error && error != asio::error::operation_not_supported) {
+            owner_.onReadFailed(error.message());
+            return;
+        }
+        readAvailable();
+        awaitBytes();
+    });
 }
 
 // What has arrived since is read without a turn of the event loop in between, but no more than so many times: writes
 // and timers wait for that.
-void Incoming::onRead(ErrorCode error, std::size_t count) {
-    for (int reads = 0; takeRead(error, count) && reads < readsInATurn; ++reads) {
-        count = stream_.read_some(wantedPieces(), error);
-        if (error == asio::error::would_block) {
-            break;
-        }
+void Incoming::readAvailable() {
+    for (int reads = 0; isReading() && reads < readsInATurn && read(); ++reads) {
     }
-    read();
 }
 
-// False when there is nothing more to read.
-bool Incoming::takeRead(const ErrorCode& error, std::size_t count) {
-    if (state_ != State::Reading || error == asio::error::operation_aborted) {
+// Returns whether there may be more.
+bool Incoming::read() {
+    const auto pieces = reader_.buffers();
+    const ssize_t count = readSome(descriptor_, pieces);
+    if (count < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
         return false;
     }
-    if (error == asio::error::eof || error == asio::error::connection_reset) {
+    if (count == 0 || (count < 0 && errno == ECONNRESET)) {
         owner_.onEndOfStream();
         return false;
     }
-    if (error) {
-        owner_.onReadFailed(error.message());
+    if (count < 0) {
+        owner_.onReadFailed(std::generic_category().message(errno));
         return false;
     }
+    const auto got = static_cast<std::size_t>(count);
+    std::size_t wanted = 0;
+    for (const iovec& piece : pieces) {
+        wanted += piece.iov_len;
+    }
+    reader_.commit(got);
+    takeItems();
+    return got == wanted;
+}
+
+void Incoming::takeItems() {
     try {
-        reader_.commit(count);
         while (isReading()) {
             auto item = reader_.next();
             if (!item) {
@@ -137,7 +148,6 @@ bool Incoming::takeRead(const ErrorCode& error, std::size_t count) {
     } catch (...) {
         owner_.onViolation("the program's handler failed with an exception of an unknown type");
     }
-    return isReading();
 }
 
 // Messages.

@@ -5,7 +5,6 @@
 // the peer has gone is noticed all the same: there is something to write then, and writing fails.
 #pragma once
 
-#include <array>
 #include <atomic>
 #include <boost/shared_ptr.hpp>
 #include <cstddef>
@@ -84,10 +83,10 @@ class Incoming {
 
     bool isReading() const noexcept { return state_ == State::Reading && !silenced_; }
     bool owesTooMuch() const noexcept { return outgoing_.answersOwed() >= config_.maxPendingAnswers; }
-    void read();
-    std::array<asio::mutable_buffer, 3> wantedPieces();
-    void onRead(ErrorCode error, std::size_t count);
-    bool takeRead(const ErrorCode& error, std::size_t count);
+    void awaitBytes();
+    void readAvailable();
+    bool read();
+    void takeItems();
     void take(MessageReader::Item item);
     void takeMessage(Frames frames);
     template <class T>

@@ -30,58 +30,59 @@ std::string frameName(framing::FrameIndex index) {
 }  // namespace
 
 MessageReader::MessageReader(const Limits& limits, std::string arrayTag)
-    : limits_(limits), arrayTag_(std::move(arrayTag)) {}
+    : limits_(limits), arrayTag_(std::move(arrayTag)), ahead_(new char[mostAhead]) {}
 
 std::span<const iovec> MessageReader::buffers() noexcept {
     std::size_t count = 0;
-    const auto add = [this, &count](char* begin, std::size_t have, std::size_t size) {
-        if (have < size) {
-            buffers_[count++] = {begin + have, size - have};
-        }
-    };
-    if (!header_) {
-        add(headerBytes_.data(), headerHave_, headerBytes_.size());
-    } else {
-        add(tag_.data(), tagHave_, tag_.size());
-        if (content_.first) {
-            add(content_.first.get(), contentHave_, content_.second);
-            add(nextHeaderBytes_.data(), nextHeaderHave_, nextHeaderBytes_.size());
+    if (straight()) {
+        const std::size_t missing = content_.second - contentHave_;
+        buffers_[count++] = {content_.first.get() + contentHave_, missing};
+        if (missing >= mostAhead) {
+            // Another large content may follow, which is better read straight to its place.
+            aheadWanted_ = usualAhead;
         }
     }
+    buffers_[count++] = {ahead_.get(), aheadWanted_};
     return {buffers_.data(), count};
 }
 
 void MessageReader::commit(std::size_t count) noexcept {
-    const auto fill = [&count](std::size_t& have, std::size_t size) {
-        const std::size_t taken = std::min(count, size - have);
-        have += taken;
+    if (straight()) {
+        const std::size_t taken = std::min(count, content_.second - contentHave_);
+        contentHave_ += taken;
         count -= taken;
-    };
-    if (!header_) {
-        fill(headerHave_, headerBytes_.size());
-    } else {
-        fill(tagHave_, tag_.size());
-        if (content_.first) {
-            fill(contentHave_, content_.second);
-            fill(nextHeaderHave_, nextHeaderBytes_.size());
-        }
     }
+    aheadBegin_ = 0;
+    aheadEnd_ = count;
+    // Whoever sends more than is usually there at once gets fewer reads.
+    aheadWanted_ = count == aheadWanted_ ? mostAhead : usualAhead;
+}
+
+// Gives a part of a frame what is there of it.
+void MessageReader::take(char* target, std::size_t& have, std::size_t size) noexcept {
+    const std::size_t taken = std::min(size - have, aheadEnd_ - aheadBegin_);
+    std::copy_n(ahead_.get() + aheadBegin_, taken, target + have);
+    aheadBegin_ += taken;
+    have += taken;
 }
 
 std::optional<MessageReader::Item> MessageReader::next() {
     for (;;) {
         if (!header_) {
+            take(headerBytes_.data(), headerHave_, headerBytes_.size());
             if (headerHave_ < headerBytes_.size()) {
                 return std::nullopt;
             }
             acceptHeader();
         }
+        take(tag_.data(), tagHave_, tag_.size());
         if (tagHave_ < tag_.size()) {
             return std::nullopt;
         }
         if (!content_.first) {
             allocateContent();
         }
+        take(content_.first.get(), contentHave_, content_.second);
         if (contentHave_ < content_.second) {
             return std::nullopt;
         }
@@ -220,8 +221,7 @@ std::optional<MessageReader::Item> MessageReader::completeFrame() {
         }
     }
     header_.reset();
-    headerBytes_ = nextHeaderBytes_;
-    headerHave_ = std::exchange(nextHeaderHave_, 0);
+    headerHave_ = 0;
     tag_.clear();
     tagHave_ = 0;
     content_ = {};

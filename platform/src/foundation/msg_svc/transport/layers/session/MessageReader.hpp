@@ -25,8 +25,10 @@ namespace foundation::msg_svc::transport::layers::session {
 ///     n = readv(descriptor, reader.buffers());  reader.commit(n);
 ///     while (auto item = reader.next()) { ... }
 ///
-/// The buffers end before the first byte whose place is not known yet, so the content of a frame is read straight to
-/// where it stays: of a data frame into its own buffer from BufferAllocator. A header's claims are checked before
+/// One read takes all that is there of small frames: bytes whose place is not known yet go to a buffer of the reader's,
+/// and are copied from there once. What is missing of a content whose size is known is read straight to where it stays:
+/// of a data frame into its own buffer from BufferAllocator. How far a read goes beyond that follows what arrives, so
+/// that hardly anything of a large content takes the way of the small frames. A header's claims are checked before
 /// memory is asked for, and pages of a large content are touched only as its bytes arrive.
 ///
 /// Not synchronised. After next() has thrown, the reader must not be used again.
@@ -45,11 +47,15 @@ class MessageReader {
     /// Longest reason of an abort, in bytes.
     static constexpr std::uint64_t longestReason = 4096;
 
+    /// Bytes of a read beyond those whose place is known: usually, and when as many as these were there.
+    static constexpr std::size_t usualAhead = 4096;
+    static constexpr std::size_t mostAhead = 65'536;
+
     /// `arrayTag` is the tag to which Limits::arrayMessage applies instead of Limits::taggedFrame.
     MessageReader(const Limits& limits, std::string arrayTag);
 
-    /// Where the next bytes of the stream belong, in order; never empty, and at least one byte long together. Valid
-    /// until the next call of next().
+    /// Where the next bytes of the stream belong, in order; never empty. Valid until the next call of next(). To be
+    /// called when next() has returned nothing.
     std::span<const iovec> buffers() noexcept;
 
     /// `count` bytes, at most the buffers' total, have been put there. Then next() is to be called until it returns
@@ -72,6 +78,10 @@ class MessageReader {
     std::string position() const;
 
   private:
+    void take(char* target, std::size_t& have, std::size_t size) noexcept;
+    bool straight() const noexcept {
+        return content_.first && contentHave_ < content_.second && tagHave_ == tag_.size();
+    }
     void acceptHeader();
     void checkControlHeader() const;
     void checkMessageHeader() const;
@@ -82,8 +92,14 @@ class MessageReader {
     Limits limits_;
     std::string arrayTag_;
 
-    // The parts of the frame that is arriving, each with how many of its bytes are there. Bytes of the next header may
-    // come along with the end of the content.
+    // Bytes that have arrived and are not taken yet.
+    std::unique_ptr<char[]> ahead_;
+    std::size_t aheadBegin_ = 0;
+    std::size_t aheadEnd_ = 0;
+    std::size_t aheadWanted_ = usualAhead;
+    std::array<iovec, 2> buffers_{};
+
+    // The parts of the frame that is arriving, each with how many of its bytes are there.
     FrameHeader::Bytes headerBytes_{};
     std::size_t headerHave_ = 0;
     std::optional<FrameHeader> header_;  // once it is complete and accepted
@@ -91,9 +107,6 @@ class MessageReader {
     std::size_t tagHave_ = 0;
     framing::FrameBuffer content_;  // null until its size is accepted
     std::size_t contentHave_ = 0;
-    FrameHeader::Bytes nextHeaderBytes_{};
-    std::size_t nextHeaderHave_ = 0;
-    std::array<iovec, 3> buffers_{};
 
     std::vector<std::unique_ptr<framing::Frame>> frames_;
     std::uint64_t messageBytes_ = 0;

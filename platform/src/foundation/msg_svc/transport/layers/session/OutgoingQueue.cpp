@@ -4,6 +4,7 @@
 #include <cerrno>
 #include <cstring>
 
+#include "foundation/msg_svc/transport/layers/session/StreamDescriptors.hpp"
 #include "foundation/vantor/carrier/framing/DataFrame.hpp"
 #include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
 
@@ -106,10 +107,7 @@ int OutgoingQueue::writeOnce(int descriptor, std::vector<OutgoingPieces>& writte
         }
         message.gather(gathered_, room, mostPieces);
     }
-    ssize_t count = 0;
-    do {
-        count = ::writev(descriptor, gathered_.data(), static_cast<int>(gathered_.size()));
-    } while (count < 0 && errno == EINTR);
+    const ssize_t count = writeSome(descriptor, gathered_);
     if (count < 0) {
         return errno == EWOULDBLOCK ? EAGAIN : errno;
     }

@@ -42,4 +42,20 @@ StreamDescriptors StreamDescriptors::takeOver(int in, int out) {
     return stream;
 }
 
+ssize_t readSome(int descriptor, std::span<const iovec> pieces) noexcept {
+    ssize_t count = 0;
+    do {
+        count = ::readv(descriptor, pieces.data(), static_cast<int>(pieces.size()));
+    } while (count < 0 && errno == EINTR);
+    return count;
+}
+
+ssize_t writeSome(int descriptor, std::span<const iovec> pieces) noexcept {
+    ssize_t count = 0;
+    do {
+        count = ::writev(descriptor, pieces.data(), static_cast<int>(pieces.size()));
+    } while (count < 0 && errno == EINTR);
+    return count;
+}
+
 }  // namespace foundation::msg_svc::transport::layers::session
