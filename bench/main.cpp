@@ -15,7 +15,6 @@
 
 #include "Comparison.hpp"
 #include "SerializerBench.hpp"
-#include "SessionBench.hpp"
 
 namespace bench {
 namespace {
@@ -113,7 +112,6 @@ int main(int argc, char** argv) {
         return 2;
     }
     bench::addSerializerBenches();
-    bench::addSessionBenches();
     const std::regex wanted(benchmark::GetBenchmarkFilter());
     for (const std::string& name : bench::comparisons()) {
         if (!std::regex_search(name, wanted)) {

@@ -32,13 +32,15 @@ class Run:
     build: str  # the build tree
     repetitions: int
     batch: float  # seconds that a contender has in a repetition
+    seconds: float  # after which a contest ends, once it has three repetitions
     largest: int  # bytes of an array, in the questions that go through sizes
     peers: bool  # whether what people use instead is measured as well
 
     @staticmethod
     def of(options):
-        repetitions, batch, largest = (5, 0.02, 1 << 24) if options.quick else (15, 0.05, 1 << 28)
-        return Run(options.build, repetitions, batch, 1 << 32 if options.large else largest, options.peers)
+        effort = (5, 0.02, 1.0, 1 << 26) if options.quick else (15, 0.05, 20.0, 1 << 28)
+        run = Run(options.build, *effort, options.peers)
+        return dataclasses.replace(run, largest=1 << 32) if options.large else run
 
     def program(self, *path):
         return os.path.join(self.build, *path)
@@ -53,7 +55,8 @@ def rows_of(command):
 def engine(name, *options):
     """Asks the program that measures real engines."""
     return lambda run: rows_of([run.program("bench", "krutil_bench_engine"), name, *options,
-                                "--repetitions", str(run.repetitions), "--batch", str(run.batch)])
+                                "--repetitions", str(run.repetitions), "--batch", str(run.batch),
+                                "--seconds", str(run.seconds), "--largest", str(run.largest)])
 
 
 def codec(prefix):
@@ -65,15 +68,38 @@ def codec(prefix):
     return measure
 
 
+RAW = "a raw framed round trip of the same bytes, from process to process"
+RAW_ARRAY = "the same bytes sent raw, from process to process, each of which uses one buffer all the time"
+REUSED = "The array is the same each time; what the engine and the client do with memory is up to them."
+FILES = "Files are in the page cache; nothing else is kept from one start to the next."
+
 QUESTIONS = [
     Question("null", "The harness itself: a raw round trip of 200 bytes there and 500 back",
              "the same once more, so the ratio must be 1 within its spread", engine("null")),
-    Question("evaluation", "Evaluation of `1+1`, request to reply",
-             "a raw framed round trip of the same bytes, from process to process", engine("evaluation")),
+    Question("evaluation", "Evaluation of `1+1`, request to reply", RAW, engine("evaluation")),
+    Question("call", "A call with 1 KiB, there and back", "an evaluation of `1+1` on a warm engine", engine("call")),
+    Question("arrays", "Calls with arrays, over the socket", RAW_ARRAY, engine("arrays"), conditions=REUSED),
+    Question("burst", "1,000 requests (`pass`) sent at once, each of them", RAW, engine("burst")),
+    Question("lines", "10,000 lines printed in one request, each of them", "one write of 16 bytes to a socket",
+             engine("lines")),
+    Question("lines-shown", "200,000 lines printed and shown by `krutil`, the whole process",
+             "`python3 -u` that prints them", processes.lines_shown, conditions=FILES),
     Question("start", "`krutil eval 1+1` with an engine of its own, the whole process", "`python3 -c 1+1`",
-             processes.evaluation_with_own_engine,
-             conditions="Files are in the page cache; nothing else is kept from one start to the next."),
+             processes.evaluation_with_own_engine, conditions=FILES),
     Question("connect", "`krutil eval 1+1 --connect` to an engine that listens, the whole process", "`python3 -c 1+1`",
              processes.evaluation_with_listening_engine,
-             conditions="Files are in the page cache; the engine listens already, and the session is new each time."),
+             conditions="Files are in the page cache, the engine listens already, and each session is new."),
+    Question("memory", "Private memory of an idle session of a listening engine, after `print(1+1)`",
+             "a `python3` that has printed the same and waits", processes.idle_memory, placements=(SCHEDULER,),
+             conditions="All processes are there at the same time.", unit="bytes"),
+    Question("message-sizes", "A request and its reply between two ends of a session, without an engine", RAW,
+             engine("message-sizes"), axis="characters of the request"),
+    Question("array-sizes", "A call with an array, over the socket", RAW_ARRAY, engine("array-sizes"), conditions=REUSED,
+             axis="bytes of the array"),
+    Question("sessions", "An evaluation of `1+1` in each session of a listening engine at the same time, each of them",
+             "raw framed round trips of the same bytes with as many processes", engine("sessions"), axis="sessions"),
+    Question("queue-lengths", "Requests (`pass`) sent at once, each of them", RAW, engine("queue-lengths"),
+             axis="requests sent at once"),
+    Question("causes", "An error with causes", "an evaluation of `1+1` on a warm engine", engine("causes"),
+             axis="causes"),
 ]

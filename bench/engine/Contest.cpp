@@ -9,10 +9,16 @@
 namespace bench {
 namespace {
 
+using Clock = std::chrono::steady_clock;
+
+double secondsSince(Clock::time_point begin) {
+    return std::chrono::duration<double>(Clock::now() - begin).count();
+}
+
 double secondsOf(const Contender& contender, std::size_t count) {
-    const auto begin = std::chrono::steady_clock::now();
+    const auto begin = Clock::now();
     contender.run(count);
-    return std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count();
+    return secondsSince(begin);
 }
 
 // How often a contender does its work in a batch of that length.
@@ -30,15 +36,28 @@ std::size_t countFor(const Contender& contender, double batchSeconds) {
 
 }  // namespace
 
+std::vector<std::size_t> sizes(const Effort& effort, std::size_t first, std::size_t last, std::size_t factor) {
+    std::vector<std::size_t> all{first};
+    while (!effort.firstSizeOnly && all.back() <= last / factor) {
+        all.push_back(all.back() * factor);
+    }
+    return all;
+}
+
 void hold(const Contest& contest, const Effort& effort) {
     std::vector<std::size_t> counts;
     for (const Contender& contender : contest.contenders) {
         counts.push_back(countFor(contender, effort.batchSeconds));
     }
+    constexpr std::size_t fewest = 3;
     std::vector<std::vector<double>> times(counts.size());
+    const auto begin = Clock::now();
     for (std::size_t repetition = 0; repetition < effort.repetitions; ++repetition) {
+        if (repetition >= fewest && secondsSince(begin) > effort.contestSeconds) {
+            break;
+        }
         for (std::size_t i = 0; i < counts.size(); ++i) {
-            const std::size_t units = counts[i] * (i == 0 ? 1 : contest.units);
+            const std::size_t units = counts[i] * contest.contenders[i].units;
             times[i].push_back(secondsOf(contest.contenders[i], counts[i]) / static_cast<double>(units));
         }
     }

@@ -57,7 +57,7 @@ EngineClient::~EngineClient() {
     over_.wait(false);
 }
 
-void EngineClient::send(const boost::shared_ptr<const cmddistributor::IIP>& request) {
+void EngineClient::send(const Request& request) {
     ++sent_;
     session_->send(session_->newStreamID(), boost::shared_ptr<const exchange::Message>(
                                                 boost::make_shared<const cmddistributor::IIPEnqueueMessage>(
@@ -66,10 +66,10 @@ void EngineClient::send(const boost::shared_ptr<const cmddistributor::IIP>& requ
                                                     capabilities::CapabilityList(), nullptr, false)));
 }
 
-void EngineClient::send(const std::string& code) {
-    send(boost::make_shared<const cmddistributor::EvalIIP>(
+EngineClient::Request EngineClient::evaluation(const std::string& code) {
+    return boost::make_shared<const cmddistributor::EvalIIP>(
         "python", IqmStreamID::ekIqmCmdWinStream, nullptr, krutil::io::SinkTraits(), krutil::io::SinkTraits(),
-        utf8_to_ustring(code), cmddistributor::CodeType::CodeBlockType));
+        utf8_to_ustring(code), cmddistributor::CodeType::CodeBlockType);
 }
 
 void EngineClient::awaitReplies() {
@@ -88,9 +88,9 @@ void EngineClient::awaitAll() {
     }
 }
 
-void EngineClient::evaluate(const std::string& code, const std::string& expected) {
+void EngineClient::evaluate(const Request& request, const std::string& expected) {
     text_.clear();
-    send(code);
+    send(request);
     awaitAll();
     if (text_.size() != expected.size() || ustring_to_utf8(text_) != expected) {
         throw std::runtime_error("evaluation: expected \"" + expected + "\", got \"" + ustring_to_utf8(text_) + "\"");
@@ -105,12 +105,16 @@ void EngineClient::fail(const std::string& code, const std::string& identifier) 
     }
 }
 
-EngineClient::Arrays EngineClient::call(const std::string& function, Arrays arguments, unsigned long outputs) {
+void EngineClient::send(const std::string& function, Arrays arguments, unsigned long outputs) {
     using cmddistributor::FEvalIIP;
     send(boost::make_shared<const FEvalIIP>(
         "python", FEvalIIP::Function(function), outputs,
         FEvalIIP::Data::makeClientSideData(krutil::cmddistributor::EDIDataWrapper(std::move(arguments))),
         IqmStreamID::ekIqmCmdWinStream, krutil::io::SinkTraits(), krutil::io::SinkTraits(), 1, 2, true));
+}
+
+EngineClient::Arrays EngineClient::call(const std::string& function, Arrays arguments, unsigned long outputs) {
+    send(function, std::move(arguments), outputs);
     awaitAll();
     const auto reply = std::exchange(lastReply_, nullptr);
     const auto* const result = dynamic_cast<const cmddistributor::FEvalResult*>(
@@ -119,10 +123,6 @@ EngineClient::Arrays EngineClient::call(const std::string& function, Arrays argu
         throw std::runtime_error("call of " + function + ": no outputs");
     }
     return boost::get<Arrays>(result->getResults());
-}
-
-std::size_t EngineClient::takeTextSize() {
-    return std::exchange(text_, {}).size();
 }
 
 Bytes EngineClient::takeBytes() {

@@ -26,7 +26,11 @@ struct Bytes {
 /// A session with an engine, which ends with the object. For one thread.
 class EngineClient : private session::SessionHandler {
   public:
+    using Request = boost::shared_ptr<const cmddistributor::IIP>;
     using Arrays = std::vector<foundation::korveldata::Array>;
+
+    /// A request to evaluate code, which may be sent any number of times.
+    static Request evaluation(const std::string& code);
 
     /// With `counting`, bytes() counts what is sent and received, which takes time.
     explicit EngineClient(krutil_client::EngineProcess engine, const session::Limits& limits = {},
@@ -36,20 +40,22 @@ class EngineClient : private session::SessionHandler {
                           bool counting = false);
     ~EngineClient() override;
 
-    /// Sends a request to evaluate code, and does not wait.
-    void send(const std::string& code);
+    /// Sends a request, and does not wait.
+    void send(const Request& request);
+    /// The same for a request to evaluate code.
+    void send(const std::string& code) { send(evaluation(code)); }
+    /// The same for a call of a function of the session, which returns as many outputs.
+    void send(const std::string& function, Arrays arguments, unsigned long outputs = 0);
     /// Waits until all that was sent is answered. Throws std::runtime_error for a request that failed.
     void awaitAll();
     /// Sends and waits. Throws what both throw, and when what the code prints is not `expected`.
-    void evaluate(const std::string& code, const std::string& expected);
+    void evaluate(const Request& request, const std::string& expected);
+    void evaluate(const std::string& code, const std::string& expected) { evaluate(evaluation(code), expected); }
     /// The same for a request that must fail with an error of this name.
     void fail(const std::string& code, const std::string& identifier);
 
-    /// Calls a function of the session, and returns its outputs. Throws std::runtime_error when it fails.
+    /// Sends a call and waits for its outputs. Throws what both throw.
     Arrays call(const std::string& function, Arrays arguments, unsigned long outputs);
-
-    /// Characters that came as text since it was asked last.
-    std::size_t takeTextSize();
 
     /// Since it was asked last; the session must count.
     Bytes takeBytes();
@@ -61,7 +67,6 @@ class EngineClient : private session::SessionHandler {
                  const boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent>& event) override;
     void onEnd(const session::SessionEnd& end) override;
 
-    void send(const boost::shared_ptr<const cmddistributor::IIP>& request);
     void awaitReplies();
 
     krutil_client::EngineProcess engine_;

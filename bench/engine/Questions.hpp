@@ -17,5 +17,7 @@ struct Question {
 
 /// In no order that matters.
 std::vector<Question> evaluationQuestions();
+std::vector<Question> arrayQuestions();
+std::vector<Question> messageQuestions();
 
 }  // namespace bench

@@ -8,6 +8,7 @@
 #include <cerrno>
 #include <cstdint>
 #include <cstring>
+#include <memory>
 #include <stdexcept>
 #include <system_error>
 
@@ -76,6 +77,14 @@ void RawPeer::receive(std::size_t back) {
     if (readFrame(process_.stream(), received_).size != back) {
         throw std::runtime_error("raw peer: expected a frame of " + std::to_string(back) + " bytes, got another");
     }
+}
+
+Contender rawRoundTrips(std::size_t there, std::size_t back, const std::string& name) {
+    return {name, [peer = std::make_shared<RawPeer>(), data = std::string(there, 'x'), back](std::size_t count) {
+                for (std::size_t i = 0; i < count; ++i) {
+                    peer->roundTrip(data.data(), data.size(), back);
+                }
+            }};
 }
 
 void serveRaw() {

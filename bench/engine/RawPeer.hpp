@@ -4,6 +4,7 @@
 #include <cstddef>
 #include <string>
 
+#include "engine/Contest.hpp"
 #include "krutil/session/EngineProcess.hpp"
 
 namespace bench {
@@ -31,6 +32,9 @@ class RawPeer {
     krutil_client::EngineProcess process_;
     std::string received_;
 };
+
+/// Framed round trips of that many bytes with a peer of their own.
+Contender rawRoundTrips(std::size_t there, std::size_t back, const std::string& name = "raw");
 
 /// The other end, on descriptors 0 and 1, until the stream ends.
 void serveRaw();

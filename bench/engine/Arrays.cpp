@@ -1,0 +1,134 @@
+// Calls with arrays, over the socket.
+
+#include <algorithm>
+#include <cstddef>
+#include <cstdint>
+#include <cstring>
+#include <memory>
+#include <stdexcept>
+#include <string>
+#include <utility>
+
+#include "engine/EngineClient.hpp"
+#include "engine/Questions.hpp"
+#include "engine/RawPeer.hpp"
+#include "foundation/korveldata/ArrayFactory.hpp"
+
+namespace bench {
+namespace {
+
+using foundation::korveldata::Array;
+using foundation::korveldata::ArrayFactory;
+using foundation::korveldata::ElementType;
+
+constexpr std::size_t KiB = std::size_t{1} << 10;
+constexpr std::size_t MiB = KiB << 10;
+constexpr std::size_t answerBytes = 200;  // of a reply without outputs, roughly
+
+enum class Way { There, ThereAndBack };
+
+Array arrayOf(std::size_t bytes) {
+    Array array = ArrayFactory().createArray(ElementType::UInt8, {bytes});
+    char* const elements = array.mutableData();
+    for (std::size_t i = 0; i < bytes; ++i) {
+        elements[i] = static_cast<char>(i % 251);
+    }
+    return array;
+}
+
+bool equal(const Array& left, const Array& right) {
+    return left.sizeInBytes() == right.sizeInBytes() && std::memcmp(left.data(), right.data(), left.sizeInBytes()) == 0;
+}
+
+// A client to an engine that has the functions, and whose limits are no hindrance.
+std::shared_ptr<EngineClient> callingClient() {
+    session::Limits limits;
+    limits.message = std::uint64_t{16} << 30;
+    auto client = std::make_shared<EngineClient>(
+        std::vector<std::string>{"--limit-message", "16GiB", "--max-queued-bytes", "16GiB"}, limits);
+    client->evaluate(
+        "def take(array): pass\n"
+        "def back(array): return array\n"
+        "def last(array): return array[-1000:]\n",
+        "");
+    return client;
+}
+
+// Calls of a function with `array`. What the engine has of it is looked at before.
+Contender calls(const Array& array, Way way) {
+    auto client = callingClient();
+    const auto end = client->call("last", {array}, 1);
+    const std::size_t seen = std::min<std::size_t>(1000, array.sizeInBytes());
+    if (end.at(0).sizeInBytes() != seen ||
+        std::memcmp(end[0].data(), array.data() + array.sizeInBytes() - seen, seen) != 0) {
+        throw std::runtime_error("array: its last bytes are others in the engine");
+    }
+    return {"krutil", [client, array, way](std::size_t count) {
+                EngineClient::Arrays outputs;
+                for (std::size_t i = 0; i < count; ++i) {
+                    outputs.clear();
+                    if (way == Way::There) {
+                        client->send("take", {array});
+                        client->awaitAll();
+                    } else {
+                        outputs = client->call("back", {array}, 1);
+                    }
+                }
+                if (way == Way::ThereAndBack && !equal(outputs.at(0), array)) {
+                    throw std::runtime_error("array: what came back is not what was sent");
+                }
+            }};
+}
+
+Contender rawArrays(const Array& array, Way way) {
+    return {"raw", [peer = std::make_shared<RawPeer>(), array, way](std::size_t count) {
+                const auto size = static_cast<std::size_t>(array.sizeInBytes());
+                for (std::size_t i = 0; i < count; ++i) {
+                    peer->roundTrip(array.data(), size, way == Way::There ? answerBytes : size);
+                }
+            }};
+}
+
+void arrays(const Effort& effort) {
+    for (const auto& [size, name] : {std::pair{MiB, "1 MiB"}, std::pair{64 * MiB, "64 MiB"}}) {
+        if (size <= effort.largest) {
+            const Array array = arrayOf(size);
+            hold({name + std::string(" to the engine"), {}, {rawArrays(array, Way::There), calls(array, Way::There)}},
+                 effort);
+            hold({name + std::string(" there and back"),
+                  {},
+                  {rawArrays(array, Way::ThereAndBack), calls(array, Way::ThereAndBack)}},
+                 effort);
+        }
+    }
+}
+
+void arraySizes(const Effort& effort) {
+    for (const std::size_t size : sizes(effort, KiB, effort.largest, 4)) {
+        const Array array = arrayOf(size);
+        hold({"to the engine", static_cast<double>(size), {rawArrays(array, Way::There), calls(array, Way::There)}},
+             effort);
+    }
+}
+
+void smallCall(const Effort& effort) {
+    const auto client = std::make_shared<EngineClient>();
+    hold({"",
+          {},
+          {{"evaluation",
+            [client, request = EngineClient::evaluation("1+1")](std::size_t count) {
+                for (std::size_t i = 0; i < count; ++i) {
+                    client->evaluate(request, "2\n");
+                }
+            }},
+           calls(arrayOf(KiB), Way::ThereAndBack)}},
+         effort);
+}
+
+}  // namespace
+
+std::vector<Question> arrayQuestions() {
+    return {{"call", smallCall}, {"arrays", arrays}, {"array-sizes", arraySizes}};
+}
+
+}  // namespace bench
