@@ -10,6 +10,8 @@
 #include <stdexcept>
 #include <utility>
 
+#include "support/Eventually.hpp"
+
 namespace programs_test {
 namespace {
 
@@ -366,7 +368,7 @@ void LifecycleTest::expectEngineGone(const std::string& said) {
 
 void LifecycleTest::expectNoSessions() {
     // It reaps them when it is told of their end.
-    EXPECT_TRUE(eventually([this] { return childrenOf(listener_->pid()).empty(); }));
+    EXPECT_TRUE(test_support::eventually([this] { return childrenOf(listener_->pid()).empty(); }));
     EXPECT_EQ(descriptorsOf(listener_->pid()), descriptors_);
 }
 

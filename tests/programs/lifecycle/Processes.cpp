@@ -1,29 +1,29 @@
 #include "programs/lifecycle/Processes.hpp"
 
 #include <gtest/gtest.h>
-#include <poll.h>
 #include <sys/prctl.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cctype>
 #include <cerrno>
+#include <chrono>
 #include <csignal>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
 #include <sstream>
 #include <stdexcept>
-#include <thread>
 
 #include "programs/support/Program.hpp"
+#include "support/Eventually.hpp"
 
 namespace programs_test {
 namespace {
 
 namespace fs = std::filesystem;
+using test_support::eventually;
 
 constexpr std::chrono::seconds patience{60};
 
@@ -106,22 +106,11 @@ std::vector<pid_t> childrenOf(pid_t parent) {
 
 pid_t onlyChildOf(pid_t parent) {
     std::vector<pid_t> children;
-    eventually([&] { return !(children = childrenOf(parent)).empty(); });
-    if (children.size() != 1) {
+    if (!eventually([&] { return !(children = childrenOf(parent)).empty(); }) || children.size() != 1) {
         throw std::runtime_error("process " + describe(parent) + " has " + std::to_string(children.size()) +
                                  " children; expected one");
     }
     return children.front();
-}
-
-bool endsWithin(pid_t pid, std::chrono::milliseconds time) {
-    pollfd watched{static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)), POLLIN, 0};
-    if (watched.fd < 0) {
-        return true;
-    }
-    const bool ended = ::poll(&watched, 1, static_cast<int>(time.count())) == 1;
-    ::close(watched.fd);
-    return ended;
 }
 
 int exitCodeOf(pid_t pid) {
@@ -149,17 +138,6 @@ void awaitStopped(pid_t pid) {
 
 void resume(pid_t pid) {
     signalOne(pid, SIGCONT);
-}
-
-bool eventually(const std::function<bool()>& holds) {
-    const auto deadline = std::chrono::steady_clock::now() + patience;
-    while (!holds()) {
-        if (std::chrono::steady_clock::now() >= deadline) {
-            return false;
-        }
-        std::this_thread::sleep_for(std::chrono::milliseconds(1));
-    }
-    return true;
 }
 
 std::map<int, std::string> descriptorsOf(pid_t pid) {

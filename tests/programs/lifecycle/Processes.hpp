@@ -7,8 +7,6 @@
 
 #include <sys/types.h>
 
-#include <chrono>
-#include <functional>
 #include <map>
 #include <string>
 #include <vector>
@@ -28,9 +26,6 @@ std::vector<pid_t> childrenOf(pid_t parent);
 /// The only child of a process, which may be about to be made. Throws std::runtime_error when there is none, or more.
 pid_t onlyChildOf(pid_t parent);
 
-/// Whether the process, which may be nobody's child here, ends within `patience`.
-bool endsWithin(pid_t pid, std::chrono::milliseconds patience);
-
 /// Waits for the end of a process that is a child of this one, perhaps an adopted one, and reaps it; returns its exit
 /// code, 128 + the signal for one that was killed.
 int exitCodeOf(pid_t pid);
@@ -43,9 +38,6 @@ void awaitStopped(pid_t pid);
 
 /// Lets a process go on if it is stopped.
 void resume(pid_t pid);
-
-/// Waits for something that the system has no way to wait for; false if it does not come to hold.
-bool eventually(const std::function<bool()>& holds);
 
 /// Descriptors that a process has open, and what they lead to.
 std::map<int, std::string> descriptorsOf(pid_t pid);

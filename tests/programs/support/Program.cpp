@@ -248,14 +248,18 @@ void signalOne(pid_t pid, int number) {
     ::kill(pid, number);
 }
 
-bool waitUntilGone(pid_t pid) {
+bool endsWithin(pid_t pid, std::chrono::milliseconds time) {
     pollfd watched{static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)), POLLIN, 0};
     if (watched.fd < 0) {
         return true;
     }
-    const bool gone = ::poll(&watched, 1, static_cast<int>(std::chrono::milliseconds(patience).count())) == 1;
+    const bool ended = ::poll(&watched, 1, static_cast<int>(time.count())) == 1;
     ::close(watched.fd);
-    return gone;
+    return ended;
+}
+
+bool waitUntilGone(pid_t pid) {
+    return endsWithin(pid, patience);
 }
 
 Ran run(const std::vector<std::string>& arguments, const Program::Options& options) {

@@ -82,7 +82,10 @@ class Program {
 /// all processes that there are.
 void signalOne(pid_t pid, int number);
 
-/// Waits until the process `pid`, which may be nobody's child here, has ended; false if it outlives the deadline.
+/// Whether the process `pid`, which may be nobody's child here, ends within `time`.
+bool endsWithin(pid_t pid, std::chrono::milliseconds time);
+
+/// The same within a minute, which is as long as a test waits for anything.
 bool waitUntilGone(pid_t pid);
 
 /// Runs a program to its end.

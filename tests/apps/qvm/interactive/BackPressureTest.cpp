@@ -6,14 +6,13 @@
 #include <unistd.h>
 
 #include <atomic>
-#include <chrono>
 #include <fstream>
 #include <sstream>
 #include <stdexcept>
 #include <string>
-#include <thread>
 
 #include "apps/qvm/fixture/EngineFixture.hpp"
+#include "support/Eventually.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 namespace qvm_test {
@@ -23,6 +22,7 @@ using namespace krutil::cmddistributor::WhenToDequeue;
 using capabilities::Capability;
 using cmddistributor::IIPCancelReply;
 using krutil::cmddistributor::inEXECUTION_CTRLC;
+using test_support::eventually;
 
 // What the engine may hold for a client that does not read: the session's room and what lies around each message. A
 // sanitizer keeps freed memory for a while.
@@ -99,19 +99,6 @@ bool sleeps(pid_t process) {
     return text.substr(text.rfind(')') + 1, 2) == " S";
 }
 
-// Looks again and again until `holds`, as long as a test is patient.
-template <class Condition>
-bool comes(Condition holds) {
-    const auto deadline = std::chrono::steady_clock::now() + patience;
-    while (!holds()) {
-        if (std::chrono::steady_clock::now() > deadline) {
-            return false;
-        }
-        std::this_thread::sleep_for(std::chrono::milliseconds(2));
-    }
-    return true;
-}
-
 struct EventKind {
     std::string name;
     std::string setup;
@@ -157,7 +144,7 @@ class BackPressureTest : public testing::TestWithParam<EventKind> {
         client().stopReading();
         std::uint64_t last = 0;
         int same = 0;
-        EXPECT_TRUE(comes([&] {
+        EXPECT_TRUE(eventually([&] {
             const std::uint64_t now = numbers_.count();
             same = now > 0 && now == last && sleeps(engine_.process.pid()) ? same + 1 : 0;
             last = now;
@@ -179,7 +166,7 @@ TEST_P(BackPressureTest, CodeWaitsAndGoesOn) {
     const IDType id = held();
     const std::uint64_t waitedAt = numbers_.count();
     client().readOn();
-    EXPECT_TRUE(comes([&] { return numbers_.count() > waitedAt; }));
+    EXPECT_TRUE(eventually([&] { return numbers_.count() > waitedAt; }));
     numbers_.stop();
     EXPECT_FALSE(client().await(id).error);
     EXPECT_EQ(client().eval("1 + 1").shown(), "2\n");
@@ -189,7 +176,7 @@ TEST_P(BackPressureTest, CodeThatWaitsCanBeCancelled) {
     const IDType id = held();
     const session::framing::StreamID cancel = client().startCancel(id);
     // Nothing is read meanwhile.
-    EXPECT_TRUE(comes([&] { return numbers_.cancelled(); }));
+    EXPECT_TRUE(eventually([&] { return numbers_.cancelled(); }));
     numbers_.stop();
     client().readOn();
     EXPECT_EQ(client().awaitCancel(cancel), IIPCancelReply::PENDING_CANCEL);
@@ -221,7 +208,7 @@ TEST(PromptBackPressureTest, PromptsWhoseAnswersWaitAreHeldUpToo) {
     gate.open();
     std::uint64_t last = 0;
     int same = 0;
-    EXPECT_TRUE(comes([&] {
+    EXPECT_TRUE(eventually([&] {
         const std::uint64_t now = numbers.count();
         same = now > 0 && now == last && sleeps(engine.process.pid()) ? same + 1 : 0;
         last = now;
@@ -229,7 +216,7 @@ TEST(PromptBackPressureTest, PromptsWhoseAnswersWaitAreHeldUpToo) {
     }));
     EXPECT_LT(numbers.count(), answers);
     engine.client.readOn();
-    EXPECT_TRUE(comes([&] { return numbers.count() == answers; }));
+    EXPECT_TRUE(eventually([&] { return numbers.count() == answers; }));
     numbers.stop();
     engine.client.enqueue("the last", atPrompt);
     EXPECT_FALSE(engine.client.await(id).error);
