@@ -11,7 +11,7 @@
 #include "NestedArrays.hpp"
 #include "foundation/korveldata/ArrayFactory.hpp"
 #include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
-#include "krutil_protobuf/support/TestTransport.hpp"
+#include "krutil_protobuf/serializers/SerializerTest.hpp"
 
 namespace arrays {
 
@@ -19,6 +19,7 @@ using foundation::korveldata::Array;
 using foundation::korveldata::ArrayFactory;
 using foundation::korveldata::ElementType;
 using foundation::vantor::carrier::framing::BufferAllocator;
+using krutil::protobuf_serializer::DataID;
 using krutil::protobuf_serializer::NestedWriter;
 using krutil::protobuf_serializer::writeArrays;
 using transport::FrameContent;
@@ -53,8 +54,8 @@ inline std::vector<FrameIndex> indexes(const transport::Frames& frames) {
     return result;
 }
 
-/// Everything that a transport gives to serializers, and frames of arrays to refer to.
-class ArraysTest : public testing::Test {
+/// Frames of arrays to refer to. A test ends with as many buffers in use as it began with.
+class ArraysTest : public transport::SerializerTest {
   protected:
     void TearDown() override {
         stream_->frames.clear();
@@ -62,19 +63,20 @@ class ArraysTest : public testing::Test {
     }
 
     std::size_t before() const { return before_; }
-    const transport::Frames& frames() const { return stream_->frames; }
-    const std::shared_ptr<const Registry>& registry() const { return registry_; }
-    const std::shared_ptr<MessageStream>& stream() const { return anyStream_; }
 
-    /// What has been written, as a peer receives it.
-    std::unique_ptr<Message> received() const { return transport::makeMessage(transport::contentOf(frames())); }
+    /// Writes `arrays` with the serializers of `registry`, from index 1 on.
+    static std::vector<DataID> writeTo(const std::shared_ptr<MessageStream>& stream,
+                                       const std::shared_ptr<const Registry>& registry,
+                                       const std::vector<Array>& arrays) {
+        const SerializationContext context;
+        NestedWriter nested(7, 1, stream, registry, context);
+        return writeArrays(arrays, nested);
+    }
 
     /// The frames of `arrays` from index 1 on.
     std::vector<FrameContent> framesOf(const std::vector<Array>& arrays) const {
         const auto stream = std::make_shared<RecordingStream>();
-        const std::shared_ptr<MessageStream> any = stream;
-        NestedWriter nested(7, 1, any, registry_, context_);
-        writeArrays(arrays, nested);
+        writeTo(stream, registry_, arrays);
         return transport::contentOf(stream->frames);
     }
 
@@ -88,10 +90,6 @@ class ArraysTest : public testing::Test {
 
   private:
     std::size_t before_ = BufferAllocator::inUse();
-    std::shared_ptr<const Registry> registry_ = transport::sessionRegistry();
-    std::shared_ptr<RecordingStream> stream_ = std::make_shared<RecordingStream>();
-    std::shared_ptr<MessageStream> anyStream_ = stream_;
-    SerializationContext context_;
 };
 
 }  // namespace arrays

@@ -18,7 +18,6 @@ using krutil::protobuf_serializer::EventFamily;
 using krutil::protobuf_serializer::IIPStateEventSerializer;
 using transport::FrameType;
 using transport::RecordingStream;
-using transport::Registry;
 using transport::SerializationContext;
 namespace wire = krutil::protobuf;
 

@@ -79,12 +79,11 @@ wire::FEvalIIP callProto(const std::vector<std::uint64_t>& dataIDs, std::uint64_
 class FEvalIIPTest : public ArraysTest {
   protected:
     FrameIndex write(const boost::shared_ptr<const IIP>& request, FrameIndex first) const {
-        return serializer().serialize(request, 7, first, stream(), registry(), SerializationContext());
+        return writeAs<IIPFamily>("krutil:FEvalIIP", request, first);
     }
 
     boost::shared_ptr<const FEvalIIP> read(const std::unique_ptr<Message>& message, FrameIndex index) const {
-        return boost::dynamic_pointer_cast<const FEvalIIP>(
-            serializer().deserialize(index, message, registry(), SerializationContext()));
+        return boost::dynamic_pointer_cast<const FEvalIIP>(readAs<IIPFamily>("krutil:FEvalIIP", message, index));
     }
 
     // Reads `proto`, which stands behind one array with a data frame; the array's ID is 2.
@@ -97,9 +96,6 @@ class FEvalIIPTest : public ArraysTest {
     }
 
     wire::FEvalIIP written() const { return parsed<wire::FEvalIIP>(*frames().back()); }
-
-  private:
-    const IIPFamily& serializer() const { return transport::serializer<IIPFamily>(*registry(), "krutil:FEvalIIP"); }
 };
 
 TEST_F(FEvalIIPTest, WithoutArgumentsTheCallIsOneFrame) {
@@ -259,7 +255,7 @@ TEST_F(FEvalIIPTest, WithoutASerializerOfArraysACallWithoutArgumentsIsOutOfRange
     const auto bare = std::make_shared<Registry>();
     const auto serializer = std::make_shared<FEvalIIPSerializer>();
     bare->insert(serializer);
-    EXPECT_THROW(serializer->serialize(call({}), 7, 1, stream(), bare, SerializationContext()), std::out_of_range);
+    EXPECT_THROW(serializer->serialize(call({}), 7, 1, stream_, bare, SerializationContext()), std::out_of_range);
     EXPECT_TRUE(frames().empty());
 }
 

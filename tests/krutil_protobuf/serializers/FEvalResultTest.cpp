@@ -39,7 +39,6 @@ using transport::FrameIndex;
 using transport::FrameType;
 using transport::Message;
 using transport::parsed;
-using transport::SerializationContext;
 namespace wire = krutil::protobuf;
 
 const IDType requestID(5, 6);
@@ -64,11 +63,11 @@ wire::FEvalResult resultProto(const std::vector<std::uint64_t>& dataIDs) {
 class FEvalResultTest : public ArraysTest {
   protected:
     FrameIndex write(const std::unique_ptr<IIPResult>& result, FrameIndex first) const {
-        return serializer().serialize(result, 7, first, stream(), registry(), SerializationContext());
+        return writeAs<ResultFamily>("krutil:FEvalResult", result, first);
     }
 
     std::unique_ptr<IIPResult> read(const std::unique_ptr<Message>& message, FrameIndex index) const {
-        return serializer().deserialize(index, message, registry(), SerializationContext());
+        return readAs<ResultFamily>("krutil:FEvalResult", message, index);
     }
 
     static const std::vector<Array>& arraysOf(const IIPResult& result) {
@@ -76,11 +75,6 @@ class FEvalResultTest : public ArraysTest {
     }
 
     wire::FEvalResult written() const { return parsed<wire::FEvalResult>(*frames().back()); }
-
-  private:
-    const ResultFamily& serializer() const {
-        return transport::serializer<ResultFamily>(*registry(), "krutil:FEvalResult");
-    }
 };
 
 TEST_F(FEvalResultTest, WithoutOutputsTheResultIsOneFrame) {
@@ -115,14 +109,12 @@ TEST_F(FEvalResultTest, OutputsAreLentToTheirFramesAndReceivedInPlace) {
 }
 
 TEST_F(FEvalResultTest, InsideAReplyTheResultIDIsTheResultsOwnFrame) {
-    const auto& replies = transport::serializer<ReplyFamily>(*registry(), "krutil:IIPReply");
-    EXPECT_EQ(replies.serialize(boost::make_shared<IIPReply>(IDType(1, 2), outputs({small(1), small(2)})), 7, 3,
-                                stream(), registry(), SerializationContext()),
-              7U);
+    const auto reply = boost::make_shared<IIPReply>(IDType(1, 2), outputs({small(1), small(2)}));
+    EXPECT_EQ(writeAs<ReplyFamily>("krutil:IIPReply", reply, 3), 7U);
     EXPECT_EQ(indexes(frames()), (std::vector<FrameIndex>{3, 4, 5, 6}));
     EXPECT_EQ(parsed<wire::IIPReply>(*frames().back()).resultid(), 5U);
-    const auto back = boost::dynamic_pointer_cast<const IIPReply>(
-        replies.deserialize(6, received(), registry(), SerializationContext()));
+    const auto back =
+        boost::dynamic_pointer_cast<const IIPReply>(readAs<ReplyFamily>("krutil:IIPReply", received(), 6));
     EXPECT_EQ(back->getID(), IDType(1, 2));
     EXPECT_EQ(back->getResult()->id, requestID);
     EXPECT_EQ(arraysOf(*back->getResult()), (std::vector<Array>{small(1), small(2)}));
@@ -134,10 +126,7 @@ TEST_F(FEvalResultTest, OutputsOfARefusedReplyAreReleased) {
     wire::IIPReply reply;
     reply.set_resultid(3);
     const auto message = messageOf(reply, "krutil:IIPReply", given);
-    EXPECT_EQ(errorText<std::logic_error>([&] {
-                  transport::serializer<ReplyFamily>(*registry(), "krutil:IIPReply")
-                      .deserialize(4, message, registry(), SerializationContext());
-              }),
+    EXPECT_EQ(errorText<std::logic_error>([&] { readAs<ReplyFamily>("krutil:IIPReply", message, 4); }),
               "Required field is missing: protobuf::IIPReply.id");
     EXPECT_EQ(message->frame(1), nullptr);
     EXPECT_EQ(BufferAllocator::inUse(), before());

@@ -9,7 +9,7 @@
 #include "EvalIIPSerializer.hpp"
 #include "IIPEnqueueMessageSerializer.hpp"
 #include "krutil/io/TextBaseEvent.hpp"
-#include "krutil_protobuf/support/TestTransport.hpp"
+#include "krutil_protobuf/serializers/SerializerTest.hpp"
 
 namespace {
 
@@ -28,7 +28,6 @@ using transport::FrameContent;
 using transport::FrameIndex;
 using transport::FrameType;
 using transport::parsed;
-using transport::RecordingStream;
 using transport::Registry;
 using transport::SerializationContext;
 namespace modes = krutil::cmddistributor::WhenToDequeue;
@@ -87,47 +86,41 @@ class BulkySerializer : public IIPFamily {
     }
 };
 
-class IIPEnqueueMessageTest : public testing::Test {
+class IIPEnqueueMessageTest : public transport::SerializerTest {
   protected:
-    const MessageFamily& serializer() const { return transport::serializer<MessageFamily>(*registry_, enqueueTag); }
-
-    FrameIndex write(const boost::shared_ptr<const IIPEnqueueMessage>& message, FrameIndex first) {
-        return serializer().serialize(message, 7, first, stream_, registry_, SerializationContext());
+    FrameIndex write(const boost::shared_ptr<const IIPEnqueueMessage>& message, FrameIndex first) const {
+        return writeAs<MessageFamily>(enqueueTag, message, first);
     }
 
     boost::shared_ptr<const IIPEnqueueMessage> read(const std::unique_ptr<transport::Message>& message,
                                                     FrameIndex index) const {
-        return boost::dynamic_pointer_cast<const IIPEnqueueMessage>(
-            serializer().deserialize(index, message, registry_, SerializationContext()));
+        return boost::dynamic_pointer_cast<const IIPEnqueueMessage>(readAs<MessageFamily>(enqueueTag, message, index));
     }
 
     // An eval request at 1 and, at 2, an enqueue message as changed by `change`.
     template <class Change>
-    static std::vector<FrameContent> frames(const Change& change) {
+    static std::vector<FrameContent> framesWith(const Change& change) {
         wire::IIPEnqueueMessage proto;
         proto.set_iiphandle(1);
         change(proto);
         return {{true, FrameType::Object, 7, 1, evalTag, evalBytes()},
                 {true, FrameType::Control, 7, 2, enqueueTag, proto.SerializeAsString()}};
     }
-
-    std::shared_ptr<Registry> registry_ = transport::sessionRegistry();
-    std::shared_ptr<RecordingStream> stream_ = std::make_shared<RecordingStream>();
 };
 
 // ---- Writing --------------------------------------------------------------------------------------------------------
 
 TEST_F(IIPEnqueueMessageTest, TheRequestIsWrittenFirstAndReferredToByItsIndex) {
     EXPECT_EQ(write(enqueue(evalRequest()), 0), 2U);
-    ASSERT_EQ(stream_->frames.size(), 2U);
-    const auto written = transport::contentOf(stream_->frames);
+    ASSERT_EQ(frames().size(), 2U);
+    const auto written = transport::contentOf(frames());
     EXPECT_EQ(written[0].tag, evalTag);
     EXPECT_EQ(written[0].index, 0U);
     EXPECT_EQ(written[0].type, FrameType::Object);
     EXPECT_EQ(written[1].tag, enqueueTag);
     EXPECT_EQ(written[1].index, 1U);
     EXPECT_EQ(written[1].type, FrameType::Control);
-    EXPECT_EQ(parsed<wire::IIPEnqueueMessage>(*stream_->frames[1]).iiphandle(), 0U);
+    EXPECT_EQ(parsed<wire::IIPEnqueueMessage>(*frames()[1]).iiphandle(), 0U);
     // A handle of 0 is an index like any other.
     const auto back = read(transport::makeMessage(written), 1);
     EXPECT_EQ(dynamic_cast<const EvalIIP&>(*back->getIIP()).getCommand(), u"1");
@@ -136,43 +129,43 @@ TEST_F(IIPEnqueueMessageTest, TheRequestIsWrittenFirstAndReferredToByItsIndex) {
 TEST_F(IIPEnqueueMessageTest, TheHandleIsTheLastFrameOfARequestThatNeedsSeveral) {
     registry_->insert(std::make_shared<BulkySerializer>());
     EXPECT_EQ(write(enqueue(unregisteredRequest()), 4), 9U);
-    ASSERT_EQ(stream_->frames.size(), 5U);
-    EXPECT_EQ(stream_->frames.back()->index(), 8U);
-    EXPECT_EQ(parsed<wire::IIPEnqueueMessage>(*stream_->frames.back()).iiphandle(), 7U);
+    ASSERT_EQ(frames().size(), 5U);
+    EXPECT_EQ(frames().back()->index(), 8U);
+    EXPECT_EQ(parsed<wire::IIPEnqueueMessage>(*frames().back()).iiphandle(), 7U);
 }
 
 TEST_F(IIPEnqueueMessageTest, AnEmptyRequestIsBadTypeidAndWritesNothing) {
     EXPECT_THROW(write(enqueue(nullptr), 1), std::bad_typeid);
-    EXPECT_TRUE(stream_->frames.empty());
+    EXPECT_TRUE(frames().empty());
 }
 
 TEST_F(IIPEnqueueMessageTest, ARequestWithoutASerializerIsOutOfRangeAndWritesNothing) {
     EXPECT_THROW(write(enqueue(unregisteredRequest()), 1), std::out_of_range);
-    EXPECT_TRUE(stream_->frames.empty());
+    EXPECT_TRUE(frames().empty());
 }
 
 TEST_F(IIPEnqueueMessageTest, ASerializerOfAnotherFamilyIsBadCastAndWritesNothing) {
     registry_->insert(std::make_shared<transport::MisplacedSerializer<MessageFamily>>(typeid(UnregisteredIIP)));
     EXPECT_THROW(write(enqueue(unregisteredRequest()), 1), std::bad_cast);
-    EXPECT_TRUE(stream_->frames.empty());
+    EXPECT_TRUE(frames().empty());
 }
 
 TEST_F(IIPEnqueueMessageTest, AStreamThatRefusesTheMessageKeepsItsRequest) {
     stream_ = std::make_shared<transport::ThrowingStream>(1);
     EXPECT_EQ(errorText<std::runtime_error>([&] { write(enqueue(evalRequest()), 1); }), "stream is full");
-    ASSERT_EQ(stream_->frames.size(), 1U);
-    EXPECT_EQ(transport::contentOf(*stream_->frames[0]).tag, evalTag);
+    ASSERT_EQ(frames().size(), 1U);
+    EXPECT_EQ(transport::contentOf(*frames()[0]).tag, evalTag);
 }
 
 TEST_F(IIPEnqueueMessageTest, AnEmptyEngineIdentifierIsWrittenAsNothingAndReadsBackEmpty) {
     write(enqueue(evalRequest()), 1);
-    EXPECT_EQ(parsed<wire::IIPEnqueueMessage>(*stream_->frames[1]).qvmid(), 0U);
-    EXPECT_FALSE(read(transport::makeMessage(transport::contentOf(stream_->frames)), 2)->getQvmID().has_value());
+    EXPECT_EQ(parsed<wire::IIPEnqueueMessage>(*frames()[1]).qvmid(), 0U);
+    EXPECT_FALSE(read(received(), 2)->getQvmID().has_value());
 }
 
 TEST_F(IIPEnqueueMessageTest, EngineIdentifierZeroReadsBackEmpty) {
     write(enqueue(evalRequest(), krutil::contextmgr::QvmID{0}), 1);
-    EXPECT_FALSE(read(transport::makeMessage(transport::contentOf(stream_->frames)), 2)->getQvmID().has_value());
+    EXPECT_FALSE(read(received(), 2)->getQvmID().has_value());
 }
 
 TEST_F(IIPEnqueueMessageTest, EveryFieldTravelsInItsOwnPlace) {
@@ -180,7 +173,7 @@ TEST_F(IIPEnqueueMessageTest, EveryFieldTravelsInItsOwnPlace) {
         evalRequest(), IDType(1, 2), -3, krutil::contextmgr::QvmID{4}, nullptr, modes::DEQUEUE_AT_DEBUG_PROMPT, u"n",
         capabilities::CapabilityList{capabilities::Capability::ModalDialogs}, nullptr, true);
     write(message, 1);
-    const wire::IIPEnqueueMessage proto = parsed<wire::IIPEnqueueMessage>(*stream_->frames[1]);
+    const wire::IIPEnqueueMessage proto = parsed<wire::IIPEnqueueMessage>(*frames()[1]);
     EXPECT_EQ(proto.iiphandle(), 1U);
     EXPECT_EQ(proto.iipid().hi(), 1U);
     EXPECT_EQ(proto.iipid().lo(), 2U);
@@ -202,13 +195,13 @@ TEST_F(IIPEnqueueMessageTest, AReceivedMessageHasNoEventManagerAndNoImpersonatio
                                                 modes::DEQUEUE_AT_PROMPT, u"n", capabilities::CapabilityList(),
                                                 std::make_shared<Impersonation>(), false),
           1);
-    const auto back = read(transport::makeMessage(transport::contentOf(stream_->frames)), 2);
+    const auto back = read(received(), 2);
     EXPECT_EQ(back->getEventMgr(), nullptr);
     EXPECT_EQ(back->getImpersonable(), nullptr);
 }
 
 TEST_F(IIPEnqueueMessageTest, AnAbsentIdentifierAndNameAreDefaults) {
-    const auto back = read(transport::makeMessage(frames([](auto&) {})), 2);
+    const auto back = read(transport::makeMessage(framesWith([](auto&) {})), 2);
     EXPECT_EQ(back->getID(), IDType());
     EXPECT_EQ(back->getDynamicName(), u"");
     EXPECT_EQ(back->getDequeueMode(), modes::DEQUEUE_UNKNOWN);
@@ -216,7 +209,8 @@ TEST_F(IIPEnqueueMessageTest, AnAbsentIdentifierAndNameAreDefaults) {
 
 TEST_F(IIPEnqueueMessageTest, AnUnknownDequeueModeIsRefusedWithItsNumber) {
     for (const int mode : {8, -1}) {
-        const auto given = frames([&](auto& proto) { proto.set_dequeuemode(static_cast<wire::WhenToDequeue>(mode)); });
+        const auto given =
+            framesWith([&](auto& proto) { proto.set_dequeuemode(static_cast<wire::WhenToDequeue>(mode)); });
         EXPECT_EQ(
             errorText<std::logic_error>([&] { read(transport::makeMessage(given), 2); }),
             "Invalid enum field value krutil::protobuf::IIPEnqueueMessage.WhenToDequeue = " + std::to_string(mode));
@@ -224,14 +218,14 @@ TEST_F(IIPEnqueueMessageTest, AnUnknownDequeueModeIsRefusedWithItsNumber) {
 }
 
 TEST_F(IIPEnqueueMessageTest, AFaultyRequestIsReportedBeforeAnUnknownDequeueMode) {
-    auto given = frames([](auto& proto) { proto.set_dequeuemode(static_cast<wire::WhenToDequeue>(8)); });
+    auto given = framesWith([](auto& proto) { proto.set_dequeuemode(static_cast<wire::WhenToDequeue>(8)); });
     given[0].bytes.clear();
     EXPECT_EQ(errorText<std::logic_error>([&] { read(transport::makeMessage(given), 2); }),
               "Required field missing: protobuf::EvalIIP.iip");
 }
 
 TEST_F(IIPEnqueueMessageTest, UnknownCapabilitiesAreDropped) {
-    const auto given = frames([](auto& proto) {
+    const auto given = framesWith([](auto& proto) {
         for (const int number : {0, 3, 9, -1, 3}) {
             proto.add_capability(static_cast<wire::Capability>(number));
         }
@@ -241,14 +235,14 @@ TEST_F(IIPEnqueueMessageTest, UnknownCapabilitiesAreDropped) {
 }
 
 TEST_F(IIPEnqueueMessageTest, AHandleWhoseTagIsNotRegisteredIsOutOfRange) {
-    auto given = frames([](auto&) {});
+    auto given = framesWith([](auto&) {});
     given[0].tag = "krutil:NoSuchType";
     EXPECT_THROW(read(transport::makeMessage(given), 2), std::out_of_range);
 }
 
 TEST_F(IIPEnqueueMessageTest, AHandleWhoseSerializerIsOfAnotherFamilyIsBadCastAndTheFrameStays) {
     for (const char* tag : {"krutil:IIPResult", "krutil:TextBaseEvent", "krutil:IIPReply"}) {
-        auto given = frames([](auto&) {});
+        auto given = framesWith([](auto&) {});
         given[0].tag = tag;
         const auto message = transport::makeMessage(given);
         EXPECT_THROW(read(message, 2), std::bad_cast) << tag;
@@ -259,19 +253,19 @@ TEST_F(IIPEnqueueMessageTest, AHandleWhoseSerializerIsOfAnotherFamilyIsBadCastAn
 TEST_F(IIPEnqueueMessageTest, AHostileHandleIsBadCast) {
     // None there, the message's own frame (taken out by then), past the end.
     for (const FrameIndex handle : {FrameIndex{0}, FrameIndex{2}, FrameIndex{3}, FrameIndex{1} << 32, ~FrameIndex{0}}) {
-        const auto given = frames([&](auto& proto) { proto.set_iiphandle(handle); });
+        const auto given = framesWith([&](auto& proto) { proto.set_iiphandle(handle); });
         EXPECT_THROW(read(transport::makeMessage(given), 2), std::bad_cast) << handle;
     }
 }
 
 TEST_F(IIPEnqueueMessageTest, AHandleOfADataFrameIsBadCast) {
-    auto given = frames([](auto&) {});
+    auto given = framesWith([](auto&) {});
     given[0].tagged = false;
     EXPECT_THROW(read(transport::makeMessage(given), 2), std::bad_cast);
 }
 
 TEST_F(IIPEnqueueMessageTest, AHandleThatWasReadAlreadyIsBadCast) {
-    auto given = frames([](auto&) {});
+    auto given = framesWith([](auto&) {});
     given.push_back(given[1]);
     given[2].index = 3;
     const auto message = transport::makeMessage(given);

@@ -19,10 +19,8 @@ using foundation::korveldata::Array;
 using foundation::vantor::carrier::framing::BufferAllocator;
 using krutil::protobuf_serializer::DataID;
 using krutil::protobuf_serializer::NestedReader;
-using krutil::protobuf_serializer::NestedWriter;
 using krutil::protobuf_serializer::readArrays;
 using krutil::protobuf_serializer::ReplyFamily;
-using krutil::protobuf_serializer::writeArrays;
 using transport::FrameIndex;
 using transport::Message;
 using transport::Registry;
@@ -39,19 +37,17 @@ class NestedArraysTest : public ArraysTest {
     std::vector<Array> read(const google::protobuf::RepeatedField<std::uint64_t>& dataIDs,
                             const std::unique_ptr<Message>& message) const {
         const SerializationContext context;
-        return readArrays(dataIDs, NestedReader(message, registry(), context));
+        return readArrays(dataIDs, NestedReader(message, registry_, context));
     }
 
     std::vector<DataID> writeWith(const std::shared_ptr<const Registry>& registry,
                                   const std::vector<Array>& arrays) const {
-        const SerializationContext context;
-        NestedWriter nested(7, 1, stream(), registry, context);
-        return writeArrays(arrays, nested);
+        return writeTo(stream_, registry, arrays);
     }
 };
 
 TEST_F(NestedArraysTest, DataIDsAreTheTaggedFramesBehindTheDataFrames) {
-    EXPECT_EQ(writeWith(registry(), {large(), small(1), large()}), (std::vector<DataID>{2, 3, 5}));
+    EXPECT_EQ(writeWith(registry_, {large(), small(1), large()}), (std::vector<DataID>{2, 3, 5}));
     EXPECT_EQ(indexes(frames()), (std::vector<FrameIndex>{1, 2, 3, 4, 5}));
     const auto message = received();
     const std::vector<Array> back = read(ids({2, 3, 5}), message);

@@ -12,7 +12,7 @@
 #include "IIPResultSerializer.hpp"
 #include "RuntimeExceptionConversions.hpp"
 #include "krutil_protobuf/serializers/AllocationRecorder.hpp"
-#include "krutil_protobuf/support/TestTransport.hpp"
+#include "krutil_protobuf/serializers/SerializerTest.hpp"
 
 namespace {
 
@@ -30,9 +30,6 @@ using transport::FrameContent;
 using transport::FrameIndex;
 using transport::FrameType;
 using transport::parsed;
-using transport::RecordingStream;
-using transport::Registry;
-using transport::SerializationContext;
 namespace status = krutil::cmddistributor;
 namespace wire = krutil::protobuf;
 
@@ -313,26 +310,19 @@ class UnregisteredResult : public IIPResult {
     using IIPResult::IIPResult;
 };
 
-class IIPReplyTest : public testing::Test {
+class IIPReplyTest : public transport::SerializerTest {
   protected:
-    const ReplyFamily& serializer() const { return transport::serializer<ReplyFamily>(*registry_, "krutil:IIPReply"); }
-
-    FrameIndex write(std::unique_ptr<IIPResult> result, FrameIndex first) {
-        return serializer().serialize(boost::make_shared<IIPReply>(IDType(1, 2), std::move(result)), 7, first, stream_,
-                                      registry_, SerializationContext());
+    FrameIndex write(std::unique_ptr<IIPResult> result, FrameIndex first) const {
+        return writeAs<ReplyFamily>("krutil:IIPReply", boost::make_shared<IIPReply>(IDType(1, 2), std::move(result)),
+                                    first);
     }
 
     boost::shared_ptr<const IIPReply> read(const std::unique_ptr<transport::Message>& message, FrameIndex index) const {
-        return boost::dynamic_pointer_cast<const IIPReply>(
-            serializer().deserialize(index, message, registry_, SerializationContext()));
-    }
-
-    boost::shared_ptr<const IIPReply> readWritten(FrameIndex index) const {
-        return read(transport::makeMessage(transport::contentOf(stream_->frames)), index);
+        return boost::dynamic_pointer_cast<const IIPReply>(readAs<ReplyFamily>("krutil:IIPReply", message, index));
     }
 
     // A result at 1 and, at 2, a reply that refers to `resultID`.
-    static std::vector<FrameContent> frames(FrameIndex resultID, bool withID = true) {
+    static std::vector<FrameContent> framesWith(FrameIndex resultID, bool withID = true) {
         wire::IIPReply proto;
         if (withID) {
             proto.mutable_id()->set_lo(5);
@@ -342,30 +332,27 @@ class IIPReplyTest : public testing::Test {
                  IIPResultSerializer::toProtobuf(IIPResult(IDType(3, 4), boost::none)).SerializeAsString()},
                 {true, FrameType::Object, 7, 2, "krutil:IIPReply", proto.SerializeAsString()}};
     }
-
-    std::shared_ptr<Registry> registry_ = transport::sessionRegistry();
-    std::shared_ptr<RecordingStream> stream_ = std::make_shared<RecordingStream>();
 };
 
 TEST_F(IIPReplyTest, WithoutAResultItIsOneFrameWithResultIDZero) {
     EXPECT_EQ(write(nullptr, 4), 5U);
-    ASSERT_EQ(stream_->frames.size(), 1U);
-    EXPECT_EQ(parsed<wire::IIPReply>(*stream_->frames.at(0)).resultid(), 0U);
-    const auto back = readWritten(4);
+    ASSERT_EQ(frames().size(), 1U);
+    EXPECT_EQ(parsed<wire::IIPReply>(*frames().at(0)).resultid(), 0U);
+    const auto back = read(received(), 4);
     EXPECT_EQ(back->getID(), IDType(1, 2));
     EXPECT_EQ(back->getResult(), nullptr);
 }
 
 TEST_F(IIPReplyTest, APlainResultIsWrittenFirstAndReferredToByItsIndex) {
     EXPECT_EQ(write(std::make_unique<IIPResult>(IDType(3, 4), boost::none), 4), 6U);
-    ASSERT_EQ(stream_->frames.size(), 2U);
-    const auto written = transport::contentOf(stream_->frames);
+    ASSERT_EQ(frames().size(), 2U);
+    const auto written = transport::contentOf(frames());
     EXPECT_EQ(written[0].index, 4U);
     EXPECT_EQ(written[0].tag, "krutil:IIPResult");
     EXPECT_EQ(written[1].index, 5U);
     EXPECT_EQ(written[1].tag, "krutil:IIPReply");
-    EXPECT_EQ(parsed<wire::IIPReply>(*stream_->frames.at(1)).resultid(), 4U);
-    const auto back = readWritten(5);
+    EXPECT_EQ(parsed<wire::IIPReply>(*frames().at(1)).resultid(), 4U);
+    const auto back = read(received(), 5);
     EXPECT_EQ(back->getID(), IDType(1, 2));
     ASSERT_NE(back->getResult(), nullptr);
     EXPECT_EQ(back->getResult()->id, IDType(3, 4));
@@ -373,52 +360,52 @@ TEST_F(IIPReplyTest, APlainResultIsWrittenFirstAndReferredToByItsIndex) {
 
 TEST_F(IIPReplyTest, AResultThatLandsAtIndexZeroReadsBackAsNone) {
     EXPECT_EQ(write(std::make_unique<IIPResult>(IDType(3, 4), boost::none), 0), 2U);
-    EXPECT_EQ(parsed<wire::IIPReply>(*stream_->frames.at(1)).resultid(), 0U);
-    const auto message = transport::makeMessage(transport::contentOf(stream_->frames));
+    EXPECT_EQ(parsed<wire::IIPReply>(*frames().at(1)).resultid(), 0U);
+    const auto message = received();
     EXPECT_EQ(read(message, 1)->getResult(), nullptr);
     EXPECT_NE(message->frame(0), nullptr);
 }
 
 TEST_F(IIPReplyTest, AResultWithoutASerializerIsOutOfRangeAndWritesNothing) {
     EXPECT_THROW(write(std::make_unique<UnregisteredResult>(IDType(3, 4), boost::none), 1), std::out_of_range);
-    EXPECT_TRUE(stream_->frames.empty());
+    EXPECT_TRUE(frames().empty());
 }
 
 TEST_F(IIPReplyTest, ASerializerOfAnotherFamilyIsBadCastAndWritesNothing) {
     registry_->insert(std::make_shared<transport::MisplacedSerializer<ReplyFamily>>(typeid(UnregisteredResult)));
     EXPECT_THROW(write(std::make_unique<UnregisteredResult>(IDType(3, 4), boost::none), 1), std::bad_cast);
-    EXPECT_TRUE(stream_->frames.empty());
+    EXPECT_TRUE(frames().empty());
 }
 
 TEST_F(IIPReplyTest, AStreamThatRefusesTheReplyKeepsItsResult) {
     stream_ = std::make_shared<transport::ThrowingStream>(1);
     EXPECT_EQ(errorText<std::runtime_error>([&] { write(std::make_unique<IIPResult>(IDType(3, 4), boost::none), 1); }),
               "stream is full");
-    ASSERT_EQ(stream_->frames.size(), 1U);
-    EXPECT_EQ(transport::contentOf(*stream_->frames[0]).tag, "krutil:IIPResult");
+    ASSERT_EQ(frames().size(), 1U);
+    EXPECT_EQ(transport::contentOf(*frames()[0]).tag, "krutil:IIPResult");
 }
 
 TEST_F(IIPReplyTest, AnAbsentIdentifierIsRefusedAfterTheResultWasRead) {
-    const auto message = transport::makeMessage(frames(1, false));
+    const auto message = transport::makeMessage(framesWith(1, false));
     EXPECT_EQ(errorText<std::logic_error>([&] { read(message, 2); }),
               "Required field is missing: protobuf::IIPReply.id");
     EXPECT_EQ(message->frame(1), nullptr);
 
-    auto faulty = frames(1, false);
+    auto faulty = framesWith(1, false);
     faulty[0].bytes.clear();
     EXPECT_EQ(errorText<std::logic_error>([&] { read(transport::makeMessage(faulty), 2); }),
               "Required field is missing: protobuf::IIPResult.id");
 }
 
 TEST_F(IIPReplyTest, AResultIDWhoseTagIsNotRegisteredIsOutOfRange) {
-    auto given = frames(1);
+    auto given = framesWith(1);
     given[0].tag = "krutil:NoSuchType";
     EXPECT_THROW(read(transport::makeMessage(given), 2), std::out_of_range);
 }
 
 TEST_F(IIPReplyTest, AResultIDWhoseSerializerIsOfAnotherFamilyIsBadCast) {
     for (const char* tag : {"krutil:EvalIIP", "krutil:TextBaseEvent", "krutil:IIPReply"}) {
-        auto given = frames(1);
+        auto given = framesWith(1);
         given[0].tag = tag;
         EXPECT_THROW(read(transport::makeMessage(given), 2), std::bad_cast) << tag;
     }
@@ -427,18 +414,18 @@ TEST_F(IIPReplyTest, AResultIDWhoseSerializerIsOfAnotherFamilyIsBadCast) {
 TEST_F(IIPReplyTest, AHostileResultIDIsBadCast) {
     // The reply's own frame, past the end.
     for (const FrameIndex index : {FrameIndex{2}, FrameIndex{3}, FrameIndex{1} << 32, ~FrameIndex{0}}) {
-        EXPECT_THROW(read(transport::makeMessage(frames(index)), 2), std::bad_cast) << index;
+        EXPECT_THROW(read(transport::makeMessage(framesWith(index)), 2), std::bad_cast) << index;
     }
 }
 
 TEST_F(IIPReplyTest, AResultIDOfADataFrameIsBadCast) {
-    auto given = frames(1);
+    auto given = framesWith(1);
     given[0].tagged = false;
     EXPECT_THROW(read(transport::makeMessage(given), 2), std::bad_cast);
 }
 
 TEST_F(IIPReplyTest, AResultThatWasReadAlreadyIsBadCast) {
-    auto given = frames(1);
+    auto given = framesWith(1);
     given.push_back(given[1]);
     given[2].index = 3;
     const auto message = transport::makeMessage(given);

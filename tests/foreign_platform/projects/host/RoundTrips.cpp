@@ -155,9 +155,9 @@ class RoundTrips : public testing::Test {
         return std::unique_ptr<Object>(dynamic_cast<Object*>(arrived.release()));
     }
 
-    template <class Object>
+    template <std::string (*Type)(), class Base = cmddistributor::IIPStateEvent>
     void stateEvent(const std::string& tag, const std::string& kind) {
-        const auto event = travelAsEvent(Object(IDType{-12}), tag);
+        const auto event = travelAsEvent(cmddistributor::DefaultIIPStateEvent<Type, Base>(IDType{-12}), tag);
         EXPECT_EQ(event->getRequestId(), IDType{-12});
         EXPECT_EQ(event->type(), kind);
     }
@@ -284,48 +284,40 @@ TEST_F(RoundTrips, DebugLoopEvent) {
     }
 }
 
-using cmddistributor::DefaultIIPStateEvent;
-using cmddistributor::IIPStateEvent;
 using cmddistributor::IIPStateEventTypes;
-using Completed = DefaultIIPStateEvent<&IIPStateEventTypes::getCompletedEventType, IIPStateEvent>;
 
 TEST_F(RoundTrips, IIPStartedEvent) {
-    using Started = DefaultIIPStateEvent<&IIPStateEventTypes::getStartedEventType, IIPStateEvent>;
-    stateEvent<Started>("krutil:IIPStartedEvent", "runs");
+    stateEvent<&IIPStateEventTypes::getStartedEventType>("krutil:IIPStartedEvent", "runs");
 }
 
 TEST_F(RoundTrips, IIPSuspendedEvent) {
-    using Suspended = DefaultIIPStateEvent<&IIPStateEventTypes::getSuspendedEventType, IIPStateEvent>;
-    stateEvent<Suspended>("krutil:IIPSuspendedEvent", "stands");
+    stateEvent<&IIPStateEventTypes::getSuspendedEventType>("krutil:IIPSuspendedEvent", "stands");
 }
 
 TEST_F(RoundTrips, IIPResumedEvent) {
-    using Resumed = DefaultIIPStateEvent<&IIPStateEventTypes::getResumedEventType, IIPStateEvent>;
-    stateEvent<Resumed>("krutil:IIPResumedEvent", "runs again");
+    stateEvent<&IIPStateEventTypes::getResumedEventType>("krutil:IIPResumedEvent", "runs again");
 }
 
 TEST_F(RoundTrips, IIPDiscardedEvent) {
-    using Discarded = DefaultIIPStateEvent<&IIPStateEventTypes::getDiscardedEventType, IIPStateEvent>;
-    stateEvent<Discarded>("krutil:IIPDiscardedEvent", "dropped");
+    stateEvent<&IIPStateEventTypes::getDiscardedEventType>("krutil:IIPDiscardedEvent", "dropped");
 }
 
 TEST_F(RoundTrips, IIPRequeuedEvent) {
-    using Requeued = DefaultIIPStateEvent<&IIPStateEventTypes::getRequeuedEventType, IIPStateEvent>;
-    stateEvent<Requeued>("krutil:IIPRequeuedEvent", "put back");
+    stateEvent<&IIPStateEventTypes::getRequeuedEventType>("krutil:IIPRequeuedEvent", "put back");
 }
 
 TEST_F(RoundTrips, IIPReactivatedEvent) {
-    using Reactivated = DefaultIIPStateEvent<&IIPStateEventTypes::getReactivatedEventType, IIPStateEvent>;
-    stateEvent<Reactivated>("krutil:IIPReactivatedEvent", "taken again");
+    stateEvent<&IIPStateEventTypes::getReactivatedEventType>("krutil:IIPReactivatedEvent", "taken again");
 }
 
 TEST_F(RoundTrips, IIPCompletedEvent) {
-    stateEvent<Completed>("krutil:IIPCompletedEvent", "over");
+    stateEvent<&IIPStateEventTypes::getCompletedEventType>("krutil:IIPCompletedEvent", "over");
 }
 
 TEST_F(RoundTrips, LastIIPEvent) {
-    using Last = DefaultIIPStateEvent<&IIPStateEventTypes::getLastEventType, Completed>;
-    stateEvent<Last>("krutil:detail::LastIIPEvent", "closed");
+    using Completed =
+        cmddistributor::DefaultIIPStateEvent<&IIPStateEventTypes::getCompletedEventType, cmddistributor::IIPStateEvent>;
+    stateEvent<&IIPStateEventTypes::getLastEventType, Completed>("krutil:detail::LastIIPEvent", "closed");
 }
 
 TEST_F(RoundTrips, TextBaseEvent) {
