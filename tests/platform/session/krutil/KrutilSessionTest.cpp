@@ -92,37 +92,33 @@ class KrutilSessionTest : public testing::Test {
 };
 
 TEST_F(KrutilSessionTest, RequestRunsFromItsQueueToItsReply) {
-    const Ends ends = socketPair();
     KrutilRecorder clientSaw;
     KrutilRecorder engineSaw;
-    std::unique_ptr<Session> client;
-    std::thread opening([&] { client = Session::open(ends.in, ends.out, krutilConfig(Role::Client)); });
-    const auto engine = Session::open(ends.otherIn, ends.otherOut, krutilConfig(Role::Engine));
-    opening.join();
-    EXPECT_EQ(client->features().size(), 1U);
-    EXPECT_EQ(client->features(), engine->features());
+    const OpenedPair opened = openPair(krutilConfig(Role::Client), krutilConfig(Role::Engine));
+    EXPECT_EQ(opened.client->features().size(), 1U);
+    EXPECT_EQ(opened.client->features(), opened.engine->features());
     engineSaw.serve = [&](framing::StreamID stream, const IIPEnqueueMessage& message) {
         const IDType id = message.getID();
-        engine->send(stream, boost::make_shared<const cmddistributor::IIPStartedEvent>(id));
-        engine->send(stream,
-                     boost::make_shared<const krutil::io::TextBaseEvent>(id, krutil::io::StreamTypeEnum{}, u"2\n"));
-        engine->send(stream, boost::make_shared<const cmddistributor::IIPCompletedEvent>(id));
-        engine->send(stream, boost::make_shared<const cmddistributor::LastIIPEvent>(id));
-        engine->send(stream, boost::make_shared<const krutil::cmddistributor::IIPReply>(
-                                 id, std::make_unique<cmddistributor::IIPResult>(id, boost::none)));
+        opened.engine->send(stream, boost::make_shared<const cmddistributor::IIPStartedEvent>(id));
+        opened.engine->send(
+            stream, boost::make_shared<const krutil::io::TextBaseEvent>(id, krutil::io::StreamTypeEnum{}, u"2\n"));
+        opened.engine->send(stream, boost::make_shared<const cmddistributor::IIPCompletedEvent>(id));
+        opened.engine->send(stream, boost::make_shared<const cmddistributor::LastIIPEvent>(id));
+        opened.engine->send(stream, boost::make_shared<const krutil::cmddistributor::IIPReply>(
+                                        id, std::make_unique<cmddistributor::IIPResult>(id, boost::none)));
     };
-    engine->start(engineSaw);
-    client->start(clientSaw);
-    client->send(client->newStreamID(), enqueue(u"print(1+1)"));
+    opened.engine->start(engineSaw);
+    opened.client->start(clientSaw);
+    opened.client->send(opened.client->newStreamID(), enqueue(u"print(1+1)"));
     EXPECT_THAT(clientSaw.waitForLines(5), ElementsAre("event 1 started", "event 1 2\n", "event 1 completed",
                                                        "event 1 last", "reply 1 " + toString(IDType(1, 2))));
-    client->send(0, boost::make_shared<const krutil::capabilities_api::CapabilitiesChanged>(
-                        capabilities::CapabilityList(), capabilities::CapabilityList(), capabilities::CapabilityList(),
-                        capabilities::CapabilityList()));
-    client->sayGoodbye();
+    opened.client->send(0, boost::make_shared<const krutil::capabilities_api::CapabilitiesChanged>(
+                               capabilities::CapabilityList(), capabilities::CapabilityList(),
+                               capabilities::CapabilityList(), capabilities::CapabilityList()));
+    opened.client->sayGoodbye();
     EXPECT_THAT(engineSaw.waitForLines(3), ElementsAre("enqueue 1 print(1+1)", "event 0 capabilities", "goodbye"));
-    engine->send(0, boost::make_shared<const krutil::eventmgr::QVMShutdownEvent>());
-    engine->close();
+    opened.engine->send(0, boost::make_shared<const krutil::eventmgr::QVMShutdownEvent>());
+    opened.engine->close();
     EXPECT_EQ(clientSaw.waitForEnd().reason, Reason::Finished);
     EXPECT_EQ(engineSaw.waitForEnd().reason, Reason::Finished);
 }

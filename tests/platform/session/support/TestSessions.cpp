@@ -136,6 +136,12 @@ boost::shared_ptr<const exchange::Message> question(const std::string& text, std
     return boost::make_shared<const Question>(text, std::move(bulks));
 }
 
+std::shared_ptr<Bulk> bulkOf(std::size_t size) {
+    auto made = std::make_shared<Bulk>();
+    made->bytes.assign(size, 'b');
+    return made;
+}
+
 boost::shared_ptr<const exchange::Reply> answer(const std::string& text) {
     return boost::make_shared<const Answer>(text);
 }
@@ -152,19 +158,28 @@ boost::shared_ptr<const eventmgr::BaseEvent> capabilityChange() {
     return boost::make_shared<const CapabilityNews>();
 }
 
-SessionPair::SessionPair(SessionConfig clientConfig, SessionConfig engineConfig, Ends ends) {
+OpenedPair openPair(const SessionConfig& clientConfig, const SessionConfig& engineConfig, Ends ends) {
     auto opening = std::async(std::launch::async, [&] { return Session::open(ends.in, ends.out, clientConfig); });
-    engine = Session::open(ends.otherIn, ends.otherOut, engineConfig);
-    client = opening.get();
+    auto engine = Session::open(ends.otherIn, ends.otherOut, engineConfig);
+    return {opening.get(), std::move(engine)};
+}
+
+SessionPair::SessionPair(SessionConfig clientConfig, SessionConfig engineConfig, Ends ends) {
+    OpenedPair opened = openPair(clientConfig, engineConfig, ends);
+    client = std::move(opened.client);
+    engine = std::move(opened.engine);
     engine->start(engineSaw);
     client->start(clientSaw);
 }
 
-SessionWithBytes::SessionWithBytes(SessionConfig config, Ends ends)
-    : peer(std::make_unique<wire::ByteEnd>(ends.otherIn, ends.otherOut)) {
+std::unique_ptr<Session> openWith(wire::ByteEnd& peer, const Ends& ends, const SessionConfig& config) {
     auto opening = std::async(std::launch::async, [&] { return Session::open(ends.in, ends.out, config); });
-    peer->shakeHands();
-    session = opening.get();
+    peer.shakeHands();
+    return opening.get();
+}
+
+SessionWithBytes::SessionWithBytes(SessionConfig config, Ends ends)
+    : peer(std::make_unique<wire::ByteEnd>(ends.otherIn, ends.otherOut)), session(openWith(*peer, ends, config)) {
     session->start(saw);
 }
 

@@ -71,8 +71,16 @@ Ends pipes();
 
 SessionConfig configOf(Role role);
 
+/// Matches the end of a session for this reason, with this text.
+inline auto isEnd(Reason reason, const std::string& text) {
+    return testing::AllOf(testing::Field("reason", &SessionEnd::reason, reason),
+                          testing::Field("text", &SessionEnd::text, text));
+}
+
 boost::shared_ptr<const exchange::Message> question(const std::string& text,
                                                     std::vector<std::shared_ptr<Bulk>> bulks = {});
+/// Bulk bytes of this number.
+std::shared_ptr<Bulk> bulkOf(std::size_t size);
 boost::shared_ptr<const exchange::Reply> answer(const std::string& text);
 boost::shared_ptr<const eventmgr::BaseEvent> notice(const std::string& text);
 boost::shared_ptr<const eventmgr::BaseEvent> shutdownEvent();
@@ -93,7 +101,14 @@ std::string textOf(Call call) {
     return {};
 }
 
-/// A client and an engine that have settled and, unless a test says otherwise, started.
+/// A client and an engine that have settled and not started.
+struct OpenedPair {
+    std::unique_ptr<Session> client;
+    std::unique_ptr<Session> engine;
+};
+OpenedPair openPair(const SessionConfig& clientConfig, const SessionConfig& engineConfig, Ends ends = socketPair());
+
+/// A client and an engine that have settled and started.
 class SessionPair {
   public:
     explicit SessionPair(SessionConfig clientConfig = configOf(Role::Client),
@@ -104,6 +119,9 @@ class SessionPair {
     std::unique_ptr<Session> client;
     std::unique_ptr<Session> engine;
 };
+
+/// One real end that has settled and not started; `peer`, the other one, has shaken hands with it.
+std::unique_ptr<Session> openWith(wire::ByteEnd& peer, const Ends& ends, const SessionConfig& config);
 
 /// One real end, and the other played by the test; the handshake is done and the real end started.
 class SessionWithBytes {

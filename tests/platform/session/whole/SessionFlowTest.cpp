@@ -21,12 +21,6 @@ class SessionFlowTest : public testing::Test {
     // More than any socket buffer takes.
     static constexpr std::size_t plenty = 8U << 20;
 
-    static std::shared_ptr<Bulk> bulk(std::size_t size) {
-        auto made = std::make_shared<Bulk>();
-        made->bytes.assign(size, 'b');
-        return made;
-    }
-
     // Fills the stream of an engine whose peer does not read, until output has to wait.
     static std::size_t fill(Session& engine) {
         std::size_t sent = 0;
@@ -102,7 +96,7 @@ TEST_F(SessionFlowTest, WaitsEndWhenTheSessionEnds) {
 
 TEST_F(SessionFlowTest, BuffersAreLetGoWhenTheyAreWrittenNotBefore) {
     SessionWithBytes end(configOf(Role::Client));
-    const auto bytes = bulk(plenty);
+    const auto bytes = bulkOf(plenty);
     end.session->send(1, question("q", {bytes}));
     EXPECT_FALSE(bytes->dropped);
     std::thread reader([&] { end.peer->read(plenty + 24 + 24 + 13 + 1); });
@@ -112,7 +106,7 @@ TEST_F(SessionFlowTest, BuffersAreLetGoWhenTheyAreWrittenNotBefore) {
 }
 
 TEST_F(SessionFlowTest, BuffersAreLetGoWhenTheSessionEndsUnwritten) {
-    const auto bytes = bulk(plenty);
+    const auto bytes = bulkOf(plenty);
     {
         SessionWithBytes end(configOf(Role::Client));
         end.session->send(1, question("q", {bytes}));
@@ -184,11 +178,9 @@ TEST_F(HeldBackTest, PeerThatReadsAgainIsAnsweredInFull) {
 
 TEST_F(HeldBackTest, PeerThatHangsUpIsNoticed) {
     end_.peer->close();
-    const SessionEnd ended = end_.saw.waitForEnd();
-    EXPECT_EQ(ended.reason, Reason::Lost);
-    EXPECT_EQ(ended.text,
-              "the stream ended between two messages, without the client's goodbye; writing to it had failed: Broken "
-              "pipe");
+    EXPECT_THAT(end_.saw.waitForEnd(), isEnd(Reason::Lost,
+                                             "the stream ended between two messages, without the client's goodbye; "
+                                             "writing to it had failed: Broken pipe"));
 }
 
 class HeldBackOverPipesTest : public HeldBackTest {
@@ -198,19 +190,15 @@ class HeldBackOverPipesTest : public HeldBackTest {
 
 TEST_F(HeldBackOverPipesTest, PeerThatHangsUpIsNoticed) {
     end_.peer->close();
-    const SessionEnd ended = end_.saw.waitForEnd();
-    EXPECT_EQ(ended.reason, Reason::Lost);
-    EXPECT_EQ(ended.text,
-              "the stream ended between two messages, without the client's goodbye; writing to it had failed: Broken "
-              "pipe");
+    EXPECT_THAT(end_.saw.waitForEnd(), isEnd(Reason::Lost,
+                                             "the stream ended between two messages, without the client's goodbye; "
+                                             "writing to it had failed: Broken pipe"));
 }
 
 TEST_F(HeldBackTest, PeerThatHangsUpAfterItsGoodbyeIsNoticed) {
     end_.peer->write(wire::goodbye());
     end_.peer->close();
-    const SessionEnd ended = end_.saw.waitForEnd();
-    EXPECT_EQ(ended.reason, Reason::Lost);
-    EXPECT_EQ(ended.text, "cannot write to the stream: Broken pipe");
+    EXPECT_THAT(end_.saw.waitForEnd(), isEnd(Reason::Lost, "cannot write to the stream: Broken pipe"));
 }
 
 TEST_F(HeldBackTest, SessionCanBeClosed) {
@@ -258,17 +246,15 @@ TEST_F(SessionFlowTest, AnswersThatAreReadDoNotCount) {
 TEST_F(SessionFlowTest, ClientWhoseEngineClosesWithoutAShutdownEventHasLostIt) {
     SessionWithBytes end(configOf(Role::Client));
     end.peer->close();
-    const SessionEnd ended = end.saw.waitForEnd();
-    EXPECT_EQ(ended.reason, Reason::Lost);
-    EXPECT_EQ(ended.text, "the stream ended between two messages, before the engine's shutdown event");
+    EXPECT_THAT(end.saw.waitForEnd(),
+                isEnd(Reason::Lost, "the stream ended between two messages, before the engine's shutdown event"));
 }
 
 TEST_F(SessionFlowTest, EngineWhoseClientClosesWithoutAGoodbyeHasLostIt) {
     SessionWithBytes end(configOf(Role::Engine));
     end.peer->close();
-    const SessionEnd ended = end.saw.waitForEnd();
-    EXPECT_EQ(ended.reason, Reason::Lost);
-    EXPECT_EQ(ended.text, "the stream ended between two messages, without the client's goodbye");
+    EXPECT_THAT(end.saw.waitForEnd(),
+                isEnd(Reason::Lost, "the stream ended between two messages, without the client's goodbye"));
 }
 
 TEST_F(SessionFlowTest, StreamThatEndsWithinAMessageTellsWhere) {
@@ -328,9 +314,7 @@ TEST_F(SessionFlowTest, EngineWhoseClientHasGoneAfterTheGoodbyeHasLostIt) {
     end.saw.waitForLines(1);
     end.peer->close();
     // Without a write that would fail.
-    const SessionEnd ended = end.saw.waitForEnd();
-    EXPECT_EQ(ended.reason, Reason::Lost);
-    EXPECT_EQ(ended.text, "the client has gone before the engine's shutdown event");
+    EXPECT_THAT(end.saw.waitForEnd(), isEnd(Reason::Lost, "the client has gone before the engine's shutdown event"));
 }
 
 TEST_F(SessionFlowTest, EngineWhoseClientClosesUponTheShutdownEventIsFinished) {
@@ -387,10 +371,7 @@ TEST_F(SessionFlowTest, DestructionClosesAndTellsTheHandler) {
     Recorder saw;
     wire::ByteEnd peer(ends.otherIn, ends.otherOut);
     {
-        auto opening =
-            std::async(std::launch::async, [&] { return Session::open(ends.in, ends.out, configOf(Role::Client)); });
-        peer.shakeHands();
-        const auto session = opening.get();
+        const auto session = openWith(peer, ends, configOf(Role::Client));
         session->start(saw);
     }
     EXPECT_THAT(saw.lines(), ElementsAre("end: closed"));
@@ -401,10 +382,7 @@ TEST_F(SessionFlowTest, SessionThatEndedBeforeItsStartStillTellsTheHandler) {
     const Ends ends = socketPair();
     Recorder saw;
     wire::ByteEnd peer(ends.otherIn, ends.otherOut);
-    auto opening =
-        std::async(std::launch::async, [&] { return Session::open(ends.in, ends.out, configOf(Role::Client)); });
-    peer.shakeHands();
-    const auto session = opening.get();
+    const auto session = openWith(peer, ends, configOf(Role::Client));
     session->abort("never mind");
     EXPECT_EQ(peer.readAll(), wire::abort("never mind"));
     session->start(saw);
@@ -414,10 +392,7 @@ TEST_F(SessionFlowTest, SessionThatEndedBeforeItsStartStillTellsTheHandler) {
 TEST_F(SessionFlowTest, SessionThatIsNeverStartedCanBeDestroyed) {
     const Ends ends = socketPair();
     wire::ByteEnd peer(ends.otherIn, ends.otherOut);
-    auto opening =
-        std::async(std::launch::async, [&] { return Session::open(ends.in, ends.out, configOf(Role::Client)); });
-    peer.shakeHands();
-    auto session = opening.get();
+    auto session = openWith(peer, ends, configOf(Role::Client));
     session->send(1, question("q"));
     session.reset();
     EXPECT_EQ(peer.readAll(), wire::tagged(1, 1, true, questionTag, "q"));
@@ -443,9 +418,7 @@ TEST_F(SessionFlowTest, StreamWhoseWritingFailsIsLostThoughItsInputStaysOpen) {
     const int keptOpen = ::fcntl(ends.otherOut, F_DUPFD_CLOEXEC, 0);
     end.peer->close();
     end.session->send(1, question("q"));
-    const SessionEnd ended = end.saw.waitForEnd();
-    EXPECT_EQ(ended.reason, Reason::Lost);
-    EXPECT_EQ(ended.text, "cannot write to the stream: Broken pipe");
+    EXPECT_THAT(end.saw.waitForEnd(), isEnd(Reason::Lost, "cannot write to the stream: Broken pipe"));
     ::close(keptOpen);
 }
 

@@ -52,9 +52,7 @@ TEST_P(SessionViolationTest, ClosesTheSessionAndTellsThePeer) {
         end.peer->read(wire::tagged(1, 1, true, questionTag, "q").size());
     }
     end.peer->write(GetParam().bytes);
-    const SessionEnd ended = end.saw.waitForEnd();
-    EXPECT_EQ(ended.reason, Reason::Violation);
-    EXPECT_EQ(ended.text, GetParam().text);
+    EXPECT_THAT(end.saw.waitForEnd(), isEnd(Reason::Violation, GetParam().text));
     EXPECT_EQ(end.peer->readAll(), wire::abort(GetParam().text));
 }
 
@@ -149,9 +147,9 @@ TEST_F(SessionRulesTest, FailureOfOneEndReachesTheOtherAsItsReason) {
     SessionPair pair;
     pair.client->send(1, question("fail to read"));
     EXPECT_EQ(pair.engineSaw.waitForEnd().reason, Reason::Violation);
-    const SessionEnd ended = pair.clientSaw.waitForEnd();
-    EXPECT_EQ(ended.reason, Reason::Violation);
-    EXPECT_EQ(ended.text, "the peer closed the session: cannot read \"test:question\": this cannot be read");
+    EXPECT_THAT(
+        pair.clientSaw.waitForEnd(),
+        isEnd(Reason::Violation, "the peer closed the session: cannot read \"test:question\": this cannot be read"));
 }
 
 TEST_F(SessionRulesTest, ExceptionOfTheHandlerClosesTheSession) {
@@ -267,12 +265,6 @@ class PeerLimitsTest : public SessionRulesTest {
         EXPECT_THAT(pair.engineSaw.waitForLines(1), ElementsAre("question 1 small"));
         return text;
     }
-
-    static std::shared_ptr<Bulk> bulk(std::size_t size) {
-        auto made = std::make_shared<Bulk>();
-        made->bytes.assign(size, 'b');
-        return made;
-    }
 };
 
 TEST_F(PeerLimitsTest, TaggedFrame) {
@@ -286,7 +278,7 @@ TEST_F(PeerLimitsTest, TaggedFrame) {
 TEST_F(PeerLimitsTest, Message) {
     Limits limits;
     limits.message = 1000;
-    EXPECT_EQ(refusal(limits, question("12345", {bulk(600), bulk(383)})),
+    EXPECT_EQ(refusal(limits, question("12345", {bulkOf(600), bulkOf(383)})),
               "\"test:question\" is larger than the engine accepts: its limit \"message\" is 1000 bytes, the message "
               "has 1001");
 }
@@ -294,7 +286,7 @@ TEST_F(PeerLimitsTest, Message) {
 TEST_F(PeerLimitsTest, Frames) {
     Limits limits;
     limits.frames = 2;
-    EXPECT_EQ(refusal(limits, question("q", {bulk(1), bulk(1)})),
+    EXPECT_EQ(refusal(limits, question("q", {bulkOf(1), bulkOf(1)})),
               "\"test:question\" is larger than the engine accepts: its limit \"frames\" is 2 frames, the message has "
               "3");
 }
@@ -312,7 +304,7 @@ TEST_F(PeerLimitsTest, WhatIsExactlyAtTheLimitsArrives) {
     SessionConfig engineConfig = configOf(Role::Engine);
     engineConfig.limits = {13, 100, 100, 1113, 2};
     SessionPair pair(configOf(Role::Client), engineConfig);
-    pair.client->send(1, question(std::string(100, 'x'), {bulk(1000)}));
+    pair.client->send(1, question(std::string(100, 'x'), {bulkOf(1000)}));
     EXPECT_THAT(pair.engineSaw.waitForLines(1), ElementsAre("question 1 " + std::string(100, 'x')));
 }
 

@@ -79,43 +79,34 @@ TEST_F(SessionTest, ReplyMayBeginTheNextExchangeFromInsideItsHandler) {
             }
         }
     };
-    const Ends ends = socketPair();
     Chain clientSaw;
     Recorder engineSaw;
-    std::unique_ptr<Session> client;
-    std::thread opening([&] { client = Session::open(ends.in, ends.out, configOf(Role::Client)); });
-    const auto engine = Session::open(ends.otherIn, ends.otherOut, configOf(Role::Engine));
-    opening.join();
+    const OpenedPair opened = openPair(configOf(Role::Client), configOf(Role::Engine));
     engineSaw.answerWith(
-        [&](framing::StreamID stream, const Question& asked) { engine->send(stream, answer(asked.text)); });
-    clientSaw.session = client.get();
-    engine->start(engineSaw);
-    client->start(clientSaw);
-    client->send(1, question("first"));
+        [&](framing::StreamID stream, const Question& asked) { opened.engine->send(stream, answer(asked.text)); });
+    clientSaw.session = opened.client.get();
+    opened.engine->start(engineSaw);
+    opened.client->start(clientSaw);
+    opened.client->send(1, question("first"));
     EXPECT_THAT(clientSaw.waitForLines(4),
                 ElementsAre("answer 1 first", "answer 1 next", "answer 1 next", "answer 1 next"));
-    client->close();
-    engine->close();
+    opened.client->close();
+    opened.engine->close();
 }
 
 TEST_F(SessionTest, WhatIsSentBeforeTheStartArrives) {
-    const Ends ends = socketPair();
     Recorder clientSaw;
     Recorder engineSaw;
-    std::unique_ptr<Session> client;
-    std::thread opening([&] { client = Session::open(ends.in, ends.out, configOf(Role::Client)); });
-    const auto engine = Session::open(ends.otherIn, ends.otherOut, configOf(Role::Engine));
-    opening.join();
-    const auto bulk = std::make_shared<Bulk>();
-    bulk->bytes.assign(3'000'000, 'b');
-    client->send(1, question("early", {bulk}));
-    client->start(clientSaw);
-    engine->start(engineSaw);
+    const OpenedPair opened = openPair(configOf(Role::Client), configOf(Role::Engine));
+    const auto bulk = bulkOf(3'000'000);
+    opened.client->send(1, question("early", {bulk}));
+    opened.client->start(clientSaw);
+    opened.engine->start(engineSaw);
     EXPECT_THAT(engineSaw.waitForLines(1), ElementsAre("question 1 early"));
-    EXPECT_TRUE(client->waitUntilWritten());
+    EXPECT_TRUE(opened.client->waitUntilWritten());
     EXPECT_TRUE(bulk->dropped);
-    client->close();
-    engine->close();
+    opened.client->close();
+    opened.engine->close();
 }
 
 TEST_F(SessionTest, OrderOnTheWireIsTheOrderOfTheCalls) {
@@ -187,8 +178,7 @@ TEST_F(SessionTest, FrameOnItsWayOutHasTheSendersOwnAddress) {
         }
     };
     SessionPair pair(config);
-    const auto bulk = std::make_shared<Bulk>();
-    bulk->bytes.assign(1000, 'b');
+    const auto bulk = bulkOf(1000);
     pair.client->send(1, question("q", {bulk}));
     EXPECT_EQ(traced, bulk->bytes.data());
     pair.engineSaw.waitForLines(1);
@@ -196,8 +186,7 @@ TEST_F(SessionTest, FrameOnItsWayOutHasTheSendersOwnAddress) {
 
 TEST_F(SessionTest, BytesThatMayChangeAfterTheSendArriveAsTheyWere) {
     SessionWithBytes end(configOf(Role::Client));
-    const auto bulk = std::make_shared<Bulk>();
-    bulk->bytes.assign(5'000'000, 'b');
+    const auto bulk = bulkOf(5'000'000);
     bulk->shareable = false;
     end.session->send(1, question("q", {bulk}));
     bulk->bytes.assign(bulk->bytes.size(), 'X');
