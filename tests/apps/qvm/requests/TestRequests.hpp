@@ -6,6 +6,7 @@
 
 #include "capabilities/CapabilityList.hpp"
 #include "cmddistributor/EvalIIP.hpp"
+#include "cmddistributor/FEvalIIP.hpp"
 #include "cmddistributor/IIPEnqueueMessage.hpp"
 #include "qvm/requests/Request.hpp"
 
@@ -19,15 +20,26 @@ struct RequestParts {
     krutil::io::SinkTraits out;
     krutil::io::SinkTraits err;
     bool flushSparingly = false;
+    capabilities::CapabilityList needs;
+    std::string function;  ///< a call of this function, without arguments, instead of the code
 };
 
+inline boost::shared_ptr<const cmddistributor::IIP> makeTask(const RequestParts& parts) {
+    using cmddistributor::FEvalIIP;
+    if (parts.function.empty()) {
+        return boost::make_shared<const cmddistributor::EvalIIP>("python", parts.streams, nullptr, parts.out, parts.err,
+                                                                 parts.code, cmddistributor::CodeType::CodeBlockType);
+    }
+    return boost::make_shared<const FEvalIIP>(
+        "python", parts.function, 0UL, FEvalIIP::Data::makeClientSideData(krutil::cmddistributor::EDIDataWrapper()),
+        parts.streams, parts.out, parts.err, 1U, 1U, true);
+}
+
 inline qvm::Request makeRequest(const RequestParts& parts = {}) {
-    const auto iip = boost::make_shared<const cmddistributor::EvalIIP>(
-        "python", parts.streams, nullptr, parts.out, parts.err, parts.code, cmddistributor::CodeType::CodeBlockType);
     return qvm::arrivedRequest(static_cast<qvm::framing::StreamID>(parts.number),
                                boost::make_shared<const cmddistributor::IIPEnqueueMessage>(
-                                   iip, foundation::msg_svc::exchange::IDType(0, parts.number), 0, boost::none, nullptr,
-                                   parts.mode, u"", capabilities::CapabilityList(), nullptr, parts.flushSparingly));
+                                   makeTask(parts), foundation::msg_svc::exchange::IDType(0, parts.number), 0,
+                                   boost::none, nullptr, parts.mode, u"", parts.needs, nullptr, parts.flushSparingly));
 }
 
 }  // namespace qvm_test
