@@ -7,6 +7,7 @@ import unittest
 import documents
 import headers
 import includes
+import texts
 import wording
 
 
@@ -208,6 +209,51 @@ class DocumentsTest(Planted):
         self.write("README.md", "```sh\nkrutil nothing 1\n```\n")
         self.assertEqual(documents.check(self.root, "/bin/false"), ["README.md: krutil has no subcommand nothing"])
         self.assertEqual(documents.check(self.root, "/bin/true"), [])
+
+
+class TextsTest(Planted):
+    WIRE = "# Wire\n\n| text | the cause |\n|---|---|\n| frame N: expected a tag, got X bytes | too long |\n"
+    SAYS = 'refuse("frame " + name(1), std::string("a tag"), to_string(x) + " bytes");\n'
+    FAILURES = '| failure | side | reaction |\n|---|---|---|\n| no id | read | `std::logic_error` "No id in it." |\n'
+    THROWS = 'require(has, "No id "\n        "in it.");  // "Not said."\nfatal("A", "void a(int b)");\n'
+    TESTS = 'EXPECT_EQ(a, "frame 1: expected a tag, "\n     "got 12 bytes");\nEXPECT_EQ(b, R"(No id in it.)");\n'
+
+    def setUp(self):
+        super().setUp()
+        self.write("docs/session-wire.md", self.WIRE)
+        self.write("docs/protocol.md", self.FAILURES)
+        self.write(texts.SESSION + "Reader.cpp", self.SAYS)
+        self.write(texts.CONVERSIONS + "A.cpp", self.THROWS)
+        self.write("tests/platform/ReaderTest.cpp", self.TESTS)
+
+    def expect(self, path, text, finding):
+        self.assertEqual(texts.check(self.root), [])
+        self.write(path, text)
+        self.assertEqual(texts.check(self.root), [finding])
+
+    def test_listed_violation_that_no_test_expects(self):
+        self.expect("docs/session-wire.md", self.WIRE + "| frame N: expected a word | |\n",
+                    'docs/session-wire.md: no test expects "frame N: expected a word"')
+
+    def test_violation_that_is_not_listed(self):
+        self.expect(texts.SESSION + "Other.cpp", 'throw ProtocolViolation(what(a) + "got no tag");\n',
+                    f'{texts.SESSION}Other.cpp: docs/session-wire.md and docs/protocol.md do not list "got no tag"')
+
+    def test_violation_of_a_function_that_says_them(self):
+        self.expect(texts.SESSION + "Other.cpp", 'std::string refusalToReceive(int a) {\n    return "no frame";\n}\n',
+                    f'{texts.SESSION}Other.cpp: docs/session-wire.md and docs/protocol.md do not list "no frame"')
+
+    def test_other_texts_of_the_session_are_not_looked_at(self):
+        self.write(texts.SESSION + "Other.cpp", 'throw std::logic_error("no such session");\n')
+        self.assertEqual(texts.check(self.root), [])
+
+    def test_listed_failure_that_no_test_expects(self):
+        self.expect("docs/protocol.md", self.FAILURES + '| no name | read | `std::logic_error` "No name." |\n',
+                    'docs/protocol.md: no test expects "No name."')
+
+    def test_failure_that_is_not_listed(self):
+        self.expect(texts.CONVERSIONS + "B.hpp", 'throw std::logic_error("No name in it.");\n',
+                    f'{texts.CONVERSIONS}B.hpp: docs/protocol.md does not have "No name in it."')
 
 
 if __name__ == "__main__":

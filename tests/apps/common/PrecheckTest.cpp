@@ -83,6 +83,11 @@ TEST(PrecheckTest, StatusesOutsideTheirRangeAreRefusedAtAnyDepth) {
     }
 }
 
+TEST(PrecheckTest, SentenceNamesTheFrameAndTheNumber) {
+    EXPECT_EQ(verdict("krutil:IIPResult", result(0, 6)),
+              "frame \"krutil:IIPResult\": expected a status from 0 to 5, got 6");
+}
+
 TEST(PrecheckTest, WhatLiesBelowTheParsersDepthIsNotSeenByTheSerializersEither) {
     for (const auto& [tag, make] : errorMessages) {
         EXPECT_EQ(verdict(tag, make(150, 99)), "") << tag;

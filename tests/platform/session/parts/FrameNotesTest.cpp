@@ -62,6 +62,17 @@ TEST_F(FrameNotesTest, FrameThatWasAskedForLastIsTheOneThatIsNamed) {
     EXPECT_EQ(explain(std::bad_cast()), "frame 3: expected a frame, got none: the message has 2");
 }
 
+TEST_F(FrameNotesTest, RootThatItsSerializerLeavesAloneIsNamed) {
+    Frames frames;
+    frames.push_back(tagged("test:root", 1));
+    notes_.take(frames);
+    frames.insert(frames.begin(), nullptr);
+    const message::Message message(std::move(frames));
+    message.frame(1);
+    EXPECT_EQ(explain(std::bad_cast()),
+              "frame 1: expected an object that can be the root, got one with tag \"test:root\"");
+}
+
 TEST_F(FrameNotesTest, OtherThreadsReadTheirOwnMessages) {
     std::thread([] {
         Frames frames(4);

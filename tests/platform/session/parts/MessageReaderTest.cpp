@@ -441,6 +441,16 @@ TEST(MessageReaderTest, FramesOfAMessageAreCounted) {
                     "number of frames of a message exceeds the limit \"frames\": expected at most 3 frames, got 4"));
 }
 
+TEST(MessageReaderTest, ContentThatNoMemoryHoldsIsRefused) {
+    Limits limits;
+    limits.message = huge;
+    EXPECT_THAT(
+        [&] {
+            read(wire::header({2, false, 4, 0, 1, 1, 1ULL << 62}), limits);
+        },
+        ThrowsMessage<ProtocolViolation>("there is no memory for the content of frame 1, 4611686018427387904 bytes"));
+}
+
 TEST(MessageReaderTest, FrameIndexesRiseByOne) {
     for (const std::uint64_t index : {std::uint64_t{0}, std::uint64_t{1}, std::uint64_t{3}, huge}) {
         EXPECT_THAT([&] { read(wire::data(1, 1, false, "") + wire::data(1, index, true, "")); },

@@ -30,7 +30,7 @@ struct Bulk {
 };
 
 /// Travels as one data frame for each bulk and a tagged frame with the text. "fail to write" and "fail to read" make
-/// the serializer throw, after it has appended the data frames or taken them out.
+/// the serializer throw, after it has appended the data frames or taken them out; "make nothing" makes it return null.
 class Question : public exchange::Message {
   public:
     explicit Question(std::string questionText, std::vector<std::shared_ptr<Bulk>> bulks = {})

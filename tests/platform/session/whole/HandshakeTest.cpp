@@ -424,6 +424,12 @@ TEST_F(HandshakeTest, VerdictThatIsTooLongIsAViolation) {
         "length of the peer's verdict: expected at most 65536 bytes, got 70000");
 }
 
+TEST_F(HandshakeTest, VerdictThatDoesNotParseIsAViolation) {
+    EXPECT_EQ(openAgainst<ProtocolViolation>(wire::helloBytes(wire::hello(SessionHello::ENGINE)) + wire::little(2, 4) +
+                                             "\x12\xFF"),
+              "the peer's verdict: its 2 bytes are not a message of its type");
+}
+
 // Lost streams and time limits.
 
 TEST_F(HandshakeTest, StreamThatEndsTellsHowFarItCame) {

@@ -96,6 +96,8 @@ INSTANTIATE_TEST_SUITE_P(
                   "cannot read \"test:question\": this cannot be read"},
         Violation{"serializer that throws what is no exception", Role::Engine, root(1, questionTag, "fail oddly"),
                   "cannot read \"test:question\": exception of an unknown type"},
+        Violation{"serializer that makes no object", Role::Engine, root(1, questionTag, "make nothing"),
+                  "cannot read \"test:question\": its serializer returned no object"},
         Violation{"header that is refused", Role::Engine, wire::header({1, true, 29, 1, 1, 7, 0}),
                   "frame index: expected 1, got 7"}),
     nameOf);
@@ -158,6 +160,13 @@ TEST_F(SessionRulesTest, ExceptionOfTheHandlerClosesTheSession) {
     pair.client->send(1, question("q"));
     EXPECT_EQ(pair.engineSaw.waitForEnd().text, "not today");
     EXPECT_EQ(pair.clientSaw.waitForEnd().text, "the peer closed the session: not today");
+}
+
+TEST_F(SessionRulesTest, HandlerThatThrowsWhatIsNoExceptionClosesTheSession) {
+    SessionPair pair;
+    pair.engineSaw.answerWith([](framing::StreamID, const Question&) { throw 42; });
+    pair.client->send(1, question("q"));
+    EXPECT_EQ(pair.engineSaw.waitForEnd().text, "the program's handler failed with an exception of an unknown type");
 }
 
 TEST_F(SessionRulesTest, AbortTellsThePeerAndNothingIsDeliveredAfterIt) {
