@@ -3,6 +3,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
 #include <functional>
 #include <numeric>
@@ -33,8 +34,12 @@ Array received(ElementType type, const std::vector<std::uint64_t>& dimensions,
                MemoryOrder order = MemoryOrder::RowMajor) {
     const std::uint64_t bytes = foundation::korveldata::checkedSizeInBytes(type, dimensions);
     std::unique_ptr<char[], void (*)(char*)> buffer(BufferAllocator::allocate(bytes), &BufferAllocator::release);
-    for (std::uint64_t i = 0; i < bytes; ++i) {
-        buffer[i] = static_cast<char>(type == ElementType::Bool ? i % 2 : i % 120);
+    const std::uint64_t period = std::min<std::uint64_t>(bytes, 120);
+    for (std::uint64_t i = 0; i < period; ++i) {
+        buffer[i] = static_cast<char>(type == ElementType::Bool ? i % 2 : i);
+    }
+    for (std::uint64_t filled = period; filled < bytes; filled *= 2) {
+        std::memcpy(&buffer[filled], buffer.get(), std::min(filled, bytes - filled));
     }
     return ArrayFactory().fromBuffer(type, dimensions, order, std::move(buffer));
 }
