@@ -110,8 +110,7 @@ def resolve(root, including, bracket, name):
         directories.insert(0, os.path.dirname(including))
     for directory in directories:
         path = os.path.normpath(os.path.join(directory, name))
-        # A template of the build is as good as the file that the build makes of it.
-        if any(os.path.isfile(os.path.join(root, path + suffix)) for suffix in ("", ".in")):
+        if os.path.isfile(os.path.join(root, path)):
             return room(path), path
     return None if bracket == "<" else ("nowhere", name)
 

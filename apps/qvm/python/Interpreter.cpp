@@ -3,6 +3,7 @@
 #include <pybind11/embed.h>
 
 #include <frameobject.h>
+#include <marshal.h>
 
 #include <unistd.h>
 
@@ -16,7 +17,7 @@
 #include "qvm/process/ForkedChild.hpp"
 #include "qvm/python/FunctionCall.hpp"
 #include "qvm/python/PythonText.hpp"
-#include "qvm/python/QvmModuleSource.hpp"
+#include "qvm/python/QvmModuleCode.hpp"
 #include "qvm/python/ReleaseQueue.hpp"
 
 namespace py = pybind11;
@@ -213,7 +214,8 @@ Interpreter::Interpreter(const MessageBounds& bounds)
     try {
         state_ = std::make_unique<State>();
         state_->globals = py::module_::import("__main__").attr("__dict__");
-        const auto code = py::reinterpret_steal<py::object>(Py_CompileString(moduleSource, engineFile, Py_file_input));
+        const auto code = py::reinterpret_steal<py::object>(
+            PyMarshal_ReadObjectFromString(moduleCode().data(), static_cast<Py_ssize_t>(moduleCode().size())));
         if (!code) {
             throw py::error_already_set();
         }

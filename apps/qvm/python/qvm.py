@@ -1,6 +1,9 @@
 """What the engine offers to the code that it runs.
 
 Names without an underscore are for that code; the others are the engine's own.
+
+Only modules that are quick to import are imported here, since every session waits for that. The others are imported
+where they are first needed.
 """
 
 import atexit as _atexit
@@ -8,21 +11,17 @@ import builtins as _builtins
 import codecs as _codecs
 import gc as _gc
 import io as _io
-import linecache as _linecache
-import numbers as _numbers
-import pprint as _pprint
-import signal as _signal
 import sys as _sys
 import time as _time
-import traceback as _traceback
 import warnings as _warnings
-from errno import EINVAL as _EINVAL
-from functools import wraps as _wraps
-from os import strerror as _strerror
+import _signal
 import _warnings as _c_warnings
-from _thread import _local as _Local
-from operator import index as _index
+from errno import EINVAL as _EINVAL
+from os import strerror as _strerror
 from _ast import Expr as _Expr, Expression as _Expression, PyCF_ONLY_AST as _PyCF_ONLY_AST
+from _frozen_importlib_external import PathFinder as _PathFinder
+from _operator import index as _index
+from _thread import _local as _Local
 
 import _qvm
 
@@ -106,7 +105,11 @@ def _show(value):
         return
     # As Python's own hook does, so that a __repr__ that uses it finds no half-made value.
     _builtins._ = None
-    text = _pprint.pformat(value) if _qvm.formats_values() else repr(value)
+    if _qvm.formats_values():
+        import pprint
+        text = pprint.pformat(value)
+    else:
+        text = repr(value)
     _qvm.show(text + "\n")
     _builtins._ = value
 
@@ -175,8 +178,9 @@ def _breakpoint(*arguments, **options):
     if not _qvm.can_debug():
         _warn("breakpoint() goes on: the client or the engine has no debugger here", RuntimeWarning, 2)
         return
+    import linecache
     code = frame.f_code
-    line = _linecache.getline(code.co_filename, frame.f_lineno).strip()
+    line = linecache.getline(code.co_filename, frame.f_lineno).strip()
     _qvm.show(f"Stopped in {code.co_name} ({code.co_filename}:{frame.f_lineno})\n" + (f"    {line}\n" if line else ""))
     if not _take_commands(_qvm.debug_prompt, frame):
         _warn("breakpoint() goes on: the client has no debugger any more", RuntimeWarning, 2)
@@ -251,9 +255,10 @@ def warning(identifier, format, *arguments):
 
 
 def _plain(value):
-    if isinstance(value, _numbers.Integral):
+    import numbers
+    if isinstance(value, numbers.Integral):
         return int(value)
-    if isinstance(value, _numbers.Real):
+    if isinstance(value, numbers.Real):
         return float(value)
     return str(value)
 
@@ -341,13 +346,15 @@ def _safe_string(value, what, func=str):
         return f"<{what} {func.__name__}() failed>"
 
 
-def _print_error(type, error, traceback):
+def _print_error(type, error, trace):
     """sys.excepthook: Python's own drops interrupts."""
-    _traceback.print_exception(type, error, traceback)
+    import traceback
+    traceback.print_exception(type, error, trace)
 
 
 def _hide_engine(report):
     """Takes the engine's frames out of a traceback.TracebackException and all that it refers to."""
+    import traceback
     seen, waiting = set(), [report]
     while waiting:
         each = waiting.pop()
@@ -355,15 +362,16 @@ def _hide_engine(report):
             continue
         seen.add(id(each))
         frames = [frame for frame in each.stack or () if frame.filename != "<qvm>"]
-        each.stack = _traceback.StackSummary.from_list(frames) if frames else None
+        each.stack = traceback.StackSummary.from_list(frames) if frames else None
         waiting += [each.__cause__, each.__context__, *(each.exceptions or ())]
 
 
 def _format_error(error, limit):
     """The text that Python prints for an uncaught error, cut after about limit characters."""
+    import traceback
     # As many frames as Python's own printing shows.
     frames = getattr(_sys, "tracebacklimit", -1000)
-    report = _traceback.TracebackException(type(error), error, error.__traceback__, limit=frames, compact=True)
+    report = traceback.TracebackException(type(error), error, error.__traceback__, limit=frames, compact=True)
     _hide_engine(report)
     pieces, length = [], 0
     for piece in report.format():
@@ -376,40 +384,36 @@ def _format_error(error, limit):
 
 
 # The signal that carries cancels is to code what SIGKILL is: it can be neither handled nor blocked.
-_set_handler = _signal.signal
-_set_mask = _signal.pthread_sigmask
-
-
-@_wraps(_set_handler)
-def _signal_signal(signalnum, handler):
+def _set_user_handler(signalnum, handler):
     if signalnum == _qvm.interrupt_signal:
         raise OSError(_EINVAL, _strerror(_EINVAL))
     return _set_handler(signalnum, handler)
 
 
-@_wraps(_set_mask)
-def _signal_pthread_sigmask(how, mask):
+def _set_user_mask(how, mask):
     return _set_mask(how, [each for each in mask if each != _qvm.interrupt_signal])
 
 
 # Sources of evaluated code, for tracebacks and inspection: the newest, by number and by length.
 _MAX_SOURCES = 1000
 _MAX_SOURCE_LENGTH = 16 << 20
-_sources = {}
+_source_lengths = {}
 _source_length = 0
+# What linecache.cache is, once that module is imported.
+_source_lines = {}
 
 
 def _remember(filename, source):
     global _source_length
-    _sources[filename] = len(source)
+    _source_lengths[filename] = len(source)
     _source_length += len(source)
-    while len(_sources) > _MAX_SOURCES or _source_length > _MAX_SOURCE_LENGTH:
-        oldest = next(iter(_sources))
-        _source_length -= _sources.pop(oldest)
-        _linecache.cache.pop(oldest, None)
-    if filename in _sources:
+    while len(_source_lengths) > _MAX_SOURCES or _source_length > _MAX_SOURCE_LENGTH:
+        oldest = next(iter(_source_lengths))
+        _source_length -= _source_lengths.pop(oldest)
+        _source_lines.pop(oldest, None)
+    if filename in _source_lengths:
         # Without a modification time an entry is never looked up in the file system.
-        _linecache.cache[filename] = (len(source), None, source.splitlines(True), filename)
+        _source_lines[filename] = (len(source), None, source.splitlines(True), filename)
 
 
 def _compile_block(source, filename):
@@ -467,11 +471,57 @@ _sys.stdin = _sys.__stdin__ = _InputStream()
 _sys.breakpointhook = _sys.__breakpointhook__ = _breakpoint
 _sys.excepthook = _sys.__excepthook__ = _print_error
 _sys.unraisablehook = _qvm.on_unraisable
+
+
+def _replace(module, name, function):
+    """Puts a function into the place of a module's own, which is returned."""
+    original = getattr(module, name)
+    function.__name__ = function.__qualname__ = name
+    function.__module__ = module.__name__
+    function.__doc__ = original.__doc__
+    setattr(module, name, function)
+    return original
+
+
+# The module signal calls these, whenever it is imported.
+_set_handler = _replace(_signal, "signal", _set_user_handler)
+_set_mask = _replace(_signal, "pthread_sigmask", _set_user_mask)
 _set_handler(_qvm.interrupt_signal, _qvm.on_interrupt_signal)
-_signal.signal, _signal.pthread_sigmask = _signal_signal, _signal_pthread_sigmask
-_traceback._safe_string = _safe_string
 _warnings._showwarnmsg = _on_shown
-for _name, _function in (("warn", _warn), ("warn_explicit", _warn_explicit)):
-    _function.__name__ = _function.__qualname__ = _name
-    _function.__module__ = "warnings"
-    setattr(_warnings, _name, _function)
+_replace(_warnings, "warn", _warn)
+_replace(_warnings, "warn_explicit", _warn_explicit)
+
+
+def _adapt_linecache(linecache):
+    _source_lines.update(linecache.cache)
+    linecache.cache = _source_lines
+
+
+def _adapt_traceback(traceback):
+    traceback._safe_string = _safe_string
+
+
+class _AdaptingFinder:
+    """Finds modules that are changed as soon as they are imported."""
+
+    changes = {"linecache": _adapt_linecache, "traceback": _adapt_traceback}
+
+    @classmethod
+    def find_spec(cls, name, path=None, target=None):
+        change = cls.changes.get(name)
+        spec = _PathFinder.find_spec(name, path, target) if change else None
+        if spec is not None and spec.loader is not None:
+            execute = spec.loader.exec_module
+
+            def execute_and_change(module):
+                execute(module)
+                change(module)
+
+            spec.loader.exec_module = execute_and_change
+        return spec
+
+
+_sys.meta_path.insert(0, _AdaptingFinder)
+for _name, _change in _AdaptingFinder.changes.items():
+    if _name in _sys.modules:
+        _change(_sys.modules[_name])
