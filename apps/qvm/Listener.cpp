@@ -21,6 +21,7 @@
 
 #include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "qvm/process/StandardDescriptors.hpp"
+#include "qvm/python/PythonStart.hpp"
 
 namespace qvm {
 namespace {
@@ -119,14 +120,16 @@ sigset_t watchedSignals() {
 }  // namespace
 
 Listener::Listener(const Options& options, Log& log) : options_(options), log_(log), socket_(newSocket()) {
+    // Before Python takes SIGINT: one that comes now is for this process, not for the code of a session.
+    const sigset_t watched = watchedSignals();
+    ::sigprocmask(SIG_BLOCK, &watched, nullptr);
     try {
+        preparePython();
         bindSocket();
     } catch (...) {
         ::close(socket_);
         throw;
     }
-    const sigset_t watched = watchedSignals();
-    ::sigprocmask(SIG_BLOCK, &watched, nullptr);
     signals_ = ::signalfd(-1, &watched, SFD_CLOEXEC | SFD_NONBLOCK);
 }
 
@@ -230,7 +233,7 @@ void Listener::accept() {
         ::close(connection);
         return;
     }
-    const pid_t child = ::fork();
+    const pid_t child = forkPrepared();
     if (child < 0) {
         log_.say("refused a client: no process for its session: " + std::generic_category().message(errno));
     } else if (child > 0) {

@@ -17,8 +17,9 @@ namespace qvm {
 class Listener {
   public:
     /// Creates the socket (mode 0600) at options.listen. Its directory is created, or must belong to this user and be
-    /// closed to others; a socket that nobody answers on is replaced. `options` and `log` must outlive the object.
-    /// Throws std::runtime_error with a sentence that says what is in the way.
+    /// closed to others; a socket that nobody answers on is replaced. Python is started before, for all sessions.
+    /// `options` and `log` must outlive the object. Throws std::runtime_error with a sentence that says what is in the
+    /// way.
     Listener(const Options& options, Log& log);
 
     /// Closes the socket and removes its file, in the process that made them.

@@ -29,6 +29,12 @@ TextOutput* output = nullptr;
 Announcer* announcer = nullptr;
 EngineServices* services = nullptr;
 
+// Whether there is no session for code to use: in a process that is forked by running code, and in one that will be
+// forked for sessions.
+bool isApart() noexcept {
+    return services == nullptr || inForkedChild();
+}
+
 // Code points that are taken out of one long text at a time, with a look at the session's room after each.
 constexpr std::size_t piecePoints = 16'384;
 
@@ -51,7 +57,7 @@ void waitForRoom() {
     }
 }
 
-// A forked child writes to the plain descriptors, in whole lines where it can, since its siblings write there too. The
+// Code that is apart writes to the plain descriptors, in whole lines where it can, since others write there too. The
 // interpreter lock guards the text.
 class PlainStream {
   public:
@@ -88,7 +94,7 @@ std::size_t write(TextSource source, const py::object& text) {
         throw py::type_error(std::string("write() argument must be str, not ") + Py_TYPE(text.ptr())->tp_name);
     }
     const auto length = static_cast<std::size_t>(PyUnicode_GET_LENGTH(text.ptr()));
-    if (inForkedChild()) {
+    if (isApart()) {
         plainStream(source).write(text.ptr());
         return length;
     }
@@ -104,7 +110,7 @@ std::size_t write(TextSource source, const py::object& text) {
 }
 
 void flush() {
-    if (inForkedChild()) {
+    if (isApart()) {
         plainStream(TextSource::Output).flush();
         plainStream(TextSource::Error).flush();
     } else if (output->flush()) {
@@ -114,7 +120,7 @@ void flush() {
 
 // Python's handler of the signal that interrupts.
 void onInterruptSignal(const py::object&, const py::object&) {
-    if (!inForkedChild() && services->takeInterrupt()) {
+    if (!isApart() && services->takeInterrupt()) {
         raise(PyExc_KeyboardInterrupt);
     }
 }
@@ -123,7 +129,7 @@ void onInterruptSignal(const py::object&, const py::object&) {
 // it. No Python code runs between its repetition and the return, or that would take it.
 void onUnraisable(const py::object& unraisable) {
     const py::object type = unraisable.attr("exc_type");
-    if (!inForkedChild() && type.ptr() == PyExc_KeyboardInterrupt && services->repeatInterrupt()) {
+    if (!isApart() && type.ptr() == PyExc_KeyboardInterrupt && services->repeatInterrupt()) {
         return;
     }
     if (PyObject* const print = PySys_GetObject("__unraisablehook__")) {
@@ -132,7 +138,7 @@ void onUnraisable(const py::object& unraisable) {
 }
 
 bool canUse(Capability capability) {
-    return !inForkedChild() && services->canUse(capability);
+    return !isApart() && services->canUse(capability);
 }
 
 const char* nameOf(PromptEnd end) {
@@ -210,7 +216,7 @@ py::object readLine() {
 }
 
 void leavePrompt(bool quit) {
-    if (inForkedChild() || !services->leavePrompt(quit ? PromptEnd::Quit : PromptEnd::Continued)) {
+    if (isApart() || !services->leavePrompt(quit ? PromptEnd::Quit : PromptEnd::Continued)) {
         raise(PyExc_RuntimeError, "no debug, keyboard or pause prompt is open");
     }
 }
@@ -222,7 +228,7 @@ void issueWarning(const py::str& identifier, const py::str& format, const py::li
 }
 
 void setDebugging(bool on) {
-    if (!inForkedChild()) {
+    if (!isApart()) {
         services->setDebugging(on);
         waitForRoom();
     }
@@ -235,10 +241,9 @@ PYBIND11_EMBEDDED_MODULE(_qvm, module) {
     module.def("write_error", [](const py::object& text) { return write(TextSource::Error, text); });
     module.def("show", [](const py::object& text) { write(TextSource::ShownOutput, text); });
     module.def("flush", &flush);
-    module.def("formats_values",
-               [] { return !inForkedChild() && output->outputTraits().getNeedsFormattingForDisplay(); });
-    module.def("makes_links", [] { return !inForkedChild() && output->outputTraits().getSupportsHotlinks(); });
-    module.def("in_forked_child", &inForkedChild);
+    module.def("formats_values", [] { return !isApart() && output->outputTraits().getNeedsFormattingForDisplay(); });
+    module.def("makes_links", [] { return !isApart() && output->outputTraits().getSupportsHotlinks(); });
+    module.def("is_apart", &isApart);
     module.attr("interrupt_signal") = Cancellation::signal();
     module.def("on_interrupt_signal", &onInterruptSignal);
     module.def("on_unraisable", &onUnraisable);

@@ -3,21 +3,19 @@
 #include <pybind11/embed.h>
 
 #include <frameobject.h>
-#include <marshal.h>
 
 #include <unistd.h>
 
 #include <atomic>
 #include <new>
-#include <stdexcept>
 #include <string>
 #include <utility>
 
 #include "msg_svc/protobuf/ustring.hpp"
 #include "qvm/process/ForkedChild.hpp"
 #include "qvm/python/FunctionCall.hpp"
+#include "qvm/python/PythonStart.hpp"
 #include "qvm/python/PythonText.hpp"
-#include "qvm/python/QvmModuleCode.hpp"
 #include "qvm/python/ReleaseQueue.hpp"
 
 namespace py = pybind11;
@@ -36,35 +34,6 @@ using krutil::cmddistributor::inEXECUTION_CTRLC;
 using krutil::cmddistributor::inEXECUTION_DBQUIT;
 using krutil::cmddistributor::inExecutionStatus;
 using krutil::cmddistributor::inRUNTIME_ERROR;
-
-void check(const PyStatus& status) {
-    if (PyStatus_Exception(status) != 0) {
-        throw std::runtime_error(std::string("Python cannot be started: ") +
-                                 (status.err_msg != nullptr ? status.err_msg : "unknown reason"));
-    }
-}
-
-void startPython() {
-    // Independent of the environment of whoever started the engine, and UTF-8 whatever the locale.
-    PyPreConfig preConfig;
-    PyPreConfig_InitIsolatedConfig(&preConfig);
-    preConfig.utf8_mode = 1;
-#if defined(KRUTIL_SANITIZED)
-    preConfig.allocator = PYMEM_ALLOCATOR_MALLOC;
-#endif
-    check(Py_PreInitialize(&preConfig));
-
-    PyConfig config;
-    PyConfig_InitIsolatedConfig(&config);
-    config.user_site_directory = 1;
-    config.install_signal_handlers = 1;
-    PyStatus status = PyConfig_SetBytesString(&config, &config.program_name, QVM_PYTHON_EXECUTABLE);
-    if (PyStatus_Exception(status) == 0) {
-        status = Py_InitializeFromConfig(&config);
-    }
-    PyConfig_Clear(&config);
-    check(status);
-}
 
 // The exception that is set, as an instance with its traceback; none is set afterwards.
 py::object takeException() {
@@ -211,25 +180,13 @@ RecordBounds recordBounds(const MessageBounds& bounds) {
 Interpreter::Interpreter(const MessageBounds& bounds)
     : bounds_(recordBounds(bounds)), printedCharacters_(bounds.printedCharacters) {
     startPython();
-    try {
-        state_ = std::make_unique<State>();
-        state_->globals = py::module_::import("__main__").attr("__dict__");
-        const auto code = py::reinterpret_steal<py::object>(
-            PyMarshal_ReadObjectFromString(moduleCode().data(), static_cast<Py_ssize_t>(moduleCode().size())));
-        if (!code) {
-            throw py::error_already_set();
-        }
-        const auto module = py::reinterpret_steal<py::object>(PyImport_ExecCodeModule("qvm", code.ptr()));
-        if (!module) {
-            throw py::error_already_set();
-        }
-        state_->compile = module.attr("_compile");
-        state_->finish = module.attr("_finish");
-        state_->formatError = module.attr("_format_error");
-        state_->debuggerQuit = module.attr("DebuggerQuit");
-    } catch (const py::error_already_set& error) {
-        throw std::runtime_error(std::string("The engine's Python code cannot be loaded: ") + error.what());
-    }
+    state_ = std::make_unique<State>();
+    state_->globals = py::module_::import("__main__").attr("__dict__");
+    const auto module = py::module_::import("qvm");
+    state_->compile = module.attr("_compile");
+    state_->finish = module.attr("_finish");
+    state_->formatError = module.attr("_format_error");
+    state_->debuggerQuit = module.attr("DebuggerQuit");
 }
 
 Interpreter::~Interpreter() {
@@ -237,6 +194,8 @@ Interpreter::~Interpreter() {
     bool alone = false;
     try {
         alone = py::module_::import("threading").attr("active_count")().cast<int>() == 1;
+        // What was prepared is to be freed as well.
+        py::module_::import("gc").attr("unfreeze")();
     } catch (const py::error_already_set&) {
         alone = false;
     }

@@ -37,7 +37,7 @@ class Interpreter {
     /// What becomes of the memory of a call's outputs.
     enum class Outputs { Shared, Copied };
 
-    /// Starts Python. The module _qvm must have been installed. Throws std::runtime_error with Python's reason.
+    /// Starts Python, where it has not been prepared. Throws std::runtime_error with Python's reason.
     explicit Interpreter(const MessageBounds& bounds);
 
     /// Leaves Python as it is, because threads of running code may still be in it: the process is about to end. Builds

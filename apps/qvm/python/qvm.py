@@ -247,7 +247,7 @@ def warning(identifier, format, *arguments):
     """Issues a warning to the client, with the text format % arguments. Without arguments the format is the text."""
     identifier, format = str(identifier), str(format)
     message = format % arguments if arguments else format
-    if _qvm.in_forked_child():
+    if _qvm.is_apart():
         _sys.stderr.write(f"{identifier}: {message}\n")
     else:
         _qvm.issue_warning(identifier, format, [_plain(each) for each in arguments], message,
@@ -286,12 +286,12 @@ def _on_shown(message):
     """warnings._showwarnmsg: what a filter lets through comes here."""
     taken = (_warnings.showwarning is not _warnings._showwarning_orig
              or _warnings._showwarnmsg_impl is not _print_warning)
-    if taken or _qvm.in_forked_child():
+    if taken or _qvm.is_apart():
         _show_warning(message)
     lets_through = getattr(_issuing, "shown", None)
     if lets_through is not None:
         lets_through.append(not taken)
-    elif not _qvm.in_forked_child():
+    elif not _qvm.is_apart():
         # C code has raised it. Its place is that of a frame, or of code that is being compiled.
         frame = _sys._getframe(1)
         while frame is not None and (frame.f_code.co_filename != message.filename or frame.f_lineno != message.lineno):
@@ -318,7 +318,7 @@ def _warn(message, category=None, stacklevel=1, source=None):
     level = max(_index(stacklevel), 1)
     # Three frames of this module lie between the caller and Python's own function.
     shown = _raise_warning(lambda: _c_warnings.warn(message, category, level + 3, source))
-    if _qvm.in_forked_child():
+    if _qvm.is_apart():
         return
     frame = _sys._getframe(1)
     while level > 1 and frame is not None:
@@ -331,7 +331,7 @@ def _warn_explicit(message, category, filename, lineno, *arguments, **options):
     """warnings.warn_explicit"""
     shown = _raise_warning(lambda: _c_warnings.warn_explicit(message, category, filename, lineno, *arguments,
                                                              **options))
-    if not _qvm.in_forked_child():
+    if not _qvm.is_apart():
         _issue(message, category, [*_stack(_sys._getframe(1)), (str(filename), "", min(max(lineno, 0), 0xFFFFFFFF))],
                shown)
 
@@ -462,6 +462,15 @@ def _finish():
                     thing.flush()
             except (OSError, ValueError):
                 pass
+
+
+def _prepare():
+    """For a process that is forked for each session: imports what this module would import in many of them, and keeps
+    all that there is where the garbage collector does not look, because looking would copy it in each of them."""
+    import linecache, numbers, pprint, signal, traceback
+    _qvm.flush()
+    _gc.collect()
+    _gc.freeze()
 
 
 _sys.stdout = _sys.__stdout__ = _TextStream("<stdout>", 1, _qvm.write_output)

@@ -6,6 +6,7 @@
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <csignal>
 #include <filesystem>
 
@@ -71,6 +72,23 @@ TEST_F(ListenerLifecycleTest, AHangUpThatIsIgnoredStaysSo) {
     listen({"/usr/bin/env", "--ignore-signal=HUP"});
     listener().signal(SIGHUP);
     EXPECT_EQ(runClient(connecting({"eval", "6 * 7"})).out, "42\n");
+}
+
+TEST_F(ListenerLifecycleTest, AListenerWithoutPythonSaysSoAndServesNobody) {
+#if defined(KRUTIL_SANITIZED)
+    GTEST_SKIP() << "sanitizers need descriptors";
+#endif
+    // Four descriptors: the last of them is the socket's.
+    const std::string limit =
+        "import os, resource, sys\n"
+        "os.closerange(3, 1000)\n"
+        "resource.setrlimit(resource.RLIMIT_NOFILE, (4, 4))\n"
+        "os.execv(sys.argv[1], sys.argv[1:])";
+    const Ran ran = run({"/usr/bin/python3", "-c", limit, enginePath(), "--listen", socket()});
+    const std::string said = "krutil-qvm: Python cannot be started: error evaluating path\n";
+    EXPECT_EQ(ran.err.substr(ran.err.size() - std::min(ran.err.size(), said.size())), said) << ran.err;
+    EXPECT_EQ(ran.exitCode, 3);
+    EXPECT_FALSE(std::filesystem::exists(socket()));
 }
 
 TEST_F(ListenerLifecycleTest, SessionsOutliveAListenerThatIsKilled) {

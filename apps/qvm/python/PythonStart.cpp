@@ -1,0 +1,97 @@
+#include "qvm/python/PythonStart.hpp"
+
+#include <pybind11/embed.h>
+
+#include <marshal.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <functional>
+#include <stdexcept>
+#include <string>
+
+#include "qvm/python/QvmModuleCode.hpp"
+
+namespace py = pybind11;
+
+namespace qvm {
+namespace {
+
+void check(const PyStatus& status) {
+    if (PyStatus_Exception(status) != 0) {
+        throw std::runtime_error(std::string("Python cannot be started: ") +
+                                 (status.err_msg != nullptr ? status.err_msg : "unknown reason"));
+    }
+}
+
+void initialize() {
+    // Independent of the environment of whoever started the engine, and UTF-8 whatever the locale.
+    PyPreConfig preConfig;
+    PyPreConfig_InitIsolatedConfig(&preConfig);
+    preConfig.utf8_mode = 1;
+#if defined(KRUTIL_SANITIZED)
+    preConfig.allocator = PYMEM_ALLOCATOR_MALLOC;
+#endif
+    check(Py_PreInitialize(&preConfig));
+
+    PyConfig config;
+    PyConfig_InitIsolatedConfig(&config);
+    config.user_site_directory = 1;
+    config.install_signal_handlers = 1;
+    PyStatus status = PyConfig_SetBytesString(&config, &config.program_name, QVM_PYTHON_EXECUTABLE);
+    if (PyStatus_Exception(status) == 0) {
+        status = Py_InitializeFromConfig(&config);
+    }
+    PyConfig_Clear(&config);
+    check(status);
+}
+
+// Calls `act`, whose Python errors become the reason why the engine cannot be used.
+void loading(const std::function<void()>& act) {
+    try {
+        act();
+    } catch (const py::error_already_set& error) {
+        throw std::runtime_error(std::string("The engine's Python code cannot be loaded: ") + error.what());
+    }
+}
+
+void loadModule() {
+    const auto code = py::reinterpret_steal<py::object>(
+        PyMarshal_ReadObjectFromString(moduleCode().data(), static_cast<Py_ssize_t>(moduleCode().size())));
+    if (!code) {
+        throw py::error_already_set();
+    }
+    const auto module = py::reinterpret_steal<py::object>(PyImport_ExecCodeModule("qvm", code.ptr()));
+    if (!module) {
+        throw py::error_already_set();
+    }
+}
+
+}  // namespace
+
+void startPython() {
+    if (Py_IsInitialized() == 0) {
+        initialize();
+        loading(loadModule);
+    }
+}
+
+void preparePython() {
+    startPython();
+    loading([] { py::module_::import("qvm").attr("_prepare")(); });
+}
+
+pid_t forkPrepared() noexcept {
+    PyOS_BeforeFork();
+    const pid_t child = ::fork();
+    const int error = errno;
+    if (child == 0) {
+        PyOS_AfterFork_Child();
+    } else {
+        PyOS_AfterFork_Parent();
+    }
+    errno = error;
+    return child;
+}
+
+}  // namespace qvm
