@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <cstring>
 #include <optional>
 #include <string>
 
@@ -234,6 +235,41 @@ void setDebugging(bool on) {
     }
 }
 
+// Code of one expression, as compile() makes it; None for what is none. compile() itself would first make all the types
+// of syntax trees, which takes as long as much of Python's own start.
+py::object compileExpression(const py::str& source, const py::str& file) {
+    Py_ssize_t length = 0;
+    const char* const text = PyUnicode_AsUTF8AndSize(source.ptr(), &length);
+    if (text == nullptr || std::strlen(text) != static_cast<std::size_t>(length)) {
+        PyErr_Clear();
+        return py::none();
+    }
+    PyCompilerFlags flags{PyCF_SOURCE_IS_UTF8 | PyCF_IGNORE_COOKIE, PY_MINOR_VERSION};
+    auto code = py::reinterpret_steal<py::object>(Py_CompileStringObject(text, file.ptr(), Py_eval_input, &flags, -1));
+    if (code) {
+        return code;
+    }
+    if (PyErr_ExceptionMatches(PyExc_SyntaxError) == 0) {
+        throw py::error_already_set();
+    }
+    PyErr_Clear();
+    return py::none();
+}
+
+// Those whose type is one of the types or derives from one, whatever they themselves say about it.
+py::list instances(const py::list& things, const py::tuple& types) {
+    py::list found;
+    for (const py::handle thing : things) {
+        for (const py::handle type : types) {
+            if (PyObject_TypeCheck(thing.ptr(), reinterpret_cast<PyTypeObject*>(type.ptr())) != 0) {
+                found.append(thing);
+                break;
+            }
+        }
+    }
+    return found;
+}
+
 }  // namespace
 
 PYBIND11_EMBEDDED_MODULE(_qvm, module) {
@@ -258,6 +294,8 @@ PYBIND11_EMBEDDED_MODULE(_qvm, module) {
     module.def("read_line", &readLine);
     module.def("issue_warning", &issueWarning);
     module.def("set_debugging", &setDebugging);
+    module.def("compile_expression", &compileExpression);
+    module.def("instances", &instances);
 }
 
 void installEngineModule(TextOutput& textOutput, Announcer& engineAnnouncer, EngineServices& engineServices) {

@@ -18,7 +18,6 @@ import _signal
 import _warnings as _c_warnings
 from errno import EINVAL as _EINVAL
 from os import strerror as _strerror
-from _ast import Expr as _Expr, Expression as _Expression, PyCF_ONLY_AST as _PyCF_ONLY_AST
 from _frozen_importlib_external import PathFinder as _PathFinder
 from _operator import index as _index
 from _thread import _local as _Local
@@ -419,14 +418,14 @@ def _remember(filename, source):
 def _compile_block(source, filename):
     """Code of the statements and of a trailing expression; either may be None."""
     if "\n" not in source.rstrip():
-        try:
-            return None, compile(source, filename, "eval", 0, True)
-        except SyntaxError:
-            pass
-    tree = compile(source, filename, "exec", _PyCF_ONLY_AST, True)
-    if not tree.body or not isinstance(tree.body[-1], _Expr):
+        expression = _qvm.compile_expression(source, filename)
+        if expression is not None:
+            return None, expression
+    import _ast
+    tree = compile(source, filename, "exec", _ast.PyCF_ONLY_AST, True)
+    if not tree.body or not isinstance(tree.body[-1], _ast.Expr):
         return compile(tree, filename, "exec", 0, True), None
-    last = compile(_Expression(tree.body.pop().value), filename, "eval", 0, True)
+    last = compile(_ast.Expression(tree.body.pop().value), filename, "eval", 0, True)
     return compile(tree, filename, "exec", 0, True) if tree.body else None, last
 
 
@@ -435,7 +434,8 @@ def _compile_program(source, filename):
 
 
 def _compile_statement(source, filename):
-    tree = compile(source + "\n", filename, "single", _PyCF_ONLY_AST, True)
+    import _ast
+    tree = compile(source + "\n", filename, "single", _ast.PyCF_ONLY_AST, True)
     if len(tree.body) != 1:
         second = tree.body[1]
         raise SyntaxError("multiple statements found while compiling a single statement",
@@ -455,19 +455,18 @@ def _compile(source, filename, code_type):
 def _finish():
     """What the end of a Python program does for its code: exit functions run, and written files are complete."""
     _atexit._run_exitfuncs()
-    for thing in _gc.get_objects():
-        if issubclass(type(thing), (_io.TextIOWrapper, _io.BufferedWriter, _io.BufferedRandom)):
-            try:
-                if not thing.closed:
-                    thing.flush()
-            except (OSError, ValueError):
-                pass
+    for file in _qvm.instances(_gc.get_objects(), (_io.TextIOWrapper, _io.BufferedWriter, _io.BufferedRandom)):
+        try:
+            if not file.closed:
+                file.flush()
+        except (OSError, ValueError):
+            pass
 
 
 def _prepare():
     """For a process that is forked for each session: imports what this module would import in many of them, and keeps
     all that there is where the garbage collector does not look, because looking would copy it in each of them."""
-    import linecache, numbers, pprint, signal, traceback
+    import _ast, linecache, numbers, pprint, signal, traceback
     _qvm.flush()
     _gc.collect()
     _gc.freeze()
