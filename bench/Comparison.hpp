@@ -16,7 +16,9 @@ enum class Clock {
 
 using Measurement = std::function<void(benchmark::State&)>;
 
-/// Registers `ours` as NAME and `baseline` as NAME/baseline. The report ends with the ratio of their medians.
-void compare(const std::string& name, Clock clock, Measurement ours, Measurement baseline);
+/// Registers `ours` beside `baseline`, under a name that may have several contenders. The report tells the ratios of
+/// their repetitions.
+void compare(const std::string& name, Clock clock, Measurement ours, Measurement baseline,
+             const std::string& contender = "krutil");
 
 }  // namespace bench

@@ -21,9 +21,17 @@ namespace {
 
 constexpr const char* baselineSuffix = "/baseline";
 
-std::vector<std::string>& comparisons() {
-    static std::vector<std::string> names;
-    return names;
+struct Comparison {
+    std::string name;
+    std::string contender;
+
+    // What Google Benchmark knows the contender's side by.
+    std::string benchmark() const { return name + "/" + contender; }
+};
+
+std::vector<Comparison>& comparisons() {
+    static std::vector<Comparison> all;
+    return all;
 }
 
 // Seconds of one iteration, by benchmark and repetition.
@@ -50,22 +58,23 @@ double quantile(const std::vector<double>& sorted, double share) {
     return sorted[below] + (place - static_cast<double>(below)) * (sorted[above] - sorted[below]);
 }
 
-void printRatios(const std::string& name, const std::vector<double>& ours, const std::vector<double>& baseline) {
+void printRatios(const Comparison& comparison, const std::vector<double>& ours, const std::vector<double>& baseline) {
     std::vector<double> ratios;
     for (std::size_t i = 0; i < ours.size(); ++i) {
         ratios.push_back(ours[i] / baseline[i]);
     }
     std::sort(ratios.begin(), ratios.end());
-    std::printf("%-70s %8.2f  (%.2f to %.2f)\n", name.c_str(), quantile(ratios, 0.5), quantile(ratios, 0.25),
-                quantile(ratios, 0.75));
+    std::printf("%-70s %8.2f  (%.2f to %.2f)\n", comparison.benchmark().c_str(), quantile(ratios, 0.5),
+                quantile(ratios, 0.25), quantile(ratios, 0.75));
     std::fflush(stdout);
 }
 
-void printRow(const std::string& name, const std::vector<double>& ours, const std::vector<double>& baseline) {
+void printRow(const Comparison& comparison, const std::vector<double>& ours, const std::vector<double>& baseline) {
     const nlohmann::ordered_json row{
-        {"label", name},
+        {"label", comparison.name},
         {"size", nullptr},
-        {"times", {{{"name", "baseline"}, {"seconds", baseline}}, {{"name", "krutil"}, {"seconds", ours}}}}};
+        {"times",
+         {{{"name", "baseline"}, {"seconds", baseline}}, {{"name", comparison.contender}, {"seconds", ours}}}}};
     std::cout << row.dump() << std::endl;
 }
 
@@ -77,16 +86,18 @@ std::string filterFor(const std::string& name) {
 
 }  // namespace
 
-void compare(const std::string& name, Clock clock, Measurement ours, Measurement baseline) {
+void compare(const std::string& name, Clock clock, Measurement ours, Measurement baseline,
+             const std::string& contender) {
+    const Comparison comparison{name, contender};
     const auto add = [clock](const std::string& fullName, Measurement measurement) {
         auto* registered = benchmark::RegisterBenchmark(fullName.c_str(), std::move(measurement));
         if (clock == Clock::Wall) {
             registered->UseRealTime();
         }
     };
-    add(name, std::move(ours));
-    add(name + baselineSuffix, std::move(baseline));
-    comparisons().push_back(name);
+    add(comparison.benchmark(), std::move(ours));
+    add(comparison.benchmark() + baselineSuffix, std::move(baseline));
+    comparisons().push_back(comparison);
 }
 
 }  // namespace bench
@@ -113,14 +124,15 @@ int main(int argc, char** argv) {
     }
     bench::addSerializerBenches();
     const std::regex wanted(benchmark::GetBenchmarkFilter());
-    for (const std::string& name : bench::comparisons()) {
-        if (!std::regex_search(name, wanted)) {
+    for (const bench::Comparison& comparison : bench::comparisons()) {
+        const std::string ours = comparison.benchmark();
+        if (!std::regex_search(ours, wanted)) {
             continue;
         }
         bench::Times times;
-        benchmark::RunSpecifiedBenchmarks(&times, bench::filterFor(name));
-        (rows ? bench::printRow : bench::printRatios)(name, times.seconds[name],
-                                                      times.seconds[name + bench::baselineSuffix]);
+        benchmark::RunSpecifiedBenchmarks(&times, bench::filterFor(ours));
+        (rows ? bench::printRow : bench::printRatios)(comparison, times.seconds[ours],
+                                                      times.seconds[ours + bench::baselineSuffix]);
     }
     return 0;
 }

@@ -24,6 +24,7 @@ class Question:
     tolerance: float = 0.25  # how much worse than recorded a ratio may be, as a share of it
     unit: str = "seconds"
     axis: str = ""  # what the size of a row is; without it the plot has bars
+    needs_peers: bool = False  # only of interest beside what people use instead
 
 
 @dataclasses.dataclass(frozen=True)
@@ -59,6 +60,20 @@ def engine(name, *options):
                                 "--seconds", str(run.seconds), "--largest", str(run.largest)])
 
 
+def beside_jupyter(run):
+    """Evaluations on the Jupyter kernel have their turns between those on an engine."""
+    from peers import jupyter  # Only a run with peers has what it needs.
+    times = {}
+    with jupyter.evaluations() as evaluate:
+        evaluate(10)
+        for _ in range(run.repetitions):
+            row, = engine("evaluation")(dataclasses.replace(run, repetitions=1))
+            row["times"].append({"name": "Jupyter", "seconds": [evaluate(20)]})
+            for each in row["times"]:
+                times.setdefault(each["name"], []).extend(each["seconds"])
+    return [{"label": "", "size": None, "times": [{"name": name, "seconds": all} for name, all in times.items()]}]
+
+
 def codec(prefix):
     """Asks the program that measures what one thread does. The prefix of its comparisons is the question."""
     def measure(run):
@@ -77,6 +92,8 @@ QUESTIONS = [
     Question("null", "The harness itself: a raw round trip of 200 bytes there and 500 back",
              "the same once more, so the ratio must be 1 within its spread", engine("null")),
     Question("evaluation", "Evaluation of `1+1`, request to reply", RAW, engine("evaluation")),
+    Question("jupyter", "Evaluation of `1+1` on a warm engine, and on a Jupyter kernel of the same Python", RAW,
+             beside_jupyter, needs_peers=True),
     Question("call", "A call with 1 KiB, there and back", "an evaluation of `1+1` on a warm engine", engine("call")),
     Question("arrays", "Calls with arrays, over the socket", RAW_ARRAY, engine("arrays"), conditions=REUSED),
     Question("burst", "1,000 requests (`pass`) sent at once, each of them", RAW, engine("burst")),

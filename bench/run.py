@@ -100,7 +100,7 @@ def main():
     os.makedirs(options.out, exist_ok=True)
     sentences = []
     for question in QUESTIONS:
-        if options.questions and question.name not in options.questions:
+        if question.name not in options.questions if options.questions else question.needs_peers > options.peers:
             continue
         results = ask(question, run)
         print(ratios.table(description(question), results), flush=True)

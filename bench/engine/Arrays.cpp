@@ -13,6 +13,7 @@
 #include "engine/Questions.hpp"
 #include "engine/RawPeer.hpp"
 #include "foundation/korveldata/ArrayFactory.hpp"
+#include "peers/RoundTripPeers.hpp"
 
 namespace bench {
 namespace {
@@ -89,16 +90,22 @@ Contender rawArrays(const Array& array, Way way) {
             }};
 }
 
+// With the library and with what people use instead.
+void holdAll(const std::string& label, const Array& array, Way way, const Effort& effort) {
+    Contest contest{label, {}, {rawArrays(array, way), calls(array, way)}};
+    const auto size = static_cast<std::size_t>(array.sizeInBytes());
+    for (Contender& peer : peerRoundTrips(size, way == Way::There ? answerBytes : size)) {
+        contest.contenders.push_back(std::move(peer));
+    }
+    hold(contest, effort);
+}
+
 void arrays(const Effort& effort) {
     for (const auto& [size, name] : {std::pair{MiB, "1 MiB"}, std::pair{64 * MiB, "64 MiB"}}) {
         if (size <= effort.largest) {
             const Array array = arrayOf(size);
-            hold({name + std::string(" to the engine"), {}, {rawArrays(array, Way::There), calls(array, Way::There)}},
-                 effort);
-            hold({name + std::string(" there and back"),
-                  {},
-                  {rawArrays(array, Way::ThereAndBack), calls(array, Way::ThereAndBack)}},
-                 effort);
+            holdAll(name + std::string(" to the engine"), array, Way::There, effort);
+            holdAll(name + std::string(" there and back"), array, Way::ThereAndBack, effort);
         }
     }
 }

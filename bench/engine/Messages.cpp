@@ -3,12 +3,14 @@
 #include <cstddef>
 #include <memory>
 #include <string>
+#include <utility>
 
 #include "engine/EngineClient.hpp"
 #include "engine/Questions.hpp"
 #include "engine/RawPeer.hpp"
 #include "engine/SessionPeer.hpp"
 #include "krutil/session/EngineProcess.hpp"
+#include "peers/RoundTripPeers.hpp"
 
 namespace bench {
 namespace {
@@ -37,8 +39,12 @@ void messageSizes(const Effort& effort) {
         counted->send(std::string(characters, 'x'));
         counted->awaitAll();
         const Bytes bytes = counted->takeBytes();
-        hold({"", static_cast<double>(characters), {rawRoundTrips(bytes.there, bytes.back), requests(characters)}},
-             effort);
+        Contest contest{
+            "", static_cast<double>(characters), {rawRoundTrips(bytes.there, bytes.back), requests(characters)}};
+        for (Contender& peer : peerRoundTrips(bytes.there, bytes.back)) {
+            contest.contenders.push_back(std::move(peer));
+        }
+        hold(contest, effort);
     }
 }
 

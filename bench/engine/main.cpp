@@ -10,8 +10,12 @@
 #include "engine/Questions.hpp"
 #include "engine/RawPeer.hpp"
 #include "engine/SessionPeer.hpp"
+#include "peers/RoundTripPeers.hpp"
 
 int main(int argc, char** argv) {
+    if (bench::servedPeer(argc, argv)) {
+        return 0;
+    }
     const std::string first = argc == 2 ? argv[1] : "";
     if (first == bench::rawPeerArgument) {
         bench::serveRaw();
