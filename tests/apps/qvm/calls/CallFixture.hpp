@@ -12,6 +12,7 @@
 #include "cmddistributor/FEvalIIP.hpp"
 #include "cmddistributor/FEvalResult.hpp"
 #include "foundation/korveldata/ArrayFactory.hpp"
+#include "support/CountingBytes.hpp"
 
 namespace qvm_test {
 
@@ -60,10 +61,7 @@ inline std::string callError(EngineClient& client, const std::string& function, 
 /// Elements 0, 1, 2, ... as unsigned bytes.
 inline Array bytes(std::uint64_t count) {
     Array array = ArrayFactory().createArray(ElementType::UInt8, {count});
-    char* const elements = array.mutableData();
-    for (std::uint64_t i = 0; i < count; ++i) {
-        elements[i] = static_cast<char>(i % 251);
-    }
+    test_support::countUp(array.mutableData(), count, 251);
     return array;
 }
 

@@ -3,7 +3,6 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <cstring>
 #include <functional>
 #include <numeric>
@@ -16,6 +15,7 @@
 #include "foundation/korveldata/ArrayFactory.hpp"
 #include "foundation/korveldata/protobuf/SerializationContext.hpp"
 #include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
+#include "support/CountingBytes.hpp"
 
 namespace qvm_test {
 namespace {
@@ -34,13 +34,7 @@ Array received(ElementType type, const std::vector<std::uint64_t>& dimensions,
                MemoryOrder order = MemoryOrder::RowMajor) {
     const std::uint64_t bytes = foundation::korveldata::checkedSizeInBytes(type, dimensions);
     std::unique_ptr<char[], void (*)(char*)> buffer(BufferAllocator::allocate(bytes), &BufferAllocator::release);
-    const std::uint64_t period = std::min<std::uint64_t>(bytes, 120);
-    for (std::uint64_t i = 0; i < period; ++i) {
-        buffer[i] = static_cast<char>(type == ElementType::Bool ? i % 2 : i);
-    }
-    for (std::uint64_t filled = period; filled < bytes; filled *= 2) {
-        std::memcpy(&buffer[filled], buffer.get(), std::min(filled, bytes - filled));
-    }
+    test_support::countUp(buffer.get(), bytes, type == ElementType::Bool ? 2 : 120);
     return ArrayFactory().fromBuffer(type, dimensions, order, std::move(buffer));
 }
 
