@@ -4,13 +4,15 @@
 #include <chrono>
 #include <thread>
 
+#include "support/Patience.hpp"
+
 namespace test_support {
 
-/// Looks again and again until `holds()`, for a minute at most; returns whether it came to hold. Between two looks the
-/// calling thread sleeps for two milliseconds.
+/// Looks again and again until `holds()`, as long as a test is patient; returns whether it came to hold. Between two
+/// looks the calling thread sleeps for two milliseconds.
 template <class Condition>
 [[nodiscard]] bool eventually(Condition holds) {
-    const auto deadline = std::chrono::steady_clock::now() + std::chrono::minutes(1);
+    const auto deadline = std::chrono::steady_clock::now() + patience;
     while (!holds()) {
         if (std::chrono::steady_clock::now() >= deadline) {
             return false;

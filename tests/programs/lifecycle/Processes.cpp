@@ -8,7 +8,6 @@
 #include <algorithm>
 #include <cctype>
 #include <cerrno>
-#include <chrono>
 #include <csignal>
 #include <filesystem>
 #include <fstream>
@@ -18,14 +17,14 @@
 
 #include "programs/support/Program.hpp"
 #include "support/Eventually.hpp"
+#include "support/Patience.hpp"
 
 namespace programs_test {
 namespace {
 
 namespace fs = std::filesystem;
 using test_support::eventually;
-
-constexpr std::chrono::seconds patience{60};
+using test_support::patience;
 
 // Names in a directory of /proc that are numbers; what vanishes meanwhile is left out.
 std::vector<int> numbersIn(const fs::path& directory) {

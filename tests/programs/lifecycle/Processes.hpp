@@ -1,8 +1,8 @@
 // Processes that a test looks at from outside, most of them nobody's child here: the engines of clients, the sessions
 // of an engine that listens.
 //
-// Nothing here waits for a fixed time; every wait ends after a minute, with a failure of the test. Numbers that are no
-// process are refused as signalOne() refuses them.
+// Nothing here waits for a fixed time; every wait ends with a failure when the patience of a test is over. Numbers that
+// are no process are refused as signalOne() refuses them.
 #pragma once
 
 #include <sys/types.h>

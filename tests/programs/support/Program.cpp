@@ -15,12 +15,14 @@
 #include <stdexcept>
 #include <system_error>
 
+#include "support/Patience.hpp"
+
 extern char** environ;
 
 namespace programs_test {
 namespace {
 
-constexpr std::chrono::seconds patience{60};
+using test_support::patience;
 
 void makePipe(int (&ends)[2]) {
     if (::pipe2(ends, O_CLOEXEC) != 0) {

@@ -19,9 +19,9 @@ struct Ran {
     std::string err;
 };
 
-/// A running child process with pipes as its standard input, output and error. Every wait has a deadline of a minute,
-/// after which the test fails and the process is killed; nothing waits for a fixed time. An object that goes kills what
-/// still runs. When the client has ended, the test fails if a request of its session had no legal life.
+/// A running child process with pipes as its standard input, output and error. Every wait has a deadline, after which
+/// the test fails and the process is killed; nothing waits for a fixed time. An object that goes kills what still runs.
+/// When the client has ended, the test fails if a request of its session had no legal life.
 class Program {
   public:
     struct Options {
@@ -85,7 +85,7 @@ void signalOne(pid_t pid, int number);
 /// Whether the process `pid`, which may be nobody's child here, ends within `time`.
 bool endsWithin(pid_t pid, std::chrono::milliseconds time);
 
-/// The same within a minute, which is as long as a test waits for anything.
+/// The same within the patience of a test.
 bool waitUntilGone(pid_t pid);
 
 /// Runs a program to its end.

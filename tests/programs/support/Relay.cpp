@@ -9,15 +9,16 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <chrono>
 #include <cstring>
 #include <system_error>
 #include <vector>
 
+#include "support/Patience.hpp"
+
 namespace programs_test {
 namespace {
 
-constexpr std::chrono::seconds patience{60};
+using test_support::patience;
 
 int checked(int result, const char* what) {
     if (result < 0) {

@@ -47,7 +47,7 @@ class Relay {
     /// Passes all up to the end of the next tagged frame with this tag, and holds back the rest. After record().
     void holdAfterFrame(Way way, const std::string& tag);
 
-    /// Waits until all that may pass has; fails the test after a minute.
+    /// Waits until all that may pass has; fails the test when its patience is over.
     void waitUntilHeld(Way way);
 
     /// Closes the streams to both ends; what has passed arrives.
