@@ -18,13 +18,13 @@ constexpr std::size_t longestHeader = 1U << 16;
 // NumPy aligns the elements in the file to this.
 constexpr std::size_t alignment = 64;
 
-[[noreturn]] void fail(const std::string& sentence) {
-    throw Failure(ExitCode::Usage, sentence);
+[[noreturn]] void cannotRead(const std::string& name, const std::string& why) {
+    throw Failure(ExitCode::Usage, "cannot read " + name + ": " + why);
 }
 
-std::string quoted(std::string_view text) {
+std::string quoted(const std::string& text) {
     constexpr std::size_t longest = 60;
-    return "'" + std::string(text.substr(0, longest)) + (text.size() > longest ? "...'" : "'");
+    return "'" + text.substr(0, longest) + (text.size() > longest ? "...'" : "'");
 }
 
 // Reads the header's text: a Python dictionary of exactly three keys, in any order.
@@ -73,7 +73,7 @@ class HeaderParser {
 
   private:
     [[noreturn]] void failHere(const std::string& what) const {
-        fail("cannot read " + name_ + ": its header has " + what + " at byte " + std::to_string(position_));
+        cannotRead(name_, "its header has " + what + " at byte " + std::to_string(position_));
     }
 
     void skipSpace() {
@@ -115,8 +115,7 @@ class HeaderParser {
     std::string parseDescr() {
         skipSpace();
         if (position_ < text_.size() && text_[position_] == '[') {
-            fail("cannot read " + name_ +
-                 ": its elements are records, which cannot be sent; send their fields one by one");
+            cannotRead(name_, "its elements are records, which cannot be sent; send their fields one by one");
         }
         return parseString();
     }
@@ -180,27 +179,26 @@ std::string NpyHeader::quotedDescr() const {
 NpyHeader readNpyHeader(std::string_view bytes, const std::string& name) {
     const auto require = [&](std::size_t end) {
         if (bytes.size() < end) {
-            fail("cannot read " + name + ": it ends after " + std::to_string(bytes.size()) +
-                 " bytes, in the middle of its header");
+            cannotRead(name, "it ends after " + std::to_string(bytes.size()) + " bytes, in the middle of its header");
         }
     };
     if (bytes.substr(0, magic.size()) != magic) {
-        fail("cannot read " + name + ": it is no .npy file (it does not begin with \"\\x93NUMPY\")");
+        cannotRead(name, "it is no .npy file (it does not begin with \"\\x93NUMPY\")");
     }
     require(versionEnd);
     const auto major = static_cast<unsigned char>(bytes[versionEnd - 2]);
     const auto minor = static_cast<unsigned char>(bytes[versionEnd - 1]);
     if (major < 1 || major > 3 || minor != 0) {
-        fail("cannot read " + name + ": it has version " + std::to_string(major) + "." + std::to_string(minor) +
-             " of the .npy format; 1.0, 2.0 and 3.0 are known here");
+        cannotRead(name, "it has version " + std::to_string(major) + "." + std::to_string(minor) +
+                             " of the .npy format; 1.0, 2.0 and 3.0 are known here");
     }
     const std::size_t begin = versionEnd + (major == 1 ? 2 : 4);
     require(begin);
     const std::size_t length = littleEndian(bytes.substr(versionEnd, begin - versionEnd));
     require(begin + length);
     if (length > longestHeader) {
-        fail("cannot read " + name + ": its header has " + std::to_string(length) + " bytes; at most " +
-             std::to_string(longestHeader) + " are expected");
+        cannotRead(name, "its header has " + std::to_string(length) + " bytes; at most " +
+                             std::to_string(longestHeader) + " are expected");
     }
     NpyHeader header = HeaderParser(bytes.substr(begin, length), name).parse();
     header.end = begin + length;

@@ -28,7 +28,7 @@ using foundation::korveldata::Array;
 using foundation::korveldata::ElementType;
 using nlohmann::ordered_json;
 
-ordered_json capabilityNames(const capabilities::CapabilityList& list) {
+ordered_json capabilitySequence(const capabilities::CapabilityList& list) {
     ordered_json names = ordered_json::array();
     for (const auto capability : list.getEnabledCapabilitySequence()) {
         names.push_back(capabilities::toString(capability));
@@ -246,10 +246,10 @@ void JsonPrinter::subscribe(foundation::msg_svc::eventmgr::EventMgr& events) {
     events.subscribe<krutil::capabilities_api::CapabilitiesChanged>(
         [this](const krutil::capabilities_api::CapabilitiesChanged& event) {
             print({{"event", "capabilities"},
-                   {"previous", capabilityNames(event.getPreviousCapabilities())},
-                   {"engine", capabilityNames(event.getQvmCapabilities())},
-                   {"client", capabilityNames(event.getClientCapabilities())},
-                   {"request", capabilityNames(event.getRequestCapabilities())}});
+                   {"previous", capabilitySequence(event.getPreviousCapabilities())},
+                   {"engine", capabilitySequence(event.getQvmCapabilities())},
+                   {"client", capabilitySequence(event.getClientCapabilities())},
+                   {"request", capabilitySequence(event.getRequestCapabilities())}});
         });
     events.subscribe<korvel::lang::diagnostic::IssuedWarningEvent>(
         [this](const korvel::lang::diagnostic::IssuedWarningEvent& event) { print(warningObject(false, event)); });
@@ -279,7 +279,7 @@ void JsonPrinter::connected(const foundation::msg_svc::transport::layers::sessio
     print({{"event", "connected"},
            {"engine", peer.build},
            {"features", std::map<std::string, std::string>(features.begin(), features.end())},
-           {"capabilities", capabilityNames(peer.capabilities)}});
+           {"capabilities", capabilitySequence(peer.capabilities)}});
 }
 
 void JsonPrinter::returned(const Returned& output) {

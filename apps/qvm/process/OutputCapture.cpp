@@ -28,10 +28,6 @@ constexpr std::size_t pieceBytes = 16'384;
 
 std::atomic<OutputCapture*> current{nullptr};
 
-[[noreturn]] void fail(const char* what) {
-    throw std::system_error(errno, std::generic_category(), what);
-}
-
 // Bytes of a sequence by its first one; 1 for what begins none.
 std::size_t sequenceLength(unsigned char lead) noexcept {
     if (lead < 0xC2 || lead > 0xF4) {
@@ -109,7 +105,7 @@ OutputCapture::~OutputCapture() {
 void OutputCapture::redirect(Source& source) {
     std::array<int, 2> ends{};
     if (::pipe2(ends.data(), O_CLOEXEC) != 0) {
-        fail("Capturing output needs a pipe");
+        throw std::system_error(errno, std::generic_category(), "Capturing output needs a pipe");
     }
     source.before = ::fcntl(source.descriptor, F_DUPFD_CLOEXEC, firstPrivateDescriptor);
     source.pipe = ::fcntl(ends[0], F_DUPFD_CLOEXEC, firstPrivateDescriptor);
@@ -119,8 +115,7 @@ void OutputCapture::redirect(Source& source) {
     const int error = errno;
     ::close(ends[1]);
     if (!done) {
-        errno = error;
-        fail("Capturing output needs descriptors 1 and 2");
+        throw std::system_error(error, std::generic_category(), "Capturing output needs descriptors 1 and 2");
     }
 }
 

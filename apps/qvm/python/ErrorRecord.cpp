@@ -23,10 +23,11 @@ using cmddistributor::StackFrame;
 using krutil::cmddistributor::inExecutionStatus;
 
 // Bytes that a record or a frame costs besides its texts.
-constexpr std::size_t fixedBytes = 32;
+constexpr std::size_t recordBytes = 32;
 constexpr std::size_t nameBytes = 1024;
 
-py::object owned(PyObject* object) {
+// Takes over what a function of Python's C interface returned, which can be nothing.
+py::object ownedOrNull(PyObject* object) {
     return py::reinterpret_steal<py::object>(object);
 }
 
@@ -44,14 +45,14 @@ class Builder {
 
     RuntimeException build(PyObject* exception, inExecutionStatus status, std::size_t depth) {
         seen_.insert(exception);
-        take(fixedBytes);
+        take(recordBytes);
         std::string name = typeName(exception);
         std::u16string text = message(exception, name);
         Stack frames = stack(exception);
         std::vector<RuntimeException> causes;
         if (depth < bounds_.depth) {
             for (const py::object& cause : causesOf(exception)) {
-                if (left_ < fixedBytes || seen_.size() >= bounds_.records) {
+                if (left_ < recordBytes || seen_.size() >= bounds_.records) {
                     break;
                 }
                 if (seen_.count(cause.ptr()) == 0) {
@@ -112,7 +113,7 @@ class Builder {
     // Reads the type itself: a metaclass may answer for __module__ and __qualname__ with anything, or raise.
     std::string typeName(PyObject* exception) {
         PyTypeObject* const type = Py_TYPE(exception);
-        const py::object name = owned(PyType_GetQualName(type));
+        const py::object name = ownedOrNull(PyType_GetQualName(type));
         if (!name || !PyUnicode_Check(name.ptr())) {
             PyErr_Clear();
             return "BaseException";
@@ -127,7 +128,7 @@ class Builder {
             return prefix + boundedUtf8(name.ptr(), nameBytes);
         }
         // The name of a type written in C is dotted already, without the builtin ones' module.
-        const py::object dotted = owned(PyUnicode_FromString(type->tp_name));
+        const py::object dotted = ownedOrNull(PyUnicode_FromString(type->tp_name));
         if (!dotted) {
             PyErr_Clear();
             return boundedUtf8(name.ptr(), nameBytes);
@@ -150,7 +151,8 @@ class Builder {
     }
 
     std::u16string message(PyObject* exception, const std::string& name) {
-        const py::object text = words_ == ErrorWords::ByCode ? owned(PyObject_Str(exception)) : plainText(exception);
+        const py::object text =
+            words_ == ErrorWords::ByCode ? ownedOrNull(PyObject_Str(exception)) : plainText(exception);
         if (!text) {
             if (words_ == ErrorWords::ByCode && PyErr_ExceptionMatches(PyExc_KeyboardInterrupt) != 0) {
                 interrupted_ = true;
@@ -166,10 +168,10 @@ class Builder {
 
     Stack stack(PyObject* exception) {
         std::vector<PyTracebackObject*> entries;
-        const py::object first = owned(PyException_GetTraceback(exception));
+        const py::object first = ownedOrNull(PyException_GetTraceback(exception));
         for (auto* entry = reinterpret_cast<PyTracebackObject*>(first.ptr()); entry != nullptr;
              entry = entry->tb_next) {
-            const py::object code = owned(reinterpret_cast<PyObject*>(PyFrame_GetCode(entry->tb_frame)));
+            const py::object code = ownedOrNull(reinterpret_cast<PyObject*>(PyFrame_GetCode(entry->tb_frame)));
             PyObject* const file = reinterpret_cast<PyCodeObject*>(code.ptr())->co_filename;
             if (PyUnicode_CompareWithASCIIString(file, engineFile) != 0) {
                 entries.push_back(entry);
@@ -181,10 +183,10 @@ class Builder {
         const std::size_t head = kept == entries.size() ? kept : kept / 2;
         // The innermost frames tell most, so they are the first to be given room.
         std::vector<StackFrame> tail;
-        for (std::size_t i = 0; i < kept - head && left_ >= fixedBytes; ++i) {
+        for (std::size_t i = 0; i < kept - head && left_ >= recordBytes; ++i) {
             tail.push_back(frame(entries[entries.size() - 1 - i]));
         }
-        for (std::size_t i = 0; i < head && left_ >= fixedBytes; ++i) {
+        for (std::size_t i = 0; i < head && left_ >= recordBytes; ++i) {
             frames.push_back(frame(entries[i]));
         }
         const std::size_t missing = entries.size() - frames.size() - tail.size();
@@ -202,8 +204,8 @@ class Builder {
     }
 
     StackFrame frame(PyTracebackObject* entry) {
-        take(fixedBytes);
-        const py::object object = owned(reinterpret_cast<PyObject*>(PyFrame_GetCode(entry->tb_frame)));
+        take(recordBytes);
+        const py::object object = ownedOrNull(reinterpret_cast<PyObject*>(PyFrame_GetCode(entry->tb_frame)));
         auto* const code = reinterpret_cast<PyCodeObject*>(object.ptr());
         // The traceback's own line number is filled in only when it is first asked for.
         const int line = PyCode_Addr2Line(code, entry->tb_lasti);
@@ -213,11 +215,11 @@ class Builder {
 
     static std::vector<py::object> causesOf(PyObject* exception) {
         std::vector<py::object> causes;
-        if (py::object cause = owned(PyException_GetCause(exception))) {
+        if (py::object cause = ownedOrNull(PyException_GetCause(exception))) {
             causes.push_back(std::move(cause));
         }
         if (reinterpret_cast<PyBaseExceptionObject*>(exception)->suppress_context == 0) {
-            if (py::object context = owned(PyException_GetContext(exception))) {
+            if (py::object context = ownedOrNull(PyException_GetContext(exception))) {
                 causes.push_back(std::move(context));
             }
         }

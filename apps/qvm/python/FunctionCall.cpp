@@ -123,7 +123,7 @@ py::object further(const py::object& container, const std::string& path, const p
                                     " has no attribute and no submodule " + quoted(partName));
 }
 
-Array output(const py::handle& value, const std::string& what, ReleaseQueue& releases) {
+Array toOutput(const py::handle& value, const std::string& what, ReleaseQueue& releases) {
     try {
         return toArray(value, releases);
     } catch (const NotConvertible& error) {
@@ -185,7 +185,7 @@ std::vector<Array> outputsOf(const py::object& value, const std::string& name, s
             raise(PyExc_ValueError, "1 output was wanted, but " + quoted(name) + " returned a tuple of " +
                                         std::to_string(given) + ", which is not one array; ask for " + outputs(given));
         }
-        results.push_back(output(value, "The output of " + quoted(name), releases));
+        results.push_back(toOutput(value, "The output of " + quoted(name), releases));
         return results;
     }
     if (!several || given != wanted) {
@@ -199,7 +199,7 @@ std::vector<Array> outputsOf(const py::object& value, const std::string& name, s
     for (std::uint64_t i = 0; i < given; ++i) {
         // Looked up each time, because a conversion may run code that changes a list.
         const py::object item = owned(PySequence_GetItem(value.ptr(), static_cast<Py_ssize_t>(i)));
-        results.push_back(output(item, "Output " + std::to_string(i + 1) + " of " + quoted(name), releases));
+        results.push_back(toOutput(item, "Output " + std::to_string(i + 1) + " of " + quoted(name), releases));
     }
     return results;
 }

@@ -26,13 +26,13 @@ using foundation::korveldata::elementTypeName;
 using foundation::korveldata::MemoryOrder;
 using Npy = py::detail::npy_api;
 
-struct Row {
+struct NumpyType {
     ElementType element;
     char kind;  // of the dtype
     int number;
 };
 
-constexpr Row elementTypes[] = {
+constexpr NumpyType elementTypes[] = {
     {ElementType::Bool, 'b', Npy::NPY_BOOL_},
     {ElementType::Single, 'f', Npy::NPY_FLOAT_},
     {ElementType::Double, 'f', Npy::NPY_DOUBLE_},
@@ -50,7 +50,7 @@ constexpr Row elementTypes[] = {
 
 py::dtype dtypeOf(ElementType element) {
     const auto* const row = std::find_if(std::begin(elementTypes), std::end(elementTypes),
-                                         [&](const Row& each) { return each.element == element; });
+                                         [&](const NumpyType& each) { return each.element == element; });
     if (row == std::end(elementTypes)) {
         throw NotConvertible("has elements of type " + std::string(elementTypeName(element)) +
                              ", which NumPy does not have");
@@ -60,7 +60,7 @@ py::dtype dtypeOf(ElementType element) {
 
 // By kind and size: C has several integer types of one size, and NumPy tells them apart.
 std::optional<ElementType> elementTypeOf(const py::dtype& dtype) {
-    const auto* const row = std::find_if(std::begin(elementTypes), std::end(elementTypes), [&](const Row& each) {
+    const auto* const row = std::find_if(std::begin(elementTypes), std::end(elementTypes), [&](const NumpyType& each) {
         return each.kind == dtype.kind() && elementSize(each.element) == static_cast<std::size_t>(dtype.itemsize());
     });
     return row == std::end(elementTypes) ? std::nullopt : std::optional(row->element);

@@ -14,7 +14,6 @@ namespace qvm {
 namespace {
 
 using korvel::lang::PrintfArgument;
-using korvel::lang::StackFrame;
 using korvel::lang::diagnostic::Warning;
 
 // The first of January 1970.
@@ -47,7 +46,7 @@ PrintfArgument argument(const py::handle& value) {
     return PrintfArgument(utf16Of(value.cast<py::str>().ptr()));
 }
 
-StackFrame stackFrame(const py::handle& value) {
+korvel::lang::StackFrame stackFrame(const py::handle& value) {
     const auto parts = value.cast<py::tuple>();
     const py::str file(parts[0]);
     const py::str function(parts[1]);
@@ -66,7 +65,7 @@ Warning warningRecord(const PythonWarning& warning) {
     for (const py::handle& each : warning.arguments) {
         arguments.push_back(argument(each));
     }
-    std::vector<StackFrame> stack;
+    std::vector<korvel::lang::StackFrame> stack;
     for (const py::handle& each : warning.stack) {
         stack.push_back(stackFrame(each));
     }

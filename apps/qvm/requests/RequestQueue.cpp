@@ -14,14 +14,14 @@ namespace {
 
 using namespace krutil::cmddistributor::WhenToDequeue;
 
-struct Row {
+struct DueMode {
     WhenToDequeue mode;
     bool idle, prompt, inputPrompt, debugPrompt, pause;
 };
 
 // A request that asks for no particular point waits for idle. Idle takes all but what only a debugger's prompt may
 // take; a prompt takes what was sent for it, and what may run anywhere. docs/protocol.md shows the same table.
-constexpr std::array<Row, 8> dueModes{{
+constexpr std::array<DueMode, 8> dueModes{{
     // mode                        idle   prompt input  debug  pause
     {DEQUEUE_UNKNOWN, true, false, false, false, false},
     {DEQUEUE_AT_PPE, true, true, false, true, true},
@@ -37,7 +37,7 @@ constexpr std::array<Row, 8> dueModes{{
 
 bool isDue(WhenToDequeue mode, DequeuePoint point) noexcept {
     const auto row =
-        std::find_if(dueModes.begin(), dueModes.end(), [mode](const Row& each) { return each.mode == mode; });
+        std::find_if(dueModes.begin(), dueModes.end(), [mode](const DueMode& each) { return each.mode == mode; });
     if (row == dueModes.end()) {
         return false;
     }

@@ -7,11 +7,11 @@
 namespace krutil::protobuf_serializer {
 namespace {
 
-const std::string registeredName = "krutil:capabilities_api:CapabilitiesChanged";
+const std::string capabilitiesChangedName = "krutil:capabilities_api:CapabilitiesChanged";
 
 }  // namespace
 
-CapabilitiesChangedSerializer::CapabilitiesChangedSerializer() : TaggedSerializer(registeredName) {}
+CapabilitiesChangedSerializer::CapabilitiesChangedSerializer() : TaggedSerializer(capabilitiesChangedName) {}
 
 protobuf::CapabilitiesChanged CapabilitiesChangedSerializer::toProtobuf(
     const capabilities_api::CapabilitiesChanged& event) {

@@ -7,7 +7,7 @@
 namespace krutil::protobuf_serializer {
 namespace {
 
-const std::string registeredName = "krutil:DebugLoopEvent";
+const std::string debugLoopEventName = "krutil:DebugLoopEvent";
 
 // The placeholder is a value of the wire's enumeration, but no state.
 bool isState(int number) {
@@ -16,7 +16,7 @@ bool isState(int number) {
 
 }  // namespace
 
-DebugLoopEventSerializer::DebugLoopEventSerializer() : TaggedSerializer(registeredName) {}
+DebugLoopEventSerializer::DebugLoopEventSerializer() : TaggedSerializer(debugLoopEventName) {}
 
 protobuf::DebugLoopEvent_State DebugLoopEventSerializer::toProtobuf(::cmddistributor::DebugLoopEvent::State state) {
     return sameNumberOrTerminate<protobuf::DebugLoopEvent_State>(

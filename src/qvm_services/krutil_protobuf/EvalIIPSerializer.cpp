@@ -8,11 +8,11 @@
 namespace krutil::protobuf_serializer {
 namespace {
 
-const std::string registeredName = "krutil:EvalIIP";
+const std::string evalIIPName = "krutil:EvalIIP";
 
 }  // namespace
 
-EvalIIPSerializer::EvalIIPSerializer() : TaggedSerializer(registeredName) {}
+EvalIIPSerializer::EvalIIPSerializer() : TaggedSerializer(evalIIPName) {}
 
 protobuf::CodeType EvalIIPSerializer::toProtobuf(::cmddistributor::CodeType codeType) {
     return sameNumberOrTerminate<protobuf::CodeType>(

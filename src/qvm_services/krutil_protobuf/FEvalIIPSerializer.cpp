@@ -15,7 +15,7 @@ using cmddistributor::EDIDataWrapper;
 
 namespace {
 
-const std::string registeredName = "krutil:FEvalIIP";
+const std::string fEvalIIPName = "krutil:FEvalIIP";
 
 [[noreturn]] void fail(const char* message, int line) {
     foundation::core::diag::terminate(
@@ -47,7 +47,7 @@ void assertSet(std::uint64_t id, const char* expression, int line) {
 
 }  // namespace
 
-FEvalIIPSerializer::FEvalIIPSerializer() : TaggedSerializer(registeredName) {}
+FEvalIIPSerializer::FEvalIIPSerializer() : TaggedSerializer(fEvalIIPName) {}
 
 protobuf::FEvalIIP FEvalIIPSerializer::toProtobuf(const ::cmddistributor::FEvalIIP& request, NestedWriter& nested) {
     protobuf::FEvalIIP proto;

@@ -12,11 +12,11 @@ using foundation::korveldata::Array;
 
 namespace {
 
-const std::string registeredName = "krutil:FEvalResult";
+const std::string fEvalResultName = "krutil:FEvalResult";
 
 }  // namespace
 
-FEvalResultSerializer::FEvalResultSerializer() : TaggedSerializer(registeredName) {}
+FEvalResultSerializer::FEvalResultSerializer() : TaggedSerializer(fEvalResultName) {}
 
 protobuf::FEvalResult FEvalResultSerializer::toProtobuf(const ::cmddistributor::FEvalResult& result,
                                                         const WriteArrays& write) {

@@ -7,11 +7,11 @@
 namespace krutil::protobuf_serializer {
 namespace {
 
-const std::string registeredName = "krutil:IIPCancelMessage";
+const std::string iipCancelMessageName = "krutil:IIPCancelMessage";
 
 }  // namespace
 
-IIPCancelMessageSerializer::IIPCancelMessageSerializer() : TaggedSerializer(registeredName) {}
+IIPCancelMessageSerializer::IIPCancelMessageSerializer() : TaggedSerializer(iipCancelMessageName) {}
 
 protobuf::IIPCancelMessage IIPCancelMessageSerializer::toProtobuf(const ::cmddistributor::IIPCancelMessage& message) {
     protobuf::IIPCancelMessage proto;

@@ -11,11 +11,11 @@ namespace {
 // The serializer copies any number in both directions.
 static_assert(sizeof(IIPCancelReply::CancelStatus) == sizeof(protobuf::CancelStatus));
 
-const std::string registeredName = "krutil:IIPCancelReply";
+const std::string iipCancelReplyName = "krutil:IIPCancelReply";
 
 }  // namespace
 
-IIPCancelReplySerializer::IIPCancelReplySerializer() : TaggedSerializer(registeredName) {}
+IIPCancelReplySerializer::IIPCancelReplySerializer() : TaggedSerializer(iipCancelReplyName) {}
 
 protobuf::CancelStatus IIPCancelReplySerializer::toProtobuf(IIPCancelReply::CancelStatus status) {
     return sameNumberOrTerminate<protobuf::CancelStatus>(

@@ -8,11 +8,11 @@
 namespace krutil::protobuf_serializer {
 namespace {
 
-const std::string registeredName = "krutil:IIPEnqueueMessage";
+const std::string iipEnqueueMessageName = "krutil:IIPEnqueueMessage";
 
 }  // namespace
 
-IIPEnqueueMessageSerializer::IIPEnqueueMessageSerializer() : TaggedSerializer(registeredName) {}
+IIPEnqueueMessageSerializer::IIPEnqueueMessageSerializer() : TaggedSerializer(iipEnqueueMessageName) {}
 
 protobuf::WhenToDequeue IIPEnqueueMessageSerializer::toProtobuf(cmddistributor::WhenToDequeue::WhenToDequeue mode) {
     return sameNumberOrTerminate<protobuf::WhenToDequeue>(

@@ -7,11 +7,11 @@
 namespace krutil::protobuf_serializer {
 namespace {
 
-const std::string registeredName = "krutil:IIPReply";
+const std::string iipReplyName = "krutil:IIPReply";
 
 }  // namespace
 
-IIPReplySerializer::IIPReplySerializer() : TaggedSerializer(registeredName) {}
+IIPReplySerializer::IIPReplySerializer() : TaggedSerializer(iipReplyName) {}
 
 protobuf::IIPReply IIPReplySerializer::toProtobuf(const cmddistributor::IIPReply& reply, NestedWriter& nested) {
     protobuf::IIPReply proto;

@@ -6,11 +6,11 @@
 namespace krutil::protobuf_serializer {
 namespace {
 
-const std::string registeredName = "krutil:IIPResult";
+const std::string iipResultName = "krutil:IIPResult";
 
 }  // namespace
 
-IIPResultSerializer::IIPResultSerializer() : TaggedSerializer(registeredName) {}
+IIPResultSerializer::IIPResultSerializer() : TaggedSerializer(iipResultName) {}
 
 protobuf::IIPResult IIPResultSerializer::toProtobuf(const ::cmddistributor::IIPResult& result) {
     protobuf::IIPResult proto;

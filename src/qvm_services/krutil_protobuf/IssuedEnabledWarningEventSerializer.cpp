@@ -6,11 +6,12 @@ using korvel::lang::diagnostic::IssuedEnabledWarningEvent;
 
 namespace {
 
-const std::string registeredName = "korvel:lang:diagnostic:IssuedEnabledWarningEvent";
+const std::string issuedEnabledWarningEventName = "korvel:lang:diagnostic:IssuedEnabledWarningEvent";
 
 }  // namespace
 
-IssuedEnabledWarningEventSerializer::IssuedEnabledWarningEventSerializer() : TaggedSerializer(registeredName) {}
+IssuedEnabledWarningEventSerializer::IssuedEnabledWarningEventSerializer()
+    : TaggedSerializer(issuedEnabledWarningEventName) {}
 
 protobuf::IssuedEnabledWarningEvent IssuedEnabledWarningEventSerializer::toProtobuf(
     const IssuedEnabledWarningEvent& event) {

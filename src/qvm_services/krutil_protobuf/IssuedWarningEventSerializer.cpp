@@ -6,11 +6,11 @@ using korvel::lang::diagnostic::IssuedWarningEvent;
 
 namespace {
 
-const std::string registeredName = "korvel:lang:diagnostic:IssuedWarningEvent";
+const std::string issuedWarningEventName = "korvel:lang:diagnostic:IssuedWarningEvent";
 
 }  // namespace
 
-IssuedWarningEventSerializer::IssuedWarningEventSerializer() : TaggedSerializer(registeredName) {}
+IssuedWarningEventSerializer::IssuedWarningEventSerializer() : TaggedSerializer(issuedWarningEventName) {}
 
 protobuf::IssuedWarningEvent IssuedWarningEventSerializer::toProtobuf(const IssuedWarningEvent& event) {
     return WarningConversions::toProtobuf(event);

@@ -8,11 +8,11 @@
 namespace krutil::protobuf_serializer {
 namespace {
 
-const std::string registeredName = "krutil:PrintableErrorEvent";
+const std::string printableErrorEventName = "krutil:PrintableErrorEvent";
 
 }  // namespace
 
-PrintableErrorEventSerializer::PrintableErrorEventSerializer() : TaggedSerializer(registeredName) {}
+PrintableErrorEventSerializer::PrintableErrorEventSerializer() : TaggedSerializer(printableErrorEventName) {}
 
 protobuf::PrintableErrorEvent PrintableErrorEventSerializer::toProtobuf(const io::PrintableErrorEvent& event) {
     protobuf::PrintableErrorEvent proto;

@@ -14,7 +14,7 @@ namespace korveldata = foundation::korveldata;
 
 namespace {
 
-const std::string registeredName = "krutil:QDA";
+const std::string qdaName = "krutil:QDA";
 
 bool zeroCopyAllowed = true;
 std::once_flag environmentChecked;
@@ -29,7 +29,7 @@ void checkEnvironment() {
 }  // namespace
 
 QDASerializer::QDASerializer(const std::unordered_map<std::string, std::string>& features)
-    : ArrayFamily(registeredName, typeid(korveldata::Array), {1U, 0U}), features_(features) {
+    : ArrayFamily(qdaName, typeid(korveldata::Array), {1U, 0U}), features_(features) {
     std::call_once(environmentChecked, checkEnvironment);
 }
 

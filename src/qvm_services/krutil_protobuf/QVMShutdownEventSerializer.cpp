@@ -5,11 +5,11 @@
 namespace krutil::protobuf_serializer {
 namespace {
 
-const std::string registeredName = "krutil:QVMShutdownEvent";
+const std::string qvmShutdownEventName = "krutil:QVMShutdownEvent";
 
 }  // namespace
 
-QVMShutdownEventSerializer::QVMShutdownEventSerializer() : TaggedSerializer(registeredName) {}
+QVMShutdownEventSerializer::QVMShutdownEventSerializer() : TaggedSerializer(qvmShutdownEventName) {}
 
 protobuf::QVMShutdownEvent QVMShutdownEventSerializer::toProtobuf() {
     return {};

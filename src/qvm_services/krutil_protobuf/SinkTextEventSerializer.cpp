@@ -3,10 +3,10 @@
 namespace krutil::protobuf_serializer {
 namespace {
 
-const std::string registeredName = "krutil:SinkTextEvent";
+const std::string sinkTextEventName = "krutil:SinkTextEvent";
 
 }  // namespace
 
-SinkTextEventSerializer::SinkTextEventSerializer() : TextEventSerializer(registeredName) {}
+SinkTextEventSerializer::SinkTextEventSerializer() : TextEventSerializer(sinkTextEventName) {}
 
 }  // namespace krutil::protobuf_serializer

@@ -3,10 +3,10 @@
 namespace krutil::protobuf_serializer {
 namespace {
 
-const std::string registeredName = "krutil:TextBaseEvent";
+const std::string textBaseEventName = "krutil:TextBaseEvent";
 
 }  // namespace
 
-TextBaseEventSerializer::TextBaseEventSerializer() : TextEventSerializer(registeredName) {}
+TextBaseEventSerializer::TextBaseEventSerializer() : TextEventSerializer(textBaseEventName) {}
 
 }  // namespace krutil::protobuf_serializer

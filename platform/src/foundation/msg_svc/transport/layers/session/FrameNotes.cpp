@@ -15,10 +15,6 @@ namespace {
 // Notes that are kept for the messages to come; what a large message needs besides is let go.
 constexpr std::size_t keptNotes = 64;
 
-std::string frameName(unsigned long index) {
-    return "frame " + std::to_string(index);
-}
-
 std::string typeNumber(framing::FrameType type) {
     return std::to_string(static_cast<unsigned>(type));
 }

@@ -23,10 +23,6 @@ namespace {
            std::to_string(got));
 }
 
-std::string frameName(framing::FrameIndex index) {
-    return "frame " + std::to_string(index);
-}
-
 }  // namespace
 
 MessageReader::MessageReader(const Limits& limits, std::string arrayTag)

@@ -33,4 +33,8 @@ std::string sentence(const std::string& text, std::size_t longest) {
     return ::msg_svc::protobuf::ustring_to_utf8(units) + (cut ? "..." : "");
 }
 
+std::string frameName(std::uint64_t index) {
+    return "frame " + std::to_string(index);
+}
+
 }  // namespace foundation::msg_svc::transport::layers::session

@@ -1,7 +1,8 @@
-// Foreign bytes in messages for a person.
+// What messages for a person name: foreign bytes, and frames.
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 #include <string>
 #include <string_view>
 
@@ -14,5 +15,8 @@ std::string quoted(std::string_view bytes, std::size_t longest = 80);
 /// Well-formed UTF-8 without control characters but tab and line feed, at most `longest` bytes (and then "..."): what
 /// is shown of a sentence that the peer wrote. Bytes that are not are replaced.
 std::string sentence(const std::string& text, std::size_t longest = 8192);
+
+/// What messages call the frame with this index.
+std::string frameName(std::uint64_t index);
 
 }  // namespace foundation::msg_svc::transport::layers::session

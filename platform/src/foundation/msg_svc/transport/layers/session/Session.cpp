@@ -35,8 +35,8 @@ using Shared = boost::shared_ptr<const T>;
 constexpr std::chrono::milliseconds lingerTime{1'000};
 constexpr std::chrono::milliseconds writeFailureGrace{1'000};
 
-std::string errorText(int error) {
-    return std::generic_category().message(error);
+std::string cannotWrite(int error) {
+    return "cannot write to the stream: " + std::generic_category().message(error);
 }
 
 Saying sayingOf(const exchange::Message&, const SessionConfig&) {
@@ -249,7 +249,7 @@ void Session::Impl::onEndOfStream() {
         // what is to come, which may take for ever.
         incoming_.stop();
         if (writeError_ != 0) {
-            lose("cannot write to the stream: " + errorText(writeError_));
+            lose(cannotWrite(writeError_));
         } else {
             outgoing_.awaitHangUp();
         }
@@ -264,7 +264,7 @@ void Session::Impl::onEndOfStream() {
         text += client ? ", before the engine's shutdown event" : ", without the client's goodbye";
     }
     if (writeError_ != 0) {
-        text += "; writing to it had failed: " + errorText(writeError_);
+        text += "; writing to it had failed: " + std::generic_category().message(writeError_);
     }
     lose(text);
 }
@@ -289,7 +289,7 @@ void Session::Impl::onWritten(bool all) {
 
 void Session::Impl::onWriteFailed(int error) {
     writeError_ = error;
-    const std::string text = "cannot write to the stream: " + errorText(error);
+    const std::string text = cannotWrite(error);
     if (stage_ == Stage::Ending) {
         closeDown();
     } else if (stage_ == Stage::Closing) {
