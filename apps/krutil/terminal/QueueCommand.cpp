@@ -1,7 +1,8 @@
 #include "krutil/terminal/QueueCommand.hpp"
 
-#include <algorithm>
 #include <charconv>
+#include <iomanip>
+#include <sstream>
 #include <string_view>
 
 namespace krutil_client {
@@ -32,20 +33,19 @@ std::string capabilityNames(const capabilities::CapabilityList& list) {
 }
 
 std::string queueText(const Client& client) {
-    constexpr std::size_t numberWidth = 4;
-    constexpr std::size_t stateWidth = 10;
-    std::string text;
+    constexpr int numberWidth = 4;
+    constexpr int stateWidth = 10;
+    std::ostringstream text;
     for (const auto& request : client.requests().unanswered()) {
-        const std::string number = std::to_string(request->number);
-        const std::string state(stateName(request->state));
-        text += std::string(numberWidth - std::min(number.size(), numberWidth), ' ') + number + "  " + state +
-                std::string(stateWidth - state.size(), ' ') + request->name + "\n";
+        text << std::right << std::setw(numberWidth) << request->number << "  " << std::left << std::setw(stateWidth)
+             << stateName(request->state) << request->name << '\n';
     }
-    if (text.empty()) {
-        text = "Nothing runs, and nothing waits.\n";
+    if (client.requests().unanswered().empty()) {
+        text << "Nothing runs, and nothing waits.\n";
     }
-    return text + "The engine states " + capabilityNames(client.engineCapabilities()) + "; this client states " +
-           capabilityNames(client.capabilities()) + ".\n";
+    text << "The engine states " << capabilityNames(client.engineCapabilities()) << "; this client states "
+         << capabilityNames(client.capabilities()) << ".\n";
+    return text.str();
 }
 
 }  // namespace
