@@ -3,6 +3,8 @@
 # Generates C++ message classes from schema files into DIRECTORY and returns the list of generated sources in the variable
 # OUT. EXPORT_MACRO marks the classes and enum helpers for export from a shared library. IMPORTS are further directories
 # in which imported files are found.
+#
+# The target krutil_generated_code makes all of it without compiling it.
 
 find_package(Protobuf 3.6 REQUIRED)
 
@@ -30,5 +32,10 @@ function(krutil_generate_messages out directory)
             VERBATIM)
         list(APPEND generated "${directory}/${stem}.pb.cc" "${directory}/${stem}.pb.h")
     endforeach()
+    add_custom_target(${out}_generated DEPENDS ${generated})
+    if(NOT TARGET krutil_generated_code)
+        add_custom_target(krutil_generated_code)
+    endif()
+    add_dependencies(krutil_generated_code ${out}_generated)
     set(${out} "${generated}" PARENT_SCOPE)
 endfunction()
