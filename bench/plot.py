@@ -25,7 +25,7 @@ def _bars(axes, results):
 def _lines(axes, results, axis):
     series = {}
     for result in results:
-        series.setdefault(ratios.name_of(result), []).append(result)
+        series.setdefault(ratios.series_of(result), []).append(result)
     for name, points in series.items():
         sizes = [point["size"] for point in points]
         axes.plot(sizes, [point["ratio"][1] for point in points], marker="o", markersize=3, label=name)

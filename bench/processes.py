@@ -36,7 +36,8 @@ def listening_engine(run):
     """An engine that listens: its process and the path of its socket."""
     with tempfile.TemporaryDirectory() as directory:
         path = os.path.join(directory, "private", "engine")
-        with subprocess.Popen([run.program("bin", "krutil-qvm"), "--listen", path], stderr=subprocess.PIPE) as engine:
+        with subprocess.Popen([run.program("bin", "krutil-qvm"), "--listen", path], stdin=subprocess.DEVNULL,
+                              stderr=subprocess.PIPE) as engine:
             try:
                 line = engine.stderr.readline().decode()
                 if line != f"krutil-qvm: serving {path}\n":
@@ -64,7 +65,7 @@ def evaluation_with_listening_engine(run):
 def lines_shown(run):
     code = "for i in range(200000): print('line', i)"
     expected = "".join(f"line {i}\n" for i in range(200000)).encode()
-    return [in_turn("", min(run.repetitions, 7), [
+    return [in_turn("", max(3, run.repetitions // 2), [
         ("python3 -u", lambda: run_checked([PYTHON, "-u", "-c", code], expected)),
         ("krutil", lambda: run_checked([run.program("bin", "krutil"), "eval", code], expected))])]
 

@@ -49,7 +49,7 @@ class Run:
 
 def rows_of(command):
     """The rows that a program prints, each a line of JSON."""
-    output = subprocess.run(command, stdout=subprocess.PIPE, check=True).stdout
+    output = subprocess.run(command, stdin=subprocess.DEVNULL, stdout=subprocess.PIPE, check=True).stdout
     return [json.loads(line) for line in output.splitlines()]
 
 
@@ -88,6 +88,7 @@ RAW_ARRAY = "the same bytes sent raw, from process to process, each of which use
 REUSED = "The array is the same each time; what the engine and the client do with memory is up to them."
 FILES = "Files are in the page cache; nothing else is kept from one start to the next."
 
+# The null case comes first.
 QUESTIONS = [
     Question("null", "The harness itself: a raw round trip of 200 bytes there and 500 back",
              "the same once more, so the ratio must be 1 within its spread", engine("null")),
@@ -110,13 +111,14 @@ QUESTIONS = [
              "a `python3` that has printed the same and waits", processes.idle_memory, placements=(SCHEDULER,),
              conditions="All processes are there at the same time.", unit="bytes"),
     Question("message-sizes", "A request and its reply between two ends of a session, without an engine", RAW,
-             engine("message-sizes"), axis="characters of the request"),
-    Question("array-sizes", "A call with an array, over the socket", RAW_ARRAY, engine("array-sizes"), conditions=REUSED,
-             axis="bytes of the array"),
+             engine("message-sizes"), placements=(ONE_CORE,), axis="characters of the request"),
+    Question("array-sizes", "A call with an array, over the socket", RAW_ARRAY, engine("array-sizes"),
+             placements=(ONE_CORE,), conditions=REUSED, axis="bytes of the array"),
     Question("sessions", "An evaluation of `1+1` in each session of a listening engine at the same time, each of them",
-             "raw framed round trips of the same bytes with as many processes", engine("sessions"), axis="sessions"),
+             "raw framed round trips of the same bytes with as many processes", engine("sessions"),
+             placements=(ONE_CORE,), axis="sessions"),
     Question("queue-lengths", "Requests (`pass`) sent at once, each of them", RAW, engine("queue-lengths"),
-             axis="requests sent at once"),
+             placements=(ONE_CORE,), axis="requests sent at once"),
     Question("causes", "An error with causes", "an evaluation of `1+1` on a warm engine", engine("causes"),
-             axis="causes"),
+             placements=(ONE_CORE,), axis="causes"),
 ]

@@ -24,9 +24,22 @@ def compare(row):
             for each in row["times"][1:]]
 
 
+def series_of(result):
+    """What a result is called together with those that differ in size only."""
+    return ", ".join(part for part in (result["case"], result["contender"]) if part)
+
+
 def name_of(result):
     """What a result is called in a table and where ratios are recorded."""
-    return ", ".join(part for part in (result["case"], result["contender"]) if part)
+    return series_of(result) if result["size"] is None else f"{series_of(result)}, {size_text(result['size'])}"
+
+
+def size_text(size):
+    """A size, with a binary prefix where that is exact."""
+    for scale, prefix in ((2**30, " Gi"), (2**20, " Mi"), (2**10, " Ki")):
+        if size >= scale and size % scale == 0:
+            return f"{size / scale:g}{prefix}"
+    return f"{size:,.0f}"
 
 
 def figure_text(value, unit):
@@ -55,8 +68,8 @@ def table(question, results):
 def regressions(name, results, recorded, tolerance):
     """Sentences about the results of a question that are worse than recorded.
 
-    `recorded` holds medians by the name of a result. A ratio is worse when even its lower quartile is above the recorded
-    median by more than the tolerance, which is a share of that median.
+    `recorded` holds medians by the name of a result. A ratio is worse when even its lower quartile is above the
+    recorded median by more than the tolerance, which is a share of that median.
     """
     sentences = []
     for result in results:
@@ -68,3 +81,13 @@ def regressions(name, results, recorded, tolerance):
             sentences.append(f"{name}, {case}: {median:.2f} times the baseline (lower quartile {low:.2f}), recorded "
                              f"{recorded[case]:.2f}; more than {tolerance:.0%} worse")
     return sentences
+
+
+def unrest(results, tolerance=0.1):
+    """A sentence when the null case says that ratios of now mean nothing; empty when they do."""
+    for result in results:
+        median = result["ratio"][1]
+        if abs(median - 1) > tolerance:
+            return (f"null, {name_of(result)}: {median:.2f} times itself; the machine is too busy to compare anything. "
+                    "Wait, or measure with real-time priority: chrt -f 10 ./scripts/bench, as root")
+    return ""

@@ -23,7 +23,6 @@ double secondsOf(const Contender& contender, std::size_t count) {
 
 // How often a contender does its work in a batch of that length.
 std::size_t countFor(const Contender& contender, double batchSeconds) {
-    secondsOf(contender, 1);
     std::size_t count = 1;
     double seconds = secondsOf(contender, count);
     while (seconds < batchSeconds / 4) {

@@ -50,6 +50,12 @@ class RatiosTest(unittest.TestCase):
                          ["2.5 s", "12.5 ms", "3 us", "84.4 ns"])
         self.assertEqual(ratios.figure_text(5 * 2**20, "bytes"), "5.0 MiB")
 
+    def test_a_size_is_part_of_a_name_but_not_of_a_series(self):
+        for size, text in ((16, "16"), (100_000, "100,000"), (65_536, "64 Ki"), (4 * 2**20, "4 Mi"), (2**32, "4 Gi")):
+            result, = ratios.compare(row([3.0], [2.0], size=size))
+            self.assertEqual(ratios.name_of(result), f"one core, krutil, {text}")
+            self.assertEqual(ratios.series_of(result), "one core, krutil")
+
     def test_contenders_have_their_turns_one_after_the_other(self):
         turns = []
         measured = processes.in_turn("cold", 2, [("a", lambda: turns.append("a") or 1.0),
@@ -87,6 +93,13 @@ class VerdictTest(unittest.TestCase):
     def test_a_case_that_nobody_recorded(self):
         self.assertEqual(self.verdict([1.0], {"two cores, krutil": 8.0}),
                          ["evaluation, one core, krutil: not recorded; ./scripts/bench --record evaluation does that"])
+
+    def test_a_busy_machine_is_found_by_the_null_case(self):
+        self.assertEqual(ratios.unrest(ratios.compare(row([1.1, 1.0, 0.9], [1.0, 1.0, 1.0]))), "")
+        for ours, text in (([1.2], "1.20"), ([0.5], "0.50")):
+            self.assertEqual(ratios.unrest(ratios.compare(row(ours, [1.0]))),
+                             f"null, one core, krutil: {text} times itself; the machine is too busy to compare anything. "
+                             "Wait, or measure with real-time priority: chrt -f 10 ./scripts/bench, as root")
 
 
 if __name__ == "__main__":
