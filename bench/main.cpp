@@ -15,6 +15,7 @@
 
 #include "Comparison.hpp"
 #include "SerializerBench.hpp"
+#include "peers/SmallMessageBench.hpp"
 
 namespace bench {
 namespace {
@@ -123,6 +124,7 @@ int main(int argc, char** argv) {
         return 2;
     }
     bench::addSerializerBenches();
+    bench::addSmallMessageBenches();
     const std::regex wanted(benchmark::GetBenchmarkFilter());
     for (const bench::Comparison& comparison : bench::comparisons()) {
         const std::string ours = comparison.benchmark();
