@@ -11,7 +11,6 @@
 #include <csignal>
 #include <filesystem>
 #include <fstream>
-#include <iterator>
 #include <sstream>
 #include <stdexcept>
 
@@ -39,9 +38,11 @@ std::vector<int> numbersIn(const fs::path& directory) {
     return numbers;
 }
 
+// Empty when the process has gone. It may go between open and read, which an iterator over the buffer would throw.
 std::string contentOf(const fs::path& file) {
-    std::ifstream in(file);
-    return {std::istreambuf_iterator<char>(in), {}};
+    std::ostringstream content;
+    content << std::ifstream(file).rdbuf();
+    return content.str();
 }
 
 // State and parent of a process or thread; a space and -1 for one that has gone.
