@@ -422,5 +422,19 @@ TEST_F(SessionFlowTest, StreamWhoseWritingFailsIsLostThoughItsInputStaysOpen) {
     ::close(keptOpen);
 }
 
+// close() does not hide that nobody heard the last event.
+TEST_F(SessionFlowTest, EngineThatClosesAfterAFailedWriteHasLostItsClient) {
+    const Ends ends = pipes();
+    SessionWithBytes end(configOf(Role::Engine), ends);
+    const int keptOpen = ::fcntl(ends.otherOut, F_DUPFD_CLOEXEC, 0);
+    end.peer->write(wire::goodbye());
+    end.saw.waitForLines(1);
+    end.peer->close();
+    end.session->send(0, shutdownEvent());
+    end.session->close();
+    EXPECT_THAT(end.saw.waitForEnd(), isEnd(Reason::Lost, "cannot write to the stream: Broken pipe"));
+    ::close(keptOpen);
+}
+
 }  // namespace
 }  // namespace testing_sessions

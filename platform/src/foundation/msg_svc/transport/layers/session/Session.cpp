@@ -318,10 +318,14 @@ bool Session::Impl::advance(Stage next) {
     return true;
 }
 
-// What close() amounts to.
+// What close() amounts to. An engine that could not write its last event has lost its client, whichever of the two is
+// noticed first.
 SessionEnd Session::Impl::ownEnd() const {
-    const bool saidAll =
-        config.role == Role::Client ? isDone(Role::Engine) : isDone(Role::Client) && isDone(Role::Engine);
+    const bool client = config.role == Role::Client;
+    if (!client && writeError_ != 0) {
+        return {SessionEnd::Reason::Lost, cannotWrite(writeError_)};
+    }
+    const bool saidAll = isDone(Role::Engine) && (client || isDone(Role::Client));
     return {saidAll && !outgoing_.hasFailed() ? SessionEnd::Reason::Finished : SessionEnd::Reason::Closed, {}};
 }
 
