@@ -105,7 +105,7 @@ TEST(ByteClientTest, ARequestNeedsNoIdentifier) {
 
 TEST(ByteClientTest, ACancelTakesTheFirstQueuedRequestOfSeveralWithOneIdentifier) {
     ByteClient client;
-    client.write(evaluation(1, "print('running', flush=True)\nwhile True: pass", enqueueing(1, 7)));
+    client.write(evaluation(1, "print('running\\n', end='', flush=True)\nwhile True: pass", enqueueing(1, 7)));
     client.awaitTag("krutil:TextBaseEvent");
     client.write(evaluation(2, "print(2)", enqueueing(1, 7)) + evaluation(3, "print(3)", enqueueing(1, 7)));
     const std::string cancelled = "KeyboardInterrupt: The request was cancelled before it was started.";
