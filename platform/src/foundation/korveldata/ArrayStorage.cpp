@@ -13,7 +13,7 @@ ArrayStorage::ArrayStorage(Buffer buffer, bool writable, char* data, std::shared
     : writable_(writable), data_(data), buffer_(std::move(buffer)), owner_(std::move(owner)) {}
 
 ArrayStorage::Pointer ArrayStorage::allocate(std::size_t size) {
-    return takeOver(Buffer(BufferAllocator::allocate(size), &BufferAllocator::release), true);
+    return takeOver(Buffer(BufferAllocator::allocateToSend(size), &BufferAllocator::release), true);
 }
 
 ArrayStorage::Pointer ArrayStorage::takeOver(Buffer buffer, bool writable) {

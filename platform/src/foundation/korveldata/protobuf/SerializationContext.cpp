@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "foundation/korveldata/describe.hpp"
+#include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
 
 namespace foundation::korveldata::protobuf {
 
@@ -14,6 +15,8 @@ namespace foundation::korveldata::protobuf {
 static_assert(std::endian::native == std::endian::little, "the wire is little-endian");
 
 namespace {
+
+using vantor::carrier::framing::BufferAllocator;
 
 MemoryOrder orderOf(const KORVEL_Array& message) {
     switch (message.order()) {
@@ -25,6 +28,11 @@ MemoryOrder orderOf(const KORVEL_Array& message) {
             throw ArrayFormatError("KORVEL_Array: memory order " + std::to_string(message.order()) +
                                    "; expected 1 (row-major) or 2 (column-major)");
     }
+}
+
+/// Whether an element of this type is one whatever its bytes are, alone and beside others.
+bool anyBytesWillDo(ElementType type) {
+    return type != ElementType::Bool && type != ElementType::Char16;
 }
 
 /// Bytes other than 0 and 1 would be undefined behaviour in whatever reads them as bool.
@@ -111,6 +119,10 @@ Array SerializationContext::convertFromProtobuf(std::unique_ptr<KORVEL_Array> me
                                        ", but data frames are off (zero copy is disabled in this process)");
             }
             array = factory_.fromBuffer(type, dimensions, order, reader_->read(message->dataid()));
+            if (!anyBytesWillDo(type) && BufferAllocator::isForeign(array.data())) {
+                // What is checked, or read twice, must not change in between.
+                array = factory_.createArray(type, dimensions, order, array.data());
+            }
             break;
         default:
             throw ArrayFormatError("KORVEL_Array: " + describe(type, claimed) +

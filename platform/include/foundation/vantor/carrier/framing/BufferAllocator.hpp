@@ -8,6 +8,13 @@
 
 namespace foundation::vantor::carrier::framing {
 
+/// What may be done with the bytes of an adopted buffer.
+enum class Adoption {
+    Borrowed,  ///< another owner still reads them: whoever receives the buffer must not write into it
+    Owned,     ///< they are the buffer's alone
+    Foreign,   ///< the same, but another process may change them at any time: what is checked must be a copy
+};
+
 /// Hands out the buffers that data frames are received into and that arrays live in, and knows each one's size by its
 /// address: a receiver can compare what a peer announced with what it sent. Addresses are 64-byte aligned. Pages of a
 /// large buffer are not touched before its user touches them; large buffers are recycled, up to a bound. All members
@@ -16,6 +23,11 @@ class BufferAllocator {
   public:
     /// A buffer of `size` bytes, uninitialised; never null, for size 0 either. Throws std::bad_alloc.
     static char* allocate(std::size_t size);
+
+    /// The same for bytes that this process fills and perhaps sends. While a session of the process shares memory with
+    /// its peer, a large buffer lies in such memory, so that it arrives without being copied. The peer may then see
+    /// what is written into it, sent or not.
+    static char* allocateToSend(std::size_t size);
 
     /// The deleter of every buffer of this allocator: a plain function, so that it can be told apart by its address and
     /// stored where only a function pointer fits. Null is ignored; an address that is not in use ends the process
@@ -26,14 +38,19 @@ class BufferAllocator {
     static std::optional<std::size_t> sizeOf(const char* buffer);
 
     /// Lets memory of another owner travel as a buffer of this allocator, without a copy: release(address) calls
-    /// `drop(owner)` instead of freeing. The bytes must stay valid and unchanged until then. An address may be adopted
-    /// several times, with the same size or another; each release() pairs with one adopt(), the latest first, and
-    /// sizeOf() tells the latest's size. `drop` runs on whatever thread releases and must not throw. Returns `address`.
-    static char* adopt(char* address, std::size_t size, void (*drop)(void* owner), void* owner);
+    /// `drop(owner)` instead of freeing. The bytes must stay valid until then, borrowed ones unchanged. An address may
+    /// be adopted several times, with the same size or another; each release() pairs with one adopt(), the latest
+    /// first, and sizeOf() tells the latest's size. `drop` runs on whatever thread releases and must not throw. Returns
+    /// `address`.
+    static char* adopt(char* address, std::size_t size, void (*drop)(void* owner), void* owner,
+                       Adoption adoption = Adoption::Borrowed);
 
-    /// True when release(buffer) would drop an adoption: the bytes are another owner's, who may still read them, so
+    /// True when release(buffer) would drop an adoption of borrowed bytes: another owner may still read them, so
     /// whoever receives such a buffer must not write into it. False for any other address.
     static bool isAdopted(const char* buffer);
+
+    /// True when release(buffer) would drop an adoption of foreign bytes. False for any other address.
+    static bool isForeign(const char* buffer);
 
     /// allocate() wrapped as a frame's buffer, with &BufferAllocator::release as deleter.
     static FrameBuffer makeFrameBuffer(std::size_t size);

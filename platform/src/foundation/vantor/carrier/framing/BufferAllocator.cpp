@@ -16,16 +16,16 @@
 #include <vector>
 
 #include "foundation/core/diag/terminate.hpp"
+#include "foundation/vantor/carrier/framing/largeBuffers.hpp"
+#include "foundation/vantor/carrier/shared_memory/SegmentPool.hpp"
 
 namespace foundation::vantor::carrier::framing {
 namespace {
 
+using shared_memory::SegmentPool;
+
 constexpr std::size_t alignment = 64;
 constexpr std::size_t pageSize = 4096;
-
-// From this size on a buffer has pages of its own. Returning those to the kernel and faulting in fresh ones takes four
-// to fifteen times as long as writing to them once, so they are kept for the next buffer of their size class.
-constexpr std::size_t largeSize = 1U << 20;
 
 // Bytes kept for recycling, in whole buffers. In sanitized builds nothing is kept, so that a use after release is seen.
 #ifdef KRUTIL_SANITIZED
@@ -40,6 +40,7 @@ struct Record {
     std::size_t capacity = 0;             // bytes mapped; 0 when the memory is from the heap or another owner's
     void (*drop)(void* owner) = nullptr;  // null for memory of our own
     void* owner = nullptr;
+    Adoption adoption = Adoption::Borrowed;
 };
 
 struct Entry {
@@ -81,16 +82,6 @@ Shard& shardOf(const char* address) {
     // Small buffers differ in the bits above the alignment, large ones in those above the page.
     const auto bits = reinterpret_cast<std::uintptr_t>(address);
     return shards()[(bits / alignment ^ bits / pageSize ^ bits / largeSize) % shards().size()];
-}
-
-// Four classes to each power of two: a buffer fits the next one of nearly its size, and what it does not use of its
-// capacity is never touched.
-std::size_t capacityFor(std::size_t size) {
-    std::size_t step = largeSize / 4;
-    while (step <= size / 8) {
-        step *= 2;
-    }
-    return (size + step - 1) / step * step;
 }
 
 char* takeRecycled(std::size_t capacity) {
@@ -178,6 +169,17 @@ void enter(const char* address, const Record& record) {
     buffersInUse.fetch_add(1, std::memory_order_relaxed);
 }
 
+// How the bytes were adopted; empty for memory of our own and for addresses that are not in use.
+std::optional<Adoption> adoptionOf(const char* buffer) {
+    Shard& shard = shardOf(buffer);
+    const std::lock_guard lock(shard.mutex);
+    const auto found = shard.entries.find(buffer);
+    if (found == shard.entries.end() || found->second.latest.drop == nullptr) {
+        return std::nullopt;
+    }
+    return found->second.latest.adoption;
+}
+
 }  // namespace
 
 char* BufferAllocator::allocate(std::size_t size) {
@@ -191,6 +193,21 @@ char* BufferAllocator::allocate(std::size_t size) {
         throw;
     }
     return buffer;
+}
+
+char* BufferAllocator::allocateToSend(std::size_t size) {
+    SegmentPool& pool = SegmentPool::ofProcess();
+    char* const memory = size >= largeSize && pool.wantsArrays() ? pool.take(size) : nullptr;
+    if (memory == nullptr) {
+        return allocate(size);
+    }
+    const auto giveBack = [](void* owner) { SegmentPool::ofProcess().giveBack(static_cast<char*>(owner)); };
+    try {
+        return adopt(memory, size, giveBack, memory, Adoption::Owned);
+    } catch (...) {
+        giveBack(memory);
+        throw;
+    }
 }
 
 void BufferAllocator::release(char* buffer) {
@@ -231,16 +248,18 @@ std::optional<std::size_t> BufferAllocator::sizeOf(const char* buffer) {
     return found == shard.entries.end() ? std::nullopt : std::optional(found->second.latest.size);
 }
 
-char* BufferAllocator::adopt(char* address, std::size_t size, void (*drop)(void* owner), void* owner) {
-    enter(address, Record{size, 0, drop, owner});
+char* BufferAllocator::adopt(char* address, std::size_t size, void (*drop)(void* owner), void* owner,
+                             Adoption adoption) {
+    enter(address, Record{size, 0, drop, owner, adoption});
     return address;
 }
 
 bool BufferAllocator::isAdopted(const char* buffer) {
-    Shard& shard = shardOf(buffer);
-    const std::lock_guard lock(shard.mutex);
-    const auto found = shard.entries.find(buffer);
-    return found != shard.entries.end() && found->second.latest.drop != nullptr;
+    return adoptionOf(buffer) == Adoption::Borrowed;
+}
+
+bool BufferAllocator::isForeign(const char* buffer) {
+    return adoptionOf(buffer) == Adoption::Foreign;
 }
 
 FrameBuffer BufferAllocator::makeFrameBuffer(std::size_t size) {
