@@ -132,6 +132,7 @@ bool Engine::open(int in, int out) {
     config.build = apps::buildString("krutil-qvm");
     config.limits = options_.limits;
     config.capabilities = capabilities_.lists().engine;
+    config.sharedMemory = !options_.noSharedMemory;
     if (!options_.noPrecheck) {
         config.check = apps::precheck;
     }

@@ -57,6 +57,9 @@ Options parseOptions(int argc, const char* const* argv) {
     app.add_flag("--no-zero-copy", options.noZeroCopy,
                  "Copy arrays into their messages, as QX_DISABLE_ZEROCOPY=1 does; clients must do the same")
         ->group(sessions);
+    app.add_flag("--no-shared-memory", options.noSharedMemory,
+                 "Send large arrays as bytes, also to a client of this machine that could read them where they are")
+        ->group(sessions);
     app.add_flag("--no-precheck", options.noPrecheck,
                  "Let numbers that the protocol has no meaning for end the process, instead of closing the session")
         ->group(sessions);

@@ -16,6 +16,7 @@ struct Options {
     foundation::msg_svc::transport::layers::session::Limits limits;
     RequestQueue::Bounds queue;
     bool noZeroCopy = false;       ///< arrays travel inside their messages; the peers must do the same
+    bool noSharedMemory = false;   ///< large arrays travel as bytes, also between processes of one machine
     bool noPrecheck = false;       ///< numbers that end the process are not looked for in what arrives
     std::size_t maxSessions = 64;  ///< sessions at a time of a listening engine
     std::chrono::milliseconds handshakeTimeout{10'000};

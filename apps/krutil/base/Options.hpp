@@ -18,8 +18,9 @@ struct ConnectionOptions {
     std::optional<std::string> engine;  ///< a shell command; empty for the engine that comes with this program
     std::optional<std::string> socket;  ///< a Unix socket to connect to instead of starting an engine
     std::chrono::milliseconds handshakeTimeout{10'000};
-    bool noPrecheck = false;  ///< a number that the protocol does not know ends this program, not just the session
-    bool noZeroCopy = false;  ///< elements of arrays travel inside their messages
+    bool noPrecheck = false;      ///< a number that the protocol does not know ends this program, not just the session
+    bool noZeroCopy = false;      ///< elements of arrays travel inside their messages
+    bool noSharedMemory = false;  ///< those of large arrays as bytes, also to an engine on this machine
     foundation::msg_svc::transport::layers::session::Limits limits;
 };
 

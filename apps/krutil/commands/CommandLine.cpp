@@ -53,6 +53,9 @@ void addConnectionOptions(CLI::App& app, ConnectionOptions& options) {
            "Copy arrays into their messages, as QX_DISABLE_ZEROCOPY=1 does; both ends must. An engine that is started "
            "here is told so, any other needs the option as well")
         ->group("Engine");
+    app.add_flag("--no-shared-memory", options.noSharedMemory,
+                 "Send large arrays as bytes, also to an engine of this machine that could read them where they are")
+        ->group("Engine");
     app.add_flag(
            "--no-precheck", options.noPrecheck,
            "Do not look for numbers that the protocol does not know before a message is read; one that comes then "

@@ -119,6 +119,7 @@ std::unique_ptr<Conversation> Client::openConversation(const ConnectionOptions& 
     capabilities_ = capabilitiesHere(connection, interactive);
     config.capabilities = capabilities_;
     config.handshakeTimeout = connection.handshakeTimeout;
+    config.sharedMemory = !connection.noSharedMemory;
     if (!connection.noPrecheck) {
         config.check = apps::precheck;
     }

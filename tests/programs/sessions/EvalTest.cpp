@@ -182,7 +182,12 @@ TEST(EvalTest, JsonHasEachEventInItsOrderWithTheIdentifierOfTheRequest) {
     EXPECT_EQ(events[2], json({{"event", "text"}, {"request", id}, {"stream", "output"}, {"text", "1\n"}}));
     EXPECT_EQ(events[3], json({{"event", "value"}, {"request", id}, {"stream", "output"}, {"text", "2\n"}}));
     EXPECT_EQ(events[6], json({{"event", "reply"}, {"request", id}, {"ok", true}}));
-    EXPECT_EQ(events[0].at("features"), json({{"ZEROCOPY", "enable"}}));
+    EXPECT_EQ(events[0].at("features"), json({{"SHM", "descriptors"}, {"ZEROCOPY", "enable"}}));
+}
+
+TEST(EvalTest, WithoutSharedMemoryASessionHasNoSuchFeature) {
+    const auto events = objects(runClient({"eval", "--json", "--no-shared-memory", "1"}).out);
+    EXPECT_EQ(events.at(0).at("features"), json({{"ZEROCOPY", "enable"}}));
 }
 
 TEST(EvalTest, OutputArrivesBeforeTheCodeHasEnded) {

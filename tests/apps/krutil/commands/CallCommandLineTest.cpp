@@ -81,6 +81,13 @@ TEST(CallCommandLineTest, NoZeroCopyIsForCodeToo) {
     EXPECT_FALSE(std::get<Options>(parse({"f"})).connection.noZeroCopy);
 }
 
+TEST(CallCommandLineTest, NoSharedMemoryIsForCodeToo) {
+    EXPECT_TRUE(std::get<Options>(parse({"f", "--no-shared-memory"})).connection.noSharedMemory);
+    const std::vector<const char*> eval{"krutil", "eval", "--no-shared-memory", "1"};
+    EXPECT_TRUE(std::get<Options>(parseCommandLine(4, eval.data())).connection.noSharedMemory);
+    EXPECT_FALSE(std::get<Options>(parse({"f"})).connection.noSharedMemory);
+}
+
 TEST(CallCommandLineTest, WrongCommandLines) {
     const auto sentence = [](const std::vector<const char*>& arguments) {
         const auto finished = std::get<Finished>(parse(arguments));

@@ -48,10 +48,9 @@ std::string joined(const std::vector<iovec>& pieces) {
 }
 
 std::vector<iovec> gathered(const OutgoingPieces& pieces) {
-    std::vector<iovec> all;
-    std::size_t room = 1U << 30;
-    pieces.gather(all, room, 1000);
-    return all;
+    GatheredWrite all{{}, {}, 1U << 30, 1000};
+    pieces.gather(all);
+    return all.pieces;
 }
 
 TEST(OutgoingPiecesTest, FramesLieAsTheWireHasThem) {
@@ -99,15 +98,14 @@ TEST(OutgoingPiecesTest, EveryPartialWriteLeavesTheRest) {
 
 TEST(OutgoingPiecesTest, GatheringKeepsToItsBounds) {
     const OutgoingPieces pieces(message("bulk", "content"), false);
-    std::vector<iovec> some;
-    std::size_t room = 26;
-    pieces.gather(some, room, 1000);
-    EXPECT_EQ(joined(some), bytesOf("bulk", "content").substr(0, 26));
-    EXPECT_EQ(room, 0U);
-    some.clear();
-    room = 1000;
-    pieces.gather(some, room, 2);
-    EXPECT_EQ(some.size(), 2U);
+    GatheredWrite some{{}, {}, 26, 1000};
+    pieces.gather(some);
+    EXPECT_EQ(joined(some.pieces), bytesOf("bulk", "content").substr(0, 26));
+    EXPECT_EQ(some.bytesLeft, 0U);
+    GatheredWrite few{{}, {}, 1000, 2};
+    pieces.gather(few);
+    EXPECT_EQ(few.pieces.size(), 2U);
+    EXPECT_EQ(few.piecesLeft, 0U);
 }
 
 TEST(OutgoingPiecesTest, BytesThatMayChangeAreCopiedWhenTheyMustWait) {

@@ -5,8 +5,10 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
+#include <cstring>
 #include <utility>
 
 #include "platform/session/support/WireBytes.hpp"
@@ -93,6 +95,50 @@ std::string ByteEnd::read(std::size_t count) {
     return bytes;
 }
 
+void ByteEnd::writeWith(const std::string& bytes, const std::vector<int>& descriptors) {
+    std::vector<char> room(CMSG_SPACE(descriptors.size() * sizeof(int)));
+    iovec piece{const_cast<char*>(bytes.data()), bytes.size()};
+    msghdr message{};
+    message.msg_iov = &piece;
+    message.msg_iovlen = 1;
+    message.msg_control = room.data();
+    message.msg_controllen = room.size();
+    cmsghdr* const control = CMSG_FIRSTHDR(&message);
+    control->cmsg_level = SOL_SOCKET;
+    control->cmsg_type = SCM_RIGHTS;
+    control->cmsg_len = CMSG_LEN(descriptors.size() * sizeof(int));
+    std::memcpy(CMSG_DATA(control), descriptors.data(), descriptors.size() * sizeof(int));
+    ASSERT_EQ(::sendmsg(out_, &message, MSG_NOSIGNAL), static_cast<ssize_t>(bytes.size()));
+}
+
+std::string ByteEnd::readWith(std::size_t count, std::vector<foundation::core::posix::OwnedDescriptor>& descriptors) {
+    std::string bytes(count, '\0');
+    std::size_t have = 0;
+    while (have < count && ready(in_, POLLIN)) {
+        std::vector<char> room(CMSG_SPACE(64 * sizeof(int)));
+        iovec piece{bytes.data() + have, count - have};
+        msghdr message{};
+        message.msg_iov = &piece;
+        message.msg_iovlen = 1;
+        message.msg_control = room.data();
+        message.msg_controllen = room.size();
+        const ssize_t got = ::recvmsg(in_, &message, MSG_CMSG_CLOEXEC);
+        if (got <= 0) {
+            break;
+        }
+        have += static_cast<std::size_t>(got);
+        for (cmsghdr* control = CMSG_FIRSTHDR(&message); control != nullptr; control = CMSG_NXTHDR(&message, control)) {
+            std::vector<int> numbers((control->cmsg_len - CMSG_LEN(0)) / sizeof(int));
+            std::memcpy(numbers.data(), CMSG_DATA(control), numbers.size() * sizeof(int));
+            for (const int number : numbers) {
+                descriptors.emplace_back(number);
+            }
+        }
+    }
+    bytes.resize(have);
+    return bytes;
+}
+
 std::string ByteEnd::readAll() {
     return read(~std::size_t{0});
 }
@@ -112,8 +158,14 @@ SessionVerdict ByteEnd::readVerdict() {
     return verdict;
 }
 
-void ByteEnd::shakeHands() {
+void ByteEnd::shakeHands(bool sharedMemory) {
     SessionHello mine = readHello();
+    if (!sharedMemory) {
+        auto& features = *mine.mutable_features();
+        features.erase(std::remove_if(features.begin(), features.end(),
+                                      [](const auto& feature) { return feature.name() == "SHM"; }),
+                       features.end());
+    }
     mine.set_role(mine.role() == SessionHello::CLIENT ? SessionHello::ENGINE : SessionHello::CLIENT);
     write(helloBytes(mine));
     const SessionVerdict verdict = readVerdict();

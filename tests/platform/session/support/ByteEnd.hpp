@@ -3,7 +3,9 @@
 
 #include <chrono>
 #include <string>
+#include <vector>
 
+#include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "msg_svc.protobuf.SessionHandshake.pb.h"
 
 namespace wire {
@@ -20,7 +22,11 @@ class ByteEnd {
     void write(const std::string& bytes);
     /// Writes what the stream takes within a short while; returns how much that is. Only for sockets.
     std::size_t writeSome(const std::string& bytes);
+    /// Writes bytes, with the descriptors beside the first of them; only for sockets.
+    void writeWith(const std::string& bytes, const std::vector<int>& descriptors);
     std::string read(std::size_t count);
+    /// Reads bytes, and appends the descriptors that come beside them; only for sockets.
+    std::string readWith(std::size_t count, std::vector<foundation::core::posix::OwnedDescriptor>& descriptors);
     /// All that comes until the stream ends.
     std::string readAll();
     void close();
@@ -31,8 +37,9 @@ class ByteEnd {
     msg_svc::protobuf::SessionHello readHello();
     msg_svc::protobuf::SessionVerdict readVerdict();
 
-    /// Performs the handshake as the counterpart of the other end, whatever that is, accepting everything.
-    void shakeHands();
+    /// Performs the handshake as the counterpart of the other end, whatever that is, accepting everything but shared
+    /// memory. With `sharedMemory` it accepts that, too, and the probe follows.
+    void shakeHands(bool sharedMemory = false);
 
   private:
     int in_;

@@ -40,6 +40,15 @@ inline std::string data(std::uint64_t stream, std::uint64_t index, bool last, co
     return header({2, last, type, 0, stream, index, content.size()}) + content;
 }
 
+inline std::string sharedData(std::uint64_t stream, std::uint64_t index, std::uint64_t number, std::uint64_t offset,
+                              std::uint64_t size) {
+    return header({5, false, 4, 0, stream, index, 24}) + little(number, 8) + little(offset, 8) + little(size, 8);
+}
+
+inline std::string giveBack(std::uint64_t number, bool kept = false) {
+    return header({6, false, kept ? 1U : 0U, 0, 0, number, 0});
+}
+
 inline std::string goodbye() {
     return header({3, false, 0, 0, 0, 0, 0});
 }

@@ -64,6 +64,10 @@ struct SessionConfig {
     ::capabilities::CapabilityList capabilities;
     std::chrono::milliseconds handshakeTimeout{10'000};
 
+    /// Lets contents of data frames of 1 MiB and more stay in memory that both ends see, where the peer wants that too,
+    /// the stream is a Unix socket and descriptors reach the peer. Code may write to such a content as to any other.
+    bool sharedMemory = false;
+
     /// Bytes of unwritten output above which waitForRoom() waits.
     std::size_t roomBytes = 1U << 20;
 

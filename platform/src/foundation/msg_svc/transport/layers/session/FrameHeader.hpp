@@ -15,9 +15,10 @@ namespace framing = ::foundation::vantor::carrier::framing;
 enum class FrameKind : std::uint8_t {
     Tagged = 1,
     Data = 2,
-    Goodbye = 3,  ///< the client sends nothing more
-    Abort = 4,    ///< the sender closes the session; the content says why
-    // 5 is kept for a data frame whose content is in shared memory that travels as a descriptor.
+    Goodbye = 3,     ///< the client sends nothing more
+    Abort = 4,       ///< the sender closes the session; the content says why
+    SharedData = 5,  ///< a data frame whose content is in memory that both ends see; see lending/SharedContent.hpp
+    Return = 6,      ///< the sender is done with a content of that kind; its number is in the place of the frame index
 };
 
 /// Header of one frame; a plain value. On the wire: kind (highest bit: last frame of its message), frame type, tag size

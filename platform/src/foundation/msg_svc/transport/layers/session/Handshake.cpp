@@ -13,6 +13,8 @@
 #include "foundation/msg_svc/transport/layers/session/LittleEndian.hpp"
 #include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
 #include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
+#include "foundation/msg_svc/transport/layers/session/lending/DescriptorPassing.hpp"
+#include "foundation/msg_svc/transport/layers/session/lending/Probe.hpp"
 #include "msg_svc.protobuf.SessionHandshake.pb.h"
 
 namespace foundation::msg_svc::transport::layers::session {
@@ -27,6 +29,10 @@ using ::msg_svc::protobuf::SessionVerdict;
 constexpr std::string_view magic("\x89KRUTIL\n", 8);
 constexpr std::uint32_t layoutVersion = 1;
 constexpr std::size_t longestBody = 65'536;
+
+// The session's own feature, beside those of the protocol. Settled only where descriptors can be passed at all.
+constexpr const char* sharedMemory = "SHM";
+constexpr const char* asDescriptors = "descriptors";
 
 // Texts for a person, so that none of them makes a hello or a verdict too long.
 constexpr std::size_t longestBuild = 1024;
@@ -339,7 +345,10 @@ SessionVerdict receiveVerdict(HandshakeStream& stream) {
 
 Settlement shakeHands(int in, int out, const SessionConfig& config) {
     const ProtocolRegistry::Protocol protocol = ProtocolRegistry::getRegistry()->find(config.protocol);
-    const std::vector<FeatureRequest> features = protocol.configuration();
+    std::vector<FeatureRequest> features = protocol.configuration();
+    if (config.sharedMemory && lending::passesDescriptors(in) && lending::passesDescriptors(out)) {
+        features.emplace_back(sharedMemory, asDescriptors, FeatureHandling::Optional);
+    }
     const SessionHello own = ownHello(config, features);
 
     HandshakeStream stream(in, out, config.handshakeTimeout);
@@ -361,7 +370,9 @@ Settlement shakeHands(int in, int out, const SessionConfig& config) {
     const bool ownIsClient = config.role == Role::Client;
     settle(ownIsClient ? ownEnd : peerEnd, ownIsClient ? peerEnd : ownEnd, agreement);
     checkUsable(config, features, ownEnd.name, agreement);
-    Settlement settlement{peerOf(peer), {agreement.features.begin(), agreement.features.end()}, nullptr, {}};
+    Settlement settlement{peerOf(peer), {agreement.features.begin(), agreement.features.end()}, nullptr, {}, false};
+    // Of the session, not of the protocol, and not settled before it has been tried.
+    settlement.features.erase(sharedMemory);
     if (agreement.mismatches.empty()) {
         settlement.registry = setUp(protocol, config, ownEnd.name, settlement.features, agreement.mismatches);
         settlement.arrayTag = tagOfArrays(*settlement.registry);
@@ -386,6 +397,10 @@ Settlement shakeHands(int in, int out, const SessionConfig& config) {
                                ownEnd.name);
     }
     stream.flush();
+    if (agreement.features.contains(sharedMemory) && lending::probeSharedMemory(stream)) {
+        settlement.sharedMemory = true;
+        settlement.features.emplace(sharedMemory, asDescriptors);
+    }
     return settlement;
 }
 

@@ -15,7 +15,8 @@ struct Settlement {
     Peer peer;
     std::unordered_map<std::string, std::string> features;
     std::shared_ptr<const serialization::Registry> registry;
-    std::string arrayTag;  ///< tag to which Limits::arrayMessage applies; empty for a protocol without arrays
+    std::string arrayTag;       ///< tag to which Limits::arrayMessage applies; empty for a protocol without arrays
+    bool sharedMemory = false;  ///< array contents may stay in memory that both ends see
 };
 
 /// Exchanges hellos and verdicts over two non-blocking descriptors, which stay the caller's; reads not one byte more.

@@ -1,14 +1,17 @@
 #include "foundation/msg_svc/transport/layers/session/HandshakeStream.hpp"
 
 #include <poll.h>
+#include <sys/uio.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <span>
 #include <system_error>
 
 #include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
+#include "foundation/msg_svc/transport/layers/session/lending/DescriptorPassing.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 namespace {
@@ -22,17 +25,27 @@ std::string errorText(int error) {
 HandshakeStream::HandshakeStream(int in, int out, std::chrono::milliseconds timeout)
     : in_(in), out_(out), timeout_(timeout), deadline_(Clock::now() + timeout) {}
 
+void HandshakeStream::sendWith(const std::string& bytes, int descriptor) {
+    flush();
+    unsent_ = bytes;
+    unsentDescriptor_ = descriptor;
+}
+
 void HandshakeStream::limitTo(std::chrono::milliseconds patience) {
     deadline_ = std::min(deadline_, Clock::now() + patience);
 }
 
 void HandshakeStream::receive(char* target, std::size_t size, const std::string& what,
-                              const std::function<void(std::size_t)>& check) {
+                              const std::function<void(std::size_t)>& check,
+                              std::vector<core::posix::OwnedDescriptor>* descriptors) {
     for (std::size_t have = 0; have < size;) {
         const std::string progress =
             std::to_string(have) + " of " + std::to_string(size) + " bytes of " + what + " had arrived";
         wait(true, progress);
-        const ssize_t count = ::read(in_, target + have, size - have);
+        const iovec piece{target + have, size - have};
+        const ssize_t count = descriptors == nullptr
+                                  ? ::readv(in_, &piece, 1)
+                                  : lending::receiveWithDescriptors(in_, std::span(&piece, 1), *descriptors);
         if (count > 0) {
             have += static_cast<std::size_t>(count);
             if (check) {
@@ -87,8 +100,12 @@ void HandshakeStream::wait(bool reading, const std::string& progress) {
 }
 
 void HandshakeStream::writeSome() {
-    const ssize_t count = ::write(out_, unsent_.data(), unsent_.size());
+    const iovec piece{unsent_.data(), unsent_.size()};
+    const ssize_t count = unsentDescriptor_ < 0 ? ::writev(out_, &piece, 1)
+                                                : lending::sendWithDescriptors(out_, std::span(&piece, 1),
+                                                                               std::span(&unsentDescriptor_, 1));
     if (count >= 0) {
+        unsentDescriptor_ = -1;
         unsent_.erase(0, static_cast<std::size_t>(count));
     } else if (errno != EINTR && errno != EAGAIN && errno != EWOULDBLOCK) {
         // The peer may have said why before it closed its end, so reading goes on.

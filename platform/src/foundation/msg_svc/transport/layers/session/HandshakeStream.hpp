@@ -5,6 +5,9 @@
 #include <cstddef>
 #include <functional>
 #include <string>
+#include <vector>
+
+#include "foundation/core/posix/OwnedDescriptor.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 
@@ -18,14 +21,19 @@ class HandshakeStream {
     /// Hands bytes over; they are written while receive() and flush() wait.
     void send(const std::string& bytes) { unsent_ += bytes; }
 
+    /// The same with a descriptor that goes with the first of the bytes, over a Unix socket; -1 for none. It stays the
+    /// caller's, and is needed until they are written. Throws StreamLost, as flush() does, which comes first.
+    void sendWith(const std::string& bytes, int descriptor);
+
     /// Shortens what is left of the time limit to `patience`.
     void limitTo(std::chrono::milliseconds patience);
 
     /// Reads exactly `size` bytes to `target`. `check` gets the number that are there, each time some have come, and
-    /// may throw; empty for none. `what` names the bytes in errors. Throws StreamLost for an end of the stream, an
-    /// error and the time limit.
+    /// may throw; empty for none. `what` names the bytes in errors. Descriptors that come along are appended to
+    /// `descriptors`, or dropped without it. Throws StreamLost for an end of the stream, an error and the time limit.
     void receive(char* target, std::size_t size, const std::string& what,
-                 const std::function<void(std::size_t)>& check = nullptr);
+                 const std::function<void(std::size_t)>& check = nullptr,
+                 std::vector<core::posix::OwnedDescriptor>* descriptors = nullptr);
 
     /// What else is there already, for a message that shows it.
     std::string peek(std::size_t most) const;
@@ -44,6 +52,7 @@ class HandshakeStream {
     std::chrono::milliseconds timeout_;
     Clock::time_point deadline_;
     std::string unsent_;
+    int unsentDescriptor_ = -1;
     int writeError_ = 0;
 };
 

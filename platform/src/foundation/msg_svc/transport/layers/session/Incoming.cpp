@@ -24,14 +24,15 @@ constexpr int readsInATurn = 16;
 
 Incoming::Incoming(asio::io_context& io, core::posix::OwnedDescriptor& descriptor, const SessionConfig& config,
                    std::shared_ptr<const serialization::Registry> registry, const std::string& arrayTag,
-                   SharedExchanges& exchanges, const Outgoing& outgoing, Owner& owner)
+                   SharedExchanges& exchanges, const Outgoing& outgoing, lending::SharedMemory* shared, Owner& owner)
     : config_(config),
       registry_(std::move(registry)),
       exchanges_(exchanges),
       outgoing_(outgoing),
+      shared_(shared),
       owner_(owner),
       stream_(io),
-      reader_(config.limits, arrayTag),
+      reader_(config.limits, arrayTag, shared == nullptr ? nullptr : &shared->borrower),
       arrayTag_(arrayTag),
       descriptor_(descriptor.get()) {
     stream_.assign(descriptor.get());
@@ -104,7 +105,13 @@ void Incoming::readAvailable() {
 // Returns whether there may be more.
 bool Incoming::read() {
     const auto pieces = reader_.buffers();
-    const ssize_t count = readSome(descriptor_, pieces);
+    ssize_t count = 0;
+    try {
+        count = shared_ == nullptr ? readSome(descriptor_, pieces) : shared_->borrower.read(descriptor_, pieces);
+    } catch (const std::exception& failure) {
+        owner_.onViolation(failure.what());
+        return false;
+    }
     if (count < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
         return false;
     }
@@ -155,6 +162,13 @@ void Incoming::takeItems() {
 void Incoming::take(MessageReader::Item item) {
     if (auto* const abort = std::get_if<MessageReader::Abort>(&item)) {
         owner_.onPeerAbort(abort->reason);
+        return;
+    }
+    if (const auto* const returned = std::get_if<MessageReader::Returned>(&item)) {
+        if (!shared_->lender.takeBack(returned->number, returned->kept)) {
+            throw ProtocolViolation("return frame: expected the number of a content that is lent, got " +
+                                    std::to_string(returned->number));
+        }
         return;
     }
     std::optional<Refusal> refusal;

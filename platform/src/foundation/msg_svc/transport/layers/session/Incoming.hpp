@@ -21,6 +21,7 @@
 #include "foundation/msg_svc/transport/layers/session/ObjectWriter.hpp"
 #include "foundation/msg_svc/transport/layers/session/Outgoing.hpp"
 #include "foundation/msg_svc/transport/layers/session/Session.hpp"
+#include "foundation/msg_svc/transport/layers/session/lending/SharedMemory.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 
@@ -41,10 +42,11 @@ class Incoming {
         ~Owner() = default;
     };
 
-    /// Takes the descriptor over; it must be non-blocking. All references must outlive this object.
+    /// Takes the descriptor over; it must be non-blocking. All references must outlive this object. `shared` is null
+    /// when the peer sees no memory of this process, nor this process any of the peer's.
     Incoming(asio::io_context& io, core::posix::OwnedDescriptor& descriptor, const SessionConfig& config,
              std::shared_ptr<const serialization::Registry> registry, const std::string& arrayTag,
-             SharedExchanges& exchanges, const Outgoing& outgoing, Owner& owner);
+             SharedExchanges& exchanges, const Outgoing& outgoing, lending::SharedMemory* shared, Owner& owner);
 
     /// Begins to read, unless stop() was called before.
     void start(SessionHandler& handler);
@@ -96,6 +98,7 @@ class Incoming {
     const std::shared_ptr<const serialization::Registry> registry_;
     SharedExchanges& exchanges_;
     const Outgoing& outgoing_;
+    lending::SharedMemory* const shared_;
     Owner& owner_;
     asio::posix::stream_descriptor stream_;
     MessageReader reader_;

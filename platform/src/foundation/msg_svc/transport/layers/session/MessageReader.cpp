@@ -9,6 +9,7 @@
 #include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
 #include "foundation/vantor/carrier/framing/DataFrame.hpp"
 #include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
+#include "foundation/vantor/carrier/shared_memory/ReceivedMemory.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 namespace {
@@ -23,10 +24,15 @@ namespace {
            std::to_string(got));
 }
 
+[[noreturn]] void refuseForMemory(framing::FrameIndex index, std::uint64_t size) {
+    throw ProtocolViolation("there is no memory for the content of " + frameName(index) + ", " + std::to_string(size) +
+                            " bytes");
+}
+
 }  // namespace
 
-MessageReader::MessageReader(const Limits& limits, std::string arrayTag)
-    : limits_(limits), arrayTag_(std::move(arrayTag)), ahead_(new char[mostAhead]) {}
+MessageReader::MessageReader(const Limits& limits, std::string arrayTag, lending::Borrower* borrower)
+    : limits_(limits), arrayTag_(std::move(arrayTag)), borrower_(borrower), ahead_(new char[mostAhead]) {}
 
 std::span<const iovec> MessageReader::buffers() noexcept {
     std::size_t count = 0;
@@ -90,9 +96,11 @@ std::optional<MessageReader::Item> MessageReader::next() {
 
 void MessageReader::acceptHeader() {
     header_ = decode(headerBytes_);
-    const bool message = header_->is(FrameKind::Tagged) || header_->is(FrameKind::Data);
-    if (message) {
+    const bool shared = borrower_ != nullptr && header_->is(FrameKind::SharedData);
+    if (shared || header_->is(FrameKind::Tagged) || header_->is(FrameKind::Data)) {
         checkMessageHeader();
+    } else if (borrower_ != nullptr && header_->is(FrameKind::Return)) {
+        checkReturnHeader();
     } else {
         checkControlHeader();
     }
@@ -107,7 +115,10 @@ void MessageReader::acceptHeader() {
 void MessageReader::checkControlHeader() const {
     const bool goodbye = header_->is(FrameKind::Goodbye);
     if (!goodbye && !header_->is(FrameKind::Abort)) {
-        refuse("frame kind", "1 (tagged), 2 (data), 3 (goodbye) or 4 (abort)", std::to_string(header_->kind));
+        refuse("frame kind",
+               borrower_ == nullptr ? "1 (tagged), 2 (data), 3 (goodbye) or 4 (abort)"
+                                    : "1 (tagged), 2 (data), 3 (goodbye), 4 (abort), 5 (shared data) or 6 (return)",
+               std::to_string(header_->kind));
     }
     if (header_->last || header_->type != framing::FrameType::Unspecified || header_->tagSize != 0 ||
         header_->stream != 0 || header_->index != 0) {
@@ -123,6 +134,17 @@ void MessageReader::checkControlHeader() const {
     if (header_->contentSize > longestReason) {
         refuse("abort frame", "a reason of at most " + std::to_string(longestReason) + " bytes",
                std::to_string(header_->contentSize));
+    }
+}
+
+void MessageReader::checkReturnHeader() const {
+    if (header_->last || static_cast<std::uint8_t>(header_->type) > 1 || header_->tagSize != 0 ||
+        header_->stream != 0 || header_->contentSize != 0) {
+        throw ProtocolViolation(
+            "return frame: expected frame type 0 or 1, and last bit, tag size, stream ID and content size 0");
+    }
+    if (!frames_.empty()) {
+        throw ProtocolViolation("return frame in the middle of a message: expected " + frameName(frames_.size() + 1));
     }
 }
 
@@ -142,9 +164,13 @@ void MessageReader::checkMessageHeader() const {
     }
     // For what is wrong only: well-formed frames cost no text.
     const auto frame = [&] { return frameName(expected) + " on stream " + std::to_string(header.stream); };
-    if (header.is(FrameKind::Data)) {
+    if (!header.is(FrameKind::Tagged)) {
         if (header.tagSize != 0) {
             refuse("tag of a data frame (" + frame() + ")", "none", std::to_string(header.tagSize) + " bytes");
+        }
+        if (header.is(FrameKind::SharedData) && header.contentSize != lending::SharedContent::bytes) {
+            refuse("content of a shared data frame (" + frame() + ")",
+                   std::to_string(lending::SharedContent::bytes) + " bytes", std::to_string(header.contentSize));
         }
     } else {
         if (header.tagSize == 0) {
@@ -160,13 +186,20 @@ void MessageReader::checkMessageHeader() const {
                        header.contentSize);
         }
     }
+    checkMessageSize(header.contentSize);
+}
+
+// With a content of that size in the frame that is arriving.
+void MessageReader::checkMessageSize(std::uint64_t contentSize) const {
+    const FrameHeader& header = *header_;
     // Written as a difference, so that no claim can make a sum wrap around.
     const std::uint64_t room = limits_.message - std::min(limits_.message, messageBytes_ + header.tagSize);
-    if (header.contentSize > room || messageBytes_ + header.tagSize > limits_.message) {
-        refuse("message with " + frame() + " exceeds the limit \"message\"",
-               "at most " + std::to_string(limits_.message) + " bytes",
-               std::to_string(messageBytes_ + header.tagSize) + " bytes and a content of " +
-                   std::to_string(header.contentSize));
+    if (contentSize > room || messageBytes_ + header.tagSize > limits_.message) {
+        refuse(
+            "message with " + frameName(header.index) + " on stream " + std::to_string(header.stream) +
+                " exceeds the limit \"message\"",
+            "at most " + std::to_string(limits_.message) + " bytes",
+            std::to_string(messageBytes_ + header.tagSize) + " bytes and a content of " + std::to_string(contentSize));
     }
 }
 
@@ -188,13 +221,29 @@ void MessageReader::allocateContent() {
         content_ = {std::unique_ptr<char[], std::function<void(char*)>>(new char[size], std::default_delete<char[]>()),
                     size};
     } catch (const std::bad_alloc&) {
-        throw ProtocolViolation("there is no memory for the content of " + frameName(header_->index) + ", " +
-                                std::to_string(size) + " bytes");
+        refuseForMemory(header_->index, size);
+    }
+}
+
+// The content says where the frame's bytes are, which are its content from now on.
+void MessageReader::borrowContent() {
+    const lending::SharedContent shared = lending::decodeSharedContent(content_.first.get());
+    checkMessageSize(shared.size);
+    try {
+        content_ = borrower_->borrow(shared);
+    } catch (const vantor::carrier::shared_memory::MemoryRefused& refused) {
+        throw ProtocolViolation("shared content of " + frameName(header_->index) + " on stream " +
+                                std::to_string(header_->stream) + ": " + refused.what());
+    } catch (const std::bad_alloc&) {
+        refuseForMemory(header_->index, shared.size);
     }
 }
 
 std::unique_ptr<framing::Frame> MessageReader::takeFrame() {
-    if (header_->is(FrameKind::Data)) {
+    if (header_->is(FrameKind::SharedData)) {
+        borrowContent();
+    }
+    if (!header_->is(FrameKind::Tagged)) {
         return std::make_unique<framing::DataFrame>(header_->type, header_->stream, std::move(content_), true,
                                                     header_->index);
     }
@@ -208,9 +257,11 @@ std::optional<MessageReader::Item> MessageReader::completeFrame() {
         item = Goodbye{};
     } else if (header_->is(FrameKind::Abort)) {
         item = Abort{std::string(content_.first.get(), content_.second)};
+    } else if (header_->is(FrameKind::Return)) {
+        item = Returned{header_->index, header_->type != framing::FrameType::Unspecified};
     } else {
-        messageBytes_ += header_->tagSize + header_->contentSize;
         frames_.push_back(takeFrame());
+        messageBytes_ += header_->tagSize + frames_.back()->size();
         if (header_->last) {
             item = Frames{std::exchange(frames_, {})};
             messageBytes_ = 0;

@@ -15,6 +15,7 @@
 
 #include "foundation/msg_svc/transport/layers/session/FrameHeader.hpp"
 #include "foundation/msg_svc/transport/layers/session/Limits.hpp"
+#include "foundation/msg_svc/transport/layers/session/lending/Borrower.hpp"
 #include "foundation/vantor/carrier/framing/Frame.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
@@ -42,7 +43,12 @@ class MessageReader {
     struct Abort {
         std::string reason;
     };
-    using Item = std::variant<Frames, Goodbye, Abort>;
+    /// The peer is done with a content that it was lent. `kept`: its memory stays mapped there.
+    struct Returned {
+        std::uint64_t number;
+        bool kept;
+    };
+    using Item = std::variant<Frames, Goodbye, Abort, Returned>;
 
     /// Longest reason of an abort, in bytes.
     static constexpr std::uint64_t longestReason = 4096;
@@ -51,8 +57,9 @@ class MessageReader {
     static constexpr std::size_t usualAhead = 4096;
     static constexpr std::size_t mostAhead = 65'536;
 
-    /// `arrayTag` is the tag to which Limits::arrayMessage applies instead of Limits::taggedFrame.
-    MessageReader(const Limits& limits, std::string arrayTag);
+    /// `arrayTag` is the tag to which Limits::arrayMessage applies instead of Limits::taggedFrame. `borrower` has the
+    /// contents that stay in the peer's memory; null when there are none.
+    MessageReader(const Limits& limits, std::string arrayTag, lending::Borrower* borrower = nullptr);
 
     /// Where the next bytes of the stream belong, in order; never empty. Valid until the next call of next(). To be
     /// called when next() has returned nothing.
@@ -84,13 +91,17 @@ class MessageReader {
     }
     void acceptHeader();
     void checkControlHeader() const;
+    void checkReturnHeader() const;
     void checkMessageHeader() const;
+    void checkMessageSize(std::uint64_t contentSize) const;
     void allocateContent();
+    void borrowContent();
     std::unique_ptr<framing::Frame> takeFrame();
     std::optional<Item> completeFrame();
 
     Limits limits_;
     std::string arrayTag_;
+    lending::Borrower* borrower_;
 
     // Bytes that have arrived and are not taken yet.
     std::unique_ptr<char[]> ahead_;

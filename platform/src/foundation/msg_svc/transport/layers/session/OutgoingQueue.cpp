@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <utility>
 
 #include "foundation/msg_svc/transport/layers/session/StreamDescriptors.hpp"
 #include "foundation/vantor/carrier/framing/DataFrame.hpp"
@@ -18,26 +19,41 @@ constexpr std::size_t mostPieces = 64;
 
 }  // namespace
 
-OutgoingPieces::OutgoingPieces(std::vector<std::unique_ptr<framing::Frame>> frames, bool answer)
+OutgoingPieces::OutgoingPieces(std::vector<std::unique_ptr<framing::Frame>> frames, bool answer,
+                               lending::Lender* lender)
     : frames_(std::move(frames)), answer_(answer) {
     headers_.reserve(frames_.size());
     pieces_.reserve(3 * frames_.size());
     for (const auto& frame : frames_) {
-        const auto* const tagged = dynamic_cast<const framing::TaggedFrame*>(frame.get());
-        FrameHeader header;
-        header.kind = static_cast<std::uint8_t>(tagged != nullptr ? FrameKind::Tagged : FrameKind::Data);
-        header.last = frame == frames_.back();
-        header.type = frame->type();
-        header.tagSize = static_cast<std::uint16_t>(tagged != nullptr ? tagged->tag().size() : 0);
-        header.stream = frame->streamID();
-        header.index = frame->index();
-        header.contentSize = frame->size();
-        headers_.push_back(encode(header));
-        add(headers_.back().data(), FrameHeader::size);
-        if (tagged != nullptr) {
-            add(tagged->tag().data(), tagged->tag().size());
-        }
-        add(frame->data(), frame->size());
+        auto* const data = dynamic_cast<framing::DataFrame*>(frame.get());
+        addFrame(*frame, frame == frames_.back(),
+                 lender != nullptr && data != nullptr ? lender->lend(*data) : std::nullopt);
+    }
+}
+
+void OutgoingPieces::addFrame(const framing::Frame& frame, bool last, std::optional<lending::Loan> loan) {
+    const auto* const tagged = dynamic_cast<const framing::TaggedFrame*>(&frame);
+    FrameHeader header;
+    header.kind = static_cast<std::uint8_t>(tagged != nullptr ? FrameKind::Tagged
+                                            : loan            ? FrameKind::SharedData
+                                                              : FrameKind::Data);
+    header.last = last;
+    header.type = frame.type();
+    header.tagSize = static_cast<std::uint16_t>(tagged != nullptr ? tagged->tag().size() : 0);
+    header.stream = frame.streamID();
+    header.index = frame.index();
+    header.contentSize = loan ? lending::SharedContent::bytes : frame.size();
+    headers_.push_back(encode(header));
+    add(headers_.back().data(), FrameHeader::size);
+    if (tagged != nullptr) {
+        add(tagged->tag().data(), tagged->tag().size());
+    }
+    if (loan) {
+        lent_.push_back({pieces_.size() - 1, *std::move(loan)});
+        const auto content = encode(lent_.back().loan.content());
+        addCopy(content.data(), content.size());
+    } else {
+        add(frame.data(), frame.size());
     }
 }
 
@@ -47,9 +63,26 @@ OutgoingPieces::OutgoingPieces(FrameKind kind, const std::string& content) {
     header.contentSize = content.size();
     headers_.push_back(encode(header));
     add(headers_.back().data(), FrameHeader::size);
-    copies_.push_back(std::make_unique<char[]>(content.size()));
-    std::copy(content.begin(), content.end(), copies_.back().get());
-    add(copies_.back().get(), content.size());
+    addCopy(content.data(), content.size());
+}
+
+OutgoingPieces OutgoingPieces::giveBack(std::uint64_t number, bool kept) {
+    FrameHeader header;
+    header.kind = static_cast<std::uint8_t>(FrameKind::Return);
+    header.type = static_cast<framing::FrameType>(kept ? 1 : 0);
+    header.index = number;
+    OutgoingPieces pieces;
+    pieces.headers_.push_back(encode(header));
+    pieces.add(pieces.headers_.back().data(), FrameHeader::size);
+    // Nobody waits for room before it gives something back, so these are counted as answers are.
+    pieces.answer_ = true;
+    return pieces;
+}
+
+void OutgoingPieces::addCopy(const char* begin, std::size_t size) {
+    copies_.push_back(std::make_unique<char[]>(size));
+    std::copy_n(begin, size, copies_.back().get());
+    add(copies_.back().get(), size);
 }
 
 void OutgoingPieces::add(const void* begin, std::size_t size) {
@@ -59,10 +92,35 @@ void OutgoingPieces::add(const void* begin, std::size_t size) {
     }
 }
 
-void OutgoingPieces::gather(std::vector<iovec>& gathered, std::size_t& room, std::size_t most) const {
-    for (std::size_t i = next_; i < pieces_.size() && room != 0 && gathered.size() < most; ++i) {
-        gathered.push_back({pieces_[i].iov_base, std::min(pieces_[i].iov_len, room)});
-        room -= gathered.back().iov_len;
+void OutgoingPieces::gather(GatheredWrite& write) const {
+    auto lent =
+        std::find_if(lent_.begin(), lent_.end(), [this](const LentFrame& frame) { return frame.header >= next_; });
+    for (std::size_t i = next_; i < pieces_.size() && !write.full(); ++i) {
+        if (lent != lent_.end() && lent->header == i) {
+            if (write.lentFramesLeft == 0) {
+                // Nothing that follows can be written before this frame.
+                write.piecesLeft = 0;
+                return;
+            }
+            --write.lentFramesLeft;
+            if (lent->loan.descriptor() >= 0) {
+                write.descriptors.push_back(lent->loan.descriptor());
+            }
+            ++lent;
+        }
+        const std::size_t size = std::min(pieces_[i].iov_len, write.bytesLeft);
+        write.pieces.push_back({pieces_[i].iov_base, size});
+        write.bytesLeft -= size;
+        --write.piecesLeft;
+    }
+}
+
+void OutgoingPieces::consumeDescriptors(std::size_t& sent) {
+    for (LentFrame& frame : lent_) {
+        if (sent != 0 && frame.loan.descriptor() >= 0) {
+            frame.loan.sent();
+            --sent;
+        }
     }
 }
 
@@ -99,17 +157,22 @@ void OutgoingPieces::detachUnshareable() {
 }
 
 int OutgoingQueue::writeOnce(int descriptor, std::vector<OutgoingPieces>& written) {
-    gathered_.clear();
-    std::size_t room = mostBytes;
-    for (const OutgoingPieces& message : messages_) {
-        if (room == 0 || gathered_.size() == mostPieces) {
-            break;
-        }
-        message.gather(gathered_, room, mostPieces);
+    pieces_.clear();
+    descriptors_.clear();
+    GatheredWrite write{std::move(pieces_), std::move(descriptors_), mostBytes, mostPieces};
+    for (auto message = messages_.begin(); message != messages_.end() && !write.full(); ++message) {
+        message->gather(write);
     }
-    const ssize_t count = writeSome(descriptor, gathered_);
+    pieces_ = std::move(write.pieces);
+    descriptors_ = std::move(write.descriptors);
+    const ssize_t count = descriptors_.empty() ? writeSome(descriptor, pieces_)
+                                               : lending::sendWithDescriptors(descriptor, pieces_, descriptors_);
     if (count < 0) {
         return errno == EWOULDBLOCK ? EAGAIN : errno;
+    }
+    std::size_t sent = descriptors_.size();
+    for (auto message = messages_.begin(); sent != 0; ++message) {
+        message->consumeDescriptors(sent);
     }
     auto left = static_cast<std::size_t>(count);
     written_ += left;

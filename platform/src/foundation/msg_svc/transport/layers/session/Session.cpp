@@ -8,6 +8,7 @@
 #include <stdexcept>
 #include <system_error>
 #include <thread>
+#include <type_traits>
 #include <utility>
 #include <vector>
 
@@ -39,25 +40,16 @@ std::string cannotWrite(int error) {
     return "cannot write to the stream: " + std::generic_category().message(error);
 }
 
-Saying sayingOf(const exchange::Message&, const SessionConfig&) {
-    return Saying::Message;
-}
-
-Saying sayingOf(const exchange::Reply&, const SessionConfig&) {
-    return Saying::Reply;
-}
-
-Saying sayingOf(const eventmgr::BaseEvent& event, const SessionConfig& config) {
-    return sayingOfEvent(typeid(event), config);
+template <class T>
+Saying sayingOf(const T& object, const SessionConfig& config) {
+    if constexpr (std::is_same_v<T, eventmgr::BaseEvent>) {
+        return sayingOfEvent(typeid(object), config);
+    } else {
+        return std::is_same_v<T, exchange::Reply> ? Saying::Reply : Saying::Message;
+    }
 }
 
 }  // namespace
-
-SessionHandler::~SessionHandler() = default;
-void SessionHandler::onMessage(framing::StreamID, const Shared<exchange::Message>&) {}
-void SessionHandler::onReply(framing::StreamID, const Shared<exchange::Reply>&) {}
-void SessionHandler::onEvent(framing::StreamID, const Shared<eventmgr::BaseEvent>&) {}
-void SessionHandler::onGoodbye() {}
 
 /// Owns the I/O thread and the parts, and decides how the session ends.
 class Session::Impl final : private Incoming::Owner, private Outgoing::Owner {
@@ -118,6 +110,7 @@ class Session::Impl final : private Incoming::Owner, private Outgoing::Owner {
     asio::executor_work_guard<asio::io_context::executor_type> work_{io_.get_executor()};
     asio::steady_timer timer_{io_};
     Outgoing outgoing_;
+    const std::unique_ptr<lending::SharedMemory> shared_;  // null without shared memory
     Incoming incoming_;
 
     // Of the I/O thread.
@@ -139,7 +132,9 @@ Session::Impl::Impl(StreamDescriptors& stream, SessionConfig sessionConfig, Sett
                          settlement.arrayTag)),
       exchanges_(config.role),
       outgoing_(io_, stream.out, config.roomBytes, *this),
-      incoming_(io_, stream.in, config, settlement.registry, settlement.arrayTag, exchanges_, outgoing_, *this) {}
+      shared_(settlement.sharedMemory ? std::make_unique<lending::SharedMemory>(config.role, outgoing_) : nullptr),
+      incoming_(io_, stream.in, config, settlement.registry, settlement.arrayTag, exchanges_, outgoing_, shared_.get(),
+                *this) {}
 
 void Session::Impl::ensureThread() {
     std::call_once(threadStarted_, [this] {
@@ -196,12 +191,16 @@ void Session::Impl::send(framing::StreamID stream, const Shared<T>& object, Urge
             config.trace({true, frame == frames.back(), *frame});
         }
     }
-    submit(OutgoingPieces(std::move(frames), urgency == Urgency::Answer), [&] {
+    submit(OutgoingPieces(std::move(frames), urgency == Urgency::Answer, shared_ ? &shared_->lender : nullptr), [&] {
         const T& referenced = *object;
         const Saying saying = sayingOf(referenced, config);
         if (const auto refusal = exchanges_.exchanges.send(saying, stream)) {
             throw std::logic_error("Session::send: " +
                                    refusalToSend(*refusal, saying, config.role, stream, typeid(referenced)));
+        }
+        if (saying == Saying::Shutdown && shared_) {
+            // Nothing follows it. The end of the session gives back what is left.
+            shared_->borrower.close();
         }
         return true;
     });
@@ -401,6 +400,9 @@ void Session::Impl::closeDown() {
     }
     incoming_.close();
     outgoing_.close();
+    if (shared_) {
+        shared_->close();
+    }
     timer_.cancel();
     if (handler_ != nullptr) {
         handler_->onEnd(end_);
@@ -411,6 +413,9 @@ void Session::Impl::abandonInChild() noexcept {
     abandoned = true;
     incoming_.abandonInChild();
     outgoing_.abandonInChild();
+    if (shared_) {
+        shared_->borrower.abandonInChild();
+    }
 }
 
 // The session itself.
