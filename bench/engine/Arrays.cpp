@@ -1,4 +1,4 @@
-// Calls with arrays, over the socket.
+// Calls with arrays, over the socket and in shared memory.
 
 #include <algorithm>
 #include <cstddef>
@@ -26,7 +26,7 @@ constexpr std::size_t KiB = std::size_t{1} << 10;
 constexpr std::size_t MiB = KiB << 10;
 constexpr std::size_t answerBytes = 200;  // of a reply without outputs, roughly
 
-enum class Way { There, ThereAndBack };
+enum class Way { There, Read, ThereAndBack };
 
 Array arrayOf(std::size_t bytes) {
     Array array = ArrayFactory().createArray(ElementType::UInt8, {bytes});
@@ -42,22 +42,23 @@ bool equal(const Array& left, const Array& right) {
 }
 
 // A client to an engine that has the functions, and whose limits are no hindrance.
-std::shared_ptr<EngineClient> callingClient() {
+std::shared_ptr<EngineClient> callingClient(bool sharedMemory) {
     session::Limits limits;
     limits.message = std::uint64_t{16} << 30;
     auto client = std::make_shared<EngineClient>(
-        std::vector<std::string>{"--limit-message", "16GiB", "--max-queued-bytes", "16GiB"}, limits);
+        std::vector<std::string>{"--limit-message", "16GiB", "--max-queued-bytes", "16GiB"}, limits, false,
+        sharedMemory);
     client->evaluate(
         "def take(array): pass\n"
+        "def read(array): array[::64].max()\n"
         "def back(array): return array\n"
         "def last(array): return array[-1000:]\n",
         "");
     return client;
 }
 
-// Calls of a function with `array`. What the engine has of it is looked at before.
-Contender calls(const Array& array, Way way) {
-    auto client = callingClient();
+// Calls of a function with an array. What the engine has of it is looked at before.
+Contender calls(const std::shared_ptr<EngineClient>& client, const Array& array, Way way) {
     const auto end = client->call("last", {array}, 1);
     const std::size_t seen = std::min<std::size_t>(1000, array.sizeInBytes());
     if (end.at(0).sizeInBytes() != seen ||
@@ -68,11 +69,11 @@ Contender calls(const Array& array, Way way) {
                 EngineClient::Arrays outputs;
                 for (std::size_t i = 0; i < count; ++i) {
                     outputs.clear();
-                    if (way == Way::There) {
-                        client->send("take", {array});
-                        client->awaitAll();
-                    } else {
+                    if (way == Way::ThereAndBack) {
                         outputs = client->call("back", {array}, 1);
+                    } else {
+                        client->send(way == Way::There ? "take" : "read", {array});
+                        client->awaitAll();
                     }
                 }
                 if (way == Way::ThereAndBack && !equal(outputs.at(0), array)) {
@@ -81,11 +82,21 @@ Contender calls(const Array& array, Way way) {
             }};
 }
 
+Contender calls(const Array& array, Way way) {
+    return calls(callingClient(false), array, way);
+}
+
+// The array is made when there is somebody to share it with.
+Contender sharedCalls(std::size_t bytes, Way way) {
+    const auto client = callingClient(true);
+    return calls(client, arrayOf(bytes), way);
+}
+
 Contender rawArrays(const Array& array, Way way) {
     return {"raw", [peer = std::make_shared<RawPeer>(), array, way](std::size_t count) {
                 const auto size = static_cast<std::size_t>(array.sizeInBytes());
                 for (std::size_t i = 0; i < count; ++i) {
-                    peer->roundTrip(array.data(), size, way == Way::There ? answerBytes : size);
+                    peer->roundTrip(array.data(), size, way == Way::ThereAndBack ? size : answerBytes);
                 }
             }};
 }
@@ -106,6 +117,19 @@ void arrays(const Effort& effort) {
             const Array array = arrayOf(size);
             holdAll(name + std::string(" to the engine"), array, Way::There, effort);
             holdAll(name + std::string(" there and back"), array, Way::ThereAndBack, effort);
+        }
+    }
+}
+
+void sharedArrays(const Effort& effort) {
+    for (const auto& [size, name] : {std::pair{MiB, "1 MiB"}, std::pair{64 * MiB, "64 MiB"}}) {
+        if (size <= effort.largest) {
+            const Array array = arrayOf(size);
+            for (const auto& [way, what] :
+                 {std::pair{Way::There, " to the engine"}, std::pair{Way::Read, " to the engine, which reads it"},
+                  std::pair{Way::ThereAndBack, " there and back"}}) {
+                hold({name + std::string(what), {}, {rawArrays(array, way), sharedCalls(size, way)}}, effort);
+            }
         }
     }
 }
@@ -135,7 +159,7 @@ void smallCall(const Effort& effort) {
 }  // namespace
 
 std::vector<Question> arrayQuestions() {
-    return {{"call", smallCall}, {"arrays", arrays}, {"array-sizes", arraySizes}};
+    return {{"call", smallCall}, {"arrays", arrays}, {"shared-arrays", sharedArrays}, {"array-sizes", arraySizes}};
 }
 
 }  // namespace bench

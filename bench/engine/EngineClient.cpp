@@ -31,11 +31,13 @@ krutil_client::EngineProcess startEngine(std::vector<std::string> arguments) {
 
 }  // namespace
 
-EngineClient::EngineClient(krutil_client::EngineProcess engine, const session::Limits& limits, bool counting)
+EngineClient::EngineClient(krutil_client::EngineProcess engine, const session::Limits& limits, bool counting,
+                           bool sharedMemory)
     : engine_(std::move(engine)) {
     session::SessionConfig config = apps::krutilSession(session::Role::Client);
     config.build = "benchmark";
     config.limits = limits;
+    config.sharedMemory = sharedMemory;
     if (counting) {
         config.trace = [this](const session::FrameTrace& trace) {
             constexpr std::size_t header = 24;
@@ -49,8 +51,9 @@ EngineClient::EngineClient(krutil_client::EngineProcess engine, const session::L
     session_->start(*this);
 }
 
-EngineClient::EngineClient(const std::vector<std::string>& arguments, const session::Limits& limits, bool counting)
-    : EngineClient(startEngine(arguments), limits, counting) {}
+EngineClient::EngineClient(const std::vector<std::string>& arguments, const session::Limits& limits, bool counting,
+                           bool sharedMemory)
+    : EngineClient(startEngine(arguments), limits, counting, sharedMemory) {}
 
 EngineClient::~EngineClient() {
     session_->sayGoodbye();

@@ -32,12 +32,13 @@ class EngineClient : private session::SessionHandler {
     /// A request to evaluate code, which may be sent any number of times.
     static Request evaluation(const std::string& code);
 
-    /// With `counting`, bytes() counts what is sent and received, which takes time.
+    /// With `counting`, bytes() counts what is sent and received, which takes time. With `sharedMemory`, large arrays
+    /// stay where both ends see them.
     explicit EngineClient(krutil_client::EngineProcess engine, const session::Limits& limits = {},
-                          bool counting = false);
+                          bool counting = false, bool sharedMemory = false);
     /// The same with an engine of its own, which is given `arguments` besides "--stdio".
     explicit EngineClient(const std::vector<std::string>& arguments = {}, const session::Limits& limits = {},
-                          bool counting = false);
+                          bool counting = false, bool sharedMemory = false);
     ~EngineClient() override;
 
     /// Sends a request, and does not wait.
