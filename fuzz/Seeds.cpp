@@ -40,6 +40,23 @@ std::string wireBytes(const std::vector<transport::FrameContent>& frames) {
     return bytes;
 }
 
+std::string header(unsigned kind, std::uint64_t type, std::uint64_t index, std::uint64_t contentSize) {
+    return std::string(1, static_cast<char>(kind)) + littleEndian(type, 1) + littleEndian(0, 6) +
+           littleEndian(index, 8) + littleEndian(contentSize, 8);
+}
+
+// Where a content of 1 MiB lies in shared memory.
+std::string sharedContent(std::uint64_t offset) {
+    return header(5, 4, 1, 24) + littleEndian(7, 8) + littleEndian(offset, 8) + littleEndian(1U << 20, 8);
+}
+
+// What only a session with shared memory sends, behind the length of the pieces and the bit that says so.
+std::vector<std::string> sharedMemoryBytes() {
+    const std::string root = header(0x81, 29, 2, 0);
+    return {'\x90' + sharedContent(0) + root, '\xFF' + sharedContent(4096) + header(6, 0, 7, 0),
+            '\x87' + header(6, 0, 7, 0) + header(6, 1, 8, 0), '\x98' + header(6, 2, 7, 0)};
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -76,6 +93,11 @@ int main(int argc, char** argv) {
             write(deserialize / (name + "-cut"), input.substr(0, input.size() / 2));
             write(reader / (name + "-cut"), wire.substr(0, wire.size() / 2));
         }
+    }
+    for (const std::string& wire : sharedMemoryBytes()) {
+        const std::string name = std::to_string(++count);
+        write(reader / name, wire);
+        write(reader / (name + "-cut"), wire.substr(0, wire.size() / 2));
     }
     return 0;
 }
