@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 #include <fstream>
 #include <limits>
@@ -12,6 +13,7 @@
 #include <utility>
 
 #include "foundation/vantor/carrier/shared_memory/Segment.hpp"
+#include "foundation/vantor/carrier/shared_memory/systemMemory.hpp"
 #include "platform/shared_memory/SharedMemorySupport.hpp"
 #include "support/Pipe.hpp"
 
@@ -51,6 +53,14 @@ bool isMapped(const void* address) {
     return false;
 }
 
+// Of this process. Allocates nothing.
+std::size_t mappedPages() {
+    const OwnedDescriptor statistics(::open("/proc/self/statm", O_RDONLY | O_CLOEXEC));
+    char text[100] = {};
+    EXPECT_GT(::read(statistics.get(), text, sizeof text - 1), 0);
+    return std::strtoul(text, nullptr, 10);
+}
+
 TEST(ReceivedMemoryTest, ShowsWhatTheOtherSideWrites) {
     const auto segment = Segment::create(4 * page);
     std::memcpy(segment->data() + page, "first", 5);
@@ -70,6 +80,20 @@ TEST(ReceivedMemoryTest, WhatIsWrittenStaysHere) {
     std::memset(segment->data(), 't', 2 * page);
     EXPECT_EQ(memory.data()[page], 'r');
     EXPECT_EQ(memory.data()[page + 1], 's') << "a page that was written to is a copy";
+}
+
+TEST(ReceivedMemoryTest, LiesWhereLargePagesCanBeUsed) {
+    const auto segment = Segment::create(3 * largePageSize);
+    std::memset(segment->data(), 's', segment->size());
+    for (const std::size_t offset : {std::size_t{0}, page, largePageSize, largePageSize - page}) {
+        const std::size_t before = mappedPages();
+        const ReceivedMemory memory(segment->descriptor()->get(), offset, largePageSize + 1);
+        EXPECT_EQ(mappedPages(), before + largePageSize / page + 1) << "what it takes to find the place is given back";
+        EXPECT_EQ(reinterpret_cast<std::uintptr_t>(memory.data()) % largePageSize, offset % largePageSize);
+        memory.data()[largePageSize] = 'r';
+        EXPECT_EQ(memory.data()[largePageSize - 1], 's');
+    }
+    EXPECT_EQ(segment->data()[largePageSize], 's');
 }
 
 TEST(ReceivedMemoryTest, OutlivesTheDescriptorAndTheSegment) {

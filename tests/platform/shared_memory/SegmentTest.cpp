@@ -4,11 +4,14 @@
 #include <sys/stat.h>
 #include <sys/wait.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <cstdint>
 #include <cstring>
 #include <limits>
 #include <memory>
 
+#include "foundation/vantor/carrier/shared_memory/systemMemory.hpp"
 #include "platform/shared_memory/SharedMemorySupport.hpp"
 
 namespace foundation::vantor::carrier::shared_memory {
@@ -31,6 +34,18 @@ TEST_F(SegmentTest, IsRoundedUpToPagesAndAllocatedWhole) {
     EXPECT_EQ(status.st_blocks * 512, static_cast<blkcnt_t>(3 * page));
     EXPECT_EQ(::fcntl(odd->descriptor()->get(), F_GET_SEALS), allSeals);
     EXPECT_EQ(::fcntl(odd->descriptor()->get(), F_GETFD), FD_CLOEXEC);
+}
+
+TEST_F(SegmentTest, LiesWhereLargePagesCanBeUsedAndIsAllocatedWithThem) {
+    for (const std::size_t size : {largePageSize, 8 * largePageSize, 8 * largePageSize + page}) {
+        const auto large = Segment::create(size);
+        EXPECT_EQ(reinterpret_cast<std::uintptr_t>(large->data()) % largePageSize, 0U);
+        struct stat status {};
+        ASSERT_EQ(::fstat(large->descriptor()->get(), &status), 0);
+        EXPECT_EQ(status.st_size, static_cast<off_t>(size));
+        EXPECT_EQ(status.st_blocks * 512, static_cast<blkcnt_t>(size));
+        EXPECT_TRUE(std::all_of(large->data(), large->data() + size, [](char byte) { return byte == 0; }));
+    }
 }
 
 TEST_F(SegmentTest, WhoeverHasTheDescriptorReadsAndCanChangeNothing) {

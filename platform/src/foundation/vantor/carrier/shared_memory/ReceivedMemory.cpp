@@ -69,15 +69,14 @@ void check(int descriptor, std::uint64_t offset, std::uint64_t size) {
 char* checkAndMap(int descriptor, std::uint64_t offset, std::uint64_t size) {
     check(descriptor, offset, size);
     // Writable: only pages that are written to cost memory of this process, so none is reserved for the others.
-    void* const memory = ::mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_NORESERVE, descriptor,
-                                static_cast<off_t>(offset));
-    if (memory == MAP_FAILED) {
+    char* const memory = map(descriptor, offset, size, MAP_PRIVATE | MAP_NORESERVE);
+    if (memory == nullptr) {
         if (errno == ENOMEM) {
             throw std::bad_alloc();
         }
         refuse("memory that can be mapped", std::generic_category().message(errno));
     }
-    return static_cast<char*>(memory);
+    return memory;
 }
 
 }  // namespace
