@@ -98,7 +98,8 @@ QUESTIONS = [
     Question("call", "A call with 1 KiB, there and back", "an evaluation of `1+1` on a warm engine", engine("call")),
     Question("arrays", "Calls with arrays, over the socket", RAW_ARRAY, engine("arrays"), conditions=REUSED),
     Question("shared-arrays", "Calls with arrays in shared memory", RAW_ARRAY, engine("shared-arrays"),
-             conditions="The array is the same each time, so its memory is warm; what reads it looks at each cache line."),
+             conditions="The array is the same each time, so its memory is warm. Who reads it looks at each cache "
+                        "line; what goes there and back is looked at by nobody within the time."),
     Question("burst", "1,000 requests (`pass`) sent at once, each of them", RAW, engine("burst")),
     Question("lines", "10,000 lines printed in one request, each of them", "one write of 16 bytes to a socket",
              engine("lines")),
