@@ -15,7 +15,11 @@ build_packages=(
     python3-dev pybind11-dev
     libcli11-dev nlohmann-json3-dev libedit-dev
 )
-test_packages=(libgtest-dev libgmock-dev libbenchmark-dev)
+test_packages=(
+    libgtest-dev libgmock-dev libbenchmark-dev
+    python3-protobuf                                    # the client for Python
+    mypy python3-pip python3-setuptools python3-wheel   # its types and its wheel
+)
 # What draws the pictures of benchmarks.
 bench_packages=(python3-matplotlib)
 # What benchmarks compare with when they are asked to; nothing else needs these.

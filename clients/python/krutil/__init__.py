@@ -1,0 +1,20 @@
+"""A client of krutil engines: evaluates Python code and calls functions with NumPy arrays in another process, on this
+machine or at the far end of an `ssh`.
+
+>>> with krutil.start() as session:
+...     session.eval("x = 6 * 7; x").value
+'42'
+"""
+
+from .errors import Aborted, Cancelled, Error, Lost, Refused, RemoteError, RemoteFrame
+from .prompts import Prompt
+from .requests import CancelAnswer, Request, Result, State, Text, Value, Warned
+from .session import Session, connect, start
+from .wire import Limits
+
+# Tracebacks name an exception by the module in which users find it.
+for _each in (Aborted, Cancelled, Error, Lost, Refused, RemoteError):
+    _each.__module__ = __name__
+
+__all__ = ["Aborted", "CancelAnswer", "Cancelled", "Error", "Limits", "Lost", "Prompt", "Refused", "RemoteError",
+           "RemoteFrame", "Request", "Result", "Session", "State", "Text", "Value", "Warned", "connect", "start"]

@@ -1,0 +1,345 @@
+"""The thread that reads: it takes every message at once, and hands it to the request that it belongs to."""
+
+import itertools
+import socket
+import subprocess
+import sys
+import threading
+from concurrent.futures import Future
+from typing import TYPE_CHECKING, Any, Callable, Iterable, Optional, TypeVar, Union
+
+from .arrays import take_value
+from .errors import Aborted, Error, Lost, as_text, error_from, remote_frames
+from .handshake import Settled
+from .prompts import KINDS, OnDebug, OnInput, Prompt
+from .requests import CancelAnswer, OnText, Request, State, Text, Value, Warned
+from .schema import (DebugLoopEvent, FEvalResult, IIPCancelReply, IIPReply, IIPResult, IssuedEnabledWarningEvent,
+                     PrintableErrorEvent, SinkTextEvent, TextBaseEvent)
+from .wire import (EndOfStream, Frame, Limits, Message, PeerAborted, Reader, Violation, abort_bytes, goodbye_bytes,
+                   message_bytes, read_message)
+from .writer import Writer
+
+if TYPE_CHECKING:
+    from .session import Session
+
+Exchange = Union[Request[Any], "Future[CancelAnswer]"]
+E = TypeVar("E", Request[Any], "Future[CancelAnswer]")
+
+_REPLY, _CANCEL_REPLY, _SHUTDOWN = "krutil:IIPReply", "krutil:IIPCancelReply", "krutil:QVMShutdownEvent"
+_STATES = {"krutil:IIPStartedEvent": "started", "krutil:IIPSuspendedEvent": "suspended",
+           "krutil:IIPResumedEvent": "resumed", "krutil:IIPDiscardedEvent": "discarded",
+           "krutil:IIPRequeuedEvent": "requeued", "krutil:IIPReactivatedEvent": "reactivated",
+           "krutil:IIPCompletedEvent": "completed", "krutil:detail::LastIIPEvent": "last"}
+_TO_ENGINES = {"krutil:IIPEnqueueMessage", "krutil:IIPCancelMessage"}
+_REFERRED_TO = {"krutil:EvalIIP", "krutil:FEvalIIP", "krutil:IIPResult", "krutil:FEvalResult", "krutil:QDA"}
+# Of no use here: each warning that is shown has an event of its own, and an engine refuses what it cannot do.
+_IGNORED = {"korvel:lang:diagnostic:IssuedWarningEvent", "krutil:capabilities_api:CapabilitiesChanged"}
+
+_STREAMS = ("output", "error", "background")
+_MOST_STATUS = 5
+_EXIT, _ENTER = 1, 2
+
+
+class Dispatch:
+    """The open exchanges of a session, and the threads that serve them. Any thread may use it."""
+
+    def __init__(self, session: "Session", connection: socket.socket, process: "Optional[subprocess.Popen[bytes]]",
+                 reader: Reader, limits: Limits, settled: Settled, on_input: Optional[OnInput],
+                 on_debug: Optional[OnDebug], on_text: Optional[OnText]) -> None:
+        self._session = session
+        self._socket = connection
+        self._process = process
+        self._reader = reader
+        self._limits = limits
+        self._settled = settled
+        self._on_input, self._on_debug, self._on_text = on_input, on_debug, on_text
+        self._numbers = itertools.count(1)
+        self._lock = threading.Lock()
+        # By stream ID, under the lock.
+        self._open: dict[int, Exchange] = {}
+        self._last_stream = 0
+        self._closing = False
+        self._over = False
+        # Of the thread that reads alone.
+        self._running: list[Request[Any]] = []
+        self._prompts: list[tuple[int, Prompt]] = []
+        self._shut_down = False
+        self._handlers: dict[str, Callable[[Message, Optional[Exchange]], None]] = {
+            "krutil:TextBaseEvent": self._text, "krutil:SinkTextEvent": self._sink_text,
+            "krutil:DebugLoopEvent": self._debug_loop, "krutil:PrintableErrorEvent": self._printable_error,
+            "korvel:lang:diagnostic:IssuedEnabledWarningEvent": self._warning,
+            _SHUTDOWN: self._shutdown,
+            **dict.fromkeys(_STATES, self._state), **dict.fromkeys(_IGNORED, lambda message, exchange: None),
+        }
+        #: Why the session has ended, when that was not as agreed.
+        self._error: Optional[Error] = None
+        self._told = self._abandoned = False
+        self._all_read, self._ended = threading.Event(), threading.Event()
+        self._writer = Writer(connection, self._on_write_failed)
+        self._thread = threading.Thread(target=self._run, name="krutil-reader", daemon=True)
+        self._thread.start()
+
+    def next_number(self) -> int:
+        """A number that no other call has returned."""
+        return next(self._numbers)
+
+    def begin(self, make: Callable[[], E], frames: list[Frame]) -> E:
+        """Opens an exchange and has its message sent. `make` makes what waits for its reply."""
+        with self._lock:
+            if self._over or self._closing:
+                raise self._copy_of_end() if self._over else Lost("the session is closed")
+            stream = self._last_stream
+            while stream == 0 or stream in self._open or stream == self._last_stream:
+                stream = (stream + 1) % 2**32
+            buffers = message_bytes(stream, frames, self._settled.limits)
+            self._last_stream = stream
+            exchange = make()
+            self._open[stream] = exchange
+            self._writer.send(buffers)
+        return exchange
+
+    def cancel_all(self, requests: Optional[Iterable[Request[Any]]] = None) -> None:
+        """Has the engine cancel these requests, or all that are open, and does not wait for its answers."""
+        if requests is None:
+            # The newest first: what waits must not begin because what it waits for was cancelled.
+            with self._lock:
+                requests = [each for each in reversed(self._open.values()) if isinstance(each, Request)]
+        for request in requests:
+            try:
+                request.submit_cancel()
+            except Error:
+                return  # The session ends or has ended, and all requests with it.
+
+    def close(self, timeout: Optional[float]) -> bool:
+        """Says goodbye, and waits for the end. Returns False when that did not come in so many seconds."""
+        if threading.current_thread() is self._thread:
+            raise RuntimeError("the thread that reads cannot wait for the end of its session: use another thread")
+        with self._lock:
+            if not self._closing and not self._over:
+                self._closing = True
+                self._writer.send([goodbye_bytes()])
+        return self._ended.wait(timeout)
+
+    def abandon(self) -> None:
+        """Closes the stream, and waits until nothing is done here any more."""
+        self._abandoned = True
+        self._close_stream()
+        if threading.current_thread() is not self._thread:
+            self._ended.wait()
+
+    def take_end(self) -> Optional[Error]:
+        """Why the session has ended, when that was not as agreed. Told once."""
+        told, self._told = self._told, True
+        return None if told or self._abandoned else self._error
+
+    # The thread.
+
+    def _run(self) -> None:
+        error: Optional[Error] = None
+        abort = ""
+        try:
+            while self._read_one():
+                pass
+        except Violation as violation:
+            abort = str(violation)
+            error = Aborted(f"the engine broke the protocol: {abort}")
+        except PeerAborted as reason:
+            error = Aborted(f"the engine has aborted the session: {reason}")
+        except (EndOfStream, OSError) as end:
+            error = Lost(f"the engine has gone{self._how_it_ended()}: {end}")
+        except Exception as fault:  # of this package; whoever waits must not wait for ever
+            abort = "the program's handler failed"
+            error = Aborted(f"this end of the session failed: {fault!r}")
+        with self._lock:
+            self._over = True
+            self._error = error
+            open_ = list(self._open.values())
+            self._open.clear()
+        self._all_read.set()
+        self._writer.finish([abort_bytes(abort)] if abort else [], timeout=1)
+        self._close_stream()
+        self._socket.close()
+        for _, prompt in self._prompts:
+            prompt._close()
+        for exchange in open_:
+            if isinstance(exchange, Request):
+                exchange._finish(self._copy_of_end())
+            else:
+                exchange.set_exception(self._copy_of_end())
+        self._ended.set()
+
+    def _read_one(self) -> bool:
+        """Reads a message and does what it says. Returns False at the end. A message is forgotten before the next one
+        is waited for: its arrays may be large."""
+        message = read_message(self._reader, self._limits)
+        if message is not None and self._shut_down:
+            raise Violation("expected nothing after the engine's shutdown event, got another frame")
+        if message is not None:
+            self._handle(message)
+            return True
+        if not self._shut_down:
+            raise OSError("the stream ended without the engine's last message")
+        return False
+
+    def _handle(self, message: Message) -> None:
+        tag, stream = message.root, message.stream
+        place = f"message on stream {stream}"
+        with self._lock:
+            exchange = self._open.get(stream)
+        if tag in (_REPLY, _CANCEL_REPLY):
+            if exchange is None or isinstance(exchange, Request) != (tag == _REPLY):
+                raise Violation(f'{place}: "{tag}" is a reply: expected the stream ID of an open exchange')
+            finish = self._reply(message, exchange) if isinstance(exchange, Request) else \
+                self._cancel_reply(message, exchange)
+            with self._lock:
+                del self._open[stream]
+            if isinstance(exchange, Request) and exchange in self._running:
+                self._running.remove(exchange)
+            finish()
+        elif tag in self._handlers:
+            if stream and exchange is None:
+                raise Violation(f'{place}: "{tag}" is an event: expected the stream ID 0 or that of an open exchange')
+            self._handlers[tag](message, exchange)
+        elif tag in _TO_ENGINES:
+            raise Violation(f'{place}: "{tag}" goes to an engine, not to a client')
+        elif tag in _REFERRED_TO:
+            raise Violation(f'{place}: "{tag}" is only ever referred to and cannot be the last frame')
+        else:
+            raise Violation(f'{place}: no serializer is registered for its tag "{tag}"')
+
+    # Replies: what they bring is read first, so nothing of a bad message reaches whoever waits.
+
+    def _reply(self, message: Message, request: Request[Any]) -> Callable[[], None]:
+        reply = message.take_root(IIPReply)
+        if not reply.HasField("id"):
+            raise message.unreadable("Required field is missing: protobuf::IIPReply.id")
+        error = None
+        values: list[Any] = []
+        if reply.resultID:
+            tag, result = message.take(reply.resultID,
+                                       {"krutil:IIPResult": IIPResult, "krutil:FEvalResult": FEvalResult})
+            if tag == "krutil:FEvalResult":
+                if not result.HasField("iipResult"):
+                    raise message.unreadable("Required field is missing: protobuf::FEvalResult.iipResult")
+                values = [take_value(message, index, self._settled.zero_copy) for index in result.dataIDs]
+                result = result.iipResult
+            elif result.HasField("exception"):
+                _check_status(tag, result.exception)
+                error = error_from(result.exception, request._error_text)
+            if not result.HasField("id"):
+                raise message.unreadable("Required field is missing: protobuf::IIPResult.id")
+        return lambda: request._finish(error, values)
+
+    def _cancel_reply(self, message: Message, answer: "Future[CancelAnswer]") -> Callable[[], None]:
+        status = message.take_root(IIPCancelReply).status
+        if status not in CancelAnswer._value2member_map_:
+            raise message.unreadable(f"the answer to a cancel: expected 0 to 3, got {status}")
+        return lambda: answer.set_result(CancelAnswer(status))
+
+    # Events.
+
+    def _text(self, message: Message, exchange: Optional[Exchange]) -> None:
+        event = message.take_root(TextBaseEvent)
+        stream = _stream(message.root, event.stream)
+        if isinstance(exchange, Request):
+            exchange._add(Text(event.text, stream))
+        elif self._running:
+            # C libraries and child processes write for whichever request runs.
+            self._running[-1]._add(Text(event.text, "background"))
+        elif self._on_text:
+            try:
+                self._on_text(Text(event.text, "background"))
+            except Exception:
+                sys.excepthook(*sys.exc_info())
+
+    def _sink_text(self, message: Message, exchange: Optional[Exchange]) -> None:
+        event = message.take_root(SinkTextEvent)
+        stream = _stream(message.root, event.stream)
+        if isinstance(exchange, Request):
+            exchange._add(Value(event.text) if stream == "output" else Text(event.text, stream))
+
+    def _state(self, message: Message, exchange: Optional[Exchange]) -> None:
+        state = _STATES[message.root]
+        if isinstance(exchange, Request):
+            if state == "started":
+                self._running.append(exchange)
+            elif state == "completed" and exchange in self._running:
+                self._running.remove(exchange)
+            exchange._add(State(state))
+
+    def _warning(self, message: Message, exchange: Optional[Exchange]) -> None:
+        warning = message.take_root(IssuedEnabledWarningEvent, frame_type=27).warningEvent.warning
+        if isinstance(exchange, Request):
+            exchange._add(Warned(as_text(warning.identifier), as_text(warning.message),
+                                 remote_frames(warning.stack, "name")))
+
+    def _printable_error(self, message: Message, exchange: Optional[Exchange]) -> None:
+        event = message.take_root(PrintableErrorEvent)
+        _check_status(message.root, getattr(event, "except"))
+        if isinstance(exchange, Request):
+            exchange._error_text = event.text
+
+    def _debug_loop(self, message: Message, exchange: Optional[Exchange]) -> None:
+        event = message.take_root(DebugLoopEvent)
+        if event.state not in (_EXIT, _ENTER):
+            raise message.unreadable(f"Invalid enum krutil::protobuf::DebugLoopEvent_State field value = {event.state}")
+        if not -1 <= event.whichLoop <= 11:
+            raise message.unreadable(f"Invalid enum krutil::protobuf::InputRequester field value = {event.whichLoop}")
+        kind = KINDS.get(event.whichLoop)
+        if kind is None or not isinstance(exchange, Request):
+            return
+        if event.state == _ENTER:
+            # The engine asks nobody who has not said that he answers, nor twice at a time for one request.
+            asks = self._on_debug if kind == "debug" else self._on_input
+            if asks is None or any(stream == message.stream for stream, _ in self._prompts):
+                raise message.unreadable(f"the {kind} prompt on stream {message.stream} asks nobody")
+            line, shown = exchange._prompted()
+            prompt = Prompt(self._session, kind, shown)
+            self._prompts.append((message.stream, prompt))
+            prompt._serve(self._on_input, self._on_debug, line)
+        elif self._prompts and self._prompts[-1][0] == message.stream:
+            self._prompts.pop()[1]._close()
+
+    def _shutdown(self, message: Message, exchange: Optional[Exchange]) -> None:
+        self._shut_down = True
+
+    # The end.
+
+    def _copy_of_end(self) -> Error:
+        """An exception for each who asks: it gets a traceback of its own when it is raised."""
+        if self._error:
+            return type(self._error)(str(self._error))
+        return Lost("the session is closed" if self._closing else "the engine has ended the session")
+
+    def _how_it_ended(self) -> str:
+        if self._process is None:
+            return ""
+        try:
+            code = self._process.wait(1)
+        except subprocess.TimeoutExpired:
+            return ""
+        return f" (killed by signal {-code})" if code < 0 else f" (exit code {code})"
+
+    def _on_write_failed(self) -> None:
+        # The engine may have said why it does not read any more; it has a second for that to arrive.
+        self._all_read.wait(1)
+        self._close_stream()
+
+    def _close_stream(self) -> None:
+        try:
+            self._socket.shutdown(socket.SHUT_RDWR)
+        except OSError:
+            pass  # It is closed already.
+
+
+def _stream(tag: str, number: int) -> str:
+    if not 0 <= number < len(_STREAMS):
+        raise Violation(f'frame "{tag}": expected a stream from 0 to {len(_STREAMS) - 1}, got {number}')
+    return _STREAMS[number]
+
+
+def _check_status(tag: str, record: Any) -> None:
+    if not 0 <= record.status <= _MOST_STATUS:
+        raise Violation(f'frame "{tag}": expected a status from 0 to {_MOST_STATUS}, got {record.status}')
+    for cause in record.causes:
+        _check_status(tag, cause)

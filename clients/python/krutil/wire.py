@@ -1,0 +1,287 @@
+"""The bytes of a session after its handshake: frames and messages. No threads, and nothing about what messages mean.
+
+docs/session-wire.md describes every byte. Texts of violations are the ones that are listed there.
+"""
+
+import socket
+import struct
+import time
+from dataclasses import dataclass
+from typing import Any, Optional, Sequence, Union
+
+import numpy
+
+LONGEST_REASON = 4_096
+
+TAGGED, DATA, GOODBYE, ABORT = 1, 2, 3, 4
+LAST = 0x80
+HEADER = struct.Struct("<BBHIQQ")
+
+ARRAY_TAG = "krutil:QDA"
+
+Buffer = Union[bytes, bytearray, memoryview]
+
+
+class Violation(Exception):
+    """The engine broke the protocol. The text goes into the abort."""
+
+
+class EndOfStream(Exception):
+    """The stream has ended in the middle of something."""
+
+    def __init__(self, what: str, done: int, size: int) -> None:
+        super().__init__(f"the stream ended after {done} of the {size} bytes of {what}")
+        self.done = done
+
+
+class PeerAborted(Exception):
+    """The engine ended the session; the text is its reason."""
+
+
+@dataclass(frozen=True)
+class Limits:
+    """What an end accepts, in bytes; `frames` is a number of frames."""
+
+    tag: int = 128
+    tagged_frame: int = 4 << 20
+    array_message: int = 64 << 20
+    message: int = 4 << 30
+    frames: int = 65_536
+
+    def of_content(self, tag: str) -> tuple[str, int]:
+        """Name and number of the limit for the content of a tagged frame."""
+        return ("arrayMessage", self.array_message) if tag == ARRAY_TAG else ("taggedFrame", self.tagged_frame)
+
+
+@dataclass
+class Frame:
+    """One frame. `tag` is None for a data frame."""
+
+    tag: Optional[str]
+    type: int
+    content: Buffer
+
+
+class Message:
+    """A message that was read: frames that refer to each other by index, the last of which is the root."""
+
+    def __init__(self, stream: int, frames: list[Frame]) -> None:
+        self.stream = stream
+        self.root = frames[-1].tag or ""
+        self._frames: list[Optional[Frame]] = list(frames)
+
+    def take_root(self, kind: Any, frame_type: int = 29) -> Any:
+        """The object of the root. Each frame can be taken once."""
+        return self.take(len(self._frames), {self.root: kind}, frame_type)[1]
+
+    def take(self, index: int, kinds: dict[str, Any], frame_type: int = 29) -> tuple[str, Any]:
+        """Tag and object of the tagged frame at the index, which comes from the peer. `kinds` are the messages that it
+        may be, by tag."""
+        frame = self._take(index)
+        if frame.tag is None:
+            raise self.unreadable(f"frame {index}: expected a tagged frame, got a data frame of type {frame.type}")
+        if frame.tag not in kinds:
+            raise self.unreadable(f'frame {index}: expected an object that "{self.root}" can refer to, '
+                                   f'got one with tag "{frame.tag}"')
+        if frame.type != frame_type:
+            raise self.unreadable(f'frame {index}: expected the frame type of "{frame.tag}", got {frame.type}')
+        return frame.tag, self.parse(kinds[frame.tag], frame.content, frame.tag)
+
+    def take_data(self, index: int) -> Buffer:
+        """The bytes of the data frame at the index, where they were received."""
+        frame = self._take(index)
+        if frame.tag is not None:
+            raise self.unreadable(f'frame {index}: expected a data frame, got a tagged frame with tag "{frame.tag}"')
+        return frame.content
+
+    def _take(self, index: int) -> Frame:
+        if not 0 < index <= len(self._frames):
+            raise self.unreadable(f"frame {index}: expected a frame, got none: the message has {len(self._frames)}")
+        frame = self._frames[index - 1]
+        if frame is None:
+            raise self.unreadable(f"frame {index}: expected a frame, got none: it was read already")
+        self._frames[index - 1] = None
+        return frame
+
+    def parse(self, kind: Any, content: Buffer, tag: str) -> Any:
+        """Bytes as a message of Protocol Buffers. Bytes that are cut are refused: no engine sends them."""
+        made = kind()
+        try:
+            made.MergeFromString(content)
+        except Exception as error:  # DecodeError, and others in some versions
+            raise self.unreadable(f'the content of "{tag}" does not parse ({error})') from None
+        return made
+
+    def unreadable(self, what: str) -> Violation:
+        """What to raise when a part of this message makes no sense."""
+        return Violation(f'cannot read "{self.root}": {what}')
+
+
+class Reader:
+    """Reads from a socket: through a buffer what is small, straight into its place what is large."""
+
+    BUFFERED = 65_536
+    _SMALL = 4_096
+
+    def __init__(self, connection: socket.socket) -> None:
+        self._socket = connection
+        self._buffer = memoryview(bytearray(self.BUFFERED))
+        self._unread = self._buffer[:0]
+        #: Until when what is asked for must have come, by time.monotonic(). Else `TimeoutError` is raised.
+        self.deadline: Optional[float] = None
+
+    def read(self, size: int, what: str, *numbers: int) -> Buffer:
+        """The next `size` bytes, in memory of their own that can be written to. `what`, a format for the numbers, names
+        them when the stream ends before."""
+        if size > len(self._unread):
+            if size > self._SMALL:
+                return self._read_large(size, what, *numbers)
+            done = len(self._unread)
+            self._buffer[:done] = self._unread
+            while done < size:
+                done += self._receive(self._buffer[done:], done, size, what, *numbers)
+            self._unread = self._buffer[:done]
+        taken = bytearray(self._unread[:size])
+        self._unread = self._unread[size:]
+        return taken
+
+    def _read_large(self, size: int, what: str, *numbers: int) -> Buffer:
+        # NumPy does not fill this memory, so it is address space only until the bytes have come.
+        try:
+            target = numpy.empty(size, numpy.uint8).data
+        except MemoryError:
+            raise Violation(f"there is no memory for {what % numbers}, {size} bytes") from None
+        done = len(self._unread)
+        target[:done] = self._unread
+        self._unread = self._buffer[:0]
+        while done < size:
+            done += self._receive(target[done:], done, size, what, *numbers)
+        return target
+
+    def buffered(self) -> bytes:
+        """What has come behind all that was read."""
+        return bytes(self._unread)
+
+    def _receive(self, target: memoryview, done: int, size: int, what: str, *numbers: int) -> int:
+        if self.deadline is not None:
+            self._socket.settimeout(max(self.deadline - time.monotonic(), 1e-3))
+        try:
+            count = self._socket.recv_into(target)
+        except ConnectionResetError:
+            count = 0  # The engine has closed the stream without reading all that was sent to it.
+        if count == 0:
+            raise EndOfStream(what % numbers, done, size)
+        return count
+
+
+def read_message(reader: Reader, limits: Limits) -> Optional[Message]:
+    """The next message, or None where the stream ends between two messages."""
+    frames: list[Frame] = []
+    stream = total = 0
+    while True:
+        number = len(frames) + 1
+        try:
+            header = reader.read(HEADER.size, "the header of frame %d", number)
+        except EndOfStream as end:
+            if end.done == 0 and not frames:
+                return None
+            raise
+        kind, frame_type, tag_size, its_stream, index, size = HEADER.unpack(header)
+        last, kind = kind & LAST, kind & ~LAST
+        if kind not in (TAGGED, DATA):
+            _read_end(reader, kind, (last, frame_type, tag_size, its_stream, index), size, number)
+        if index != number:
+            raise Violation(f"frame index: expected {number}, got {index}")
+        if frames and its_stream != stream:
+            raise Violation(f"stream ID of frame {number}: expected {stream} as in the frames before it in its "
+                            f"message, got {its_stream}")
+        stream = its_stream
+        _check_sizes(kind, number, stream, tag_size, size, total, limits)
+        total += tag_size + size
+        tag = None
+        if kind == TAGGED:
+            tag = str(reader.read(tag_size, "the tag of frame %d", number), "utf-8", "replace")
+            name, limit = limits.of_content(tag)
+            if size > limit:
+                raise _too_large(f'content of frame {number} with tag "{tag}"', name, limit, f"{size}")
+        frames.append(Frame(tag, frame_type, reader.read(size, "the content of frame %d", number)))
+        if last:
+            if tag is None:
+                raise Violation(f"message on stream {stream}: expected a tagged frame as its last one, "
+                                "got a data frame")
+            return Message(stream, frames)
+
+
+def _check_sizes(kind: int, number: int, stream: int, tag_size: int, size: int, total: int, limits: Limits) -> None:
+    """What a header claims, before memory is asked for."""
+    if kind == DATA and tag_size:
+        raise Violation(f"tag of a data frame (frame {number} on stream {stream}): expected none, got {tag_size} bytes")
+    if kind == TAGGED and not tag_size:
+        raise Violation(f"tag of a tagged frame (frame {number} on stream {stream}): expected at least 1 byte, "
+                        "got none")
+    if tag_size > limits.tag:
+        raise _too_large(f"tag of frame {number} on stream {stream}", "tag", limits.tag, f"{tag_size}")
+    if number > limits.frames:
+        raise Violation(f'number of frames of a message exceeds the limit "frames": expected at most {limits.frames} '
+                        f"frames, got {number}")
+    if total + tag_size + size > limits.message:
+        raise _too_large(f"message with frame {number} on stream {stream}", "message", limits.message,
+                         f"{total + tag_size} bytes and a content of {size}")
+
+
+def _read_end(reader: Reader, kind: int, others: tuple[int, ...], size: int, number: int) -> None:
+    """What is neither tagged nor data: always the end of the session."""
+    if kind == GOODBYE:
+        if any(others):
+            raise Violation("goodbye frame: expected last bit, frame type, tag size, stream ID and index 0")
+        if size:
+            raise Violation(f"goodbye frame: expected no content, got {size} bytes")
+        if number > 1:
+            raise Violation(f"goodbye frame in the middle of a message: expected frame {number}")
+        raise Violation("goodbye frame: expected one from clients only, got one from the engine")
+    if kind == ABORT:
+        if any(others):
+            raise Violation("abort frame: expected last bit, frame type, tag size, stream ID and index 0")
+        if size > LONGEST_REASON:
+            raise Violation(f"abort frame: expected a reason of at most {LONGEST_REASON} bytes, got {size}")
+        raise PeerAborted(str(reader.read(size, "the reason of an abort"), "utf-8", "replace"))
+    raise Violation(f"frame kind: expected 1 (tagged), 2 (data), 3 (goodbye) or 4 (abort), got {kind}")
+
+
+def _too_large(what: str, name: str, limit: int, got: str) -> Violation:
+    return Violation(f'{what} exceeds the limit "{name}": expected at most {limit} bytes, got {got}')
+
+
+def message_bytes(stream: int, frames: Sequence[Frame], peer: Limits) -> list[Buffer]:
+    """The buffers of a message, to be sent in this order. What the peer does not accept is a `ValueError`."""
+    if len(frames) > peer.frames:
+        raise ValueError(f'the request has {len(frames)} frames; the engine accepts {peer.frames} (its limit "frames")')
+    buffers: list[Buffer] = []
+    total = 0
+    for index, frame in enumerate(frames, 1):
+        tag = (frame.tag or "").encode()
+        size = len(frame.content)
+        if frame.tag is not None:
+            name, limit = peer.of_content(frame.tag)
+            if size > limit:
+                raise ValueError(f'a part of the request ("{frame.tag}") has {size} bytes; the engine accepts {limit} '
+                                 f'(its limit "{name}")')
+            if len(tag) > peer.tag:
+                raise ValueError(f'the tag "{frame.tag}" is longer than the engine accepts ({peer.tag} bytes, its '
+                                 'limit "tag")')
+        total += len(tag) + size
+        kind = (DATA if frame.tag is None else TAGGED) | (LAST if index == len(frames) else 0)
+        buffers.append(HEADER.pack(kind, frame.type, len(tag), stream, index, size) + tag)
+        buffers.append(frame.content)
+    if total > peer.message:
+        raise ValueError(f'the request has {total} bytes; the engine accepts {peer.message} (its limit "message")')
+    return buffers
+
+
+def goodbye_bytes() -> bytes:
+    return HEADER.pack(GOODBYE, 0, 0, 0, 0, 0)
+
+
+def abort_bytes(reason: str) -> bytes:
+    content = reason.encode()[:LONGEST_REASON]
+    return HEADER.pack(ABORT, 0, 0, 0, 0, len(content)) + content

@@ -1,0 +1,32 @@
+"""The examples in the docstrings, and those in the page about the client.
+
+    examples_test.py PAGE
+"""
+
+import doctest
+import importlib
+import os
+import pkgutil
+import sys
+import unittest
+
+import krutil
+import numpy
+from engine_test import Listener
+
+PAGE = sys.argv.pop(1)
+
+
+def load_tests(loader, tests, pattern):
+    listener = Listener()
+    unittest.addModuleCleanup(listener.stop)
+    names = {"krutil": krutil, "numpy": numpy, "listening_engine": listener.path}
+    for module in pkgutil.iter_modules(krutil.__path__, "krutil."):
+        tests.addTests(doctest.DocTestSuite(importlib.import_module(module.name), extraglobs=names))
+    tests.addTests(doctest.DocTestSuite(krutil, extraglobs=names))
+    tests.addTests(doctest.DocFileSuite(os.path.abspath(PAGE), module_relative=False, globs=names))
+    return tests
+
+
+if __name__ == "__main__":
+    unittest.main()
