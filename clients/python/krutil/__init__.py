@@ -6,6 +6,7 @@ machine or at the far end of an `ssh`.
 '42'
 """
 
+from . import aio
 from .errors import Aborted, Cancelled, Error, Lost, Refused, RemoteError, RemoteFrame
 from .prompts import Prompt
 from .requests import CancelAnswer, Request, Result, State, Text, Value, Warned
@@ -17,4 +18,4 @@ for _each in (Aborted, Cancelled, Error, Lost, Refused, RemoteError):
     _each.__module__ = __name__
 
 __all__ = ["Aborted", "CancelAnswer", "Cancelled", "Error", "Limits", "Lost", "Prompt", "Refused", "RemoteError",
-           "RemoteFrame", "Request", "Result", "Session", "State", "Text", "Value", "Warned", "connect", "start"]
+           "RemoteFrame", "Request", "Result", "Session", "State", "Text", "Value", "Warned", "aio", "connect", "start"]

@@ -1,5 +1,6 @@
 """A request from its beginning to its reply, as whoever made it sees it."""
 
+import contextlib
 import enum
 import threading
 import time
@@ -105,6 +106,7 @@ class Request(Generic[T]):
         self._future.set_running_or_notify_cancel()
         self._changed = threading.Condition()
         self._events: list[Event] = []
+        self._listeners: list[Callable[[], object]] = []
         self._error_text = ""
 
     def result(self, timeout: Optional[float] = None) -> T:
@@ -180,9 +182,20 @@ class Request(Generic[T]):
         """The warnings so far."""
         return tuple(event for event in self._so_far() if isinstance(event, Warned))
 
-    def _so_far(self) -> list[Event]:
+    def _so_far(self, position: int = 0) -> list[Event]:
         with self._changed:
-            return list(self._events)
+            return self._events[position:]
+
+    @contextlib.contextmanager
+    def _listening(self, listener: Callable[[], object]) -> Iterator[None]:
+        """Has the listener called whenever there is more to see, in the thread that reads; it must not wait or fail."""
+        with self._changed:
+            self._listeners.append(listener)
+        try:
+            yield
+        finally:
+            with self._changed:
+                self._listeners.remove(listener)
 
     # For the thread that reads:
 
@@ -195,7 +208,7 @@ class Request(Generic[T]):
     def _add(self, event: Event) -> None:
         with self._changed:
             self._events.append(event)
-            self._changed.notify_all()
+            self._notify()
 
     def _since_prompt(self) -> list[Event]:
         """What has come since the last prompt was closed."""
@@ -216,4 +229,9 @@ class Request(Generic[T]):
         else:
             self._future.set_result(result)  # type: ignore[arg-type]
         with self._changed:
-            self._changed.notify_all()
+            self._notify()
+
+    def _notify(self) -> None:
+        self._changed.notify_all()
+        for listener in self._listeners:
+            listener()

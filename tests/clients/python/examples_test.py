@@ -3,6 +3,7 @@
     examples_test.py PAGE
 """
 
+import asyncio
 import doctest
 import importlib
 import os
@@ -20,7 +21,7 @@ PAGE = sys.argv.pop(1)
 def load_tests(loader, tests, pattern):
     listener = Listener()
     unittest.addModuleCleanup(listener.stop)
-    names = {"krutil": krutil, "numpy": numpy, "listening_engine": listener.path}
+    names = {"asyncio": asyncio, "krutil": krutil, "numpy": numpy, "listening_engine": listener.path}
     for module in pkgutil.iter_modules(krutil.__path__, "krutil."):
         tests.addTests(doctest.DocTestSuite(importlib.import_module(module.name), extraglobs=names))
     tests.addTests(doctest.DocTestSuite(krutil, extraglobs=names))
