@@ -82,13 +82,15 @@ struct Borrower::Borrowed {
     static void drop(void* borrowed) noexcept {
         std::shared_ptr<Core> core;
         std::uint64_t number = 0;
-        bool kept = false;
+        unsigned forksBefore = 0;
         {
             const std::unique_ptr<Borrowed> last(static_cast<Borrowed*>(borrowed));
             core = std::move(last->core);
             number = last->number;
-            kept = last->forksBefore != forks;
+            forksBefore = last->forksBefore;
         }
+        // Only now that the memory is unmapped can no further fork have it.
+        const bool kept = forksBefore != forks;
         try {
             core->giveBack(number, kept);
         } catch (const std::bad_alloc&) {
