@@ -42,7 +42,8 @@ void HandshakeStream::receive(char* target, std::size_t size, const std::string&
         const std::string progress =
             std::to_string(have) + " of " + std::to_string(size) + " bytes of " + what + " had arrived";
         wait(true, progress);
-        const iovec piece{target + have, size - have};
+        char* const rest = target + have;
+        const iovec piece{rest, size - have};
         const ssize_t count = descriptors == nullptr
                                   ? ::readv(in_, &piece, 1)
                                   : lending::receiveWithDescriptors(in_, std::span(&piece, 1), *descriptors);
