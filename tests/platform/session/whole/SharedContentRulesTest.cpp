@@ -3,9 +3,12 @@
 
 #include <algorithm>
 #include <cctype>
+#include <filesystem>
 #include <functional>
 #include <future>
 #include <ostream>
+#include <string>
+#include <system_error>
 
 #include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
 #include "foundation/vantor/carrier/shared_memory/SegmentPool.hpp"
@@ -71,6 +74,19 @@ class SharingWithBytes {
     std::string answered;
 };
 
+// Descriptors of this process that stand for memory as the test makes it; each of them has to be close-on-exec.
+std::size_t memoryDescriptors() {
+    std::size_t count = 0;
+    for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
+        std::error_code gone;
+        if (std::filesystem::read_symlink(entry, gone).string().starts_with("/memfd:test")) {
+            EXPECT_EQ(::fcntl(std::stoi(entry.path().filename()), F_GETFD), FD_CLOEXEC);
+            ++count;
+        }
+    }
+    return count;
+}
+
 // Frame 1 on stream 1 in shared memory, and the question that it belongs to.
 std::string sharedQuestion(std::uint64_t number, std::uint64_t offset, std::uint64_t size) {
     return wire::sharedData(1, 1, number, offset, size) + wire::tagged(1, 2, true, questionTag, "?");
@@ -80,8 +96,10 @@ TEST(SharedContentTest, IsReadWhereItIsAndGivenBack) {
     SharingWithBytes pair(sharingConfig(Role::Engine));
     ASSERT_TRUE(pair.shares());
     const auto memory = anonymousMemory(mebi + 3 * page, mebi + 3 * page, allSeals);
+    const std::size_t descriptors = memoryDescriptors();
     pair.peer->writeWith(sharedQuestion(77, 2 * page, mebi), {memory.get()});
     EXPECT_THAT(pair.saw.waitForLines(1), ElementsAre("question 1 ?"));
+    EXPECT_EQ(memoryDescriptors(), descriptors) << "closed once the memory is mapped";
     auto question = pair.saw.lastQuestion();
     const framing::Frame& frame = *question->received.at(0);
     EXPECT_EQ(frame.size(), mebi);
@@ -102,10 +120,12 @@ TEST(SharedContentTest, DescriptorsMayComeBeforeTheirFrames) {
     const std::string bytes = wire::sharedData(1, 1, 1, 0, mebi) + wire::sharedData(1, 2, 2, 0, mebi) +
                               wire::tagged(1, 3, true, questionTag, "two");
     const auto third = anonymousMemory(mebi, mebi, allSeals);
-    pair.peer->writeWith(bytes.substr(0, 1), {first.get(), third.get()});
+    const std::size_t descriptors = memoryDescriptors();
+    pair.peer->writeWith(bytes.substr(0, 1), {first.get(), third.get(), second.get()});
     pair.peer->write(bytes.substr(1));
     EXPECT_THAT(pair.saw.waitForLines(1), ElementsAre("question 1 two"));
     EXPECT_EQ(pair.saw.lastQuestion()->received.size(), 2U);
+    EXPECT_EQ(memoryDescriptors(), descriptors + 1) << "the last one waits for its frame";
 }
 
 TEST(SharedContentTest, OutlivesTheSession) {
