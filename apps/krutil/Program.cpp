@@ -21,7 +21,6 @@
 #include "krutil/commands/CommandLine.hpp"
 #include "krutil/commands/EvalCommand.hpp"
 #include "krutil/commands/Repl.hpp"
-#include "krutil/commands/RunCommand.hpp"
 #include "krutil/display/JsonPrinter.hpp"
 #include "krutil/display/PersonPrinter.hpp"
 #include "krutil/session/Client.hpp"
@@ -162,12 +161,6 @@ ExitCode runCommand(const Options& options, const ReplOptions& repl, Printer& pr
         return readAndEvaluate(asking.client(), repl, asking.readingCode(), person,
                                options.display.json ? terminal.err : terminal.out, terminal.interrupt);
     });
-}
-
-ExitCode runCommand(const Options& options, const RunOptions& run, Printer& printer, Terminal& terminal) {
-    const std::string script = readScript(run);
-    AskingClient asking(options, printer, terminal, standardInputIsTerminal());
-    return inSession(asking, [&] { return runScript(asking.client(), run, script); });
 }
 
 ExitCode runCommand(const Options& options, const CallOptions& call, Printer& printer, Terminal& terminal) {

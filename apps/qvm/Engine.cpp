@@ -115,7 +115,7 @@ ExitCode Engine::run(int in, int out) {
     }
     installEngineModule(*output_, *announcer_, *this);
     try {
-        python_ = std::make_unique<Interpreter>(bounds);
+        python_ = std::make_unique<Interpreter>(options_.python, bounds);
         serve();
     } catch (const std::exception& error) {
         log_.say(std::string("The engine has failed: ") + error.what());
@@ -256,7 +256,7 @@ Interpreter::Ending Engine::runCode(const Request& request, PyObject* frame) {
     } else {
         const EvalIIP& evaluation = *std::get<const EvalIIP*>(request.task);
         echo(evaluation);
-        ending = python_->evaluate(evaluation, frame);
+        ending = python_->evaluate(evaluation, fileOf(request), frame);
     }
     checkDescriptors();
     capture_->finish();

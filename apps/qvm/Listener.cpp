@@ -124,7 +124,7 @@ Listener::Listener(const Options& options, Log& log) : options_(options), log_(l
     const sigset_t watched = watchedSignals();
     ::sigprocmask(SIG_BLOCK, &watched, nullptr);
     try {
-        preparePython();
+        preparePython(options_.python);
         bindSocket();
     } catch (...) {
         ::close(socket_);

@@ -64,6 +64,15 @@ Options parseOptions(int argc, const char* const* argv) {
                  "Let numbers that the protocol has no meaning for end the process, instead of closing the session")
         ->group(sessions);
 
+    const std::string python = "Python";
+    app.add_option("--python", options.python.program,
+                   "Interpreter whose packages code finds; otherwise bin/python3 of VIRTUAL_ENV, or the system's")
+        ->type_name("FILE")
+        ->group(python);
+    app.add_flag("--isolated", options.python.isolated,
+                 "Neither environment variables (PYTHONPATH, VIRTUAL_ENV, ...) nor packages of the user count")
+        ->group(python);
+
     const std::string files = "Files";
     app.add_option("--diary", options.diary, "Append what is shown to sinks with the diary trait to this file")
         ->type_name("FILE")

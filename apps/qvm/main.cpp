@@ -13,6 +13,7 @@
 #include "qvm/Options.hpp"
 #include "qvm/process/Log.hpp"
 #include "qvm/process/StandardDescriptors.hpp"
+#include "qvm/python/PythonChoice.hpp"
 
 namespace {
 
@@ -58,7 +59,7 @@ SANITIZER_HOOK const char* __lsan_default_suppressions() {
 #endif
 
 int main(int argc, char** argv) {
-    const qvm::Options options = qvm::parseOptions(argc, argv);
+    qvm::Options options = qvm::parseOptions(argc, argv);
     try {
         qvm::holdStandardDescriptors();
         ::signal(SIGPIPE, SIG_IGN);
@@ -68,6 +69,8 @@ int main(int argc, char** argv) {
             // Read once in the life of a process, when its first session shakes hands.
             ::setenv("QX_DISABLE_ZEROCOPY", "1", 1);
         }
+        const char* const environment = options.python.isolated ? nullptr : std::getenv("VIRTUAL_ENV");
+        options.python.program = qvm::choosePython(options.python.program, environment != nullptr ? environment : "");
         krutil::protobuf::KrutilProtocol::init();
         leave(serve(options, log));
     } catch (const std::exception& error) {

@@ -45,11 +45,13 @@ struct SinkOptions {
     bool log = false;
 };
 
-/// `krutil eval`.
+/// `krutil eval`, and `krutil run`, which is a script from a file with arguments.
 struct EvalOptions {
     std::string source;     ///< the code, or the file that holds it
     bool fromFile = false;  ///< `source` names a file
     bool fromStandardInput = false;
+    /// What the code finds in sys.argv after its name; without, sys.argv stays as it is.
+    std::optional<std::vector<std::string>> arguments;
     cmddistributor::CodeType type = cmddistributor::CodeType::CodeBlockType;
     bool sparingly = false;
     SinkOptions sink;
@@ -65,14 +67,6 @@ struct CallOptions {
     SinkOptions sink;
 };
 
-/// `krutil run`.
-struct RunOptions {
-    std::string file;
-    std::vector<std::string> arguments;  ///< of the script
-    bool sparingly = false;
-    SinkOptions sink;
-};
-
 /// `krutil repl`.
 struct ReplOptions {
     bool noHistory = false;  ///< lines are not kept for later sessions
@@ -82,7 +76,7 @@ struct ReplOptions {
 struct Options {
     ConnectionOptions connection;
     DisplayOptions display;
-    std::variant<EvalOptions, CallOptions, RunOptions, ReplOptions> command;
+    std::variant<EvalOptions, CallOptions, ReplOptions> command;
 };
 
 }  // namespace krutil_client

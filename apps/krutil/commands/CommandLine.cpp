@@ -96,13 +96,18 @@ void addSparingly(CLI::App& app, bool& sparingly) {
         ->group("Request");
 }
 
-void addEval(CLI::App& app, Options& options, EvalOptions& eval) {
+// Words of a file's code come after two dashes, so that code beside a file is found to be one too many.
+void addEval(CLI::App& app, Options& options, EvalOptions& eval, bool twoDashes) {
     auto* command = app.add_subcommand("eval", "Evaluate code and show what it prints");
     auto* code =
-        command->add_option("CODE", eval.source, "The code, or - for standard input; after -- it may begin with a dash")
+        command
+            ->add_option("CODE",
+                         "The code, or - for standard input; after -- it may begin with a dash. Not with --file")
             ->type_name("");
-    auto* file = command->add_option("-f,--file", eval.source, "Take the code from a file")->type_name("FILE");
-    file->excludes(code);
+    const auto words = std::make_shared<std::vector<std::string>>();
+    command->add_option("ARG", *words, "With --file, after --: what the code finds in sys.argv after the file's name")
+        ->type_name("");
+    auto* file = command->add_option("-f,--file", "Take the code from a file")->expected(1)->type_name("FILE");
     static const std::map<std::string, cmddistributor::CodeType> types{
         {"block", cmddistributor::CodeType::CodeBlockType},
         {"script", cmddistributor::CodeType::ScriptType},
@@ -123,12 +128,24 @@ void addEval(CLI::App& app, Options& options, EvalOptions& eval) {
     addDisplayOptions(*command, options.display);
     addConnectionOptions(*command, options.connection);
     command->footer(exitCodes);
-    command->callback([&options, &eval, code, file] {
+    command->callback([&options, &eval, twoDashes, code, words, file] {
         if (code->count() == 0 && file->count() == 0) {
             throw CLI::RequiredError("CODE or --file");
         }
         eval.fromFile = file->count() > 0;
+        eval.source = (eval.fromFile ? file : code)->results().front();
         eval.fromStandardInput = !eval.fromFile && eval.source == "-";
+        if (eval.fromFile && code->count() > 0 && !twoDashes) {
+            throw CLI::ExcludesError("CODE", "--file");
+        }
+        if (!eval.fromFile && !words->empty()) {
+            throw CLI::ExtrasError(*words);
+        }
+        std::vector<std::string> arguments = code->results();
+        arguments.insert(arguments.end(), words->begin(), words->end());
+        if (eval.fromFile && !arguments.empty()) {
+            eval.arguments = std::move(arguments);
+        }
         options.command = eval;
     });
 }
@@ -139,14 +156,14 @@ constexpr const char* promptHelp = R"(Prompts:
   Ctrl-D) quits, :queue lists requests and :queue cancel N cancels one. Ctrl-C cancels; a second
   one within two seconds ends the engine.)";
 
-void addRun(CLI::App& app, Options& options, RunOptions& run) {
+void addRun(CLI::App& app, Options& options, EvalOptions& run) {
     auto* command = app.add_subcommand("run", "Run a Python script from a file");
-    command->add_option("FILE", run.file, "The script, a file of this machine; the engine gets its text")
+    command->add_option("FILE", run.source, "The script, a file of this machine; the engine gets its text")
         ->required()
         ->type_name("");
     command
         ->add_option(
-            "ARG", run.arguments,
+            "ARG", run.arguments.emplace(),
             "What the script finds in sys.argv after its name; put -- before the first one if any begins with a dash")
         ->type_name("");
     addSparingly(*command, run.sparingly);
@@ -154,7 +171,11 @@ void addRun(CLI::App& app, Options& options, RunOptions& run) {
     addDisplayOptions(*command, options.display);
     addConnectionOptions(*command, options.connection);
     command->footer(std::string(promptHelp) + "\n\n" + exitCodes);
-    command->callback([&options, &run] { options.command = run; });
+    command->callback([&options, &run] {
+        run.fromFile = true;
+        run.type = cmddistributor::CodeType::ScriptType;
+        options.command = run;
+    });
 }
 
 void addRepl(CLI::App& app, Options& options, ReplOptions& repl) {
@@ -240,7 +261,7 @@ std::variant<Options, Finished> parseCommandLine(int argc, const char* const* ar
     Options options;
     EvalOptions eval;
     CallOptions call;
-    RunOptions run;
+    EvalOptions run;
     ReplOptions repl;
     options.command = repl;
     CLI::App app("Evaluates code on an engine in another process. Without a command, code is read line by line.",
@@ -250,7 +271,8 @@ std::variant<Options, Finished> parseCommandLine(int argc, const char* const* ar
     app.require_subcommand(0, 1);
     app.footer(exitCodes);
     app.formatter(std::make_shared<apps::HelpFormatter>());
-    addEval(app, options, eval);
+    const std::vector<std::string> words(argv, argv + argc);
+    addEval(app, options, eval, std::find(words.begin(), words.end(), "--") != words.end());
     addCall(app, options, call);
     addRun(app, options, run);
     addRepl(app, options, repl);

@@ -6,7 +6,10 @@
 #include <array>
 #include <cerrno>
 #include <cstring>
+#include <filesystem>
+#include <nlohmann/json.hpp>
 #include <string>
+#include <vector>
 
 #include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "krutil/base/Text.hpp"
@@ -32,9 +35,34 @@ std::string readAll(int fd, const std::string& name) {
     }
 }
 
+// A request of its own before the code, which may begin with statements that must be its first.
+std::string argumentsCode(const EvalOptions& options) {
+    nlohmann::json list = nlohmann::json::array({options.source});
+    for (const std::string& argument : *options.arguments) {
+        list.push_back(argument);
+    }
+    // JSON's texts are literals of Python too.
+    return "__import__('sys').argv = " + list.dump();
+}
+
+ExitCode submit(Client& client, const EvalOptions& options, const std::string& code, const std::string& name) {
+    return client
+        .request(
+            {.iip = client.evaluation(code, options.type, options.sink), .name = name, .sparingly = options.sparingly})
+        .exitCode;
+}
+
 }  // namespace
 
 std::string readCode(const EvalOptions& options) {
+    for (const std::string& argument : options.arguments.value_or(std::vector<std::string>())) {
+        if (firstInvalidUtf8(argument)) {
+            throw Failure(ExitCode::Usage, "an argument of the script is not valid UTF-8");
+        }
+    }
+    if (options.fromFile && options.arguments && firstInvalidUtf8(options.source)) {
+        throw Failure(ExitCode::Usage, "the file's name is not valid UTF-8");
+    }
     std::string code = options.source;
     std::string where = "the code";
     if (options.fromStandardInput) {
@@ -56,11 +84,17 @@ std::string readCode(const EvalOptions& options) {
 }
 
 ExitCode evaluate(Client& client, const EvalOptions& options, const std::string& code) {
-    const std::string name = options.fromFile ? options.source : nameOfCode(code);
-    return client
-        .request(
-            {.iip = client.evaluation(code, options.type, options.sink), .name = name, .sparingly = options.sparingly})
-        .exitCode;
+    if (options.arguments) {
+        // Only the code itself is timed.
+        const bool timing = client.timing();
+        client.setTiming(false);
+        if (const ExitCode result = submit(client, options, argumentsCode(options), ""); result != ExitCode::Ok) {
+            return result;
+        }
+        client.setTiming(timing);
+    }
+    return submit(client, options, code,
+                  options.fromFile ? std::filesystem::absolute(options.source).string() : nameOfCode(code));
 }
 
 }  // namespace krutil_client

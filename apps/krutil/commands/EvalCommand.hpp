@@ -6,10 +6,11 @@
 
 namespace krutil_client {
 
-/// Reads the code text: valid UTF-8, whatever its length. Throws Failure.
+/// Reads the code text: valid UTF-8, whatever its length, like its arguments. Throws Failure.
 std::string readCode(const EvalOptions& options);
 
-/// Has `code` evaluated and shows what comes of it.
+/// Has `code` evaluated, with sys.argv as Python itself sets it if there are arguments, and shows what comes of it. The
+/// engine learns the absolute path of a file, so that tracebacks name it.
 ExitCode evaluate(Client& client, const EvalOptions& options, const std::string& code);
 
 }  // namespace krutil_client

@@ -177,9 +177,9 @@ RecordBounds recordBounds(const MessageBounds& bounds) {
 
 }  // namespace
 
-Interpreter::Interpreter(const MessageBounds& bounds)
+Interpreter::Interpreter(const PythonConfig& world, const MessageBounds& bounds)
     : bounds_(recordBounds(bounds)), printedCharacters_(bounds.printedCharacters) {
-    startPython();
+    startPython(world);
     state_ = std::make_unique<State>();
     state_->globals = py::module_::import("__main__").attr("__dict__");
     const auto module = py::module_::import("qvm");
@@ -214,14 +214,17 @@ Interpreter::~Interpreter() {
     left = state_.release();
 }
 
-Interpreter::Ending Interpreter::evaluate(const cmddistributor::EvalIIP& request, PyObject* frame) {
+Interpreter::Ending Interpreter::evaluate(const cmddistributor::EvalIIP& request, const std::string& file,
+                                          PyObject* frame) {
     const Namespace names = frame == nullptr ? Namespace(state_->globals) : Namespace(frame);
     names.forgetWarnings();
-    const std::string file = "<eval-" + std::to_string(++evaluations_) + ">";
+    ++evaluations_;
+    const std::string name = file.empty() ? "<eval-" + std::to_string(evaluations_) + ">" : file;
+    const int beginsFile = !file.empty() && frame == nullptr ? 1 : 0;
     const auto source = py::reinterpret_steal<py::object>(strOf(request.getCommand()));
     const auto compiled = py::reinterpret_steal<py::object>(
-        source ? PyObject_CallFunction(state_->compile.ptr(), "Osi", source.ptr(), file.c_str(),
-                                       static_cast<int>(request.getCodeType()))
+        source ? PyObject_CallFunction(state_->compile.ptr(), "Osii", source.ptr(), name.c_str(),
+                                       static_cast<int>(request.getCodeType()), beginsFile)
                : nullptr);
     if (!compiled) {
         return failure(inCOMPILE_ERROR);

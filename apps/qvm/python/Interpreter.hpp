@@ -17,6 +17,7 @@
 #include "cmddistributor/RuntimeException.hpp"
 #include "foundation/korveldata/Array.hpp"
 #include "qvm/python/ErrorRecord.hpp"
+#include "qvm/python/PythonChoice.hpp"
 #include "qvm/requests/MessageBounds.hpp"
 
 namespace qvm {
@@ -38,7 +39,7 @@ class Interpreter {
     enum class Outputs { Shared, Copied };
 
     /// Starts Python, where it has not been prepared. Throws std::runtime_error with Python's reason.
-    explicit Interpreter(const MessageBounds& bounds);
+    Interpreter(const PythonConfig& world, const MessageBounds& bounds);
 
     /// Leaves Python as it is, because threads of running code may still be in it: the process is about to end. Builds
     /// with a sanitizer finalise it where they can, so that leaks show.
@@ -49,8 +50,10 @@ class Interpreter {
     /// Runs the request's text as its code type says. Nothing that the text raises leaves this function, SystemExit
     /// included. An interrupt that comes while its error is put into words is the error then. In a process that the
     /// text has forked it does not return. `frame` is one that stands still, whose variables the text sees and assigns;
-    /// null for the namespace of the session. Evaluations nest.
-    Ending evaluate(const cmddistributor::EvalIIP& request, PyObject* frame = nullptr);
+    /// null for the namespace of the session. `file` is the absolute path that the text comes from, UTF-8; empty for
+    /// none. Tracebacks name it and show its lines as they are in the text, `__file__` and the first entry of sys.path
+    /// are as when Python runs it; in a frame only the tracebacks are. Evaluations nest.
+    Ending evaluate(const cmddistributor::EvalIIP& request, const std::string& file, PyObject* frame = nullptr);
 
     /// Calls the function that the request names with the arrays that it carries, which are taken out of it, and
     /// returns as many outputs as it asks for; see FunctionCall.hpp. Unless they are to be copied, the outputs share

@@ -48,6 +48,10 @@ constexpr NumpyType elementTypes[] = {
     {ElementType::ComplexDouble, 'c', Npy::NPY_CDOUBLE_},
 };
 
+std::string program() {
+    return "this Python (" + std::string(py::str(py::module_::import("sys").attr("executable"))) + ")";
+}
+
 py::dtype dtypeOf(ElementType element) {
     const auto* const row = std::find_if(std::begin(elementTypes), std::end(elementTypes),
                                          [&](const NumpyType& each) { return each.element == element; });
@@ -56,6 +60,33 @@ py::dtype dtypeOf(ElementType element) {
                              ", which NumPy does not have");
     }
     return py::dtype(row->number);
+}
+
+// The module, which everything below needs that is neither text nor a number. The headers of NumPy 1 look into its
+// objects, which another major version lays out differently.
+py::module_ numpyModule() {
+    static bool fits = false;
+    py::module_ numpy;
+    try {
+        numpy = py::module_::import("numpy");
+    } catch (py::error_already_set& error) {
+        if (!error.matches(PyExc_ImportError)) {
+            throw;
+        }
+        const std::string why = py::str(error.value());
+        py::raise_from(error, PyExc_ImportError,
+                       ("Arrays need NumPy, which " + program() + " cannot import: " + why).c_str());
+        throw py::error_already_set();
+    }
+    if (!fits) {
+        const std::string version = py::str(numpy.attr("__version__"));
+        fits = version.starts_with("1.");
+        if (!fits) {
+            PyErr_SetString(PyExc_ImportError, ("Arrays need NumPy 1; " + program() + " has " + version).c_str());
+            throw py::error_already_set();
+        }
+    }
+    return numpy;
 }
 
 // By kind and size: C has several integer types of one size, and NumPy tells them apart.
@@ -164,6 +195,7 @@ py::object toPython(Array array) {
     if (array.elementType() == ElementType::Char16) {
         return textOf(array);
     }
+    numpyModule();
     const py::dtype dtype = dtypeOf(array.elementType());
     const bool writable = array.writableInPlace();
     auto kept = std::make_unique<Array>(std::move(array));
@@ -186,7 +218,7 @@ Array toArray(py::handle value, ReleaseQueue& releases) {
     if (std::optional<Array> scalar = scalarOf(value.ptr())) {
         return *std::move(scalar);
     }
-    const py::module_ numpy = py::module_::import("numpy");
+    const py::module_ numpy = numpyModule();
     if (py::isinstance(value, numpy.attr("ma").attr("MaskedArray"))) {
         throw NotConvertible(
             "is a masked array, whose mask would be lost; return its filled(...) or its data and mask");

@@ -15,7 +15,8 @@
 // - results of dtype bool in which a byte is neither 0 nor 1;
 // - results that are no arrays yet: numbers, and lists of numbers.
 //
-// The caller holds the interpreter lock. NumPy is imported when it is first needed.
+// The caller holds the interpreter lock. NumPy is imported when it is first needed. Without one that fits, text and
+// numbers still cross, and everything else raises ImportError.
 #pragma once
 
 #include <pybind11/pybind11.h>

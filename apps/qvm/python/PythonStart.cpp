@@ -24,10 +24,15 @@ void check(const PyStatus& status) {
     }
 }
 
-void initialize() {
-    // Independent of the environment of whoever started the engine, and UTF-8 whatever the locale.
+void initialize(const PythonConfig& world) {
     PyPreConfig preConfig;
-    PyPreConfig_InitIsolatedConfig(&preConfig);
+    if (world.isolated) {
+        PyPreConfig_InitIsolatedConfig(&preConfig);
+    } else {
+        PyPreConfig_InitPythonConfig(&preConfig);
+        preConfig.parse_argv = 0;
+    }
+    // Whatever the locale.
     preConfig.utf8_mode = 1;
 #if defined(KRUTIL_SANITIZED)
     preConfig.allocator = PYMEM_ALLOCATOR_MALLOC;
@@ -35,10 +40,16 @@ void initialize() {
     check(Py_PreInitialize(&preConfig));
 
     PyConfig config;
-    PyConfig_InitIsolatedConfig(&config);
-    config.user_site_directory = 1;
+    if (world.isolated) {
+        PyConfig_InitIsolatedConfig(&config);
+    } else {
+        PyConfig_InitPythonConfig(&config);
+        config.parse_argv = 0;
+        // Those of the process are not Python's to change.
+        config.configure_c_stdio = 0;
+    }
     config.install_signal_handlers = 1;
-    PyStatus status = PyConfig_SetBytesString(&config, &config.program_name, QVM_PYTHON_EXECUTABLE);
+    PyStatus status = PyConfig_SetBytesString(&config, &config.program_name, world.program.c_str());
     if (PyStatus_Exception(status) == 0) {
         status = Py_InitializeFromConfig(&config);
     }
@@ -69,15 +80,15 @@ void loadModule() {
 
 }  // namespace
 
-void startPython() {
+void startPython(const PythonConfig& world) {
     if (Py_IsInitialized() == 0) {
-        initialize();
+        initialize(world);
         loading(loadModule);
     }
 }
 
-void preparePython() {
-    startPython();
+void preparePython(const PythonConfig& world) {
+    startPython(world);
     loading([] { py::module_::import("qvm").attr("_prepare")(); });
 }
 

@@ -17,6 +17,7 @@ import warnings as _warnings
 import _signal
 import _warnings as _c_warnings
 from errno import EINVAL as _EINVAL
+from os import path as _path
 from os import strerror as _strerror
 from _frozen_importlib_external import PathFinder as _PathFinder
 from _operator import index as _index
@@ -404,6 +405,7 @@ _source_lines = {}
 
 def _remember(filename, source):
     global _source_length
+    _source_length -= _source_lengths.pop(filename, 0)
     _source_lengths[filename] = len(source)
     _source_length += len(source)
     while len(_source_lengths) > _MAX_SOURCES or _source_length > _MAX_SOURCE_LENGTH:
@@ -447,7 +449,28 @@ def _compile_statement(source, filename):
 _COMPILERS = (_compile_block, _compile_program, _compile_statement, _compile_block)
 
 
-def _compile(source, filename, code_type):
+# What the engine has put at the begin of sys.path, as Python does for code (an empty text, the current directory) and
+# for a file (its directory).
+_path_entry = ""
+
+
+def _begin_file(filename):
+    """Lets code of a file find what it finds when Python runs the file. It stays until the next file."""
+    global _path_entry
+    _sys.modules["__main__"].__file__ = filename
+    if _sys.flags.safe_path:
+        return
+    directory = _path.dirname(_path.realpath(filename))
+    if _sys.path[:1] == [_path_entry]:
+        _sys.path[0] = directory
+    else:
+        _sys.path.insert(0, directory)
+    _path_entry = directory
+
+
+def _compile(source, filename, code_type, begins_file):
+    if begins_file:
+        _begin_file(filename)
     _remember(filename, source)
     return _COMPILERS[code_type](source, filename)
 
@@ -472,6 +495,8 @@ def _prepare():
     _gc.freeze()
 
 
+if not _sys.flags.safe_path:
+    _sys.path.insert(0, _path_entry)
 _sys.stdout = _sys.__stdout__ = _TextStream("<stdout>", 1, _qvm.write_output)
 _sys.stderr = _sys.__stderr__ = _TextStream("<stderr>", 2, _qvm.write_error)
 _sys.displayhook = _sys.__displayhook__ = _show

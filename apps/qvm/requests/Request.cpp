@@ -3,6 +3,8 @@
 #include <stdexcept>
 #include <utility>
 
+#include "msg_svc/protobuf/ustring.hpp"
+
 namespace qvm {
 namespace {
 
@@ -39,6 +41,12 @@ Request::Task taskOf(const cmddistributor::IIP* iip) {
 Request arrivedRequest(framing::StreamID stream, boost::shared_ptr<const cmddistributor::IIPEnqueueMessage> message) {
     const Request::Task task = taskOf(message->getIIP().get());
     return {stream, std::move(message), task};
+}
+
+std::string fileOf(const Request& request) {
+    const std::u16string& name = request.message->getDynamicName();
+    const bool isPath = name.starts_with(u'/') && name.find(u'\0') == std::u16string::npos;
+    return isPath ? msg_svc::protobuf::ustring_to_utf8(name) : std::string();
 }
 
 std::size_t memoryOf(const Request& request) {

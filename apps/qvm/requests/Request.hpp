@@ -3,6 +3,7 @@
 
 #include <boost/shared_ptr.hpp>
 #include <cstddef>
+#include <string>
 #include <variant>
 
 #include "cmddistributor/EvalIIP.hpp"
@@ -30,6 +31,10 @@ struct Request {
 /// The request that a message from the client brings. Throws std::invalid_argument when the message asks for something
 /// else than an evaluation or a call.
 Request arrivedRequest(framing::StreamID stream, boost::shared_ptr<const cmddistributor::IIPEnqueueMessage> message);
+
+/// The absolute path of the file that the request's code comes from, UTF-8. Empty for none: the request's name is a
+/// path if it begins with a slash, which no code does.
+std::string fileOf(const Request& request);
 
 /// Memory that a waiting request holds, in bytes, roughly: what its peer decides counts, plus a fixed share for the
 /// rest.

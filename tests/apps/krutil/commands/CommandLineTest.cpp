@@ -45,6 +45,14 @@ TEST(CommandLineTest, CodeOfAFileOrOfStandardInput) {
     EXPECT_FALSE(parseEval({"eval", "-f", "./-"}).fromStandardInput);
 }
 
+TEST(CommandLineTest, CodeOfAFileHasArguments) {
+    EXPECT_EQ(parseEval({"eval", "x"}).arguments, std::nullopt);
+    EXPECT_EQ(parseEval({"eval", "-f", "x.py"}).arguments, std::nullopt);
+    const EvalOptions file = parseEval({"eval", "-f", "x.py", "--", "-b", "c"});
+    EXPECT_EQ(file.source, "x.py");
+    EXPECT_EQ(file.arguments, (std::vector<std::string>{"-b", "c"}));
+}
+
 TEST(CommandLineTest, KindsOfCode) {
     EXPECT_EQ(parseEval({"eval", "--type", "script", "x"}).type, cmddistributor::CodeType::ScriptType);
     EXPECT_EQ(parseEval({"eval", "--type", "conventional", "x"}).type, cmddistributor::CodeType::ConventionalType);
@@ -133,9 +141,13 @@ TEST(CommandLineTest, WithoutACommandLinesAreRead) {
 TEST(CommandLineTest, AProgramHasArguments) {
     const Options options = std::get<Options>(parse({"run", "--no-precheck", "a.py", "--", "-b", "c", "-d"}));
     EXPECT_TRUE(options.connection.noPrecheck);
-    const RunOptions run = std::get<RunOptions>(options.command);
-    EXPECT_EQ(run.file, "a.py");
+    const EvalOptions run = std::get<EvalOptions>(options.command);
+    EXPECT_EQ(run.source, "a.py");
+    EXPECT_TRUE(run.fromFile);
+    EXPECT_EQ(run.type, cmddistributor::CodeType::ScriptType);
     EXPECT_EQ(run.arguments, (std::vector<std::string>{"-b", "c", "-d"}));
+    EXPECT_EQ(std::get<EvalOptions>(std::get<Options>(parse({"run", "a.py"})).command).arguments,
+              std::vector<std::string>());
     EXPECT_EQ(parseFinished({"run"}).err, "krutil: FILE is required\nRun krutil --help for help.\n");
 }
 
@@ -151,7 +163,7 @@ TEST(CommandLineTest, HelpGoesToStandardOutput) {
 TEST(CommandLineTest, HelpOfACommandFitsInOneHundredColumns) {
     const Finished finished = parseFinished({"eval", "--help"});
     EXPECT_EQ(finished.code, ExitCode::Ok);
-    EXPECT_THAT(finished.out, HasSubstr("Usage: krutil eval [OPTIONS] [CODE]\n"));
+    EXPECT_THAT(finished.out, HasSubstr("Usage: krutil eval [OPTIONS] [CODE] [ARG...]\n"));
     for (const auto* option :
          {"-f,--file FILE", "--type TYPE", "--sparingly", "--engine COMMAND", "--connect PATH", "--json", "--trace",
           "--trace-to FILE", "--timing", "--handshake-timeout SECONDS", "--limit-tag SIZE", "--limit-tagged-frame SIZE",
