@@ -4,8 +4,9 @@
 #include <google/protobuf/io/zero_copy_stream_impl_lite.h>
 
 #include <limits>
+#include <map>
 #include <string>
-#include <unordered_map>
+#include <string_view>
 
 #include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
 #include "krutil.protobuf.FEvalResult.pb.h"
@@ -22,8 +23,8 @@ using foundation::vantor::carrier::framing::TaggedFrame;
 namespace proto = krutil::protobuf;
 
 [[noreturn]] void refuse(const TaggedFrame& frame, const char* field, int value, const char* expected) {
-    throw ProtocolViolation("frame \"" + frame.tag() + "\": expected " + field + " from " + expected + ", got " +
-                            std::to_string(value));
+    throw ProtocolViolation("frame \"" + std::string(frame.tag()) + "\": expected " + field + " from " + expected +
+                            ", got " + std::to_string(value));
 }
 
 // The same steps as the serializers', so that both see the same fields of content that does not parse.
@@ -70,8 +71,8 @@ void checkPrintableError(const TaggedFrame& frame) {
     checkStatus(frame, parse<proto::PrintableErrorEvent>(frame).except());
 }
 
-const std::unordered_map<std::string, void (*)(const TaggedFrame&)>& checks() {
-    static const std::unordered_map<std::string, void (*)(const TaggedFrame&)> byTag{
+const std::map<std::string_view, void (*)(const TaggedFrame&)>& checks() {
+    static const std::map<std::string_view, void (*)(const TaggedFrame&)> byTag{
         {"krutil:TextBaseEvent", checkText<proto::TextBaseEvent>},
         {"krutil:SinkTextEvent", checkText<proto::SinkTextEvent>},
         {"krutil:IIPResult", checkResult},

@@ -42,8 +42,8 @@ std::string hexPrefix(const framing::Frame& frame) {
     return frame.size() > length ? text + "..." : text;
 }
 
-std::string printableTag(const std::string& tag) {
-    std::string text = tag;
+std::string printableTag(std::string_view tag) {
+    std::string text(tag);
     std::replace_if(
         text.begin(), text.end(), [](char c) { return c <= ' ' || c > '~'; }, '?');
     return text;

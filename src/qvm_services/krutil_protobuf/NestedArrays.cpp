@@ -5,11 +5,11 @@ namespace krutil::protobuf_serializer {
 using foundation::korveldata::Array;
 
 std::vector<DataID> writeArrays(const std::vector<Array>& arrays, NestedWriter& nested) {
-    const auto serializer = nested.find<ArrayFamily>(typeid(Array));
+    const auto& serializer = nested.find<ArrayFamily>(typeid(Array));
     std::vector<DataID> dataIDs;
     dataIDs.reserve(arrays.size());
     for (const Array& array : arrays) {
-        dataIDs.push_back(nested.write(*serializer, array));
+        dataIDs.push_back(nested.write(serializer, array));
     }
     return dataIDs;
 }
@@ -20,9 +20,9 @@ std::vector<Array> readArrays(const google::protobuf::RepeatedField<std::uint64_
     if (dataIDs.empty()) {
         return arrays;
     }
-    const auto serializer = nested.serializerAt<ArrayFamily>(dataIDs[0]);
+    const auto& serializer = nested.serializerAt<ArrayFamily>(dataIDs[0]);
     for (const DataID dataID : dataIDs) {
-        arrays.push_back(nested.read(*serializer, dataID));
+        arrays.push_back(nested.read(serializer, dataID));
     }
     return arrays;
 }

@@ -7,6 +7,7 @@
 #include <typeindex>
 #include <typeinfo>
 
+#include "Casts.hpp"
 #include "Families.hpp"
 #include "TaggedFraming.hpp"
 #include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
@@ -23,11 +24,11 @@ class NestedWriter {
                  const std::shared_ptr<const Registry>& registry, const SerializationContext& context)
         : streamID_(streamID), next_(frameIndex), stream_(stream), registry_(registry), context_(context) {}
 
-    /// The serializer registered for `type`. Throws std::out_of_range when there is none, std::bad_cast when it is not
-    /// of `Family`.
+    /// The serializer registered for `type`, which the registry keeps. Throws std::out_of_range when there is none,
+    /// std::bad_cast when it is not of `Family`.
     template <class Family>
-    std::shared_ptr<const Family> find(std::type_index type) const {
-        return cast<Family>(registry_->find(type));
+    const Family& find(std::type_index type) const {
+        return cast<Family>(*registry_->find(type));
     }
 
     /// Writes one object and returns its data ID. Frames that its serializer wrote besides lie before that index.
@@ -42,19 +43,19 @@ class NestedWriter {
     template <class Family, class Ptr>
     DataID writeByDynamicType(const Ptr& object) {
         const auto* raw = object.get();
-        return write(*find<Family>(typeid(*raw)), object);
+        return write(find<Family>(typeid(*raw)), object);
     }
 
     /// The next free frame index.
     FrameIndex next() const noexcept { return next_; }
 
     template <class Family>
-    static std::shared_ptr<const Family> cast(const std::shared_ptr<const SerializerBase>& serializer) {
-        auto found = std::dynamic_pointer_cast<const Family>(serializer);
-        if (!found) {
+    static const Family& cast(const SerializerBase& serializer) {
+        const Family* const found = familyCast<Family>(serializer);
+        if (found == nullptr) {
             throw std::bad_cast();
         }
-        return found;
+        return *found;
     }
 
   private:
@@ -72,16 +73,15 @@ class NestedReader {
                  const SerializationContext& context)
         : message_(message), registry_(registry), context_(context) {}
 
-    /// The serializer that the tag of the frame at `dataID` names. Throws std::bad_cast when no tagged frame is there
-    /// (any more) or the serializer is not of `Family`, std::out_of_range for an unknown tag.
+    /// The serializer that the tag of the frame at `dataID` names, which the registry keeps. Throws std::bad_cast when
+    /// no tagged frame is there (any more) or the serializer is not of `Family`, std::out_of_range for an unknown tag.
     template <class Family>
-    std::shared_ptr<const Family> serializerAt(DataID dataID) const {
-        const auto* frame =
-            dynamic_cast<const foundation::vantor::carrier::framing::TaggedFrame*>(message_->frame(dataID).get());
+    const Family& serializerAt(DataID dataID) const {
+        const auto* frame = downcast<foundation::vantor::carrier::framing::TaggedFrame>(message_->frame(dataID).get());
         if (frame == nullptr) {
             throw std::bad_cast();
         }
-        return NestedWriter::cast<Family>(registry_->find(frame->tag()));
+        return NestedWriter::cast<Family>(*registry_->find(frame->tag()));
     }
 
     /// Reads the object at `dataID` with a serializer found before.
@@ -93,7 +93,7 @@ class NestedReader {
     /// Reads the object at `dataID` with the serializer that its frame's tag names; throws as serializerAt().
     template <class Family>
     auto read(DataID dataID) const {
-        return read(*serializerAt<Family>(dataID), dataID);
+        return read(serializerAt<Family>(dataID), dataID);
     }
 
   private:

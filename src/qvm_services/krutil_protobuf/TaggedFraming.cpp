@@ -4,6 +4,8 @@
 #include <stdexcept>
 #include <typeinfo>
 
+#include "Casts.hpp"
+
 namespace krutil::protobuf_serializer::detail {
 
 using foundation::vantor::carrier::framing::Frame;
@@ -27,7 +29,7 @@ void appendTaggedFrame(FrameBuffer&& buffer, const std::string& tag, StreamID st
 }
 
 FrameBuffer takeTaggedFrame(FrameIndex frameIndex, Message& message, FrameType frameType) {
-    if (dynamic_cast<const TaggedFrame*>(message.frame(frameIndex).get()) == nullptr) {
+    if (downcast<TaggedFrame>(message.frame(frameIndex).get()) == nullptr) {
         throw std::bad_cast();
     }
     const std::unique_ptr<Frame> frame = message.release(frameIndex);

@@ -17,7 +17,7 @@ FrameContent contentOf(const Frame& frame) {
             frame.type(),
             frame.streamID(),
             frame.index(),
-            tagged != nullptr ? tagged->tag() : std::string(),
+            std::string(tagged != nullptr ? tagged->tag() : std::string_view()),
             std::string(frame.data(), frame.size())};
 }
 
@@ -37,7 +37,11 @@ FrameBuffer makeBuffer(const std::string& bytes) {
 
 std::unique_ptr<Frame> makeFrame(const FrameContent& content) {
     if (content.tagged) {
-        return std::make_unique<TaggedFrame>(content.type, content.streamID, content.tag, makeBuffer(content.bytes),
+        FrameBuffer buffer{std::unique_ptr<char[], std::function<void(char*)>>(new char[content.bytes.size()],
+                                                                               std::default_delete<char[]>()),
+                           content.bytes.size()};
+        std::copy(content.bytes.begin(), content.bytes.end(), buffer.first.get());
+        return std::make_unique<TaggedFrame>(content.type, content.streamID, content.tag, std::move(buffer),
                                              content.index);
     }
     return std::make_unique<DataFrame>(content.type, content.streamID, makeBuffer(content.bytes), true, content.index);

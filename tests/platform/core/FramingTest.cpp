@@ -31,6 +31,19 @@ TEST(FramingTest, TaggedFrameTellsWhatItWasGiven) {
     EXPECT_EQ(std::string(frame.data(), frame.size()), "abc");
 }
 
+TEST(FramingTest, TaggedFrameHasACopyOfItsTagWhateverItsLength) {
+    for (const std::size_t length : {0U, 1U, 47U, 48U, 49U, 128U, 1000U}) {
+        std::string tag;
+        for (std::size_t i = 0; i < length; ++i) {
+            tag += static_cast<char>(i % 251);
+        }
+        const std::string expected = tag;
+        const TaggedFrame frame(FrameType::Object, 1, tag, bufferOf(""), 1);
+        tag.assign(length, '?');
+        EXPECT_EQ(frame.tag(), expected) << length;
+    }
+}
+
 TEST(FramingTest, DataFrameKeepsTheBufferThatItWasGiven) {
     FrameBuffer buffer = bufferOf("12345");
     const char* const address = buffer.first.get();

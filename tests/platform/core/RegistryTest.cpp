@@ -34,8 +34,48 @@ TEST(RegistryTest, FindsByNameAndByExactType) {
 TEST(RegistryTest, UnknownNameOrTypeIsOutOfRange) {
     Registry registry;
     registry.insert(serializer("ints", typeid(int)));
-    EXPECT_THROW(registry.find(std::string("Ints")), std::out_of_range);
+    EXPECT_THAT(
+        [&] { registry.find(std::string("Ints")); },
+        ThrowsMessage<std::out_of_range>("Registry::find: no serializer is registered under the name \"Ints\""));
     EXPECT_THROW(registry.find(std::type_index(typeid(unsigned))), std::out_of_range);
+}
+
+// Two libraries may each have the description of one type.
+struct DescriptionElsewhere : std::type_info {
+    explicit DescriptionElsewhere(const char* name) : std::type_info(name) {}
+};
+
+TEST(RegistryTest, FindsATypeWhoseDescriptionStandsElsewhere) {
+    Registry registry;
+    const auto ints = serializer("ints", typeid(int));
+    registry.insert(ints);
+    const std::string name = typeid(int).name();
+    const DescriptionElsewhere elsewhere(name.c_str());
+    ASSERT_NE(elsewhere.name(), typeid(int).name());
+    EXPECT_EQ(registry.find(std::type_index(elsewhere)), ints);
+    EXPECT_THROW(registry.insert(serializer("more ints", elsewhere)), std::invalid_argument);
+}
+
+TEST(RegistryTest, NamesOfAllLengthsAreToldApart) {
+    Registry registry;
+    const std::vector<std::pair<std::string, const std::type_info*>> named{{"", &typeid(bool)},
+                                                                           {"a", &typeid(char)},
+                                                                           {"vent", &typeid(short)},
+                                                                           {"aseEvent", &typeid(int)},
+                                                                           {"1:aseEvent", &typeid(long)},
+                                                                           {"2:aseEvent", &typeid(float)},
+                                                                           {"22:aseEvent", &typeid(double)}};
+    for (const auto& [name, type] : named) {
+        registry.insert(serializer(name, *type));
+    }
+    for (const auto& [name, type] : named) {
+        EXPECT_EQ(registry.find(name)->type(), *type) << name;
+    }
+    EXPECT_THROW(registry.find("3:aseEvent"), std::out_of_range);
+}
+
+TEST(RegistryTest, OnlyASerializerAPIIsOfAFamily) {
+    EXPECT_EQ(serializer("ints", typeid(int))->family(), typeid(SerializerBase));
 }
 
 TEST(RegistryTest, KeepsTheOrderOfInsertion) {

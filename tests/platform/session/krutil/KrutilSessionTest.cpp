@@ -128,7 +128,8 @@ TEST_F(KrutilSessionTest, RequestIsAFrameOfItsOwnBeforeTheMessageThatEnqueuesIt)
     std::vector<std::string> traced;
     config.trace = [&](const session::FrameTrace& trace) {
         traced.push_back(std::to_string(trace.frame.index()) + " " +
-                         dynamic_cast<const framing::TaggedFrame&>(trace.frame).tag() + (trace.last ? " last" : ""));
+                         std::string(dynamic_cast<const framing::TaggedFrame&>(trace.frame).tag()) +
+                         (trace.last ? " last" : ""));
     };
     SessionWithBytes end(config);
     end.session->send(1, enqueue(u"1"));

@@ -72,8 +72,8 @@ std::string describe(const MessageReader::Item& item) {
     for (const auto& frame : std::get<MessageReader::Frames>(item).frames) {
         const auto* const tagged = dynamic_cast<const TaggedFrame*>(frame.get());
         text += " " + std::to_string(frame->index()) + "/" + std::to_string(frame->streamID()) + "/" +
-                std::to_string(static_cast<int>(frame->type())) + (tagged ? "/" + tagged->tag() : "") + "=" +
-                std::string(frame->data(), frame->size());
+                std::to_string(static_cast<int>(frame->type())) + (tagged ? "/" + std::string(tagged->tag()) : "") +
+                "=" + std::string(frame->data(), frame->size());
     }
     return text;
 }

@@ -204,7 +204,7 @@ TEST_F(SessionTest, TraceSeesEveryFrameInBothDirections) {
         const auto* const tagged = dynamic_cast<const framing::TaggedFrame*>(&trace.frame);
         const std::lock_guard lock(mutex);
         traced.push_back(std::string(trace.outgoing ? "> " : "< ") + std::to_string(trace.frame.index()) + " " +
-                         (tagged ? tagged->tag() : "data") + (trace.last ? " last " : " ") +
+                         std::string(tagged ? tagged->tag() : "data") + (trace.last ? " last " : " ") +
                          std::string(trace.frame.data(), trace.frame.size()));
     };
     SessionPair pair(config);
@@ -222,7 +222,7 @@ TEST_F(SessionTest, CheckMayCloseTheSessionBeforeTheSerializerRuns) {
     SessionConfig config = configOf(Role::Engine);
     config.check = [](const framing::TaggedFrame& frame) {
         if (std::string(frame.data(), frame.size()) == "fail to read") {
-            throw session::ProtocolViolation("checked: " + frame.tag());
+            throw session::ProtocolViolation("checked: " + std::string(frame.tag()));
         }
     };
     SessionPair pair(configOf(Role::Client), config);

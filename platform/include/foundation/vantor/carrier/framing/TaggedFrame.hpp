@@ -1,7 +1,10 @@
 // A frame whose tag names the serializer that wrote it.
 #pragma once
 
+#include <array>
+#include <cstdint>
 #include <string>
+#include <string_view>
 
 #include "foundation/vantor/carrier/framing/Frame.hpp"
 
@@ -11,15 +14,20 @@ namespace foundation::vantor::carrier::framing {
 /// the serializer that reads it.
 class TaggedFrame final : public Frame {
   public:
-    /// Takes over `buffer`; `tag` is copied.
+    /// Takes over `buffer`; `tag` is copied, without an allocation when it has at most 48 characters.
     TaggedFrame(FrameType type, unsigned int streamID, const std::string& tag, FrameBuffer&& buffer,
                 unsigned long frameIndex);
     ~TaggedFrame() override;
 
-    const std::string& tag() const noexcept { return tag_; }
+    /// Valid as long as the frame.
+    std::string_view tag() const noexcept {
+        return longTag_.empty() ? std::string_view(shortTag_.data(), shortLength_) : longTag_;
+    }
 
   private:
-    std::string tag_;
+    std::array<char, 48> shortTag_;
+    std::uint8_t shortLength_ = 0;
+    std::string longTag_;
 };
 
 }  // namespace foundation::vantor::carrier::framing

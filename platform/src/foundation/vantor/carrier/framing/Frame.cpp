@@ -16,7 +16,14 @@ FrameBuffer Frame::releaseBuffer() noexcept {
 
 TaggedFrame::TaggedFrame(FrameType type, unsigned int streamID, const std::string& tag, FrameBuffer&& buffer,
                          unsigned long frameIndex)
-    : Frame(type, streamID, std::move(buffer), frameIndex), tag_(tag) {}
+    : Frame(type, streamID, std::move(buffer), frameIndex) {
+    if (tag.size() > shortTag_.size()) {
+        longTag_ = tag;
+        return;
+    }
+    tag.copy(shortTag_.data(), tag.size());
+    shortLength_ = static_cast<std::uint8_t>(tag.size());
+}
 
 TaggedFrame::~TaggedFrame() = default;
 

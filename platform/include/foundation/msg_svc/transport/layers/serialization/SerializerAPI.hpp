@@ -2,6 +2,9 @@
 #pragma once
 
 #include <memory>
+#include <string>
+#include <typeinfo>
+#include <utility>
 
 #include "foundation/msg_svc/transport/layers/message/Message.hpp"
 #include "foundation/msg_svc/transport/layers/message/MessageStream.hpp"
@@ -17,7 +20,10 @@ namespace foundation::msg_svc::transport::layers::serialization {
 template <class T, class Ptr, class Ret>
 class SerializerAPI : public SerializerBase {
   public:
-    using SerializerBase::SerializerBase;
+    /// `name` is copied; `type` is that of the concrete class whose objects the serializer handles.
+    SerializerAPI(const std::string& name, const std::type_info& type,
+                  const std::pair<unsigned int, unsigned int>& version)
+        : SerializerBase(name, type, version, typeid(SerializerAPI)) {}
     ~SerializerAPI() override = default;
 
     /// Writes `object` as one or more frames, the first at `frameIndex`, and returns the next free index. Objects that
@@ -35,5 +41,12 @@ class SerializerAPI : public SerializerBase {
                             const std::shared_ptr<const Registry>& registry,
                             const SerializationContext& context) const = 0;
 };
+
+/// The serializer as one of `Family`, which is a SerializerAPI; null when it is of another. Does what a dynamic cast
+/// does, for the price of a comparison.
+template <class Family>
+const Family* asFamily(const SerializerBase& serializer) noexcept {
+    return serializer.family() == typeid(Family) ? static_cast<const Family*>(&serializer) : nullptr;
+}
 
 }  // namespace foundation::msg_svc::transport::layers::serialization

@@ -22,9 +22,18 @@ class SerializerBase {
     const std::type_info& type() const noexcept { return *type_; }
     const std::pair<unsigned int, unsigned int>& version() const noexcept { return version_; }
 
+    /// The SerializerAPI that this is; SerializerBase for an object that is none.
+    const std::type_info& family() const noexcept { return *family_; }
+
+  protected:
+    /// For `family`, a SerializerAPI.
+    SerializerBase(const std::string& name, const std::type_info& type,
+                   const std::pair<unsigned int, unsigned int>& version, const std::type_info& family);
+
   private:
     std::string name_;
     const std::type_info* type_;
+    const std::type_info* family_;
     std::pair<unsigned int, unsigned int> version_;
 };
 

@@ -201,15 +201,15 @@ void Incoming::takeMessage(Frames frames) {
     if (root == nullptr) {
         refuse("expected a tagged frame as its last one, got a data frame");
     }
-    std::shared_ptr<const serialization::SerializerBase> serializer;
+    const serialization::SerializerBase* serializer = nullptr;
     try {
-        serializer = registry_->find(root->tag());
+        serializer = registry_->find(root->tag()).get();
     } catch (const std::out_of_range&) {
         refuse("no serializer is registered for its tag " + quoted(root->tag()));
     }
-    const auto* const messages = dynamic_cast<const RootSerializer<exchange::Message>*>(serializer.get());
-    const auto* const replies = dynamic_cast<const RootSerializer<exchange::Reply>*>(serializer.get());
-    const auto* const events = dynamic_cast<const RootSerializer<eventmgr::BaseEvent>*>(serializer.get());
+    const auto* const messages = serialization::asFamily<RootSerializer<exchange::Message>>(*serializer);
+    const auto* const replies = serialization::asFamily<RootSerializer<exchange::Reply>>(*serializer);
+    const auto* const events = serialization::asFamily<RootSerializer<eventmgr::BaseEvent>>(*serializer);
     if (messages == nullptr && replies == nullptr && events == nullptr) {
         refuse(quoted(root->tag()) + " is only ever referred to and cannot be the last frame");
     }

@@ -4,6 +4,7 @@
 #include <stdexcept>
 #include <string>
 #include <typeindex>
+#include <typeinfo>
 #include <utility>
 
 #include "foundation/msg_svc/transport/layers/session/OutgoingMessage.hpp"
@@ -39,15 +40,18 @@ template <class T>
 Frames ObjectWriter::write(framing::StreamID stream, const boost::shared_ptr<const T>& object) const {
     const T& referenced = *object;
     const std::type_info& type = typeid(referenced);
-    std::shared_ptr<const serialization::SerializerBase> found;
+    const serialization::SerializerBase* found = nullptr;
     try {
-        found = registry_->find(std::type_index(type));
+        found = registry_->find(std::type_index(type)).get();
     } catch (const std::out_of_range&) {
         throw std::out_of_range("Session::send: no serializer is registered for " + boost::core::demangle(type.name()));
     }
-    const auto& serializer = dynamic_cast<const RootSerializer<T>&>(*found);
+    const auto* const serializer = serialization::asFamily<RootSerializer<T>>(*found);
+    if (serializer == nullptr) {
+        throw std::bad_cast();
+    }
     const auto collected = std::make_shared<OutgoingMessage>();
-    serializer.serialize(object, stream, 1, collected, registry_, serialization::SerializationContext());
+    serializer->serialize(object, stream, 1, collected, registry_, serialization::SerializationContext());
     auto frames = collected->takeFrames();
     checkFrames(frames, stream);
     limits_.check(frames);

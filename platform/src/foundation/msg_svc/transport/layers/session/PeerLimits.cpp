@@ -15,7 +15,7 @@ PeerLimits::PeerLimits(const Limits& limits, std::string peerName, std::string a
 void PeerLimits::check(const std::vector<std::unique_ptr<framing::Frame>>& frames) const {
     const auto refuse = [&](const char* limit, std::uint64_t accepted, std::uint64_t size, const std::string& what,
                             const char* unit) {
-        const std::string& root = dynamic_cast<const framing::TaggedFrame&>(*frames.back()).tag();
+        const std::string_view root = dynamic_cast<const framing::TaggedFrame&>(*frames.back()).tag();
         throw LimitExceeded(quoted(root) + " is larger than " + peerName_ + " accepts: its limit \"" + limit +
                             "\" is " + std::to_string(accepted) + " " + unit + ", " + what + " has " +
                             std::to_string(size));

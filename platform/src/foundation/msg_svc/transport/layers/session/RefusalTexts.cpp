@@ -37,8 +37,7 @@ std::string refusalToSend(Refusal refusal, Saying saying, Role own, framing::Str
     }
 }
 
-std::string refusalToReceive(Refusal refusal, Saying saying, Role own, framing::StreamID stream,
-                             const std::string& tag) {
+std::string refusalToReceive(Refusal refusal, Saying saying, Role own, framing::StreamID stream, std::string_view tag) {
     const std::string message = "message on stream " + std::to_string(stream) + ": " + quoted(tag);
     switch (refusal) {
         case Refusal::WrongSpeaker:

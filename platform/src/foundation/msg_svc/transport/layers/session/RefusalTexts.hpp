@@ -2,6 +2,7 @@
 #pragma once
 
 #include <string>
+#include <string_view>
 #include <typeinfo>
 
 #include "foundation/msg_svc/transport/layers/session/Exchanges.hpp"
@@ -13,7 +14,6 @@ std::string refusalToSend(Refusal refusal, Saying saying, Role own, framing::Str
                           const std::type_info& type);
 
 /// For the end that is `own` and got a message with this root, or a goodbye (of which tag and stream do not count).
-std::string refusalToReceive(Refusal refusal, Saying saying, Role own, framing::StreamID stream,
-                             const std::string& tag);
+std::string refusalToReceive(Refusal refusal, Saying saying, Role own, framing::StreamID stream, std::string_view tag);
 
 }  // namespace foundation::msg_svc::transport::layers::session
