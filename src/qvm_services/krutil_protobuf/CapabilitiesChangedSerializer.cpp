@@ -13,15 +13,14 @@ const std::string capabilitiesChangedName = "krutil:capabilities_api:Capabilitie
 
 CapabilitiesChangedSerializer::CapabilitiesChangedSerializer() : TaggedSerializer(capabilitiesChangedName) {}
 
-protobuf::CapabilitiesChanged CapabilitiesChangedSerializer::toProtobuf(
-    const capabilities_api::CapabilitiesChanged& event) {
+void CapabilitiesChangedSerializer::fill(const capabilities_api::CapabilitiesChanged& event,
+                                         protobuf::CapabilitiesChanged& proto) {
     using protobuf_serializer::toProtobuf;
-    protobuf::CapabilitiesChanged proto;
+    proto.Clear();
     toProtobuf(event.getPreviousCapabilities(), proto.mutable_previouscapabilities());
     toProtobuf(event.getQvmCapabilities(), proto.mutable_qvmcapabilities());
     toProtobuf(event.getClientCapabilities(), proto.mutable_clientcapabilities());
     toProtobuf(event.getRequestCapabilities(), proto.mutable_requestcapabilities());
-    return proto;
 }
 
 boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> CapabilitiesChangedSerializer::fromProtobuf(

@@ -13,7 +13,7 @@ class CapabilitiesChangedSerializer final
   public:
     CapabilitiesChangedSerializer();
 
-    static protobuf::CapabilitiesChanged toProtobuf(const capabilities_api::CapabilitiesChanged& event);
+    static void fill(const capabilities_api::CapabilitiesChanged& event, protobuf::CapabilitiesChanged& proto);
     static boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> fromProtobuf(
         const protobuf::CapabilitiesChanged& proto);
 };

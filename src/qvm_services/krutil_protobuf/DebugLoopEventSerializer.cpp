@@ -44,12 +44,10 @@ prompt::InputRequester DebugLoopEventSerializer::fromProtobuf(protobuf::InputReq
                                                      "Invalid enum krutil::protobuf::InputRequester field value = ");
 }
 
-protobuf::DebugLoopEvent DebugLoopEventSerializer::toProtobuf(const ::cmddistributor::DebugLoopEvent& event) {
-    protobuf::DebugLoopEvent proto;
+void DebugLoopEventSerializer::fill(const ::cmddistributor::DebugLoopEvent& event, protobuf::DebugLoopEvent& proto) {
     *proto.mutable_requestid() = IDTypeSerializer::toProtobuf(event.getRequestId());
     proto.set_state(toProtobuf(event.getLoopState()));
     proto.set_whichloop(toProtobuf(event.getWhichDebugLoop()));
-    return proto;
 }
 
 boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> DebugLoopEventSerializer::fromProtobuf(

@@ -13,6 +13,8 @@ class DebugLoopEventSerializer final
   public:
     DebugLoopEventSerializer();
 
+    using TaggedSerializer::toProtobuf;
+
     /// End the process for a state other than 1 and 2, a prompt other than -1 to 11.
     static protobuf::DebugLoopEvent_State toProtobuf(::cmddistributor::DebugLoopEvent::State state);
     static protobuf::InputRequester toProtobuf(prompt::InputRequester prompt);
@@ -21,7 +23,7 @@ class DebugLoopEventSerializer final
     static ::cmddistributor::DebugLoopEvent::State fromProtobuf(protobuf::DebugLoopEvent_State state);
     static prompt::InputRequester fromProtobuf(protobuf::InputRequester prompt);
 
-    static protobuf::DebugLoopEvent toProtobuf(const ::cmddistributor::DebugLoopEvent& event);
+    static void fill(const ::cmddistributor::DebugLoopEvent& event, protobuf::DebugLoopEvent& proto);
 
     /// Checks the state before the prompt. An absent identifier reads as the default one.
     static boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> fromProtobuf(

@@ -27,12 +27,10 @@ protobuf::CodeType EvalIIPSerializer::toProtobuf(::cmddistributor::CodeType code
                                                          "Invalid enum krutil::protobuf::CodeType field value = ");
 }
 
-protobuf::EvalIIP EvalIIPSerializer::toProtobuf(const ::cmddistributor::EvalIIP& request) {
-    protobuf::EvalIIP proto;
-    *proto.mutable_iip() = IIPSerializer::toProtobuf(request);
+void EvalIIPSerializer::fill(const ::cmddistributor::EvalIIP& request, protobuf::EvalIIP& proto) {
+    IIPSerializer::fill(request, *proto.mutable_iip());
     proto.set_cmd(ustring_to_utf8(request.getCommand()));
     proto.set_codetype(toProtobuf(request.getCodeType()));
-    return proto;
 }
 
 boost::shared_ptr<const ::cmddistributor::IIP> EvalIIPSerializer::fromProtobuf(const protobuf::EvalIIP& proto) {

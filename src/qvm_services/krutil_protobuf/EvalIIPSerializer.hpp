@@ -12,6 +12,8 @@ class EvalIIPSerializer final
   public:
     EvalIIPSerializer();
 
+    using TaggedSerializer::toProtobuf;
+
     /// Ends the process for a number other than 0 to 3.
     static protobuf::CodeType toProtobuf(::cmddistributor::CodeType codeType);
 
@@ -19,7 +21,7 @@ class EvalIIPSerializer final
     static ::cmddistributor::CodeType fromProtobuf(protobuf::CodeType codeType);
 
     /// Ends the process for a stream number or a code type outside its table.
-    static protobuf::EvalIIP toProtobuf(const ::cmddistributor::EvalIIP& request);
+    static void fill(const ::cmddistributor::EvalIIP& request, protobuf::EvalIIP& proto);
 
     /// Throws std::logic_error for an absent core, for what IIPSerializer refuses, and for a bad code type, tested in
     /// this order. The request has no workspace, whatever the message says.

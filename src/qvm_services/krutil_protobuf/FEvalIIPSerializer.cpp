@@ -49,19 +49,19 @@ void assertSet(std::uint64_t id, const char* expression, int line) {
 
 FEvalIIPSerializer::FEvalIIPSerializer() : TaggedSerializer(fEvalIIPName) {}
 
-protobuf::FEvalIIP FEvalIIPSerializer::toProtobuf(const ::cmddistributor::FEvalIIP& request, NestedWriter& nested) {
-    protobuf::FEvalIIP proto;
+void FEvalIIPSerializer::fill(const ::cmddistributor::FEvalIIP& request, protobuf::FEvalIIP& proto,
+                              NestedWriter& nested) {
+    proto.clear_dataids();
     for (const DataID dataID : writeArrays(argumentsOf(request), nested)) {
         proto.add_dataids(dataID);
     }
-    *proto.mutable_iip() = IIPSerializer::toProtobuf(request);
+    IIPSerializer::fill(request, *proto.mutable_iip());
     proto.set_functionname(request.getFunctionName());
     proto.set_nlhs(request.getNlhs());
     assertSet(request.getClientQvmID(), "fevaliip->getClientQvmID()", 80);
     proto.set_clientqvmid(request.getClientQvmID());
     assertSet(request.getQvmID(), "fevaliip->getQvmID()", 82);
     proto.set_serverqvmid(request.getQvmID());
-    return proto;
 }
 
 boost::shared_ptr<const ::cmddistributor::IIP> FEvalIIPSerializer::fromProtobuf(const protobuf::FEvalIIP& proto,

@@ -15,7 +15,7 @@ class FEvalIIPSerializer final
 
     /// Ends the process when the arguments are not data arrays or cannot be had, for an unsupported stream number, and,
     /// while diagnostic assertions are enabled, for identifiers of 0. Throws as writeArrays() does.
-    static protobuf::FEvalIIP toProtobuf(const ::cmddistributor::FEvalIIP& request, NestedWriter& nested);
+    static void fill(const ::cmddistributor::FEvalIIP& request, protobuf::FEvalIIP& proto, NestedWriter& nested);
 
     /// Reads the arrays first, throwing as readArrays() does; then throws std::logic_error for an absent core, for what
     /// IIPSerializer refuses, for a client identifier of 0 and for a server identifier of 0, tested in this order.

@@ -18,16 +18,15 @@ const std::string fEvalResultName = "krutil:FEvalResult";
 
 FEvalResultSerializer::FEvalResultSerializer() : TaggedSerializer(fEvalResultName) {}
 
-protobuf::FEvalResult FEvalResultSerializer::toProtobuf(const ::cmddistributor::FEvalResult& result,
-                                                        const WriteArrays& write) {
-    protobuf::FEvalResult proto;
-    *proto.mutable_iipresult() = IIPResultSerializer::toProtobuf(result);
+void FEvalResultSerializer::fill(const ::cmddistributor::FEvalResult& result, protobuf::FEvalResult& proto,
+                                 const WriteArrays& write) {
+    IIPResultSerializer::fill(result, *proto.mutable_iipresult());
+    proto.clear_dataids();
     if (write) {
         for (const DataID dataID : write(boost::get<std::vector<Array>>(result.getResults()))) {
             proto.add_dataids(dataID);
         }
     }
-    return proto;
 }
 
 std::unique_ptr<::cmddistributor::IIPResult> FEvalResultSerializer::fromProtobuf(const protobuf::FEvalResult& proto,
@@ -40,9 +39,9 @@ std::unique_ptr<::cmddistributor::IIPResult> FEvalResultSerializer::fromProtobuf
     return std::make_unique<::cmddistributor::FEvalResult>(result->id, read(proto.dataids()));
 }
 
-protobuf::FEvalResult FEvalResultSerializer::toProtobuf(const ::cmddistributor::FEvalResult& result,
-                                                        NestedWriter& nested) {
-    return toProtobuf(result, [&nested](const std::vector<Array>& arrays) { return writeArrays(arrays, nested); });
+void FEvalResultSerializer::fill(const ::cmddistributor::FEvalResult& result, protobuf::FEvalResult& proto,
+                                 NestedWriter& nested) {
+    fill(result, proto, [&nested](const std::vector<Array>& arrays) { return writeArrays(arrays, nested); });
 }
 
 std::unique_ptr<::cmddistributor::IIPResult> FEvalResultSerializer::fromProtobuf(const protobuf::FEvalResult& proto,

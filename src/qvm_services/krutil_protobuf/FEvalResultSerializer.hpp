@@ -22,18 +22,21 @@ class FEvalResultSerializer final : public TaggedSerializer<FEvalResultSerialize
     using ReadArrays = std::function<std::vector<foundation::korveldata::Array>(
         const google::protobuf::RepeatedField<std::uint64_t>&)>;
 
+    static constexpr bool manyParts = true;
+
     FEvalResultSerializer();
 
     /// Throws boost::bad_get (in Boost's exception wrapper) for outputs that are not data arrays, and what `write`
     /// throws. Without a callable the outputs are left out.
-    static protobuf::FEvalResult toProtobuf(const ::cmddistributor::FEvalResult& result, const WriteArrays& write);
+    static void fill(const ::cmddistributor::FEvalResult& result, protobuf::FEvalResult& proto,
+                     const WriteArrays& write);
 
     /// Throws std::logic_error for an absent result record and for its absent identifier, then what `read` throws. A
     /// bad status in the record's error ends the process, though the error is dropped. Without a callable returns null.
     static std::unique_ptr<::cmddistributor::IIPResult> fromProtobuf(const protobuf::FEvalResult& proto,
                                                                      const ReadArrays& read);
 
-    static protobuf::FEvalResult toProtobuf(const ::cmddistributor::FEvalResult& result, NestedWriter& nested);
+    static void fill(const ::cmddistributor::FEvalResult& result, protobuf::FEvalResult& proto, NestedWriter& nested);
     static std::unique_ptr<::cmddistributor::IIPResult> fromProtobuf(const protobuf::FEvalResult& proto,
                                                                      const NestedReader& nested);
 };

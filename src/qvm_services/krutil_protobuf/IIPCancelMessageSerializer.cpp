@@ -13,11 +13,10 @@ const std::string iipCancelMessageName = "krutil:IIPCancelMessage";
 
 IIPCancelMessageSerializer::IIPCancelMessageSerializer() : TaggedSerializer(iipCancelMessageName) {}
 
-protobuf::IIPCancelMessage IIPCancelMessageSerializer::toProtobuf(const ::cmddistributor::IIPCancelMessage& message) {
-    protobuf::IIPCancelMessage proto;
+void IIPCancelMessageSerializer::fill(const ::cmddistributor::IIPCancelMessage& message,
+                                      protobuf::IIPCancelMessage& proto) {
     *proto.mutable_iipid() = IDTypeSerializer::toProtobuf(message.getID());
     proto.set_evenifrunning(message.getEvenIfRunning());
-    return proto;
 }
 
 boost::shared_ptr<const foundation::msg_svc::exchange::Message> IIPCancelMessageSerializer::fromProtobuf(

@@ -13,7 +13,7 @@ class IIPCancelMessageSerializer final
   public:
     IIPCancelMessageSerializer();
 
-    static protobuf::IIPCancelMessage toProtobuf(const ::cmddistributor::IIPCancelMessage& message);
+    static void fill(const ::cmddistributor::IIPCancelMessage& message, protobuf::IIPCancelMessage& proto);
 
     /// Throws std::logic_error for an absent identifier; one that is present and empty is accepted.
     static boost::shared_ptr<const foundation::msg_svc::exchange::Message> fromProtobuf(

@@ -34,10 +34,8 @@ IIPCancelReply::CancelStatus IIPCancelReplySerializer::fromProtobuf(protobuf::Ca
          "krutil::protobuf_serializer::IIPCancelReplySerializer::fromProtobuf(krutil::protobuf::CancelStatus)"});
 }
 
-protobuf::IIPCancelReply IIPCancelReplySerializer::toProtobuf(const IIPCancelReply& reply) {
-    protobuf::IIPCancelReply proto;
+void IIPCancelReplySerializer::fill(const IIPCancelReply& reply, protobuf::IIPCancelReply& proto) {
     proto.set_status(static_cast<protobuf::CancelStatus>(reply.getStatus()));
-    return proto;
 }
 
 boost::shared_ptr<const foundation::msg_svc::exchange::Reply> IIPCancelReplySerializer::fromProtobuf(

@@ -15,11 +15,13 @@ class IIPCancelReplySerializer final
   public:
     IIPCancelReplySerializer();
 
+    using TaggedSerializer::toProtobuf;
+
     /// Both end the process for a number other than 0 to 3.
     static protobuf::CancelStatus toProtobuf(::cmddistributor::IIPCancelReply::CancelStatus status);
     static ::cmddistributor::IIPCancelReply::CancelStatus fromProtobuf(protobuf::CancelStatus status);
 
-    static protobuf::IIPCancelReply toProtobuf(const ::cmddistributor::IIPCancelReply& reply);
+    static void fill(const ::cmddistributor::IIPCancelReply& reply, protobuf::IIPCancelReply& proto);
 
     /// The reply is allocated by itself and not together with its reference count.
     static boost::shared_ptr<const foundation::msg_svc::exchange::Reply> fromProtobuf(

@@ -29,20 +29,20 @@ cmddistributor::WhenToDequeue::WhenToDequeue IIPEnqueueMessageSerializer::fromPr
         "Invalid enum field value krutil::protobuf::IIPEnqueueMessage.WhenToDequeue = ");
 }
 
-protobuf::IIPEnqueueMessage IIPEnqueueMessageSerializer::toProtobuf(const ::cmddistributor::IIPEnqueueMessage& message,
-                                                                    NestedWriter& nested) {
-    protobuf::IIPEnqueueMessage proto;
+void IIPEnqueueMessageSerializer::fill(const ::cmddistributor::IIPEnqueueMessage& message,
+                                       protobuf::IIPEnqueueMessage& proto, NestedWriter& nested) {
     *proto.mutable_iipid() = IDTypeSerializer::toProtobuf(message.getID());
     proto.set_qcrid(message.getQcrID());
+    proto.clear_qvmid();
     if (message.getQvmID()) {
         proto.set_qvmid(*message.getQvmID());
     }
     proto.set_dequeuemode(toProtobuf(message.getDequeueMode()));
     proto.set_name(ustring_to_utf8(message.getDynamicName()));
+    proto.clear_capability();
     protobuf_serializer::toProtobuf(message.getCapabilities(), proto.mutable_capability());
     proto.set_iiphandle(nested.writeByDynamicType<IIPFamily>(message.getIIP()));
     proto.set_oktoflushsparingly(message.getOkToFlushSparingly());
-    return proto;
 }
 
 boost::shared_ptr<const foundation::msg_svc::exchange::Message> IIPEnqueueMessageSerializer::fromProtobuf(

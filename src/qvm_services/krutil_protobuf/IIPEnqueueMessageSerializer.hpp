@@ -23,8 +23,8 @@ class IIPEnqueueMessageSerializer final
     /// Ends the process for an unsupported dequeue mode, before any frame is written. Throws std::bad_typeid for an
     /// empty request, std::out_of_range for a request without a serializer, std::bad_cast for one whose serializer is
     /// of another family, and what that serializer throws.
-    static protobuf::IIPEnqueueMessage toProtobuf(const ::cmddistributor::IIPEnqueueMessage& message,
-                                                  NestedWriter& nested);
+    static void fill(const ::cmddistributor::IIPEnqueueMessage& message, protobuf::IIPEnqueueMessage& proto,
+                     NestedWriter& nested);
 
     /// Rebuilds the request first, so its errors come first: std::bad_cast when there is no tagged frame under the
     /// handle or its serializer is of another family, std::out_of_range for an unknown tag. Then std::logic_error for a

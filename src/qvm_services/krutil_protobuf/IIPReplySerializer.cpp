@@ -13,13 +13,9 @@ const std::string iipReplyName = "krutil:IIPReply";
 
 IIPReplySerializer::IIPReplySerializer() : TaggedSerializer(iipReplyName) {}
 
-protobuf::IIPReply IIPReplySerializer::toProtobuf(const cmddistributor::IIPReply& reply, NestedWriter& nested) {
-    protobuf::IIPReply proto;
+void IIPReplySerializer::fill(const cmddistributor::IIPReply& reply, protobuf::IIPReply& proto, NestedWriter& nested) {
     *proto.mutable_id() = IDTypeSerializer::toProtobuf(reply.getID());
-    if (reply.getResult()) {
-        proto.set_resultid(nested.writeByDynamicType<ResultFamily>(reply.getResult()));
-    }
-    return proto;
+    proto.set_resultid(reply.getResult() ? nested.writeByDynamicType<ResultFamily>(reply.getResult()) : 0);
 }
 
 boost::shared_ptr<const foundation::msg_svc::exchange::Reply> IIPReplySerializer::fromProtobuf(

@@ -16,7 +16,7 @@ class IIPReplySerializer final
 
     /// Throws std::out_of_range for a result without a serializer, std::bad_cast for one whose serializer is of another
     /// family, and what that serializer throws.
-    static protobuf::IIPReply toProtobuf(const cmddistributor::IIPReply& reply, NestedWriter& nested);
+    static void fill(const cmddistributor::IIPReply& reply, protobuf::IIPReply& proto, NestedWriter& nested);
 
     /// Reads the result first: std::bad_cast when there is no tagged frame under its index or the serializer is of
     /// another family, std::out_of_range for an unknown tag. Then std::logic_error for an absent identifier.

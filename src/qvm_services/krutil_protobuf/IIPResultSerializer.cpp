@@ -12,13 +12,13 @@ const std::string iipResultName = "krutil:IIPResult";
 
 IIPResultSerializer::IIPResultSerializer() : TaggedSerializer(iipResultName) {}
 
-protobuf::IIPResult IIPResultSerializer::toProtobuf(const ::cmddistributor::IIPResult& result) {
-    protobuf::IIPResult proto;
+void IIPResultSerializer::fill(const ::cmddistributor::IIPResult& result, protobuf::IIPResult& proto) {
     if (result.getException()) {
-        *proto.mutable_exception() = protobuf_serializer::toProtobuf(*result.getException());
+        protobuf_serializer::fill(*result.getException(), *proto.mutable_exception());
+    } else {
+        proto.clear_exception();
     }
     *proto.mutable_id() = IDTypeSerializer::toProtobuf(result.id);
-    return proto;
 }
 
 std::unique_ptr<::cmddistributor::IIPResult> IIPResultSerializer::fromProtobuf(const protobuf::IIPResult& proto) {

@@ -6,13 +6,17 @@
 
 namespace krutil::protobuf_serializer {
 
-protobuf::SinkTraits toProtobuf(const io::SinkTraits& traits) {
-    protobuf::SinkTraits proto;
+void fill(const io::SinkTraits& traits, protobuf::SinkTraits& proto) {
     proto.set_supportshotlinks(traits.getSupportsHotlinks());
     proto.set_needsformattingfordisplay(traits.getNeedsFormattingForDisplay());
     proto.set_usediary(traits.getUseDiary());
     proto.set_useecho(traits.getUseEcho());
     proto.set_uselogging(traits.getUseLogging());
+}
+
+protobuf::SinkTraits toProtobuf(const io::SinkTraits& traits) {
+    protobuf::SinkTraits proto;
+    fill(traits, proto);
     return proto;
 }
 
@@ -37,12 +41,16 @@ protobuf::IqmStreamID IIPSerializer::toProtobuf(::cmddistributor::IqmStreamID st
          "krutil::protobuf_serializer::IIPSerializer::fromProtobuf(krutil::protobuf::IqmStreamID)"});
 }
 
-protobuf::IIP IIPSerializer::toProtobuf(const ::cmddistributor::IIP& iip) {
-    protobuf::IIP proto;
+void IIPSerializer::fill(const ::cmddistributor::IIP& iip, protobuf::IIP& proto) {
     proto.set_streamid(toProtobuf(iip.getStreamID()));
     proto.set_plugintype(iip.getPluginType());
-    *proto.mutable_outtraits() = protobuf_serializer::toProtobuf(iip.getOutTraits());
-    *proto.mutable_errtraits() = protobuf_serializer::toProtobuf(iip.getErrTraits());
+    protobuf_serializer::fill(iip.getOutTraits(), *proto.mutable_outtraits());
+    protobuf_serializer::fill(iip.getErrTraits(), *proto.mutable_errtraits());
+}
+
+protobuf::IIP IIPSerializer::toProtobuf(const ::cmddistributor::IIP& iip) {
+    protobuf::IIP proto;
+    fill(iip, proto);
     return proto;
 }
 

@@ -9,7 +9,8 @@
 
 namespace krutil::protobuf_serializer {
 
-/// Copies the five traits that travel.
+/// Copies the five traits that travel. Each fill() sets every field of a message that may hold another object's values.
+void fill(const io::SinkTraits& traits, protobuf::SinkTraits& proto);
 protobuf::SinkTraits toProtobuf(const io::SinkTraits& traits);
 
 /// The trait that does not travel comes back false.
@@ -24,6 +25,7 @@ class IIPSerializer {
     static ::cmddistributor::IqmStreamID fromProtobuf(protobuf::IqmStreamID streamID);
 
     /// Ends the process for an unsupported stream number.
+    static void fill(const ::cmddistributor::IIP& iip, protobuf::IIP& proto);
     static protobuf::IIP toProtobuf(const ::cmddistributor::IIP& iip);
 
     /// Takes any stream number as it is. Throws std::logic_error for an empty plug-in type, absent output traits and

@@ -61,11 +61,9 @@ class IIPStateEventSerializer final
         : TaggedSerializer<IIPStateEventSerializer, EventFamily, EventT, protobuf::IIPStateEvent>(
               stateEventName(static_cast<std::size_t>(StateEventType<EventT>::value))) {}
 
-    static protobuf::IIPStateEvent toProtobuf(const EventT& event) {
-        protobuf::IIPStateEvent proto;
+    static void fill(const EventT& event, protobuf::IIPStateEvent& proto) {
         *proto.mutable_id() = IDTypeSerializer::toProtobuf(event.getRequestId());
         proto.set_type(StateEventType<EventT>::value);
-        return proto;
     }
 
     static boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> fromProtobuf(

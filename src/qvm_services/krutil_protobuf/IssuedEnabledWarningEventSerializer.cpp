@@ -13,9 +13,9 @@ const std::string issuedEnabledWarningEventName = "korvel:lang:diagnostic:Issued
 IssuedEnabledWarningEventSerializer::IssuedEnabledWarningEventSerializer()
     : TaggedSerializer(issuedEnabledWarningEventName) {}
 
-protobuf::IssuedEnabledWarningEvent IssuedEnabledWarningEventSerializer::toProtobuf(
-    const IssuedEnabledWarningEvent& event) {
-    return WarningConversions::toProtobuf(event);
+void IssuedEnabledWarningEventSerializer::fill(const IssuedEnabledWarningEvent& event,
+                                               protobuf::IssuedEnabledWarningEvent& proto) {
+    WarningConversions::fill(event, proto);
 }
 
 boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> IssuedEnabledWarningEventSerializer::fromProtobuf(

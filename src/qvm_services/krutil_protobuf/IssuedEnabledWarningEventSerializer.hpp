@@ -13,10 +13,12 @@ class IssuedEnabledWarningEventSerializer final
                               korvel::lang::diagnostic::IssuedEnabledWarningEvent, protobuf::IssuedEnabledWarningEvent,
                               controlFrame> {
   public:
+    static constexpr bool manyParts = true;
+
     IssuedEnabledWarningEventSerializer();
 
-    static protobuf::IssuedEnabledWarningEvent toProtobuf(
-        const korvel::lang::diagnostic::IssuedEnabledWarningEvent& event);
+    static void fill(const korvel::lang::diagnostic::IssuedEnabledWarningEvent& event,
+                     protobuf::IssuedEnabledWarningEvent& proto);
     static boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> fromProtobuf(
         const protobuf::IssuedEnabledWarningEvent& proto);
 };

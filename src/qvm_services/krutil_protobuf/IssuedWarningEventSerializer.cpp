@@ -12,8 +12,8 @@ const std::string issuedWarningEventName = "korvel:lang:diagnostic:IssuedWarning
 
 IssuedWarningEventSerializer::IssuedWarningEventSerializer() : TaggedSerializer(issuedWarningEventName) {}
 
-protobuf::IssuedWarningEvent IssuedWarningEventSerializer::toProtobuf(const IssuedWarningEvent& event) {
-    return WarningConversions::toProtobuf(event);
+void IssuedWarningEventSerializer::fill(const IssuedWarningEvent& event, protobuf::IssuedWarningEvent& proto) {
+    WarningConversions::fill(event, proto);
 }
 
 boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> IssuedWarningEventSerializer::fromProtobuf(

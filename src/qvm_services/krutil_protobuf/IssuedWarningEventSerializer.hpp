@@ -12,9 +12,11 @@ class IssuedWarningEventSerializer final
     : public TaggedSerializer<IssuedWarningEventSerializer, EventFamily, korvel::lang::diagnostic::IssuedWarningEvent,
                               protobuf::IssuedWarningEvent> {
   public:
+    static constexpr bool manyParts = true;
+
     IssuedWarningEventSerializer();
 
-    static protobuf::IssuedWarningEvent toProtobuf(const korvel::lang::diagnostic::IssuedWarningEvent& event);
+    static void fill(const korvel::lang::diagnostic::IssuedWarningEvent& event, protobuf::IssuedWarningEvent& proto);
     static boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> fromProtobuf(
         const protobuf::IssuedWarningEvent& proto);
 };

@@ -14,12 +14,10 @@ const std::string printableErrorEventName = "krutil:PrintableErrorEvent";
 
 PrintableErrorEventSerializer::PrintableErrorEventSerializer() : TaggedSerializer(printableErrorEventName) {}
 
-protobuf::PrintableErrorEvent PrintableErrorEventSerializer::toProtobuf(const io::PrintableErrorEvent& event) {
-    protobuf::PrintableErrorEvent proto;
+void PrintableErrorEventSerializer::fill(const io::PrintableErrorEvent& event, protobuf::PrintableErrorEvent& proto) {
     *proto.mutable_id() = IDTypeSerializer::toProtobuf(event.getRequestId());
     proto.set_text(ustring_to_utf8(event.getText()));
-    *proto.mutable_except() = protobuf_serializer::toProtobuf(event.getException());
-    return proto;
+    protobuf_serializer::fill(event.getException(), *proto.mutable_except());
 }
 
 boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> PrintableErrorEventSerializer::fromProtobuf(

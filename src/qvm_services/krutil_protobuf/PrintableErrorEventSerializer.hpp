@@ -11,10 +11,12 @@ class PrintableErrorEventSerializer final
     : public TaggedSerializer<PrintableErrorEventSerializer, EventFamily, io::PrintableErrorEvent,
                               protobuf::PrintableErrorEvent> {
   public:
+    static constexpr bool manyParts = true;
+
     PrintableErrorEventSerializer();
 
     /// Both directions end the process for a status outside its table, at any level of the error.
-    static protobuf::PrintableErrorEvent toProtobuf(const io::PrintableErrorEvent& event);
+    static void fill(const io::PrintableErrorEvent& event, protobuf::PrintableErrorEvent& proto);
 
     /// Accepts every message: absent fields read as the default identifier, the empty error and empty text.
     static boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> fromProtobuf(

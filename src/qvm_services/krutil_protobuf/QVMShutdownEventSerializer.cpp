@@ -11,10 +11,6 @@ const std::string qvmShutdownEventName = "krutil:QVMShutdownEvent";
 
 QVMShutdownEventSerializer::QVMShutdownEventSerializer() : TaggedSerializer(qvmShutdownEventName) {}
 
-protobuf::QVMShutdownEvent QVMShutdownEventSerializer::toProtobuf() {
-    return {};
-}
-
 boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> QVMShutdownEventSerializer::fromProtobuf(
     const protobuf::QVMShutdownEvent& /*proto*/) {
     return boost::make_shared<const eventmgr::QVMShutdownEvent>();

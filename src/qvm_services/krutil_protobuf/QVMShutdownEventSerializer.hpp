@@ -14,7 +14,7 @@ class QVMShutdownEventSerializer final
   public:
     QVMShutdownEventSerializer();
 
-    static protobuf::QVMShutdownEvent toProtobuf();
+    static void fill() {}
     static boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> fromProtobuf(
         const protobuf::QVMShutdownEvent& proto);
 };

@@ -20,11 +20,15 @@ cmddistributor::inExecutionStatus fromProtobuf(protobuf::ExecutionStatus status)
          "krutil::protobuf_serializer::fromProtobuf(krutil::protobuf::ExecutionStatus)"});
 }
 
-protobuf::StackFrame toProtobuf(const ::cmddistributor::StackFrame& frame) {
-    protobuf::StackFrame proto;
+void fill(const ::cmddistributor::StackFrame& frame, protobuf::StackFrame& proto) {
     proto.set_file(ustring_to_utf8(frame.file));
     proto.set_func(frame.func);
     proto.set_line(frame.line);
+}
+
+protobuf::StackFrame toProtobuf(const ::cmddistributor::StackFrame& frame) {
+    protobuf::StackFrame proto;
+    fill(frame, proto);
     return proto;
 }
 
@@ -32,18 +36,24 @@ protobuf::StackFrame toProtobuf(const ::cmddistributor::StackFrame& frame) {
     return {utf8_to_ustring(proto.file()), proto.func(), proto.line()};
 }
 
-protobuf::RuntimeException toProtobuf(const ::cmddistributor::RuntimeException& exception) {
-    protobuf::RuntimeException proto;
+void fill(const ::cmddistributor::RuntimeException& exception, protobuf::RuntimeException& proto) {
     proto.set_status(toProtobuf(exception.getExecutionStatus()));
     proto.set_msgid(exception.GetID());
     proto.set_msgtext(ustring_to_utf8(exception.GetUnicodeMessageTxt()));
     proto.set_functionname(exception.getFunctionName());
+    proto.clear_frames();
     for (const auto& frame : exception.getStackFrames()) {
-        *proto.add_frames() = toProtobuf(frame);
+        fill(frame, *proto.add_frames());
     }
+    proto.clear_causes();
     for (const auto& cause : exception.getCauses()) {
-        *proto.add_causes() = toProtobuf(cause);
+        fill(cause, *proto.add_causes());
     }
+}
+
+protobuf::RuntimeException toProtobuf(const ::cmddistributor::RuntimeException& exception) {
+    protobuf::RuntimeException proto;
+    fill(exception, proto);
     return proto;
 }
 

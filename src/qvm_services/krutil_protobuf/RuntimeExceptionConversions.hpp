@@ -13,12 +13,15 @@ namespace krutil::protobuf_serializer {
 protobuf::ExecutionStatus toProtobuf(cmddistributor::inExecutionStatus status);
 cmddistributor::inExecutionStatus fromProtobuf(protobuf::ExecutionStatus status);
 
+/// Each fill() sets every field of a message that may hold another object's values.
+void fill(const ::cmddistributor::StackFrame& frame, protobuf::StackFrame& proto);
 protobuf::StackFrame toProtobuf(const ::cmddistributor::StackFrame& frame);
 ::cmddistributor::StackFrame fromProtobuf(const protobuf::StackFrame& proto);
 
 /// Both directions recurse once for each level of causes, without a limit of their own (the parser of received messages
 /// has one), and end the process for a bad status at any level. On the way out the status of a record is looked at
 /// before the rest of it, on the way in after.
+void fill(const ::cmddistributor::RuntimeException& exception, protobuf::RuntimeException& proto);
 protobuf::RuntimeException toProtobuf(const ::cmddistributor::RuntimeException& exception);
 ::cmddistributor::RuntimeException fromProtobuf(const protobuf::RuntimeException& proto);
 

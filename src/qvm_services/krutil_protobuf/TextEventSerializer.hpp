@@ -14,12 +14,10 @@ namespace krutil::protobuf_serializer {
 template <class Derived, class EventT, class ProtoMessage>
 class TextEventSerializer : public TaggedSerializer<Derived, EventFamily, EventT, ProtoMessage> {
   public:
-    static ProtoMessage toProtobuf(const EventT& event) {
-        ProtoMessage proto;
+    static void fill(const EventT& event, ProtoMessage& proto) {
         *proto.mutable_id() = IDTypeSerializer::toProtobuf(event.getRequestId());
         proto.set_stream(StreamTypeSerializer::toProtobuf(event.getStreamType()));
         proto.set_text(ustring_to_utf8(event.getText()));
-        return proto;
     }
 
     static boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> fromProtobuf(const ProtoMessage& proto) {

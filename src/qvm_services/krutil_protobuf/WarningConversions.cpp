@@ -29,18 +29,20 @@ struct SetValue : boost::static_visitor<> {
 
 // Both events become the same message; they have no base in common that has their two values.
 template <class EventT>
-protobuf::IssuedWarningEvent issuedWarning(const EventT& event) {
-    protobuf::IssuedWarningEvent proto;
+void fillIssuedWarning(const EventT& event, protobuf::IssuedWarningEvent& proto) {
     *proto.mutable_id() = IDTypeSerializer::toProtobuf(event.getRequestId());
-    *proto.mutable_warning() = WarningConversions::toProtobuf(event.getWarning());
-    return proto;
+    WarningConversions::fill(event.getWarning(), *proto.mutable_warning());
 }
 
 }  // namespace
 
+void WarningConversions::fill(const korvel::lang::PrintfArgument& argument, protobuf::PrintfArgument& proto) {
+    boost::apply_visitor(SetValue(proto), argument.getValue());
+}
+
 protobuf::PrintfArgument WarningConversions::toProtobuf(const korvel::lang::PrintfArgument& argument) {
     protobuf::PrintfArgument proto;
-    boost::apply_visitor(SetValue(proto), argument.getValue());
+    fill(argument, proto);
     return proto;
 }
 
@@ -67,11 +69,15 @@ korvel::lang::PrintfArgument WarningConversions::fromProtobuf(const protobuf::Pr
     return PrintfArgument(Value());
 }
 
-protobuf::WarningStackFrame WarningConversions::toProtobuf(const korvel::lang::StackFrame& frame) {
-    protobuf::WarningStackFrame proto;
+void WarningConversions::fill(const korvel::lang::StackFrame& frame, protobuf::WarningStackFrame& proto) {
     proto.set_file(ustring_to_utf8(frame.file));
     proto.set_name(ustring_to_utf8(frame.name));
     proto.set_line(frame.line);
+}
+
+protobuf::WarningStackFrame WarningConversions::toProtobuf(const korvel::lang::StackFrame& frame) {
+    protobuf::WarningStackFrame proto;
+    fill(frame, proto);
     return proto;
 }
 
@@ -79,19 +85,25 @@ korvel::lang::StackFrame WarningConversions::fromProtobuf(const protobuf::Warnin
     return {utf8_to_ustring(proto.file()), utf8_to_ustring(proto.name()), proto.line()};
 }
 
-protobuf::Warning WarningConversions::toProtobuf(const korvel::lang::diagnostic::Warning& warning) {
-    protobuf::Warning proto;
+void WarningConversions::fill(const korvel::lang::diagnostic::Warning& warning, protobuf::Warning& proto) {
     proto.set_identifier(warning.getIdentifier());
     proto.set_format(ustring_to_utf8(warning.getFormat()));
+    proto.clear_arguments();
     for (const auto& argument : warning.getArguments()) {
-        *proto.add_arguments() = toProtobuf(argument);
+        fill(argument, *proto.add_arguments());
     }
     proto.set_message(ustring_to_utf8(warning.getMessage()));
+    proto.clear_stack();
     for (const auto& frame : warning.getStack()) {
-        *proto.add_stack() = toProtobuf(frame);
+        fill(frame, *proto.add_stack());
     }
     proto.set_wasdisabled(warning.getWasDisabled());
     proto.set_datenum(warning.getTime());
+}
+
+protobuf::Warning WarningConversions::toProtobuf(const korvel::lang::diagnostic::Warning& warning) {
+    protobuf::Warning proto;
+    fill(warning, proto);
     return proto;
 }
 
@@ -111,8 +123,9 @@ korvel::lang::diagnostic::Warning WarningConversions::fromProtobuf(const protobu
                                              proto.datenum());
 }
 
-protobuf::IssuedWarningEvent WarningConversions::toProtobuf(const korvel::lang::diagnostic::IssuedWarningEvent& event) {
-    return issuedWarning(event);
+void WarningConversions::fill(const korvel::lang::diagnostic::IssuedWarningEvent& event,
+                              protobuf::IssuedWarningEvent& proto) {
+    fillIssuedWarning(event, proto);
 }
 
 boost::shared_ptr<const korvel::lang::diagnostic::IssuedWarningEvent> WarningConversions::fromProtobuf(
@@ -121,11 +134,9 @@ boost::shared_ptr<const korvel::lang::diagnostic::IssuedWarningEvent> WarningCon
         IDTypeSerializer::fromProtobuf(proto.id()), fromProtobuf(proto.warning()));
 }
 
-protobuf::IssuedEnabledWarningEvent WarningConversions::toProtobuf(
-    const korvel::lang::diagnostic::IssuedEnabledWarningEvent& event) {
-    protobuf::IssuedEnabledWarningEvent proto;
-    *proto.mutable_warningevent() = issuedWarning(event);
-    return proto;
+void WarningConversions::fill(const korvel::lang::diagnostic::IssuedEnabledWarningEvent& event,
+                              protobuf::IssuedEnabledWarningEvent& proto) {
+    fillIssuedWarning(event, *proto.mutable_warningevent());
 }
 
 boost::shared_ptr<const korvel::lang::diagnostic::IssuedEnabledWarningEvent> WarningConversions::fromProtobuf(

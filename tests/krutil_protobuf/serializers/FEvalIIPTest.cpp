@@ -323,10 +323,11 @@ void extractWithoutMemory() {
     const SerializationContext context;
     NestedWriter nested(7, 1, stream, registry, context);
     const auto request = boost::dynamic_pointer_cast<const FEvalIIP>(callWith(nullptr));
+    krutil::protobuf::FEvalIIP proto;
     std::signal(SIGABRT, tellWhetherMemoryRanOut);
     const AllocationRecorder recorder(0);
     exhausted = &recorder;
-    FEvalIIPSerializer::toProtobuf(*request, nested);
+    FEvalIIPSerializer::fill(*request, proto, nested);
 }
 
 TEST_F(FEvalIIPDeathTest, ArgumentsThatCannotBeHadForLackOfMemory) {

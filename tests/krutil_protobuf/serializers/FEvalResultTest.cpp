@@ -203,13 +203,14 @@ TEST_F(FEvalResultTest, OutputsInAnotherFormAreBoostsWrappedBadGetAndNothingIsWr
 }
 
 TEST_F(FEvalResultTest, WithoutACallableTheArraysAreLeftOutAndNothingComesBack) {
-    const wire::FEvalResult proto =
-        FEvalResultSerializer::toProtobuf(FEvalResult(requestID, {small(1)}), FEvalResultSerializer::WriteArrays());
+    wire::FEvalResult proto;
+    FEvalResultSerializer::fill(FEvalResult(requestID, {small(1)}), proto, FEvalResultSerializer::WriteArrays());
     EXPECT_EQ(proto.iipresult().id().lo(), 6U);
     EXPECT_EQ(proto.dataids_size(), 0);
     // Nor is the form of the outputs looked at.
     const FEvalResult nothing(requestID, FEvalResult::Results(), boost::none);
-    EXPECT_TRUE(FEvalResultSerializer::toProtobuf(nothing, FEvalResultSerializer::WriteArrays()).has_iipresult());
+    FEvalResultSerializer::fill(nothing, proto, FEvalResultSerializer::WriteArrays());
+    EXPECT_TRUE(proto.has_iipresult());
 
     EXPECT_EQ(FEvalResultSerializer::fromProtobuf(resultProto({1}), FEvalResultSerializer::ReadArrays()), nullptr);
     EXPECT_EQ(errorText<std::logic_error>([] {
@@ -224,8 +225,8 @@ TEST_F(FEvalResultTest, TheCallablesGetTheArraysAndTheIDsInOrder) {
         given = arrays;
         return std::vector<DataID>{8, 3};
     };
-    const wire::FEvalResult proto =
-        FEvalResultSerializer::toProtobuf(FEvalResult(requestID, {small(1), small(2)}), writer);
+    wire::FEvalResult proto;
+    FEvalResultSerializer::fill(FEvalResult(requestID, {small(1), small(2)}), proto, writer);
     EXPECT_EQ(given, (std::vector<Array>{small(1), small(2)}));
     EXPECT_EQ(dataIDs(proto), (std::vector<std::uint64_t>{8, 3}));
 
