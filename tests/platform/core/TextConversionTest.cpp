@@ -43,6 +43,27 @@ TEST(TextConversionTest, AllCodePointsRoundTrip) {
     }
 }
 
+// Long text is converted piece by piece. Wherever a piece may end, a pair of surrogates begins, or half of one stands.
+TEST(TextConversionTest, PairsOfSurrogatesMayStandAnywhere) {
+    for (const std::u16string& prefix : {u""s, u"a"s, u"\u00E9"s}) {
+        for (std::size_t filled = (1U << 16) - 4; filled <= (1U << 16) + 1; ++filled) {
+            for (const char16_t* const end : {u"\U0001F600", u"\xD83D", u"\xDE00", u"\xD83D\xD83D\xDE00"}) {
+                std::u16string text = prefix;
+                std::string expected = ustring_to_utf8(prefix);
+                for (std::size_t i = 0; i < filled; ++i) {
+                    text += u'\u6F22';
+                    expected += "\xE6\xBC\xA2";
+                }
+                text += end;
+                text += text;
+                expected += ustring_to_utf8(end);
+                expected += expected;
+                ASSERT_EQ(ustring_to_utf8(text), expected) << filled;
+            }
+        }
+    }
+}
+
 TEST(TextConversionTest, EmptyTextIsEmpty) {
     EXPECT_EQ(ustring_to_utf8(u""), "");
     EXPECT_EQ(utf8_to_ustring(""), u"");

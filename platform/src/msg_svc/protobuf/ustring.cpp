@@ -2,6 +2,7 @@
 
 #include <unicode/ustring.h>
 
+#include <algorithm>
 #include <array>
 #include <cstdint>
 #include <cstring>
@@ -54,6 +55,9 @@ std::size_t asciiPrefix(const std::string& text) {
     return asciiPrefix(text.data(), text.size(), 0x8080808080808080ULL);
 }
 
+// Code units that are converted at a time where there are others than ASCII.
+constexpr std::size_t piece = 1U << 16;
+
 // Copies `length` code units that are ASCII.
 template <class From, class To>
 void convertAscii(const From* from, std::size_t length, To* to) {
@@ -77,22 +81,33 @@ void convertAscii(const From* from, std::size_t length, To* to) {
 std::string ustring_to_utf8(const std::basic_string<char16_t>& text) {
     checkedLength(text.size(), "ustring_to_utf8");
     const std::size_t ascii = asciiPrefix(text);
-    std::string utf8(ascii, '\0');
-    convertAscii(text.data(), ascii, utf8.data());
     if (ascii == text.size()) {
+        std::string utf8(ascii, '\0');
+        convertAscii(text.data(), ascii, utf8.data());
         return utf8;
     }
-    const char16_t* rest = text.data() + ascii;
-    const auto restLength = static_cast<std::int32_t>(text.size() - ascii);
-    std::int32_t needed = 0;
-    UErrorCode status = U_ZERO_ERROR;
-    u_strToUTF8WithSub(nullptr, 0, &needed, rest, restLength, replacement, nullptr, &status);
-    if (needed < 0 || status == U_INDEX_OUTOFBOUNDS_ERROR) {
+    // Piece by piece, each with room for the longest result: one pass over the text, whose size in UTF-8 need not be
+    // known before.
+    std::string utf8(ascii + 3 * std::min(piece, text.size() - ascii), '\0');
+    std::size_t used = ascii;
+    for (std::size_t done = ascii; done < text.size();) {
+        std::size_t length = std::min(piece, text.size() - done);
+        if (done + length < text.size() && U16_IS_LEAD(text[done + length - 1])) {
+            --length;  // a pair stays together
+        }
+        utf8.resize(used + 3 * length);
+        std::int32_t bytes = 0;
+        UErrorCode status = U_ZERO_ERROR;
+        u_strToUTF8WithSub(utf8.data() + used, static_cast<std::int32_t>(3 * length), &bytes, text.data() + done,
+                           static_cast<std::int32_t>(length), replacement, nullptr, &status);
+        used += static_cast<std::size_t>(bytes);
+        done += length;
+    }
+    utf8.resize(used);
+    convertAscii(text.data(), ascii, utf8.data());
+    if (utf8.size() > static_cast<std::size_t>(std::numeric_limits<std::int32_t>::max())) {
         throw std::length_error("ustring_to_utf8: the UTF-8 text is longer than 2147483647 bytes");
     }
-    utf8.resize(ascii + static_cast<std::size_t>(needed));
-    status = U_ZERO_ERROR;
-    u_strToUTF8WithSub(utf8.data() + ascii, needed, nullptr, rest, restLength, replacement, nullptr, &status);
     return utf8;
 }
 
