@@ -16,7 +16,7 @@ build_packages=(
     libcli11-dev nlohmann-json3-dev libedit-dev
 )
 test_packages=(
-    libgtest-dev libgmock-dev libbenchmark-dev
+    libgtest-dev libgmock-dev libbenchmark-dev valgrind
     python3-protobuf                                    # the client for Python
     mypy python3-pip python3-setuptools python3-wheel   # its types and its wheel
 )
