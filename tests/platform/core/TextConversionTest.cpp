@@ -64,6 +64,22 @@ TEST(TextConversionTest, PairsOfSurrogatesMayStandAnywhere) {
     }
 }
 
+// Short text goes another way than long text; 256 is the longest that is short.
+TEST(TextConversionTest, ShortAndLongTextBecomeTheSame) {
+    for (std::size_t length = 1; length <= 300; ++length) {
+        for (const char32_t point : {0xE9U, 0x6F22U, 0x1F600U}) {
+            std::u16string text;
+            std::string bytes;
+            for (std::size_t i = 0; i < length; ++i) {
+                text += utf16Of(point);
+                bytes += utf8Of(point);
+            }
+            ASSERT_EQ(ustring_to_utf8(text), bytes) << length;
+            ASSERT_EQ(utf8_to_ustring(bytes), text) << length;
+        }
+    }
+}
+
 TEST(TextConversionTest, EmptyTextIsEmpty) {
     EXPECT_EQ(ustring_to_utf8(u""), "");
     EXPECT_EQ(utf8_to_ustring(""), u"");
@@ -102,9 +118,11 @@ class IllFormedTextTest : public testing::TestWithParam<IllFormed> {};
 // "U+FFFD Substitution of Maximal Subparts" of the Unicode Standard, with its own examples first.
 TEST_P(IllFormedTextTest, EachMaximalSubpartBecomesOneReplacementCharacter) {
     EXPECT_EQ(utf8_to_ustring(GetParam().bytes), GetParam().text);
-    const std::string before(13, 'x');
-    EXPECT_EQ(utf8_to_ustring(before + GetParam().bytes + before),
-              std::u16string(13, u'x') + GetParam().text + std::u16string(13, u'x'));
+    for (const std::size_t length : {13U, 300U}) {
+        const std::string around(length, 'x');
+        const std::u16string aroundText(length, u'x');
+        EXPECT_EQ(utf8_to_ustring(around + GetParam().bytes + around), aroundText + GetParam().text + aroundText);
+    }
 }
 
 INSTANTIATE_TEST_SUITE_P(

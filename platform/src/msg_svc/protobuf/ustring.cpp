@@ -14,19 +14,19 @@ namespace {
 
 constexpr UChar32 replacement = 0xFFFD;
 
-std::int32_t checkedLength(std::size_t length, const char* where) {
+void checkLength(std::size_t length, const char* where) {
     if (length > static_cast<std::size_t>(std::numeric_limits<std::int32_t>::max())) {
         throw std::length_error(std::string(where) + ": expected at most 2147483647 code units, got " +
                                 std::to_string(length));
     }
-    return static_cast<std::int32_t>(length);
 }
 
 // ASCII is most of what travels. It is looked for and converted in blocks of constant size, which compilers turn into
 // vector instructions without being asked for more than -O2.
 constexpr std::size_t block = 16;
 
-// Length of the leading run of code units without the bits of `beyondAscii`, which is repeated through a word.
+// Length of a leading run of code units without the bits of `beyondAscii`, which is repeated through a word: of the
+// whole text, or else of whole blocks.
 template <class Unit>
 std::size_t asciiPrefix(const Unit* text, std::size_t length, std::uint64_t beyondAscii) {
     std::array<std::uint64_t, block * sizeof(Unit) / sizeof(std::uint64_t)> words;
@@ -38,7 +38,7 @@ std::size_t asciiPrefix(const Unit* text, std::size_t length, std::uint64_t beyo
             any |= word;
         }
         if ((any & beyondAscii) != 0) {
-            break;
+            return i;
         }
     }
     while (i < length && static_cast<char16_t>(text[i]) <= 0x7F) {
@@ -55,7 +55,11 @@ std::size_t asciiPrefix(const std::string& text) {
     return asciiPrefix(text.data(), text.size(), 0x8080808080808080ULL);
 }
 
-// Code units that are converted at a time where there are others than ASCII.
+// Text of up to this many code units or bytes is converted on the stack, so that its string is made once and with its
+// exact size.
+constexpr std::size_t shortText = 256;
+
+// Code units of longer text that are converted at a time where there are others than ASCII.
 constexpr std::size_t piece = 1U << 16;
 
 // Copies `length` code units that are ASCII.
@@ -76,19 +80,41 @@ void convertAscii(const From* from, std::size_t length, To* to) {
     }
 }
 
+// Converts into `utf8`, which has room for three bytes for each code unit; returns how many it wrote.
+std::size_t convertByIcu(const char16_t* text, std::size_t length, char* utf8) {
+    std::int32_t bytes = 0;
+    UErrorCode status = U_ZERO_ERROR;
+    u_strToUTF8WithSub(utf8, static_cast<std::int32_t>(3 * length), &bytes, text, static_cast<std::int32_t>(length),
+                       replacement, nullptr, &status);
+    return static_cast<std::size_t>(bytes);
+}
+
+// Converts into `text`, which has room for a code unit for each byte; returns how many it wrote.
+std::size_t convertByIcu(const char* utf8, std::size_t length, char16_t* text) {
+    std::int32_t units = 0;
+    UErrorCode status = U_ZERO_ERROR;
+    u_strFromUTF8WithSub(text, static_cast<std::int32_t>(length), &units, utf8, static_cast<std::int32_t>(length),
+                         replacement, nullptr, &status);
+    return static_cast<std::size_t>(units);
+}
+
 }  // namespace
 
 std::string ustring_to_utf8(const std::basic_string<char16_t>& text) {
-    checkedLength(text.size(), "ustring_to_utf8");
+    checkLength(text.size(), "ustring_to_utf8");
     const std::size_t ascii = asciiPrefix(text);
     if (ascii == text.size()) {
         std::string utf8(ascii, '\0');
         convertAscii(text.data(), ascii, utf8.data());
         return utf8;
     }
+    if (text.size() <= shortText) {
+        std::array<char, 3 * shortText> utf8;
+        return std::string(utf8.data(), convertByIcu(text.data(), text.size(), utf8.data()));
+    }
     // Piece by piece, each with room for the longest result: one pass over the text, whose size in UTF-8 need not be
     // known before.
-    std::string utf8(ascii + 3 * std::min(piece, text.size() - ascii), '\0');
+    std::string utf8;
     std::size_t used = ascii;
     for (std::size_t done = ascii; done < text.size();) {
         std::size_t length = std::min(piece, text.size() - done);
@@ -96,11 +122,7 @@ std::string ustring_to_utf8(const std::basic_string<char16_t>& text) {
             --length;  // a pair stays together
         }
         utf8.resize(used + 3 * length);
-        std::int32_t bytes = 0;
-        UErrorCode status = U_ZERO_ERROR;
-        u_strToUTF8WithSub(utf8.data() + used, static_cast<std::int32_t>(3 * length), &bytes, text.data() + done,
-                           static_cast<std::int32_t>(length), replacement, nullptr, &status);
-        used += static_cast<std::size_t>(bytes);
+        used += convertByIcu(text.data() + done, length, utf8.data() + used);
         done += length;
     }
     utf8.resize(used);
@@ -112,20 +134,18 @@ std::string ustring_to_utf8(const std::basic_string<char16_t>& text) {
 }
 
 std::basic_string<char16_t> utf8_to_ustring(const std::string& utf8) {
-    checkedLength(utf8.size(), "utf8_to_ustring");
+    checkLength(utf8.size(), "utf8_to_ustring");
     const std::size_t ascii = asciiPrefix(utf8);
+    if (ascii < utf8.size() && utf8.size() <= shortText) {
+        std::array<char16_t, shortText> text;
+        return std::u16string(text.data(), convertByIcu(utf8.data(), utf8.size(), text.data()));
+    }
     // UTF-16 never has more units than UTF-8 has bytes, so one allocation serves both steps.
     std::u16string text(utf8.size(), u'\0');
     convertAscii(utf8.data(), ascii, text.data());
-    if (ascii == utf8.size()) {
-        return text;
+    if (ascii < utf8.size()) {
+        text.resize(ascii + convertByIcu(utf8.data() + ascii, utf8.size() - ascii, text.data() + ascii));
     }
-    const auto restLength = static_cast<std::int32_t>(utf8.size() - ascii);
-    std::int32_t units = 0;
-    UErrorCode status = U_ZERO_ERROR;
-    u_strFromUTF8WithSub(text.data() + ascii, restLength, &units, utf8.data() + ascii, restLength, replacement, nullptr,
-                         &status);
-    text.resize(ascii + static_cast<std::size_t>(units));
     return text;
 }
 
