@@ -85,6 +85,8 @@ def codec(prefix):
 
 RAW = "a raw framed round trip of the same bytes, from process to process"
 RAW_ARRAY = "the same bytes sent raw, from process to process, each of which uses one buffer all the time"
+BARE_CODE = "bare Protocol Buffers code for the same object"
+ICU = "one call of ICU, with room for the longest result"
 REUSED = "The array is the same each time; what the engine and the client do with memory is up to them."
 FILES = "Files are in the page cache; nothing else is kept from one start to the next."
 
@@ -113,9 +115,14 @@ QUESTIONS = [
     Question("memory", "Private memory of an idle session of a listening engine, after `print(1+1)`",
              "a `python3` that has printed the same and waits", processes.idle_memory, placements=(SCHEDULER,),
              conditions="All processes are there at the same time.", unit="bytes"),
+    Question("serialize", "An object to its frames: look-up by type, casts, conversion, frame, append", BARE_CODE,
+             codec("serialize"), placements=(ONE_CORE,)),
+    Question("deserialize", "Frames to an object: look-up by tag, parsing, conversion", BARE_CODE, codec("deserialize"),
+             placements=(ONE_CORE,)),
+    Question("to-utf-8", "Text from UTF-16 to UTF-8", ICU, codec("to UTF-8"), placements=(ONE_CORE,)),
+    Question("to-utf-16", "Text from UTF-8 to UTF-16", ICU, codec("to UTF-16"), placements=(ONE_CORE,)),
     Question("small-messages", "Small messages in the formats that people use instead",
-             "bare Protocol Buffers code for the same object", codec("small-messages"), placements=(ONE_CORE,),
-             needs_peers=True),
+             BARE_CODE, codec("small-messages"), placements=(ONE_CORE,), needs_peers=True),
     Question("message-sizes", "A request and its reply between two ends of a session, without an engine", RAW,
              engine("message-sizes"), placements=(ONE_CORE,), axis="characters of the request"),
     Question("array-sizes", "A call with an array, over the socket", RAW_ARRAY, engine("array-sizes"),
