@@ -1,22 +1,19 @@
 #include "foundation/msg_svc/transport/layers/session/Session.hpp"
 
-#include <pthread.h>
-
 #include <algorithm>
 #include <atomic>
 #include <mutex>
 #include <stdexcept>
 #include <system_error>
-#include <thread>
 #include <type_traits>
 #include <utility>
 #include <vector>
 
-#include "foundation/core/posix/SignalsBlocked.hpp"
 #include "foundation/msg_svc/transport/layers/session/Asio.hpp"
 #include "foundation/msg_svc/transport/layers/session/Exchanges.hpp"
 #include "foundation/msg_svc/transport/layers/session/Handshake.hpp"
 #include "foundation/msg_svc/transport/layers/session/Incoming.hpp"
+#include "foundation/msg_svc/transport/layers/session/IoThread.hpp"
 #include "foundation/msg_svc/transport/layers/session/ObjectWriter.hpp"
 #include "foundation/msg_svc/transport/layers/session/Outgoing.hpp"
 #include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
@@ -25,8 +22,6 @@
 
 namespace foundation::msg_svc::transport::layers::session {
 namespace {
-
-using core::posix::SignalsBlocked;
 
 template <class T>
 using Shared = boost::shared_ptr<const T>;
@@ -81,9 +76,7 @@ class Session::Impl final : private Incoming::Owner, private Outgoing::Owner {
         Down,     // the descriptors are closed, and the handler knows
     };
 
-    // Any thread.
-    void ensureThread();
-    // `say` runs with the mutex of the exchanges held; it may throw, or return false to send nothing.
+    // Any thread. `say` runs with the mutex of the exchanges held; it may throw, or return false to send nothing.
     template <class Say>
     void submit(OutgoingPieces message, Say say);
     bool isDone(Role role) const;
@@ -107,7 +100,7 @@ class Session::Impl final : private Incoming::Owner, private Outgoing::Owner {
     const ObjectWriter writer_;
     SharedExchanges exchanges_;
     asio::io_context io_{1};
-    asio::executor_work_guard<asio::io_context::executor_type> work_{io_.get_executor()};
+    IoThread thread_{io_};
     asio::steady_timer timer_{io_};
     Outgoing outgoing_;
     const std::unique_ptr<lending::SharedMemory> shared_;  // null without shared memory
@@ -118,10 +111,6 @@ class Session::Impl final : private Incoming::Owner, private Outgoing::Owner {
     Stage stage_ = Stage::Open;
     int writeError_ = 0;
     SessionEnd end_{SessionEnd::Reason::Closed, {}};
-
-    std::once_flag threadStarted_;
-    std::mutex joinMutex_;
-    std::thread thread_;
 };
 
 Session::Impl::Impl(StreamDescriptors& stream, SessionConfig sessionConfig, Settlement settled)
@@ -136,16 +125,6 @@ Session::Impl::Impl(StreamDescriptors& stream, SessionConfig sessionConfig, Sett
       incoming_(io_, stream.in, config, settlement.registry, settlement.arrayTag, exchanges_, outgoing_, shared_.get(),
                 *this) {}
 
-void Session::Impl::ensureThread() {
-    std::call_once(threadStarted_, [this] {
-        const SignalsBlocked blocked;
-        thread_ = std::thread([this] {
-            ::pthread_setname_np(::pthread_self(), "session-io");
-            io_.run();
-        });
-    });
-}
-
 void Session::Impl::start(SessionHandler& handler) {
     asio::post(io_, [this, &handler] {
         handler_ = &handler;
@@ -155,7 +134,7 @@ void Session::Impl::start(SessionHandler& handler) {
             incoming_.start(handler);
         }
     });
-    ensureThread();
+    thread_.start();
 }
 
 framing::StreamID Session::Impl::newStreamID() {
@@ -348,17 +327,14 @@ void Session::Impl::close(std::chrono::milliseconds patience) {
     if (abandoned) {
         return;
     }
-    ensureThread();
+    thread_.start();
     asio::post(io_, [this, patience] {
         beginClose(patience);
         // The thread outlives the stream until somebody waits for it here, so that a session which ended before it was
         // started still tells its handler.
-        work_.reset();
+        thread_.release();
     });
-    const std::lock_guard lock(joinMutex_);
-    if (thread_.joinable()) {
-        thread_.join();
-    }
+    thread_.join();
 }
 
 void Session::Impl::abort(const std::string& text) {
@@ -367,7 +343,7 @@ void Session::Impl::abort(const std::string& text) {
     }
     incoming_.silence();
     asio::post(io_, [this, text] { onViolation(text); });
-    ensureThread();
+    thread_.start();
 }
 
 void Session::Impl::finish(SessionEnd end, const std::string& abortReason) {

@@ -1,0 +1,33 @@
+// The thread on which a session reads, and writes what the stream did not take at once.
+#pragma once
+
+#include <mutex>
+#include <thread>
+
+#include "foundation/msg_svc/transport/layers/session/Asio.hpp"
+
+namespace foundation::msg_svc::transport::layers::session {
+
+/// Runs what is posted to an `io_context`. Members may be called from any thread.
+class IoThread {
+  public:
+    explicit IoThread(asio::io_context& io) : io_(io), work_(io.get_executor()) {}
+
+    /// Starts the thread, unless it was started. Signals are not delivered to it.
+    void start();
+
+    /// Lets the thread end when nothing is left to be done. On the thread itself.
+    void release() { work_.reset(); }
+
+    /// Waits for the thread's end. Several threads may, and it may not have been started.
+    void join();
+
+  private:
+    asio::io_context& io_;
+    asio::executor_work_guard<asio::io_context::executor_type> work_;
+    std::once_flag started_;
+    std::mutex joinMutex_;
+    std::thread thread_;
+};
+
+}  // namespace foundation::msg_svc::transport::layers::session
