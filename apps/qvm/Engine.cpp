@@ -88,7 +88,11 @@ Engine::Engine(const Options& options, Log& log)
       queue_(options.queue),
       capabilities_({Capability::Debugging, Capability::InteractiveCommandLine}) {}
 
-Engine::~Engine() = default;
+Engine::~Engine() {
+    if (timer_) {
+        timer_->stop();
+    }
+}
 
 ExitCode Engine::run(int in, int out) {
     if (!open(in, out)) {
@@ -96,14 +100,22 @@ ExitCode Engine::run(int in, int out) {
     }
     const MessageBounds bounds(session_->peer().limits);
     ForkGuard guard(*session_);
-    announcer_ = std::make_unique<Announcer>(*session_, diary_, log_);
+    timer_ = std::make_unique<FlushTimer>([this](FlushTimer::Time now) {
+        // Text first, because it is sent then.
+        const FlushTimer::Time text = output_->flushDue(now);
+        return std::min(text, announcer_->flushDue(now));
+    });
+    announcer_ = std::make_unique<Announcer>(*session_, diary_, log_, *timer_);
     TextOutput::Settings settings;
     settings.maxUnits = bounds.textUnits;
     {
         posix::SignalsBlocked blocked;
-        output_ = std::make_unique<TextOutput>(settings, [this](const TextTarget& target, std::u16string text) {
-            announcer_->announceText(target, std::move(text));
-        });
+        output_ = std::make_unique<TextOutput>(
+            settings,
+            [this](const TextTarget& target, std::u16string text) {
+                announcer_->announceText(target, std::move(text));
+            },
+            [this](FlushTimer::Time due) { timer_->expect(due); });
         PromptHost& host = *this;
         prompts_ = std::make_unique<Prompts>(queue_, *announcer_, *output_, cancellation_, capabilities_, host);
         capture_ = std::make_unique<OutputCapture>(
@@ -116,6 +128,7 @@ ExitCode Engine::run(int in, int out) {
     installEngineModule(*output_, *announcer_, *this);
     try {
         python_ = std::make_unique<Interpreter>(options_.python, bounds);
+        lastWords_.emplace(*timer_);
         serve();
     } catch (const std::exception& error) {
         log_.say(std::string("The engine has failed: ") + error.what());
@@ -177,7 +190,9 @@ void Engine::loop() {
         if (prompts_->admit(*request) && !handle(*request, nullptr)) {
             return;
         }
-        settle();
+        // Replies leave together while more evaluations wait.
+        const bool isEvaluation = std::holds_alternative<const EvalIIP*>(request->task);
+        settle(isEvaluation && queue_.hasDue(DequeuePoint::Idle) ? Until::Room : Until::Written);
     }
 }
 
@@ -186,6 +201,7 @@ void Engine::loop() {
 void Engine::checkDescriptors() {
     // A session that is over has closed its own, and says so at once.
     if (!descriptors_->areOpen() && !announcer_->awaitEnd(grace)) {
+        sendAll();
         log_.say("Running code has closed descriptors of the engine, so its session cannot go on.");
         ::_exit(static_cast<int>(ExitCode::Lost));
     }
@@ -193,8 +209,12 @@ void Engine::checkDescriptors() {
 
 // Outputs are sent from Python's own memory, which the next request might change. And a client that only sends must not
 // make this process grow. A cancel ends the wait, so what was returned at a prompt has been copied.
-void Engine::settle() {
-    python_->unlocked([this] { announcer_->waitUntilWritten(cancellation_.descriptor()); });
+void Engine::settle(Until until) {
+    checkDescriptors();
+    python_->unlocked([this, until] {
+        const int interrupt = cancellation_.descriptor();
+        until == Until::Room ? announcer_->waitForRoom(interrupt) : announcer_->waitUntilWritten(interrupt);
+    });
     python_->dropReleased();
 }
 
@@ -204,10 +224,11 @@ void Engine::unlocked(const std::function<void()>& wait) {
 
 std::optional<Request> Engine::next() {
     for (;;) {
-        RequestQueue::Wait wait = RequestQueue::Wait::Interrupted;
-        {
+        RequestQueue::Wait wait = RequestQueue::Wait::Due;
+        if (!queue_.hasDue(DequeuePoint::Idle)) {
             posix::SignalsBlocked blocked;
             python_->handleSignals();
+            announcer_->flush();
             python_->unlocked(
                 [&] { wait = queue_.wait(DequeuePoint::Idle, python_->releasedDescriptor(), {}, blocked.before()); });
         }
@@ -258,7 +279,6 @@ Interpreter::Ending Engine::runCode(const Request& request, PyObject* frame) {
         echo(evaluation);
         ending = python_->evaluate(evaluation, fileOf(request), frame);
     }
-    checkDescriptors();
     capture_->finish();
     const bool toldToStop = cancellation_.end();
     if (!prompts_->isInner()) {
@@ -351,6 +371,11 @@ bool Engine::drainDescriptors() {
     return capture_->drain();
 }
 
+void Engine::sendAll() {
+    output_->flush();
+    announcer_->flush();
+}
+
 // Whether running code is to go on with an exception, which is set.
 bool Engine::interrupted() {
     if (cancellation_.takeInterrupt()) {
@@ -363,16 +388,22 @@ bool Engine::interrupted() {
 // What the session's I/O thread hands over.
 
 void Engine::onMessage(framing::StreamID stream, const boost::shared_ptr<const Message>& message) {
-    Announcer::Turn turn = announcer_->turn(Session::Urgency::Answer);
-    if (!turn.isServing()) {
-        return;
+    const auto enqueued = boost::dynamic_pointer_cast<const IIPEnqueueMessage>(message);
+    {
+        Announcer::Turn turn = announcer_->turn(Session::Urgency::Answer);
+        if (!turn.isServing()) {
+            return;
+        }
+        if (enqueued) {
+            enqueue(turn, arrivedRequest(stream, enqueued));
+        } else if (const auto* const cancelled = dynamic_cast<const IIPCancelMessage*>(message.get())) {
+            cancel(turn, stream, *cancelled);
+        } else {
+            throw session_layer::ProtocolViolation("The engine cannot act on a message of this kind.");
+        }
     }
-    if (const auto enqueued = boost::dynamic_pointer_cast<const IIPEnqueueMessage>(message)) {
-        enqueue(turn, arrivedRequest(stream, enqueued));
-    } else if (const auto* const cancelled = dynamic_cast<const IIPCancelMessage*>(message.get())) {
-        cancel(turn, stream, *cancelled);
-    } else {
-        throw session_layer::ProtocolViolation("The engine cannot act on a message of this kind.");
+    if (enqueued) {
+        queue_.wake();
     }
 }
 

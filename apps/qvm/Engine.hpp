@@ -18,6 +18,8 @@
 #include "foundation/msg_svc/transport/layers/session/Session.hpp"
 #include "qvm/Options.hpp"
 #include "qvm/process/AppendFile.hpp"
+#include "qvm/process/FlushTimer.hpp"
+#include "qvm/process/LastWords.hpp"
 #include "qvm/process/Log.hpp"
 #include "qvm/process/OutputCapture.hpp"
 #include "qvm/process/OwnDescriptors.hpp"
@@ -80,10 +82,11 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
     bool takeInterrupt() override;
     bool repeatInterrupt() override;
     bool drainDescriptors() override;
+    void sendAll() override;
 
     bool interrupted() override;
     void unlocked(const std::function<void()>& wait) override;
-    void settle() override;
+    void settle() override { settle(Until::Written); }
 
     bool open(int in, int out);
     void serve();
@@ -92,6 +95,8 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
     bool handle(const Request& request, PyObject* frame);
     Interpreter::Ending runCode(const Request& request, PyObject* frame);
     void checkDescriptors();
+    enum class Until { Room, Written };
+    void settle(Until until);
     const Request* requestOfThisThread() const noexcept;
     void echo(const cmddistributor::EvalIIP& evaluation);
 
@@ -106,11 +111,13 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
 
     // Of one session, in the order in which they are made.
     std::unique_ptr<Session> session_;
+    std::unique_ptr<FlushTimer> timer_;
     std::unique_ptr<Announcer> announcer_;
     std::unique_ptr<TextOutput> output_;
     std::unique_ptr<Prompts> prompts_;
     std::unique_ptr<OutputCapture> capture_;
     std::unique_ptr<Interpreter> python_;
+    std::optional<LastWords> lastWords_;
     std::optional<OwnDescriptors> descriptors_;
 };
 

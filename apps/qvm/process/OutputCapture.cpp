@@ -155,9 +155,13 @@ bool OutputCapture::readAvailable(Source& source) {
 
 bool OutputCapture::drain() {
     const std::lock_guard lock(mutex_);
+    // Mostly there is nothing, and one call tells.
+    std::array<pollfd, 2> watched{{{sources_[0].pipe, POLLIN, 0}, {sources_[1].pipe, POLLIN, 0}}};
     bool emitted = false;
-    for (Source& source : sources_) {
-        emitted = readAvailable(source) || emitted;
+    if (::poll(watched.data(), watched.size(), 0) > 0) {
+        for (Source& source : sources_) {
+            emitted = readAvailable(source) || emitted;
+        }
     }
     return emitted;
 }

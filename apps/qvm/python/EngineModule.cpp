@@ -5,8 +5,10 @@
 
 #include <unistd.h>
 
+#include <array>
 #include <chrono>
 #include <cstring>
+#include <new>
 #include <optional>
 #include <string>
 
@@ -14,6 +16,7 @@
 #include "msg_svc/protobuf/ustring.hpp"
 #include "qvm/process/AppendFile.hpp"
 #include "qvm/process/ForkedChild.hpp"
+#include "qvm/process/LastWords.hpp"
 #include "qvm/python/PythonText.hpp"
 #include "qvm/python/WarningRecord.hpp"
 #include "qvm/requests/Cancellation.hpp"
@@ -90,32 +93,67 @@ PlainStream& plainStream(TextSource source) {
     return source == TextSource::Error ? plainError : plainOutput;
 }
 
-std::size_t write(TextSource source, const py::object& text) {
-    if (!PyUnicode_Check(text.ptr())) {
-        throw py::type_error(std::string("write() argument must be str, not ") + Py_TYPE(text.ptr())->tp_name);
+std::size_t write(TextSource source, PyObject* text) {
+    if (!PyUnicode_Check(text)) {
+        throw py::type_error(std::string("write() argument must be str, not ") + Py_TYPE(text)->tp_name);
     }
-    const auto length = static_cast<std::size_t>(PyUnicode_GET_LENGTH(text.ptr()));
+    const auto length = static_cast<std::size_t>(PyUnicode_GET_LENGTH(text));
     if (isApart()) {
-        plainStream(source).write(text.ptr());
+        plainStream(source).write(text);
         return length;
     }
     if (services->drainDescriptors()) {
         waitForRoom();
     }
+    // Guarded by the interpreter lock, and used up before that is let go.
+    static std::u16string units;
     for (std::size_t begin = 0; begin < length; begin += piecePoints) {
-        if (output->write(source, utf16Of(text.ptr(), begin, piecePoints))) {
+        toUtf16(text, begin, piecePoints, units);
+        if (output->write(source, units)) {
             waitForRoom();
         }
     }
     return length;
 }
 
+// A line is several writes, so these are plain functions of Python's: a call through pybind11 takes longer than the
+// rest of a write.
+template <TextSource source>
+PyObject* writeMethod(PyObject* /*module*/, PyObject* text) noexcept {
+    try {
+        return PyLong_FromSize_t(write(source, text));
+    } catch (py::error_already_set& error) {
+        error.restore();
+    } catch (const py::builtin_exception& error) {
+        error.set_error();
+    } catch (const std::bad_alloc&) {
+        PyErr_NoMemory();
+    }
+    return nullptr;
+}
+
+std::array writeMethods{PyMethodDef{"write_output", &writeMethod<TextSource::Output>, METH_O, nullptr},
+                        PyMethodDef{"write_error", &writeMethod<TextSource::Error>, METH_O, nullptr},
+                        PyMethodDef{nullptr, nullptr, 0, nullptr}};
+
 void flush() {
     if (isApart()) {
         plainStream(TextSource::Output).flush();
         plainStream(TextSource::Error).flush();
-    } else if (output->flush()) {
+        return;
+    }
+    const bool handedOn = output->flush();
+    announcer->flush();
+    if (handedOn) {
         waitForRoom();
+    }
+}
+
+// For what ends the process without a word.
+void sendAll() {
+    if (!isApart()) {
+        services->drainDescriptors();
+        services->sendAll();
     }
 }
 
@@ -273,10 +311,13 @@ py::list instances(const py::list& things, const py::tuple& types) {
 }  // namespace
 
 PYBIND11_EMBEDDED_MODULE(_qvm, module) {
-    module.def("write_output", [](const py::object& text) { return write(TextSource::Output, text); });
-    module.def("write_error", [](const py::object& text) { return write(TextSource::Error, text); });
-    module.def("show", [](const py::object& text) { write(TextSource::ShownOutput, text); });
+    if (PyModule_AddFunctions(module.ptr(), writeMethods.data()) != 0) {
+        throw py::error_already_set();
+    }
+    module.def("show", [](const py::object& text) { write(TextSource::ShownOutput, text.ptr()); });
     module.def("flush", &flush);
+    module.def("send_all", &sendAll);
+    module.def("keep_last_words", &LastWords::keep);
     module.def("formats_values", [] { return !isApart() && output->outputTraits().getNeedsFormattingForDisplay(); });
     module.def("makes_links", [] { return !isApart() && output->outputTraits().getSupportsHotlinks(); });
     module.def("is_apart", &isApart);

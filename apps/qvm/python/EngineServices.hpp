@@ -52,6 +52,9 @@ class EngineServices {
     /// that runs was given none.
     virtual bool repeatInterrupt() = 0;
 
+    /// Sends whatever is held, as far as the stream takes it.
+    virtual void sendAll() = 0;
+
     /// Hands on what was written to descriptors 1 and 2. Returns whether that was anything.
     virtual bool drainDescriptors() = 0;
 };

@@ -96,7 +96,8 @@ class Builder {
             bytes += next;
         }
         take(bytes);
-        std::u16string units = utf16Of(text, 0, count);
+        std::u16string units;
+        toUtf16(text, 0, count, units);
         if (count < length) {
             const std::string note = "... (" + std::to_string(length - count) + " more characters)";
             take(note.size());

@@ -11,14 +11,19 @@ constexpr char16_t replacement = 0xFFFD;
 
 }  // namespace
 
-std::u16string utf16Of(PyObject* text, std::size_t begin, std::size_t count) {
+void toUtf16(PyObject* text, std::size_t begin, std::size_t count, std::u16string& units) {
     const auto length = static_cast<std::size_t>(PyUnicode_GET_LENGTH(text));
-    const std::size_t end = begin + std::min(count, length - std::min(begin, length));
+    begin = std::min(begin, length);
+    const std::size_t end = begin + std::min(count, length - begin);
     const int kind = PyUnicode_KIND(text);
     const void* data = PyUnicode_DATA(text);
-
-    std::u16string units;
-    units.reserve(end - std::min(begin, end));
+    if (kind == PyUnicode_1BYTE_KIND) {
+        const auto* const points = static_cast<const Py_UCS1*>(data);
+        units.assign(points + begin, points + end);
+        return;
+    }
+    units.clear();
+    units.reserve(end - begin);
     for (std::size_t i = begin; i < end; ++i) {
         const Py_UCS4 point = PyUnicode_READ(kind, data, i);
         if (point >= 0x10000) {
@@ -30,11 +35,12 @@ std::u16string utf16Of(PyObject* text, std::size_t begin, std::size_t count) {
             units += static_cast<char16_t>(point);
         }
     }
-    return units;
 }
 
 std::u16string utf16Of(PyObject* text) {
-    return utf16Of(text, 0, static_cast<std::size_t>(PyUnicode_GET_LENGTH(text)));
+    std::u16string units;
+    toUtf16(text, 0, static_cast<std::size_t>(PyUnicode_GET_LENGTH(text)), units);
+    return units;
 }
 
 PyObject* strOf(const std::u16string& text) {

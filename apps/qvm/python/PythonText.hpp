@@ -8,9 +8,9 @@
 
 namespace qvm {
 
-/// UTF-16 text of the code points [begin, begin + count) of a str, as far as there are so many. A surrogate, which a
-/// str may hold and text may not, becomes U+FFFD.
-std::u16string utf16Of(PyObject* text, std::size_t begin, std::size_t count);
+/// Makes `units` the UTF-16 text of the code points [begin, begin + count) of a str, as far as there are so many. A
+/// surrogate, which a str may hold and text may not, becomes U+FFFD.
+void toUtf16(PyObject* text, std::size_t begin, std::size_t count, std::u16string& units);
 
 /// The same for the whole str.
 std::u16string utf16Of(PyObject* text);

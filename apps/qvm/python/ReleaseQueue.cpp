@@ -35,12 +35,15 @@ class ReleaseQueue::Core {
             !returned_.compare_exchange_weak(held->next, held, std::memory_order_release, std::memory_order_relaxed)) {
         }
         wake_.raise();
+        raised_.store(true, std::memory_order_release);
     }
 
     // All that has come back, the latest first.
     Held* takeAll() noexcept {
-        // Emptied before the look at the list, so that nothing is missed.
-        wake_.clear();
+        // Emptied before the look at the list, so that nothing is missed. Nothing is there most of the time.
+        if (raised_.exchange(false, std::memory_order_acquire)) {
+            wake_.clear();
+        }
         return returned_.exchange(nullptr, std::memory_order_acquire);
     }
 
@@ -48,6 +51,7 @@ class ReleaseQueue::Core {
 
   private:
     const foundation::core::posix::EventDescriptor wake_;
+    std::atomic<bool> raised_{false};  // a moment after wake_
     std::atomic<Held*> returned_{nullptr};
 };
 

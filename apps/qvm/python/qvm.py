@@ -11,6 +11,8 @@ import builtins as _builtins
 import codecs as _codecs
 import gc as _gc
 import io as _io
+import os as _os
+import posix as _posix
 import sys as _sys
 import time as _time
 import warnings as _warnings
@@ -387,7 +389,10 @@ def _format_error(error, limit):
 def _set_user_handler(signalnum, handler):
     if signalnum == _qvm.interrupt_signal:
         raise OSError(_EINVAL, _strerror(_EINVAL))
-    return _set_handler(signalnum, handler)
+    before = _set_handler(signalnum, handler)
+    if not callable(handler):
+        _qvm.keep_last_words()
+    return before
 
 
 def _set_user_mask(how, mask):
@@ -475,6 +480,14 @@ def _compile(source, filename, code_type, begins_file):
     return _COMPILERS[code_type](source, filename)
 
 
+def _after_sending(leave):
+    """What leaves the program at once, with what it has printed sent before."""
+    def send_and_leave(*arguments, **options):
+        _qvm.send_all()
+        return leave(*arguments, **options)
+    return send_and_leave
+
+
 def _finish():
     """What the end of a Python program does for its code: exit functions run, and written files are complete."""
     _atexit._run_exitfuncs()
@@ -520,6 +533,9 @@ def _replace(module, name, function):
 _set_handler = _replace(_signal, "signal", _set_user_handler)
 _set_mask = _replace(_signal, "pthread_sigmask", _set_user_mask)
 _set_handler(_qvm.interrupt_signal, _qvm.on_interrupt_signal)
+for _name in "_exit", "execv", "execve":
+    _replace(_posix, _name, _after_sending(getattr(_posix, _name)))
+    setattr(_os, _name, getattr(_posix, _name))
 _warnings._showwarnmsg = _on_shown
 _replace(_warnings, "warn", _warn)
 _replace(_warnings, "warn_explicit", _warn_explicit)

@@ -49,11 +49,29 @@ Warning shortened(const Warning& warning, std::size_t units) {
 
 }  // namespace
 
+template <class T>
+void Announcer::Turn::send(framing::StreamID stream, const boost::shared_ptr<const T>& object,
+                           Session::Urgency urgency) {
+    if (!isServing()) {
+        return;
+    }
+    announcer_.session_.send(stream, object, urgency);
+    if (urgency != Session::Urgency::Held) {
+        announcer_.due_ = FlushTimer::never;
+    } else if (announcer_.due_ == FlushTimer::never) {
+        announcer_.due_ = FlushTimer::Clock::now() + holdTime;
+        announcer_.timer_.expect(announcer_.due_);
+    }
+}
+
+// What may wait for the next message does.
+auto Announcer::Turn::patient() const noexcept -> Session::Urgency {
+    return urgency_ == Session::Urgency::Output ? Session::Urgency::Held : urgency_;
+}
+
 bool Announcer::Turn::publish(framing::StreamID stream, const Event& event) noexcept {
     try {
-        if (isServing()) {
-            announcer_.session_.send(stream, event, urgency_);
-        }
+        send(stream, event, patient());
         return true;
     } catch (const std::exception& error) {
         announcer_.log_.say(std::string("An event cannot be sent: ") + error.what());
@@ -62,25 +80,27 @@ bool Announcer::Turn::publish(framing::StreamID stream, const Event& event) noex
 }
 
 void Announcer::Turn::answer(framing::StreamID stream, const boost::shared_ptr<const Reply>& reply) {
-    if (isServing()) {
-        announcer_.session_.send(stream, reply, urgency_);
-    }
+    send(stream, reply, urgency_);
 }
 
 void Announcer::Turn::finish(const Request& request, std::unique_ptr<IIPResult> result) {
     raise<cmddistributor::LastIIPEvent>(request);
+    // The outputs of a call are sent from where they are, which may change: that does not wait.
+    const bool isCall = std::holds_alternative<const cmddistributor::FEvalIIP*>(request.task);
+    const auto reply = [&](std::unique_ptr<IIPResult> sent) {
+        send(request.stream,
+             boost::shared_ptr<const Reply>(boost::make_shared<const IIPReply>(request.id(), std::move(sent))),
+             isCall ? urgency_ : patient());
+    };
     std::string problem;
     try {
-        answer(request.stream, boost::make_shared<const IIPReply>(request.id(), std::move(result)));
+        reply(std::move(result));
         return;
     } catch (const std::exception& error) {
         problem = error.what();
     }
-    answer(request.stream,
-           boost::make_shared<const IIPReply>(
-               request.id(),
-               std::make_unique<IIPResult>(
-                   request.id(), communicationError("The result of this request cannot be sent: " + problem))));
+    reply(std::make_unique<IIPResult>(request.id(),
+                                      communicationError("The result of this request cannot be sent: " + problem)));
 }
 
 void Announcer::Turn::discard(const Request& request, RuntimeException error) {
@@ -92,8 +112,17 @@ void Announcer::Turn::refuse(const Request& request, const std::string& why) {
     discard(request, communicationError(why));
 }
 
-Announcer::Announcer(Session& session, AppendFile& diary, Log& log)
-    : session_(session), diary_(diary), log_(log), bounds_(session.peer().limits) {}
+Announcer::Announcer(Session& session, AppendFile& diary, Log& log, FlushTimer& timer)
+    : session_(session), diary_(diary), log_(log), timer_(timer), bounds_(session.peer().limits) {}
+
+FlushTimer::Time Announcer::flushDue(FlushTimer::Time now) {
+    const std::lock_guard lock(mutex_);
+    if (due_ != FlushTimer::never && due_ <= now) {
+        due_ = FlushTimer::never;
+        session_.sendHeld();
+    }
+    return due_;
+}
 
 void Announcer::announceText(const TextTarget& target, std::u16string text) noexcept {
     try {
@@ -137,6 +166,7 @@ void Announcer::shutDown() {
     {
         Turn last = turn();
         last.publish(0, boost::make_shared<const krutil::eventmgr::QVMShutdownEvent>());
+        session_.sendHeld();
         phase_ = next(phase_, SessionStep::ShutDown);
     }
     changed_.notify_all();

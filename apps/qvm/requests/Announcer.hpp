@@ -4,6 +4,10 @@
 // session's I/O thread takes one for each message from the client as well: while a turn is held, each request is either
 // in the queue, or among the running ones, or has ended, and a cancel finds it.
 //
+// What a request sends is held for a moment, so that a short request leaves in one write, and short requests that wait
+// for each other leave together: until the engine has none left or waits, when it is much, and in any case for holdTime
+// only, since nobody knows how long the code goes on.
+//
 // Nobody waits for the client in a turn, because sending never waits. So the threads of running code wait afterwards,
 // without a turn and without the interpreter lock: waitForRoom() returns when the client has read enough. That bounds
 // what is unwritten to the session's room and one message of each thread.
@@ -24,6 +28,7 @@
 #include "foundation/msg_svc/transport/layers/session/Session.hpp"
 #include "korvel/lang/diagnostic/Warning.hpp"
 #include "qvm/process/AppendFile.hpp"
+#include "qvm/process/FlushTimer.hpp"
 #include "qvm/process/Log.hpp"
 #include "qvm/requests/MessageBounds.hpp"
 #include "qvm/requests/Request.hpp"
@@ -59,6 +64,7 @@ class Announcer {
                     const boost::shared_ptr<const foundation::msg_svc::exchange::Reply>& reply);
 
         /// Ends a request: its last event, and the reply. A result that cannot be sent becomes an error that says so.
+        /// The reply to an evaluation is held for a moment; Announcer::flush() and waitUntilWritten() send it.
         void finish(const Request& request, std::unique_ptr<cmddistributor::IIPResult> result);
 
         /// Ends a request that is never run: discarded, last and a reply with the error.
@@ -72,13 +78,21 @@ class Announcer {
         Turn(Announcer& announcer, Session::Urgency urgency)
             : lock_(announcer.mutex_), announcer_(announcer), urgency_(urgency) {}
 
+        template <class T>
+        void send(framing::StreamID stream, const boost::shared_ptr<const T>& object, Session::Urgency urgency);
+        Session::Urgency patient() const noexcept;
+
         std::unique_lock<std::mutex> lock_;
         Announcer& announcer_;
         const Session::Urgency urgency_;
     };
 
-    /// All must outlive the object. `diary` and `log` get copies of the texts that ask for it.
-    Announcer(Session& session, AppendFile& diary, Log& log);
+    /// How long what is sent may be held.
+    static constexpr std::chrono::microseconds holdTime{300};
+
+    /// All must outlive the object. `diary` and `log` get copies of the texts that ask for it. `timer` calls
+    /// flushDue().
+    Announcer(Session& session, AppendFile& diary, Log& log, FlushTimer& timer);
     Announcer(const Announcer&) = delete;
     Announcer& operator=(const Announcer&) = delete;
 
@@ -91,6 +105,12 @@ class Announcer {
     /// Sends a warning of `request`, or of none when it is null, and once more when it is enabled. Takes a turn of its
     /// own.
     void announceWarning(const Request* request, korvel::lang::diagnostic::Warning warning);
+
+    /// Writes what is held.
+    void flush() { flushDue(FlushTimer::never); }
+
+    /// Writes what is held if it is due at `now`; returns when it is due otherwise, FlushTimer::never if there is none.
+    FlushTimer::Time flushDue(FlushTimer::Time now);
 
     /// Waits until the client has read enough for more to be sent, the session is over, or `interrupt` (a descriptor,
     /// -1 for none) is readable; returns false in the last case.
@@ -117,8 +137,10 @@ class Announcer {
     Session& session_;
     AppendFile& diary_;
     Log& log_;
+    FlushTimer& timer_;
     const MessageBounds bounds_;
     std::mutex mutex_;
+    FlushTimer::Time due_ = FlushTimer::never;  // of what is held
     std::condition_variable changed_;
     SessionPhase phase_ = SessionPhase::Serving;
 };

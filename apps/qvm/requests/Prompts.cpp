@@ -135,6 +135,7 @@ PromptEnd Prompts::attend(Prompt& prompt, unsigned batch) {
             if (host_.interrupted()) {
                 return PromptEnd::Raised;
             }
+            announcer_.flush();
             host_.unlocked(
                 [&] { came = queue_.wait(prompt.point, cancellation_.descriptor(), deadline, blocked.before()); });
         }

@@ -84,27 +84,38 @@ RequestQueue::Put RequestQueue::put(Request request) {
         entries_.insert(place, {std::move(request), bytes});
         bytes_ += bytes;
     }
-    changed_.raise();
     return Put::Taken;
 }
 
+bool RequestQueue::anyIsDue(DequeuePoint point) const {
+    return intake_ != Intake::Closed && std::any_of(entries_.begin(), entries_.end(),
+                                                    [point](const Entry& entry) { return isFreeAndDue(entry, point); });
+}
+
+bool RequestQueue::hasDue(DequeuePoint point) const {
+    const std::lock_guard lock(mutex_);
+    return anyIsDue(point);
+}
+
+// What wait() returns; empty when it is to wait.
+std::optional<RequestQueue::Wait> RequestQueue::look(DequeuePoint point) {
+    const std::lock_guard lock(mutex_);
+    if (anyIsDue(point)) {
+        return Wait::Due;
+    }
+    if (intake_ != Intake::Open) {
+        return Wait::Closed;
+    }
+    return std::exchange(interruptWait_, false) ? std::optional(Wait::Interrupted) : std::nullopt;
+}
+
 RequestQueue::Wait RequestQueue::wait(DequeuePoint point, int interrupt, Deadline deadline, const sigset_t* signals) {
-    const auto isMeant = [point](const Entry& entry) { return isFreeAndDue(entry, point); };
     for (;;) {
-        {
-            const std::lock_guard lock(mutex_);
-            if (intake_ == Intake::Closed) {
-                return Wait::Closed;
-            }
-            if (std::any_of(entries_.begin(), entries_.end(), isMeant)) {
-                return Wait::Due;
-            }
-            if (intake_ == Intake::Ended) {
-                return Wait::Closed;
-            }
-            if (std::exchange(interruptWait_, false)) {
-                return Wait::Interrupted;
-            }
+        // Said before the look, so that no change is missed.
+        waiting_ = true;
+        if (const std::optional<Wait> found = look(point)) {
+            waiting_ = false;
+            return *found;
         }
         timespec left{};
         if (deadline) {
@@ -122,8 +133,13 @@ RequestQueue::Wait RequestQueue::wait(DequeuePoint point, int interrupt, Deadlin
             watched[1].revents != 0) {
             return Wait::Interrupted;
         }
-        // Emptied before the next look at the entries, so that no change is missed.
         changed_.clear();
+    }
+}
+
+void RequestQueue::wake() {
+    if (waiting_.exchange(false)) {
+        changed_.raise();
     }
 }
 
@@ -197,7 +213,7 @@ void RequestQueue::interruptWait() {
         const std::lock_guard lock(mutex_);
         interruptWait_ = true;
     }
-    changed_.raise();
+    wake();
 }
 
 void RequestQueue::end() {
@@ -213,7 +229,7 @@ void RequestQueue::leave(Intake intake) {
         const std::lock_guard lock(mutex_);
         intake_ = std::max(intake_, intake);
     }
-    changed_.raise();
+    wake();
 }
 
 }  // namespace qvm

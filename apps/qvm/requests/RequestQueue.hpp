@@ -9,6 +9,7 @@
 
 #include <signal.h>
 
+#include <atomic>
 #include <chrono>
 #include <cstddef>
 #include <deque>
@@ -66,13 +67,20 @@ class RequestQueue {
 
     const Bounds& bounds() const noexcept { return bounds_; }
 
-    /// Adds a request behind the others, or one for the bootstrap before all of another mode. Never waits.
+    /// Adds a request behind the others, or one for the bootstrap before all of another mode. Never waits. wake() is to
+    /// follow: whoever waits is not to wake up and stand before a lock that the caller holds.
     Put put(Request request);
+
+    /// Has wait() look again. Without a system call when nobody waits.
+    void wake();
 
     /// Waits until a request is due at `point`. `interrupt` is a descriptor that ends the wait when it becomes
     /// readable, -1 for none. `signals` are blocked during the wait instead of those that the thread blocks now; null
     /// for no change.
     Wait wait(DequeuePoint point, int interrupt = -1, Deadline deadline = {}, const sigset_t* signals = nullptr);
+
+    /// Whether wait() would find a request that is due.
+    bool hasDue(DequeuePoint point) const;
 
     /// Ends the wait that is under way, or else the next one, unless that has a request.
     void interruptWait();
@@ -112,6 +120,8 @@ class RequestQueue {
         unsigned batch = 0;  // 0 for none
     };
 
+    bool anyIsDue(DequeuePoint point) const;  // with the mutex held
+    std::optional<Wait> look(DequeuePoint point);
     static bool isFreeAndDue(const Entry& entry, DequeuePoint point) noexcept;
     template <class Predicate>
     std::optional<Request> takeFirst(Predicate isMeant);
@@ -120,7 +130,8 @@ class RequestQueue {
     const Bounds bounds_;
     // Readable when something may have changed for wait(), so that the wait can watch another descriptor as well.
     foundation::core::posix::EventDescriptor changed_;
-    std::mutex mutex_;
+    std::atomic<bool> waiting_{false};  // changed_ is to be raised
+    mutable std::mutex mutex_;
     std::deque<Entry> entries_;
     std::size_t bytes_ = 0;
     Intake intake_ = Intake::Open;

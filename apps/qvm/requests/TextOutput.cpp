@@ -1,5 +1,6 @@
 #include "qvm/requests/TextOutput.hpp"
 
+#include <algorithm>
 #include <utility>
 
 #include "cmddistributor/IqmStreamID.hpp"
@@ -20,20 +21,14 @@ bool belongsToError(TextSource source) noexcept {
 
 }  // namespace
 
-TextOutput::TextOutput(Settings settings, Emit emit)
+TextOutput::TextOutput(Settings settings, Emit emit, Expect expect)
     : settings_(settings),
       emit_(std::move(emit)),
-      requestThread_(std::this_thread::get_id()),
-      timer_([this] { runTimer(); }) {}
+      expect_(std::move(expect)),
+      requestThread_(std::this_thread::get_id()) {}
 
 TextOutput::~TextOutput() {
-    {
-        const std::lock_guard lock(mutex_);
-        handOn();
-        ending_ = true;
-    }
-    changed_.notify_one();
-    timer_.join();
+    flush();
 }
 
 void TextOutput::begin(const Request& request) {
@@ -57,35 +52,37 @@ bool TextOutput::write(TextSource source, std::u16string_view text) {
     if (text.empty()) {
         return false;
     }
-    bool wake = false;
-    bool handedOn = false;
-    {
-        const std::lock_guard lock(mutex_);
-        const std::optional<TextTarget> target = route(source);
-        if (!target) {
-            return false;
-        }
-        handedOn = std::exchange(handedOnLate_, false);
-        // One piece is held for all targets, so that the order between them is the order of writing.
-        if (!held_.empty() && !(target_ == *target)) {
-            handedOn = handOn() || handedOn;
-        }
-        const bool sparing = target->stream != 0 && running_.back().message->getOkToFlushSparingly();
-        wake = held_.empty();
-        if (wake) {
-            target_ = *target;
-            due_ = Clock::now() + (sparing ? settings_.sparingDelay : settings_.delay);
-        }
-        held_ += text;
-        const bool lineEnds = !sparing && text.find(u'\n') != std::u16string_view::npos;
-        if (lineEnds || held_.size() >= settings_.flushUnits) {
-            handedOn = handOn() || handedOn;
-            wake = false;
-        }
+    const std::lock_guard lock(mutex_);
+    const std::optional<TextTarget> target = route(source);
+    if (!target) {
+        return false;
     }
-    if (wake) {
-        changed_.notify_one();
+    bool handedOn = std::exchange(handedOnLate_, false);
+    // One piece is held for all targets, so that the order between them is the order of writing.
+    if (!held_.empty() && !(target_ == *target)) {
+        handedOn = handOn() || handedOn;
     }
+    const bool sparing = target->stream != 0 && running_.back().message->getOkToFlushSparingly();
+    const bool lineEnds = !sparing && text.find(u'\n') != std::u16string_view::npos;
+    const bool first = held_.empty();
+    held_ += text;
+    if (!first && !lineEnds && held_.size() < settings_.flushUnits) {
+        return handedOn;
+    }
+    const Clock::time_point now = Clock::now();
+    if (first) {
+        target_ = *target;
+        due_ = now + (sparing ? settings_.sparingDelay : settings_.delay);
+    }
+    if (held_.size() >= settings_.flushUnits || (lineEnds && now >= nextLine_)) {
+        handedOn = handOn() || handedOn;
+        nextLine_ = now + settings_.lineGap;
+        return handedOn;
+    }
+    if (lineEnds) {
+        due_ = std::min(due_, nextLine_);
+    }
+    expect_(due_);
     return handedOn;
 }
 
@@ -149,16 +146,13 @@ bool TextOutput::handOn() {
     return true;
 }
 
-void TextOutput::runTimer() {
-    std::unique_lock lock(mutex_);
-    while (!ending_) {
-        if (held_.empty()) {
-            changed_.wait(lock);
-        } else if (changed_.wait_until(lock, due_) == std::cv_status::timeout && !held_.empty() &&
-                   Clock::now() >= due_) {
-            handedOnLate_ = handOn();
-        }
+FlushTimer::Time TextOutput::flushDue(FlushTimer::Time now) {
+    const std::lock_guard lock(mutex_);
+    if (!held_.empty() && due_ <= now) {
+        handedOnLate_ = handOn();
+        nextLine_ = Clock::now() + settings_.lineGap;
     }
+    return held_.empty() ? FlushTimer::never : due_;
 }
 
 }  // namespace qvm

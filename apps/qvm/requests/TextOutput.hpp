@@ -1,12 +1,12 @@
 // Text on its way from running code to the client.
 //
 // Whatever running code writes passes through here: it is assigned to the request that runs, or to none, held back
-// until a newline, an amount or a time, and handed on in the order of writing. The running requests are a stack,
-// because a prompt of one request evaluates others.
+// until a newline, an amount or a time, and handed on in the order of writing. Lines that follow each other closely are
+// handed on together; the first one after a silence does not wait. The running requests are a stack, because a prompt
+// of one request evaluates others.
 #pragma once
 
 #include <chrono>
-#include <condition_variable>
 #include <cstddef>
 #include <functional>
 #include <mutex>
@@ -20,6 +20,7 @@
 #include "foundation/vantor/carrier/framing/Frame.hpp"
 #include "krutil/io/SinkTraits.hpp"
 #include "krutil/io/StreamTypeEnum.hpp"
+#include "qvm/process/FlushTimer.hpp"
 #include "qvm/requests/Request.hpp"
 
 namespace qvm {
@@ -59,11 +60,14 @@ class TextOutput {
         std::size_t maxUnits = 32768;   ///< longest piece that is handed on, in UTF-16 units; at least 2
         std::chrono::milliseconds delay{20};
         std::chrono::milliseconds sparingDelay{200};  ///< for requests that may be flushed sparingly
+        std::chrono::milliseconds lineGap{1};         ///< lines that follow each other faster are handed on together
     };
 
-    /// The calling thread becomes the one whose text belongs to running requests. Starts a thread of its own, for what
-    /// is held back too long.
-    TextOutput(Settings settings, Emit emit);
+    /// Has flushDue() called at a time, or before; see FlushTimer::expect().
+    using Expect = std::function<void(FlushTimer::Time due)>;
+
+    /// The calling thread becomes the one whose text belongs to running requests.
+    TextOutput(Settings settings, Emit emit, Expect expect);
 
     /// Hands on what is held back.
     ~TextOutput();
@@ -80,36 +84,37 @@ class TextOutput {
     /// that comes meanwhile belongs to none.
     void suspend();
 
-    /// Takes well-formed UTF-16 text. Returns whether any text was handed on, by this call or by the thread of this
-    /// object since the last call.
+    /// Takes well-formed UTF-16 text. Returns whether any text was handed on, by this call or by flushDue() since the
+    /// last call.
     bool write(TextSource source, std::u16string_view text);
 
     /// Hands on what is held back; returns whether that was anything.
     bool flush();
 
+    /// Hands on what is due at `now`; returns when the rest is, FlushTimer::never if there is none.
+    FlushTimer::Time flushDue(FlushTimer::Time now);
+
     /// Traits of the running request's output sink; all false when none runs.
     krutil::io::SinkTraits outputTraits() const;
 
   private:
-    using Clock = std::chrono::steady_clock;
+    using Clock = FlushTimer::Clock;
 
     std::optional<TextTarget> route(TextSource source) const;
     bool handOn();
-    void runTimer();
 
     const Settings settings_;
     const Emit emit_;
+    const Expect expect_;
     const std::thread::id requestThread_;
 
     mutable std::mutex mutex_;
-    std::condition_variable changed_;
     std::vector<Request> running_;  // one without a message stands for a prompt
     TextTarget target_;
     std::u16string held_;
-    Clock::time_point due_;      // of the held text, when there is any
-    bool handedOnLate_ = false;  // by the timer, and no write() has told so yet
-    bool ending_ = false;
-    std::thread timer_;
+    Clock::time_point due_;       // of the held text, when there is any
+    Clock::time_point nextLine_;  // lines are handed on without waiting for others from then on
+    bool handedOnLate_ = false;   // by flushDue(), and no write() has told so yet
 };
 
 }  // namespace qvm

@@ -246,7 +246,12 @@ TEST_F(EvaluationTest, SparinglyFlushedOutputComesInFewEvents) {
     options.flushSparingly = true;
     const Evaluation result = client().eval("for i in range(100):\n    print(i)", options);
     EXPECT_LE(result.events.size(), 3U + 10U);
-    EXPECT_EQ(client().eval("for i in range(100):\n    print(f'{i}\\n', end='')").events.size(), 3U + 100U);
+}
+
+TEST_F(EvaluationTest, LinesThatAreApartComeInAnEventEach) {
+    const Evaluation result =
+        client().eval("import time\nfor i in range(100):\n    print(f'{i}\\n', end='')\n    time.sleep(0.0011)");
+    EXPECT_EQ(result.events.size(), 3U + 100U);
 }
 
 TEST_F(EvaluationTest, FlushIsHonoured) {

@@ -90,9 +90,11 @@ class PromptsTest : public testing::Test, protected qvm::PromptHost {
 
     ServedClient client_;
     RequestQueue queue_{{}};
-    qvm::TextOutput output_{{}, [this](const qvm::TextTarget& target, std::u16string text) {
+    qvm::TextOutput output_{{},
+                            [this](const qvm::TextTarget& target, std::u16string text) {
                                 client_.announcer().announceText(target, std::move(text));
-                            }};
+                            },
+                            [](qvm::FlushTimer::Time) {}};
     Cancellation cancellation_;
     qvm::Capabilities capabilities_{{Capability::InteractiveCommandLine, Capability::Debugging}};
     Prompts prompts_{queue_, client_.announcer(), output_, cancellation_, capabilities_, *this};

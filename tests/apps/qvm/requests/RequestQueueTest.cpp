@@ -170,7 +170,10 @@ TEST(RequestQueueTest, ClosedQueueRefusesAndStillGivesBackWhatItHas) {
     RequestQueue queue({});
     queue.put(numbered(1, DEQUEUE_AT_DEBUG_PROMPT));
     queue.put(numbered(2));
+    EXPECT_TRUE(queue.hasDue(DequeuePoint::Idle));
+    EXPECT_FALSE(queue.hasDue(DequeuePoint::Prompt));
     queue.close();
+    EXPECT_FALSE(queue.hasDue(DequeuePoint::Idle)) << "nothing is to be taken";
     EXPECT_EQ(queue.put(numbered(3)), RequestQueue::Put::Closed);
     EXPECT_EQ(queue.wait(DequeuePoint::Idle), RequestQueue::Wait::Closed);
     const std::vector<qvm::Request> rest = queue.takeAll();
@@ -221,7 +224,9 @@ TEST(RequestQueueTest, WaitEndsWhenADueRequestComes) {
     RequestQueue queue({});
     auto waited = std::async(std::launch::async, [&] { return queue.wait(DequeuePoint::DebugPrompt); });
     queue.put(numbered(1, DEQUEUE_AT_IDLE));
+    queue.wake();
     queue.put(numbered(2, DEQUEUE_AT_DEBUG_PROMPT));
+    queue.wake();
     EXPECT_EQ(waited.get(), RequestQueue::Wait::Due);
     EXPECT_EQ(queue.take(DequeuePoint::DebugPrompt)->id().lo(), 2U);
 }

@@ -97,7 +97,7 @@ void ServedClient::Engine::onMessage(qvm::framing::StreamID stream,
 
 ServedClient::ServedClient(const foundation::msg_svc::transport::layers::session::Limits& limits)
     : opened_(testing_sessions::openPair(configOf(Role::Client, limits), configOf(Role::Engine, {}))),
-      announcer_(*opened_.engine, diary_, log_) {
+      announcer_(*opened_.engine, diary_, log_, timer_) {
     opened_.engine->start(engineSaw_);
     opened_.client->start(clientSaw_);
 }

@@ -19,6 +19,9 @@ class ServedClient {
   public:
     /// `limits` are the client's.
     explicit ServedClient(const foundation::msg_svc::transport::layers::session::Limits& limits = {});
+    ~ServedClient() { timer_.stop(); }
+    ServedClient(const ServedClient&) = delete;
+    ServedClient& operator=(const ServedClient&) = delete;
 
     /// A request that the client has sent and the engine's end has received, so that its exchange is open.
     qvm::Request send(const RequestParts& parts);
@@ -54,6 +57,7 @@ class ServedClient {
     Client clientSaw_;
     Engine engineSaw_;
     testing_sessions::OpenedPair opened_;
+    qvm::FlushTimer timer_{[this](qvm::FlushTimer::Time now) { return announcer_.flushDue(now); }};
     qvm::Announcer announcer_;
 };
 

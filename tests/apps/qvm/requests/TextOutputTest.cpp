@@ -14,6 +14,7 @@ namespace {
 using cmddistributor::IqmStreamID;
 using krutil::io::SinkTraits;
 using krutil::io::StreamTypeEnum;
+using qvm::FlushTimer;
 using qvm::TextOutput;
 using qvm::TextSource;
 using qvm::TextTarget;
@@ -30,11 +31,22 @@ class TextOutputTest : public testing::Test {
     };
 
     void make(TextOutput::Settings settings) {
-        output_.emplace(settings, [this](const TextTarget& target, std::u16string text) {
-            const std::lock_guard lock(mutex_);
-            pieces_.push_back({target, std::move(text)});
-            arrived_.notify_all();
-        });
+        timer_.reset();
+        output_.emplace(
+            settings,
+            [this](const TextTarget& target, std::u16string text) {
+                const std::lock_guard lock(mutex_);
+                pieces_.push_back({target, std::move(text)});
+                arrived_.notify_all();
+            },
+            [this](FlushTimer::Time due) { timer_->expect(due); });
+        timer_.emplace([this](FlushTimer::Time now) { return output_->flushDue(now); });
+    }
+
+    void makeWithLineGap(std::chrono::milliseconds gap) {
+        TextOutput::Settings settings{8192, 32768, never, never};
+        settings.lineGap = gap;
+        make(settings);
     }
 
     void SetUp() override { make({8192, 32768, never, never}); }
@@ -61,6 +73,7 @@ class TextOutputTest : public testing::Test {
     std::condition_variable arrived_;
     std::vector<Piece> pieces_;
     std::optional<TextOutput> output_;
+    std::optional<FlushTimer> timer_;
 };
 
 TEST_F(TextOutputTest, NewlineHandsOnWhatIsHeld) {
@@ -69,6 +82,42 @@ TEST_F(TextOutputTest, NewlineHandsOnWhatIsHeld) {
     EXPECT_THAT(texts(), ElementsAre());
     EXPECT_TRUE(output_->write(TextSource::Output, u"c\nd"));
     EXPECT_THAT(texts(), ElementsAre(u"abc\nd"));
+}
+
+TEST_F(TextOutputTest, LinesThatFollowAreHandedOnTogether) {
+    makeWithLineGap(never);
+    EXPECT_TRUE(output_->write(TextSource::Output, u"first\n"));
+    EXPECT_FALSE(output_->write(TextSource::Output, u"second\n"));
+    EXPECT_FALSE(output_->write(TextSource::Output, u"third\n"));
+    EXPECT_THAT(texts(), ElementsAre(u"first\n"));
+    EXPECT_TRUE(output_->flush());
+    EXPECT_THAT(texts(), ElementsAre(u"first\n", u"second\nthird\n"));
+}
+
+TEST_F(TextOutputTest, LineAfterASilenceDoesNotWait) {
+    makeWithLineGap(std::chrono::milliseconds(0));
+    EXPECT_TRUE(output_->write(TextSource::Output, u"first\n"));
+    EXPECT_TRUE(output_->write(TextSource::Output, u"second\n"));
+    EXPECT_THAT(texts(), ElementsAre(u"first\n", u"second\n"));
+}
+
+TEST_F(TextOutputTest, LinesThatFollowAreHandedOnWhenNothingFollowsThem) {
+    makeWithLineGap(std::chrono::milliseconds(1));
+    output_->write(TextSource::Output, u"first\n");
+    output_->write(TextSource::Output, u"second\n");
+    awaitPieces(2);
+    EXPECT_THAT(texts(), ElementsAre(u"first\n", u"second\n"));
+}
+
+TEST_F(TextOutputTest, LineThatWaitsIsHandedOnBeforeTextForAnotherTarget) {
+    makeWithLineGap(never);
+    output_->begin(makeRequest());
+    output_->write(TextSource::Output, u"first\n");
+    output_->write(TextSource::Output, u"second\n");
+    EXPECT_TRUE(output_->write(TextSource::Error, u"third\n"));
+    EXPECT_THAT(texts(), ElementsAre(u"first\n", u"second\n"));
+    output_->end();
+    EXPECT_THAT(texts(), ElementsAre(u"first\n", u"second\n", u"third\n"));
 }
 
 TEST_F(TextOutputTest, EmptyTextIsNothing) {

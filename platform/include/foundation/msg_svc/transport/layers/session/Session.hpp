@@ -7,6 +7,7 @@
 
 #include <boost/shared_ptr.hpp>
 #include <chrono>
+#include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <string>
@@ -96,8 +97,12 @@ class Session {
     /// What a message is to the sender.
     enum class Urgency {
         Output,  ///< the sender applies back-pressure with waitForRoom() or waitUntilWritten()
+        Held,    ///< output that may wait for what follows, so that both leave in one write
         Answer,  ///< posted by the handler, which must not wait; see SessionConfig::maxPendingAnswers
     };
+
+    /// Bytes of held messages with which these are written.
+    static constexpr std::size_t heldBytes = 16'384;
 
     /// Serializes an object and hands it to the stream: written at once as far as the stream takes it, the rest by the
     /// I/O thread. Never blocks. Order on the wire is the order of the calls. After the session's end these do nothing.
@@ -110,6 +115,11 @@ class Session {
               Urgency urgency = Urgency::Output);
     void send(framing::StreamID stream, const boost::shared_ptr<const eventmgr::BaseEvent>& event,
               Urgency urgency = Urgency::Output);
+
+    /// Writes what was sent with Urgency::Held, as far as the stream takes it. The same happens with the next message
+    /// that is not held, when heldBytes are held, and before a wait for the stream. Whoever sends held messages calls
+    /// this when nothing follows soon.
+    void sendHeld();
 
     /// Waits until no more than roomBytes are unwritten, the session is over, or `interrupt` (a descriptor, -1 for
     /// none) becomes readable; returns false in the last case only. Returns at once, without a system call, when there

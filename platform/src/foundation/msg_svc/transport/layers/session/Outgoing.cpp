@@ -9,6 +9,8 @@
 #include <system_error>
 #include <utility>
 
+#include "foundation/msg_svc/transport/layers/session/Session.hpp"
+
 namespace foundation::msg_svc::transport::layers::session {
 
 Outgoing::Outgoing(asio::io_context& io, core::posix::OwnedDescriptor& descriptor, std::size_t roomBytes, Owner& owner)
@@ -18,34 +20,66 @@ Outgoing::Outgoing(asio::io_context& io, core::posix::OwnedDescriptor& descripto
     updateEvents();
 }
 
-std::vector<OutgoingPieces> Outgoing::push(OutgoingPieces&& message) {
+Outgoing::Total Outgoing::totalOf(const std::vector<OutgoingPieces>& messages) {
+    Total total;
+    for (const OutgoingPieces& message : messages) {
+        total.bytes += message.bytes();
+        total.answers += message.answer() ? 1 : 0;
+    }
+    return total;
+}
+
+std::vector<OutgoingPieces> Outgoing::push(OutgoingPieces&& message, Hold hold) {
     std::vector<OutgoingPieces> done;
     const std::lock_guard lock(mutex_);
     if (!isOpen()) {
         return done;
     }
-    const std::size_t bytes = message.bytes();
-    const bool answer = message.answer();
+    unwritten_ += message.bytes();
+    answersOwed_ += message.answer() ? 1 : 0;
     queue_.push(std::move(message));
-    const int error = queue_.size() == 1 ? queue_.writeOnce(descriptor_, done) : 0;
-    if (error != 0 && error != EAGAIN) {
-        state_ = State::Failed;
-        asio::post(io_, [this, error] { fail(error); });
+    if (!writerAwake_ && (hold == Hold::No || unwritten_ >= Session::heldBytes)) {
+        write(done);
     }
     if (!queue_.empty()) {
         queue_.back().detachUnshareable();
-        unwritten_ += bytes;
-        answersOwed_ += answer ? 1 : 0;
-        updateEvents();
-        if (!writerAwake_ && isOpen()) {
-            writerAwake_ = true;
-            asio::post(io_, [this] { armWrite(); });
-        }
     }
+    uncount(totalOf(done));
     return done;
 }
 
+// With the mutex held.
+void Outgoing::write(std::vector<OutgoingPieces>& written) {
+    const int error = queue_.writeOnce(descriptor_, written);
+    if (error != 0 && error != EAGAIN) {
+        state_ = State::Failed;
+        asio::post(io_, [this, error] { fail(error); });
+    } else if (!queue_.empty()) {
+        writerAwake_ = true;
+        asio::post(io_, [this] { armWrite(); });
+    }
+}
+
+void Outgoing::sendHeld() {
+    std::vector<OutgoingPieces> done;
+    {
+        const std::lock_guard lock(mutex_);
+        if (isOpen() && !writerAwake_ && !queue_.empty()) {
+            write(done);
+        }
+    }
+    drop(done);
+}
+
+bool Outgoing::waitForRoom(int interrupt) {
+    if (!room_.holds()) {
+        sendHeld();
+    }
+    return waitFor(room_, interrupt);
+}
+
 bool Outgoing::waitUntilWritten(int interrupt) {
+    sendHeld();
     {
         // Other threads may go on sending, which must not prolong the wait.
         const std::lock_guard lock(mutex_);
@@ -87,24 +121,24 @@ void Outgoing::updateEvents() {
     allWritten_.set(over || awaited_ == 0);
 }
 
+// With the mutex held.
+void Outgoing::uncount(Total written) {
+    unwritten_ -= written.bytes;
+    // Messages are written in the order in which they were handed over, so the awaited ones are the first.
+    awaited_ -= std::min(awaited_, written.bytes);
+    answersOwed_ -= written.answers;
+    updateEvents();
+}
+
 // Only when the frames are gone do their bytes stop counting: whoever waits for the stream finds the buffers released.
 void Outgoing::drop(std::vector<OutgoingPieces>& messages) {
     if (messages.empty()) {
         return;
     }
-    std::size_t bytes = 0;
-    std::size_t answers = 0;
-    for (const OutgoingPieces& message : messages) {
-        bytes += message.bytes();
-        answers += message.answer() ? 1 : 0;
-    }
+    const Total total = totalOf(messages);
     messages.clear();
     const std::lock_guard lock(mutex_);
-    unwritten_ -= bytes;
-    // Messages are written in the order in which they were handed over, so the awaited ones are the first.
-    awaited_ -= std::min(awaited_, bytes);
-    answersOwed_ -= answers;
-    updateEvents();
+    uncount(total);
 }
 
 void Outgoing::armWrite() {

@@ -1,5 +1,8 @@
 // The way out of a session: what was handed over is written in order, at once as far as the stream takes it, the rest
 // by the I/O thread. Nobody waits for a write unless they ask to.
+//
+// A message may be held, for one write together with what follows. What is held is unwritten like all that waits for
+// the stream, so it counts against the room, and whoever waits for the stream sends it first.
 #pragma once
 
 #include <atomic>
@@ -40,14 +43,19 @@ class Outgoing {
     /// Whether messages are taken. False after an error and after finish().
     bool isOpen() const noexcept { return state_.load(std::memory_order_acquire) == State::Open; }
 
-    /// Writes a message, or puts it behind those that are unwritten. Returns what has been written at once, for the
-    /// caller to drop where it holds no lock: deleters of frames are their owners' code. A message that is not taken
-    /// stays the caller's.
-    [[nodiscard]] std::vector<OutgoingPieces> push(OutgoingPieces&& message);
+    enum class Hold { No, Yes };
+
+    /// Writes a message behind those that are held, or puts it behind those that are unwritten. With Hold::Yes it is
+    /// held, until Session::heldBytes are. Returns what has been written at once, for the caller to drop where it holds
+    /// no lock: deleters of frames are their owners' code. A message that is not taken stays the caller's.
+    [[nodiscard]] std::vector<OutgoingPieces> push(OutgoingPieces&& message, Hold hold = Hold::No);
+
+    /// Writes what is held.
+    void sendHeld();
 
     /// Waits until no more than `roomBytes` are unwritten, nothing is taken any more, or `interrupt` (a descriptor, -1
     /// for none) becomes readable; returns false in the last case only. Not from the I/O thread.
-    bool waitForRoom(int interrupt) const { return waitFor(room_, interrupt); }
+    bool waitForRoom(int interrupt);
 
     /// The same until all is written that was handed over before the call.
     bool waitUntilWritten(int interrupt);
@@ -84,8 +92,16 @@ class Outgoing {
     // Open -> Finishing -> Closed; Failed may come before each of the last two.
     enum class State { Open, Finishing, Failed, Closed };
 
+    struct Total {
+        std::size_t bytes = 0;
+        std::size_t answers = 0;
+    };
+    static Total totalOf(const std::vector<OutgoingPieces>& messages);
+
     static bool waitFor(const LevelEvent& event, int interrupt);
     void updateEvents();
+    void write(std::vector<OutgoingPieces>& written);
+    void uncount(Total written);
     void drop(std::vector<OutgoingPieces>& messages);
     void armWrite();
     void fail(int error);
@@ -104,8 +120,8 @@ class Outgoing {
     mutable std::mutex mutex_;
     OutgoingQueue queue_;
     std::size_t unwritten_ = 0;
-    std::size_t awaited_ = 0;  ///< of these, what was there when somebody began to wait for it
-    bool writerAwake_ = false;
+    std::size_t awaited_ = 0;   ///< of these, what was there when somebody began to wait for it
+    bool writerAwake_ = false;  ///< the I/O thread writes; without it, what is in the queue is held
 };
 
 }  // namespace foundation::msg_svc::transport::layers::session

@@ -15,7 +15,7 @@ namespace {
 // Bounds of one gathered write. The bytes are bounded because writes happen under the session's lock, and a peer that
 // reads as fast as this end writes would otherwise keep it locked for the whole of a large message.
 constexpr std::size_t mostBytes = 1U << 20;
-constexpr std::size_t mostPieces = 64;
+constexpr std::size_t mostPieces = 1024;  // IOV_MAX
 
 }  // namespace
 

@@ -55,7 +55,8 @@ class Session::Impl final : private Incoming::Owner, private Outgoing::Owner {
     template <class T>
     void send(framing::StreamID stream, const Shared<T>& object, Urgency urgency);
     void sayGoodbye();
-    bool waitForRoom(int interrupt) const { return abandoned || outgoing_.waitForRoom(interrupt); }
+    void sendHeld();
+    bool waitForRoom(int interrupt) { return abandoned || outgoing_.waitForRoom(interrupt); }
     bool waitUntilWritten(int interrupt) { return abandoned || outgoing_.waitUntilWritten(interrupt); }
     void close(std::chrono::milliseconds patience);
     void abort(const std::string& text);
@@ -78,7 +79,7 @@ class Session::Impl final : private Incoming::Owner, private Outgoing::Owner {
 
     // Any thread. `say` runs with the mutex of the exchanges held; it may throw, or return false to send nothing.
     template <class Say>
-    void submit(OutgoingPieces message, Say say);
+    void submit(OutgoingPieces message, Outgoing::Hold hold, Say say);
     bool isDone(Role role) const;
 
     // I/O thread.
@@ -170,28 +171,36 @@ void Session::Impl::send(framing::StreamID stream, const Shared<T>& object, Urge
             config.trace({true, frame == frames.back(), *frame});
         }
     }
-    submit(OutgoingPieces(std::move(frames), urgency == Urgency::Answer, shared_ ? &shared_->lender : nullptr), [&] {
-        const T& referenced = *object;
-        const Saying saying = sayingOf(referenced, config);
-        if (const auto refusal = exchanges_.exchanges.send(saying, stream)) {
-            throw std::logic_error("Session::send: " +
-                                   refusalToSend(*refusal, saying, config.role, stream, typeid(referenced)));
-        }
-        if (saying == Saying::Shutdown && shared_) {
-            // Nothing follows it. The end of the session gives back what is left.
-            shared_->borrower.close();
-        }
-        return true;
-    });
+    const Outgoing::Hold hold = urgency == Urgency::Held ? Outgoing::Hold::Yes : Outgoing::Hold::No;
+    submit(OutgoingPieces(std::move(frames), urgency == Urgency::Answer, shared_ ? &shared_->lender : nullptr), hold,
+           [&] {
+               const T& referenced = *object;
+               const Saying saying = sayingOf(referenced, config);
+               if (const auto refusal = exchanges_.exchanges.send(saying, stream)) {
+                   throw std::logic_error("Session::send: " +
+                                          refusalToSend(*refusal, saying, config.role, stream, typeid(referenced)));
+               }
+               if (saying == Saying::Shutdown && shared_) {
+                   // Nothing follows it. The end of the session gives back what is left.
+                   shared_->borrower.close();
+               }
+               return true;
+           });
 }
 
 template <class Say>
-void Session::Impl::submit(OutgoingPieces message, Say say) {
+void Session::Impl::submit(OutgoingPieces message, Outgoing::Hold hold, Say say) {
     // Dropped when the lock is released.
     std::vector<OutgoingPieces> done;
     const std::lock_guard lock(exchanges_.mutex);
     if (outgoing_.isOpen() && say()) {
-        done = outgoing_.push(std::move(message));
+        done = outgoing_.push(std::move(message), hold);
+    }
+}
+
+void Session::Impl::sendHeld() {
+    if (!abandoned) {
+        outgoing_.sendHeld();
     }
 }
 
@@ -199,7 +208,7 @@ void Session::Impl::sayGoodbye() {
     if (abandoned) {
         return;
     }
-    submit(OutgoingPieces(FrameKind::Goodbye, {}), [this] {
+    submit(OutgoingPieces(FrameKind::Goodbye, {}), Outgoing::Hold::No, [this] {
         const auto refusal = exchanges_.exchanges.send(Saying::Goodbye, 0);
         if (refusal == Refusal::WrongSpeaker) {
             throw std::logic_error("Session::sayGoodbye: " +
@@ -311,6 +320,7 @@ void Session::Impl::beginClose(std::chrono::milliseconds patience) {
     if (!advance(Stage::Closing) && stage_ != Stage::Closing) {
         return;
     }
+    outgoing_.sendHeld();
     if (outgoing_.isDrained() || outgoing_.hasFailed()) {
         finish(ownEnd(), {});
         return;
@@ -352,6 +362,7 @@ void Session::Impl::finish(SessionEnd end, const std::string& abortReason) {
     }
     end_ = std::move(end);
     incoming_.stop();
+    outgoing_.sendHeld();
     std::optional<OutgoingPieces> abort;
     if (!abortReason.empty()) {
         // A replaced byte takes three, so a quarter of the longest reason always fits.
@@ -446,6 +457,10 @@ void Session::send(framing::StreamID stream, const Shared<exchange::Reply>& repl
 
 void Session::send(framing::StreamID stream, const Shared<eventmgr::BaseEvent>& event, Urgency urgency) {
     impl_->send(stream, event, urgency);
+}
+
+void Session::sendHeld() {
+    impl_->sendHeld();
 }
 
 bool Session::waitForRoom(int interrupt) {
