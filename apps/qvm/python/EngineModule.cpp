@@ -8,6 +8,7 @@
 #include <array>
 #include <chrono>
 #include <cstring>
+#include <exception>
 #include <new>
 #include <optional>
 #include <string>
@@ -128,6 +129,8 @@ PyObject* writeMethod(PyObject* /*module*/, PyObject* text) noexcept {
         error.set_error();
     } catch (const std::bad_alloc&) {
         PyErr_NoMemory();
+    } catch (const std::exception& error) {
+        PyErr_SetString(PyExc_RuntimeError, error.what());
     }
     return nullptr;
 }
