@@ -81,10 +81,21 @@ def record(question, results):
         save(RECORD, dict(sorted({**load_record(), question.name: medians}.items())))
 
 
+def published():
+    """The sections of the document of figures, by the title of their question."""
+    try:
+        with open(os.path.join(FIGURES, "figures.md"), encoding="utf-8") as stream:
+            sections = stream.read().split("\n### ")[1:]
+    except FileNotFoundError:
+        return {}
+    return {section.partition("\n")[0]: "### " + section.rstrip() + "\n" for section in sections}
+
+
 def publish(out):
     """Writes the tables of all questions that were ever answered there into the document of figures, with the pictures
-    of those that go through sizes."""
+    of those that go through sizes. What the document says about other questions stays."""
     os.makedirs(FIGURES, exist_ok=True)
+    before = published()
     parts = ["# Figures", "What `./scripts/bench --record` has measured last; [performance.md](../performance.md) tells "
              "how, and what the figures mean.\n"]
     for question in QUESTIONS:
@@ -96,6 +107,8 @@ def publish(out):
             if question.axis:
                 shutil.copy(os.path.join(out, question.name + ".svg"), FIGURES)
                 parts.append(f"![{question.name}]({question.name}.svg)\n")
+        elif question.title in before:
+            parts.append(before[question.title])
     with open(os.path.join(FIGURES, "figures.md"), "w", encoding="utf-8") as stream:
         stream.write("\n".join(parts))
 
