@@ -51,7 +51,7 @@ class NestedWriter {
 
     template <class Family>
     static const Family& cast(const SerializerBase& serializer) {
-        const Family* const found = familyCast<Family>(serializer);
+        const auto* const found = familyCast<Family>(serializer);
         if (found == nullptr) {
             throw std::bad_cast();
         }
