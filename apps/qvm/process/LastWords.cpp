@@ -16,13 +16,13 @@ constexpr std::array endings{SIGHUP,  SIGINT,  SIGQUIT, SIGILL,  SIGTRAP, SIGABR
                              SIGFPE,  SIGUSR1, SIGSEGV, SIGUSR2, SIGALRM, SIGTERM,  SIGSTKFLT,
                              SIGXCPU, SIGPROF, SIGPOLL, SIGPWR,  SIGSYS,  SIGVTALRM};
 
-std::atomic<FlushTimer*> current{nullptr};
+std::atomic<FlushTimer*> sender{nullptr};
 
 // Its action is the default one again. A fault repeats itself when this returns; any other signal comes once more.
 void sendAndEnd(int number) {
     const int before = errno;
     if (!inForkedChild()) {
-        if (FlushTimer* const timer = current.exchange(nullptr)) {
+        if (FlushTimer* const timer = sender.exchange(nullptr)) {
             timer->flushAll();
         }
     }
@@ -40,16 +40,16 @@ LastWords::LastWords(FlushTimer& timer) {
         stack = {spare.data(), 0, spare.size()};
         ::sigaltstack(&stack, nullptr);
     }
-    current = &timer;
+    sender = &timer;
     keep();
 }
 
 LastWords::~LastWords() {
-    current = nullptr;
+    sender = nullptr;
 }
 
 void LastWords::keep() noexcept {
-    if (current.load() == nullptr) {
+    if (sender.load() == nullptr) {
         return;
     }
     struct sigaction action {};
