@@ -4,11 +4,10 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <boost/algorithm/string/trim.hpp>
 #include <cctype>
-#include <cerrno>
 #include <filesystem>
 #include <fstream>
-#include <optional>
 #include <stdexcept>
 #include <string_view>
 #include <system_error>
@@ -21,16 +20,6 @@ namespace fs = std::filesystem;
 const std::string& embeddedVersion() {
     static const std::string version = std::to_string(PY_MAJOR_VERSION) + "." + std::to_string(PY_MINOR_VERSION);
     return version;
-}
-
-std::string trimmed(std::string_view text) {
-    const auto isBlank = [](unsigned char c) { return std::isspace(c) != 0; };
-    const auto* const begin = std::find_if_not(text.begin(), text.end(), isBlank);
-    const auto* end = text.end();
-    while (end != begin && isBlank(static_cast<unsigned char>(*(end - 1)))) {
-        --end;
-    }
-    return {begin, end};
 }
 
 // "3.11" of "3.11.2"; empty for a text that is no version.
@@ -52,9 +41,9 @@ std::string versionInFile(const fs::path& file) {
         if (sign == std::string::npos) {
             continue;
         }
-        const std::string key = trimmed(std::string_view(line).substr(0, sign));
+        const std::string key = boost::algorithm::trim_copy(line.substr(0, sign));
         if (key == "version" || key == "version_info") {
-            return minorVersion(trimmed(std::string_view(line).substr(sign + 1)));
+            return minorVersion(boost::algorithm::trim_copy(line.substr(sign + 1)));
         }
     }
     return {};
