@@ -2,7 +2,6 @@
 
 #include <pybind11/embed.h>
 
-#include <marshal.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -10,7 +9,7 @@
 #include <stdexcept>
 #include <string>
 
-#include "qvm/python/QvmModuleCode.hpp"
+#include "qvm/python/EngineModules.hpp"
 
 namespace py = pybind11;
 
@@ -49,6 +48,7 @@ void initialize(const PythonConfig& world) {
         config.configure_c_stdio = 0;
     }
     config.install_signal_handlers = 1;
+    PyImport_FrozenModules = engineModules();
     PyStatus status = PyConfig_SetBytesString(&config, &config.program_name, world.program.c_str());
     if (PyStatus_Exception(status) == 0) {
         status = Py_InitializeFromConfig(&config);
@@ -66,24 +66,12 @@ void loading(const std::function<void()>& act) {
     }
 }
 
-void loadModule() {
-    const auto code = py::reinterpret_steal<py::object>(
-        PyMarshal_ReadObjectFromString(moduleCode().data(), static_cast<Py_ssize_t>(moduleCode().size())));
-    if (!code) {
-        throw py::error_already_set();
-    }
-    const auto module = py::reinterpret_steal<py::object>(PyImport_ExecCodeModule("qvm", code.ptr()));
-    if (!module) {
-        throw py::error_already_set();
-    }
-}
-
 }  // namespace
 
 void startPython(const PythonConfig& world) {
     if (Py_IsInitialized() == 0) {
         initialize(world);
-        loading(loadModule);
+        loading([] { py::module_::import("qvm"); });
     }
 }
 
