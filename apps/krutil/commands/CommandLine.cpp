@@ -2,10 +2,12 @@
 
 #include <CLI/CLI.hpp>
 #include <algorithm>
+#include <array>
 #include <map>
 #include <memory>
 #include <sstream>
 #include <string>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -188,6 +190,13 @@ void addRepl(CLI::App& app, Options& options, ReplOptions& repl) {
     command->callback([&options, &repl] { options.command = repl; });
 }
 
+// Options without a command are those of the one that needs no name.
+bool beginsOptionsOfRepl(const std::string& argument) {
+    constexpr std::array<std::string_view, 3> ofTheProgram{"-h", "--help", "--version"};
+    return argument.starts_with('-') && argument != "--" &&
+           std::find(ofTheProgram.begin(), ofTheProgram.end(), argument) == ofTheProgram.end();
+}
+
 constexpr const char* argumentForms = R"(Arguments:
   7  3.5  1e3  1+2j  true       a number or a truth value
   [1,2,3]  [[1,2.5],[3,4]]      an array, with one dimension for each level of lists
@@ -264,8 +273,10 @@ std::variant<Options, Finished> parseCommandLine(int argc, const char* const* ar
     EvalOptions run;
     ReplOptions repl;
     options.command = repl;
-    CLI::App app("Evaluates code on an engine in another process. Without a command, code is read line by line.",
-                 "krutil");
+    CLI::App app(
+        "Evaluates code on an engine in another process. Without a command, code is read line by line; the options are "
+        "those of repl.",
+        "krutil");
     app.set_version_flag("--version", apps::buildString("krutil"), "Print the version and exit");
     app.set_help_flag("-h,--help", "Print this help and exit");
     app.require_subcommand(0, 1);
@@ -278,6 +289,9 @@ std::variant<Options, Finished> parseCommandLine(int argc, const char* const* ar
     addRepl(app, options, repl);
     try {
         auto arguments = withLiteralsKept(app, argc, argv);
+        if (!arguments.empty() && beginsOptionsOfRepl(arguments.front())) {
+            arguments.insert(arguments.begin(), "repl");
+        }
         std::reverse(arguments.begin(), arguments.end());
         app.parse(std::move(arguments));
     } catch (const CLI::ParseError& error) {

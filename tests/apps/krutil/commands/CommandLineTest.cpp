@@ -138,6 +138,19 @@ TEST(CommandLineTest, WithoutACommandLinesAreRead) {
               "krutil: --color: red not in {always,auto,never}\nRun krutil --help for help.\n");
 }
 
+TEST(CommandLineTest, OptionsWithoutACommandAreThoseOfRepl) {
+    const Options options = std::get<Options>(parse({"--connect", "/run/x", "--no-history"}));
+    EXPECT_TRUE(std::get<ReplOptions>(options.command).noHistory);
+    EXPECT_EQ(options.connection.socket, "/run/x");
+    EXPECT_EQ(std::get<Options>(parse({"--engine=an engine"})).connection.engine, "an engine");
+    EXPECT_EQ(parseFinished({"--conect", "/run/x"}).code, ExitCode::Usage);
+    EXPECT_THAT(parseFinished({"--conect"}).err, HasSubstr("--conect"));
+    // A command has its own options behind its name.
+    const Finished before = parseFinished({"--connect", "/run/x", "eval", "1"});
+    EXPECT_EQ(before.code, ExitCode::Usage);
+    EXPECT_THAT(before.err, HasSubstr("eval"));
+}
+
 TEST(CommandLineTest, AProgramHasArguments) {
     const Options options = std::get<Options>(parse({"run", "--no-precheck", "a.py", "--", "-b", "c", "-d"}));
     EXPECT_TRUE(options.connection.noPrecheck);
