@@ -65,8 +65,13 @@ py::dtype dtypeOf(ElementType element) {
 // The module, which everything below needs that is neither text nor a number. The headers of NumPy 1 look into its
 // objects, which another major version lays out differently.
 py::module_ numpyModule() {
+    static PyObject* const name = PyUnicode_InternFromString("numpy");
     static bool fits = false;
-    py::module_ numpy;
+    // An import takes longer than a look at the modules that are there, even of one of them.
+    auto numpy = py::reinterpret_steal<py::module_>(fits ? PyImport_GetModule(name) : nullptr);
+    if (numpy && !numpy.is_none()) {
+        return numpy;
+    }
     try {
         numpy = py::module_::import("numpy");
     } catch (py::error_already_set& error) {

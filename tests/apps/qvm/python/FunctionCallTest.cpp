@@ -146,6 +146,20 @@ TEST_F(FunctionCallTest, CallerIsTheSession) {
     EXPECT_TRUE(call("sys._getframe", {}, 0).empty());
 }
 
+TEST_F(FunctionCallTest, ShortCallsNeitherCompileNorImport) {
+    run("import builtins, sys\n"
+        "callers, imported = [], []\n"
+        "def look(array): callers.append(sys._getframe(1).f_code)\n"
+        "def noting(name, *others, importing=builtins.__import__):\n"
+        "    imported.append(name)\n"
+        "    return importing(name, *others)\n");
+    call("look", {doubles({1})}, 0);
+    run("builtins.__import__, kept = noting, builtins.__import__");
+    call("look", {doubles({2})}, 0);
+    run("builtins.__import__ = kept");
+    EXPECT_EQ(show("len(callers), callers[0] is callers[1], imported"), "(2, True, [])");
+}
+
 TEST_F(FunctionCallTest, ArgumentsAreReleasedAfterTheCall) {
     const std::size_t before = BufferAllocator::inUse();
     std::vector<Array> arguments;
