@@ -139,8 +139,10 @@ void EngineClient::onReply(session::framing::StreamID /*stream*/,
         failure_ = result->getException()->GetID();
     }
     lastReply_ = reply;
-    ++answered_;
-    answered_.notify_one();
+    // Whoever waits, waits for all: of many replies that come together, the last one wakes it up.
+    if (++answered_ == sent_) {
+        answered_.notify_one();
+    }
 }
 
 void EngineClient::onEvent(session::framing::StreamID /*stream*/,

@@ -71,7 +71,7 @@ class EngineClient : private session::SessionHandler {
     void awaitReplies();
 
     krutil_client::EngineProcess engine_;
-    std::size_t sent_ = 0;
+    std::atomic<std::size_t> sent_{0};
 
     // Written by the session's thread before `answered_`, which this thread waits for.
     std::u16string text_;
