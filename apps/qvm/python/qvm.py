@@ -18,6 +18,7 @@ import time as _time
 import warnings as _warnings
 import _signal
 import _warnings as _c_warnings
+from _collections import OrderedDict as _OrderedDict
 from errno import EINVAL as _EINVAL
 from os import path as _path
 from os import strerror as _strerror
@@ -402,7 +403,7 @@ def _set_user_mask(how, mask):
 # Sources of evaluated code, for tracebacks and inspection: the newest, by number and by length.
 _MAX_SOURCES = 1000
 _MAX_SOURCE_LENGTH = 16 << 20
-_source_lengths = {}
+_source_lengths = _OrderedDict()  # a plain one is searched for its first entry
 _source_length = 0
 # What linecache.cache is, once that module is imported.
 _source_lines = {}
@@ -414,17 +415,36 @@ def _remember(filename, source):
     _source_lengths[filename] = len(source)
     _source_length += len(source)
     while len(_source_lengths) > _MAX_SOURCES or _source_length > _MAX_SOURCE_LENGTH:
-        oldest = next(iter(_source_lengths))
-        _source_length -= _source_lengths.pop(oldest)
+        oldest, length = _source_lengths.popitem(last=False)
+        _source_length -= length
         _source_lines.pop(oldest, None)
     if filename in _source_lengths:
         # Without a modification time an entry is never looked up in the file system.
         _source_lines[filename] = (len(source), None, source.splitlines(True), filename)
 
 
+# Keywords that only statements begin with.
+_STATEMENTS = frozenset(("assert", "break", "class", "continue", "def", "del", "for", "from", "global", "if", "import",
+                         "nonlocal", "pass", "raise", "return", "try", "while", "with"))
+
+
+def _is_statement(line):
+    """Whether the begin of a line shows that it is one statement and no expression, if it is well-formed at all."""
+    if ";" in line or "\r" in line:
+        return False
+    name, equals, value = line.partition("=")
+    if equals and not value.startswith("=") and name.strip().isidentifier():
+        return True
+    words = line.split(None, 1)
+    return bool(words) and words[0] in _STATEMENTS
+
+
 def _compile_block(source, filename):
     """Code of the statements and of a trailing expression; either may be None."""
     if "\n" not in source.rstrip():
+        if _is_statement(source):
+            # Quicker than to try it as an expression, and to look at its tree then.
+            return _compile_program(source, filename)
         expression = _qvm.compile_expression(source, filename)
         if expression is not None:
             return None, expression

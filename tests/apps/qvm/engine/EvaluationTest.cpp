@@ -3,6 +3,8 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <utility>
+#include <vector>
 
 #include "apps/qvm/fixture/EngineFixture.hpp"
 #include "krutil/io/TextBaseEvent.hpp"
@@ -84,6 +86,45 @@ TEST_F(EvaluationTest, BlockShowsTheValueOfATrailingExpression) {
     EXPECT_EQ(client().eval("x = 6").shown(), "");
     EXPECT_EQ(client().eval("1\n2\n3").shown(), "3\n");
     EXPECT_EQ(client().eval("").kinds().size(), 3U);
+}
+
+TEST_F(EvaluationTest, LineThatBeginsLikeAStatementShowsWhatTheParserFinds) {
+    const std::vector<std::pair<const char*, const char*>> lines{
+        {"pass", ""},
+        {"  ", ""},
+        {"x = 6\n\n", ""},
+        {"x == 6", "True\n"},
+        {"x= 7; x", "7\n"},
+        {"x = 8\rx", "8\n"},
+        {"import sys; sys is None", "False\n"},
+        {"if x: x", ""},
+        {"not x", "False\n"},
+        {"*[1], x", "(1, 8)\n"},
+        {"x; pass", ""},
+    };
+    for (const auto& [line, shown] : lines) {
+        const Evaluation result = client().eval(line);
+        EXPECT_FALSE(result.error) << line;
+        EXPECT_EQ(result.shown(), shown) << line;
+    }
+    for (const char* const line : {"pass 1", "  x = 1", "lambda = 1", "x = "}) {
+        const Evaluation result = client().eval(line);
+        ASSERT_TRUE(result.error) << line;
+        EXPECT_EQ(result.error->getExecutionStatus(), krutil::cmddistributor::inCOMPILE_ERROR) << line;
+    }
+}
+
+TEST_F(EvaluationTest, PlainStatementIsCompiledOnce) {
+    client().eval(
+        "import sys\n"
+        "compiled = []\n"
+        "sys.addaudithook(lambda event, arguments: compiled.append(arguments) if event == 'compile' else None)");
+    for (const char* const statement : {"pass", "y = 5", "import sys", "for i in range(3): i"}) {
+        client().eval("compiled.clear()");
+        client().eval(statement);
+        // The question is the second of them.
+        EXPECT_EQ(client().eval("len(compiled)").shown(), "2\n") << statement;
+    }
 }
 
 TEST_F(EvaluationTest, NoneIsNotShown) {
