@@ -31,6 +31,12 @@ peer_packages=(
     libgrpc++-dev protobuf-compiler-grpc
     python3-ipykernel python3-jupyter-client
 )
+# What ./scripts/ecosystem tests the client for Python with; nothing else needs these.
+ecosystem_packages=(
+    python3-ipykernel python3-jupyter-client python3-nbclient jupyter-notebook  # notebooks
+    chromium chromium-driver python3-selenium                                   # the page of a notebook
+    python3-matplotlib
+)
 clang_packages=(clang libclang-rt-14-dev)
 tidy_packages=(clang-tidy)
 

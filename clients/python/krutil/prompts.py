@@ -9,13 +9,26 @@ from .requests import Request, Result
 if TYPE_CHECKING:
     from .session import Session
 
-OnInput = Callable[[str], Optional[str]]
+OnInput = Callable[["Question"], Optional[str]]
 OnDebug = Callable[["Prompt"], object]
 
 # The input loops of the protocol that a client serves.
 KINDS = {1: "debug", 2: "input", 3: "keyboard", 4: "pause"}
 
 _END_OF_INPUT = "\x04"
+
+
+class Question(str):
+    """What `on_input` gets: the text of the prompt, a `str` that knows whether an answer is still wanted.
+
+    It is not when the request is cancelled or the session ends. Whatever shows a dialog can close it then.
+    """
+
+    _closed: threading.Event
+
+    def withdrawn(self, timeout: float = 0) -> bool:
+        """Whether no answer is wanted any more; waits for that, so many seconds at most."""
+        return self._closed.wait(timeout)
 
 
 class Prompt:
@@ -96,7 +109,9 @@ class Prompt:
     def _ask(self, on_input: OnInput, text: str) -> None:
         line = _END_OF_INPUT
         try:
-            answer = on_input(text)
+            question = Question(text)
+            question._closed = self._closed
+            answer = on_input(question)
             if isinstance(answer, str):
                 line = answer
             elif answer is not None:

@@ -399,11 +399,12 @@ class Behaviour:
             self.assertEqual(session.eval("import qvm; qvm.keyboard(); 'over'", timeout=PATIENCE).value, "'over'")
 
     def test_cancel_at_a_prompt(self):
-        asked, answered = threading.Event(), threading.Event()
+        asked, withdrawn = threading.Event(), queue.Queue()
 
-        def answer(text):
+        def answer(question):
+            withdrawn.put(question.withdrawn())
             asked.set()
-            answered.wait(PATIENCE)
+            withdrawn.put(question.withdrawn(PATIENCE))
             return "too late"
 
         with self.begin(on_input=answer) as session:
@@ -412,7 +413,7 @@ class Behaviour:
             self.assertEqual(request.cancel(timeout=PATIENCE), krutil.CancelAnswer.PENDING)
             with self.assertRaises(krutil.Cancelled):
                 request.result(PATIENCE)
-            answered.set()
+            self.assertEqual([withdrawn.get(timeout=PATIENCE) for _ in range(2)], [False, True])
             self.assertEqual(session.eval("'goes on'", timeout=PATIENCE).value, "'goes on'")
 
 
