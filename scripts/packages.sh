@@ -35,6 +35,7 @@ peer_packages=(
 ecosystem_packages=(
     python3-ipykernel python3-jupyter-client python3-nbclient jupyter-notebook  # notebooks
     chromium chromium-driver python3-selenium                                   # the page of a notebook
+    python3-distributed                                                         # clusters
     python3-matplotlib
 )
 clang_packages=(clang libclang-rt-14-dev)

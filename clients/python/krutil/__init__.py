@@ -8,6 +8,7 @@ machine or at the far end of an `ssh`.
 
 from . import aio
 from .errors import Aborted, Cancelled, Error, Lost, Refused, RemoteError, RemoteFrame
+from .pool import Pool
 from .prompts import Prompt, Question
 from .requests import CancelAnswer, Request, Result, State, Text, Value, Warned
 from .session import Session, connect, start
@@ -17,5 +18,6 @@ from .wire import Limits
 for _each in (Aborted, Cancelled, Error, Lost, Refused, RemoteError):
     _each.__module__ = __name__
 
-__all__ = ["Aborted", "CancelAnswer", "Cancelled", "Error", "Limits", "Lost", "Prompt", "Question", "Refused", "RemoteError",
-           "RemoteFrame", "Request", "Result", "Session", "State", "Text", "Value", "Warned", "aio", "connect", "start"]
+__all__ = ["Aborted", "CancelAnswer", "Cancelled", "Error", "Limits", "Lost", "Pool", "Prompt", "Question", "Refused",
+           "RemoteError", "RemoteFrame", "Request", "Result", "Session", "State", "Text", "Value", "Warned", "aio", "connect",
+           "start"]

@@ -83,6 +83,12 @@ class Dispatch:
         """A number that no other call has returned."""
         return next(self._numbers)
 
+    @property
+    def ended(self) -> bool:
+        """Whether there is nothing more to be read."""
+        with self._lock:
+            return self._over
+
     def begin(self, make: Callable[[], E], frames: list[Frame]) -> E:
         """Opens an exchange and has its message sent. `make` makes what waits for its reply."""
         with self._lock:

@@ -123,6 +123,11 @@ class Session:
         if error:
             raise error
 
+    @property
+    def ended(self) -> bool:
+        """Whether the session is over, however it came to that: a request that is made now raises `Lost`."""
+        return self._dispatch.ended
+
     def kill(self) -> None:
         """Ends the session at once, whatever the engine does, and its process if `start()` has started it."""
         self._dispatch.abandon()

@@ -18,7 +18,7 @@ from engine_test import Listener
 PAGE = sys.argv.pop(1)
 
 # What needs packages of others, which ./scripts/ecosystem installs and tests.
-OPTIONAL = {"krutil.notebook"}
+OPTIONAL = {"krutil.dask", "krutil.notebook"}
 
 
 def load_tests(loader, tests, pattern):
