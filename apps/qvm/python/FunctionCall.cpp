@@ -50,6 +50,11 @@ std::string typeNameOf(const py::handle& value) {
     return Py_TYPE(value.ptr())->tp_name;
 }
 
+// Functions of the engine's own module are asked for by clients, so they need neither NumPy nor the session's consent.
+bool isEngineFunction(const std::string& name) {
+    return name.starts_with("qvm.");
+}
+
 std::vector<py::str> partsOf(const std::string& name) {
     std::vector<py::str> parts;
     for (std::size_t begin = 0; begin <= name.size();) {
@@ -144,9 +149,9 @@ std::string outputs(std::uint64_t count) {
 
 }  // namespace
 
-py::object findFunction(const std::string& name, const py::dict& session) {
+py::object findFunction(const std::string& name, const py::dict& session, const py::object& engineModule) {
     const std::vector<py::str> parts = partsOf(name);
-    py::object found = first(parts.front(), name, session);
+    py::object found = isEngineFunction(name) ? engineModule : first(parts.front(), name, session);
     std::string path = parts.front();
     for (std::size_t i = 1; i < parts.size(); ++i) {
         found = further(found, path, parts[i], name);
@@ -163,7 +168,8 @@ py::object callWithArrays(const py::object& function, const std::string& name, s
     py::tuple values(arguments.size());
     for (std::size_t i = 0; i < arguments.size(); ++i) {
         try {
-            values[i] = toPython(std::move(arguments[i]));
+            py::object number = isEngineFunction(name) ? toNumber(arguments[i]) : py::object();
+            values[i] = number ? std::move(number) : toPython(std::move(arguments[i]));
         } catch (const NotConvertible& error) {
             raise(PyExc_TypeError, "Argument " + std::to_string(i + 1) + " of " + quoted(name) + " " + error.what());
         }

@@ -14,16 +14,19 @@ namespace qvm {
 
 /// What the dotted `name` stands for. Its first part is looked for in `session`, then among the builtins, then as a
 /// module to import; each further part as an attribute, then, of a package, as a module to import. So a name means what
-/// it would mean in the session's code if all modules were imported.
+/// it would mean in the session's code if all modules were imported. Only `qvm.` before other names is always
+/// `engineModule`: clients ask for the engine's functions, whatever code has called `qvm`.
 ///
 /// Throws py::error_already_set: NameError or AttributeError that say where the search stopped, TypeError for something
 /// that cannot be called, and whatever an import or an attribute raises.
-pybind11::object findFunction(const std::string& name, const pybind11::dict& session);
+pybind11::object findFunction(const std::string& name, const pybind11::dict& session,
+                              const pybind11::object& engineModule);
 
-/// Calls `function` with `arguments`, as toPython() shows them, and returns what it returns. To the function, code of
+/// Calls `function` with `arguments`, as toPython() shows them, and returns what it returns. A function of the engine's
+/// own module gets numbers as toNumber() shows them. To the function, code of
 /// `session` is what calls it: functions such as eval, dir and warnings.warn look at their caller. The arguments'
 /// memory is released as soon as neither the call nor what it left behind refers to it. Throws py::error_already_set:
-/// what the function raises, and TypeError for an argument that Python cannot have. `name` is for texts.
+/// what the function raises, and TypeError for an argument that Python cannot have. `name` is that of findFunction().
 pybind11::object callWithArrays(const pybind11::object& function, const std::string& name,
                                 std::vector<foundation::korveldata::Array> arguments, const pybind11::dict& session);
 

@@ -160,6 +160,7 @@ class Namespace {
 
 struct Interpreter::State {
     py::dict globals;
+    py::object module;
     py::object compile;
     py::object finish;
     py::object formatError;
@@ -183,6 +184,7 @@ Interpreter::Interpreter(const PythonConfig& world, const MessageBounds& bounds)
     state_ = std::make_unique<State>();
     state_->globals = py::module_::import("__main__").attr("__dict__");
     const auto module = py::module_::import("qvm");
+    state_->module = module;
     state_->compile = module.attr("_compile");
     state_->finish = module.attr("_finish");
     state_->formatError = module.attr("_format_error");
@@ -258,7 +260,7 @@ Interpreter::Ending Interpreter::call(const cmddistributor::FEvalIIP& request, O
     Namespace(state_->globals).forgetWarnings();
     try {
         const std::string& name = request.getFunctionName();
-        const py::object function = findFunction(name, state_->globals);
+        const py::object function = findFunction(name, state_->globals, state_->module);
         const py::object value = callWithArrays(function, name, request.getData()->takeArrays(), state_->globals);
         if (inForkedChild()) {
             endForkedChild({});

@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <complex>
 #include <cstdint>
+#include <cstring>
 #include <optional>
 #include <string>
 #include <utility>
@@ -211,6 +212,20 @@ py::object toPython(Array array) {
         py::detail::array_proxy(view.ptr())->flags &= ~Npy::NPY_ARRAY_WRITEABLE_;
     }
     return view;
+}
+
+py::object toNumber(const Array& array) {
+    if (array.dimensions().empty() && array.elementType() == ElementType::Int64) {
+        std::int64_t number = 0;
+        std::memcpy(&number, array.data(), sizeof(number));
+        return py::int_(number);
+    }
+    if (array.dimensions().empty() && array.elementType() == ElementType::Double) {
+        double number = 0;
+        std::memcpy(&number, array.data(), sizeof(number));
+        return py::float_(number);
+    }
+    return {};
 }
 
 Array toArray(py::handle value, ReleaseQueue& releases) {

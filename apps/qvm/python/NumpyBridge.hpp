@@ -41,6 +41,9 @@ class NotConvertible : public std::runtime_error {
 /// Throws NotConvertible for complex integers and for text in several rows, py::error_already_set when NumPy refuses.
 pybind11::object toPython(foundation::korveldata::Array array);
 
+/// Python's own number for an int64 or double without dimensions, which needs no NumPy; null for any other array.
+pybind11::object toNumber(const foundation::korveldata::Array& array);
+
 /// The array that `value` is or stands for; a str becomes a row of UTF-16 code units, a number a scalar, anything else
 /// what numpy.asarray makes of it. NumPy's memory is shared and `value` kept until the last share is gone; nobody
 /// should write to it until then. Contiguous memory keeps its order; row-major where both hold.

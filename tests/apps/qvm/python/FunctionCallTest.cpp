@@ -21,7 +21,7 @@ using qvm::ReleaseQueue;
 
 class FunctionCallTest : public PythonTest {
   protected:
-    py::object find(const std::string& name) { return qvm::findFunction(name, names); }
+    py::object find(const std::string& name) { return qvm::findFunction(name, names, engineModule); }
 
     std::vector<Array> call(const std::string& name, std::vector<Array> arguments, std::uint64_t wanted) {
         return qvm::outputsOf(qvm::callWithArrays(find(name), name, std::move(arguments), names), name, wanted,
@@ -42,6 +42,7 @@ class FunctionCallTest : public PythonTest {
 
     static Array integer(std::int64_t value) { return ArrayFactory().createScalar(value); }
 
+    const py::object engineModule = py::module_::import("types").attr("ModuleType")("qvm");
     ReleaseQueue releases;
 };
 
@@ -74,6 +75,16 @@ TEST_F(FunctionCallTest, NameOfTheSessionComesFirst) {
     EXPECT_EQ(call("math.sin", {integer(1)}, 1)[0].toText(), u"mine");
     run("größe = lambda: 'mine'");
     EXPECT_EQ(call("größe", {}, 1)[0].toText(), u"mine");
+}
+
+TEST_F(FunctionCallTest, NameOfTheEnginesModuleIsThatModuleWhateverTheSessionCallsIt) {
+    engineModule.attr("kinds") = eval("lambda *values: str([type(value).__name__ for value in values])");
+    run("class qvm:\n    kinds = staticmethod(lambda *values: 'mine')\n");
+    EXPECT_EQ(call("qvm.kinds", {integer(1), ArrayFactory().createScalar(1.5), doubles({2})}, 1)[0].toText(),
+              u"['int', 'float', 'ndarray']");
+    EXPECT_EQ(call("qvm", {}, 0).size(), 0U);
+    EXPECT_EQ(errorOf([&] { find("qvm.none"); }),
+              "AttributeError: Unknown function 'qvm.none': the module 'qvm' has no attribute and no submodule 'none'");
 }
 
 TEST_F(FunctionCallTest, UnknownNameSaysWhereTheSearchStopped) {
