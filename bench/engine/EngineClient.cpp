@@ -57,7 +57,8 @@ EngineClient::EngineClient(const std::vector<std::string>& arguments, const sess
 
 EngineClient::~EngineClient() {
     session_->sayGoodbye();
-    over_.wait(false);
+    std::unique_lock lock(mutex_);
+    changed_.wait(lock, [this] { return over_; });
 }
 
 void EngineClient::send(const Request& request) {
@@ -76,11 +77,10 @@ EngineClient::Request EngineClient::evaluation(const std::string& code) {
 }
 
 void EngineClient::awaitReplies() {
-    for (auto answered = answered_.load(); answered < sent_; answered = answered_.load()) {
-        if (over_) {
-            throw std::runtime_error("the session with the engine is over");
-        }
-        answered_.wait(answered);
+    std::unique_lock lock(mutex_);
+    changed_.wait(lock, [this] { return over_ || answered_ == sent_; });
+    if (answered_ != sent_) {
+        throw std::runtime_error("the session with the engine is over");
     }
 }
 
@@ -140,8 +140,13 @@ void EngineClient::onReply(session::framing::StreamID /*stream*/,
     }
     lastReply_ = reply;
     // Whoever waits, waits for all: of many replies that come together, the last one wakes it up.
-    if (++answered_ == sent_) {
-        answered_.notify_one();
+    bool all = false;
+    {
+        const std::lock_guard lock(mutex_);
+        all = ++answered_ == sent_;
+    }
+    if (all) {
+        changed_.notify_one();
     }
 }
 
@@ -153,11 +158,11 @@ void EngineClient::onEvent(session::framing::StreamID /*stream*/,
 }
 
 void EngineClient::onEnd(const session::SessionEnd& /*end*/) {
-    over_ = true;
-    over_.notify_one();
-    // Whoever waits for an answer looks again.
-    ++answered_;
-    answered_.notify_one();
+    {
+        const std::lock_guard lock(mutex_);
+        over_ = true;
+    }
+    changed_.notify_one();
 }
 
 }  // namespace bench

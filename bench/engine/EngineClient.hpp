@@ -3,8 +3,10 @@
 
 #include <atomic>
 #include <boost/shared_ptr.hpp>
+#include <condition_variable>
 #include <cstddef>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -79,8 +81,11 @@ class EngineClient : private session::SessionHandler {
     boost::shared_ptr<const foundation::msg_svc::exchange::Reply> lastReply_;
     std::atomic<std::size_t> there_{0};
     std::atomic<std::size_t> back_{0};
-    std::atomic<std::size_t> answered_{0};
-    std::atomic<bool> over_{false};
+    // A wait of an atomic would yield the core several times first, and the engine may be on the same one.
+    std::mutex mutex_;
+    std::condition_variable changed_;
+    std::size_t answered_ = 0;
+    bool over_ = false;
 
     std::unique_ptr<session::Session> session_;
 };
