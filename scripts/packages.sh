@@ -19,6 +19,7 @@ test_packages=(
     libgtest-dev libgmock-dev libbenchmark-dev valgrind
     python3-protobuf                                    # the client for Python
     mypy python3-pip python3-setuptools python3-wheel   # its types and its wheel
+    python3-matplotlib                                  # figures, which an engine shows
 )
 # What draws the pictures of benchmarks.
 bench_packages=(python3-matplotlib)

@@ -86,7 +86,7 @@ Engine::Engine(const Options& options, Log& log)
       log_(log),
       diary_(options.diary),
       queue_(options.queue),
-      capabilities_({Capability::Debugging, Capability::InteractiveCommandLine}) {}
+      capabilities_({Capability::Debugging, Capability::InteractiveCommandLine, Capability::WebWindow}) {}
 
 Engine::~Engine() {
     if (timer_) {
@@ -278,6 +278,9 @@ Interpreter::Ending Engine::runCode(const Request& request, PyObject* frame) {
         const EvalIIP& evaluation = *std::get<const EvalIIP*>(request.task);
         echo(evaluation);
         ending = python_->evaluate(evaluation, fileOf(request), frame);
+    }
+    if (!prompts_->isInner()) {
+        python_->endRequest(ending);
     }
     capture_->finish();
     const bool toldToStop = cancellation_.end();

@@ -328,6 +328,7 @@ PYBIND11_EMBEDDED_MODULE(_qvm, module) {
     module.def("on_interrupt_signal", &onInterruptSignal);
     module.def("on_unraisable", &onUnraisable);
     module.def("can_debug", [] { return canUse(Capability::Debugging); });
+    module.def("can_show", [] { return canUse(Capability::WebWindow); });
     module.def("can_ask", [] { return canUse(Capability::InteractiveCommandLine); });
     module.def("debug_prompt",
                [](const py::object& frame) { return commandPrompt(InputRequester::mnDEBUG_PROMPT, frame); });

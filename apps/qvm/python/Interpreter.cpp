@@ -165,6 +165,8 @@ struct Interpreter::State {
     py::object finish;
     py::object formatError;
     py::object debuggerQuit;
+    py::list atEnd;  // empty for most sessions
+    py::object endRequest;
     ReleaseQueue releases;
 };
 
@@ -189,6 +191,8 @@ Interpreter::Interpreter(const PythonConfig& world, const MessageBounds& bounds)
     state_->finish = module.attr("_finish");
     state_->formatError = module.attr("_format_error");
     state_->debuggerQuit = module.attr("DebuggerQuit");
+    state_->atEnd = module.attr("_at_end");
+    state_->endRequest = module.attr("_end_request");
 }
 
 Interpreter::~Interpreter() {
@@ -282,6 +286,20 @@ Interpreter::Ending Interpreter::call(const cmddistributor::FEvalIIP& request, O
         PyErr_SetString(PyExc_RuntimeError, error.what());
     }
     return failure(inRUNTIME_ERROR);
+}
+
+void Interpreter::endRequest(Ending& ending) {
+    if (state_->atEnd.empty() || ending.exit ||
+        (ending.error && ending.error->getExecutionStatus() == inEXECUTION_CTRLC)) {
+        return;
+    }
+    if (const auto done = py::reinterpret_steal<py::object>(PyObject_CallNoArgs(state_->endRequest.ptr()))) {
+        return;
+    }
+    Ending failed = failure(inRUNTIME_ERROR);
+    if (!ending.error) {
+        ending = std::move(failed);
+    }
 }
 
 void Interpreter::dropReleased() noexcept {

@@ -61,6 +61,11 @@ class Interpreter {
     /// they are sent. Everything else is as for evaluate().
     Ending call(const cmddistributor::FEvalIIP& request, Outputs outputs);
 
+    /// Does what is to be done when a request has ended that no prompt holds, such as showing the pictures that it left
+    /// open; nothing when the code has ended the session or was interrupted. What is raised meanwhile becomes the error
+    /// of an ending without one.
+    void endRequest(Ending& ending);
+
     /// Drops Python's share in the memory of outputs that are not used any more, on whatever thread they ended.
     void dropReleased() noexcept;
 

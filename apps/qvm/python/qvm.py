@@ -114,7 +114,34 @@ def _show(value):
     else:
         text = repr(value)
     _qvm.show(text + "\n")
+    for kind in type(value).__mro__:
+        names = kind.__dict__
+        if "_repr_png_" in names or "_repr_svg_" in names or "_repr_html_" in names:
+            import qvm_displays
+            qvm_displays.offer(value)
+            break
     _builtins._ = value
+
+
+def take_displays():
+    """Hands over the pictures that are kept for the client, and forgets them. Clients call it after a request that has
+    shown the line of a picture.
+
+    Returns a text in JSON, a list with what there is of each picture, and an array of the bytes that it counts.
+
+    >>> description, data = qvm.take_displays()
+    """
+    import qvm_displays
+    return qvm_displays.take()
+
+
+# What is called when a request has ended that no prompt holds, in the order in which it was added.
+_at_end = []
+
+
+def _end_request():
+    for action in _at_end:
+        action()
 
 
 class _InputStream(_io.TextIOBase):
@@ -606,10 +633,26 @@ def _adapt_traceback(traceback):
     traceback._safe_string = _safe_string
 
 
+def _adapt_matplotlib(matplotlib):
+    """Makes the engine's backend the one that is used when nobody has chosen another. What the package and the
+    distribution say in their own files is nobody's choice."""
+    try:
+        from matplotlib import cbook, rcsetup
+        parameters = matplotlib.rcParams
+        if dict.get(parameters, "backend") is not rcsetup._auto_backend_sentinel:
+            by_default = "/etc/matplotlibrc", _path.realpath(cbook._get_data_path("matplotlibrc"))
+            if _os.environ.get("MPLBACKEND") or _path.realpath(matplotlib.matplotlib_fname()) not in by_default:
+                return
+        # Looking it up as others do would already choose one.
+        dict.__setitem__(parameters, "backend", "module://qvm_pictures")
+    except (ImportError, AttributeError):
+        pass  # It is another package of this name, or a version that chooses in another way.
+
+
 class _AdaptingFinder:
     """Finds modules that are changed as soon as they are imported."""
 
-    changes = {"linecache": _adapt_linecache, "traceback": _adapt_traceback}
+    changes = {"linecache": _adapt_linecache, "traceback": _adapt_traceback, "matplotlib": _adapt_matplotlib}
 
     @classmethod
     def find_spec(cls, name, path=None, target=None):

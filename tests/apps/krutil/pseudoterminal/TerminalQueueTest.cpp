@@ -88,7 +88,7 @@ TEST_F(TerminalQueueTest, TheQueueIsListedAndCancelledByNumber) {
     terminal->expect("   4  running   " + waiting(directory / "second") + "\r\n");
     terminal->expect("   5  requeued  print('never', 6 * 7)\r\n");
     terminal->expect(
-        "The engine states InteractiveCommandLine, Debugging; this client states InteractiveCommandLine, "
+        "The engine states InteractiveCommandLine, WebWindow, Debugging; this client states InteractiveCommandLine, "
         "Debugging.\r\n");
     terminal->expect(prompt);
     evaluate(":queue cancel 5", "krutil: cancelled\r\n");
