@@ -113,6 +113,26 @@ TEST(SharedContentTest, IsReadWhereItIsAndGivenBack) {
     EXPECT_EQ(pair.peer->read(24), wire::giveBack(77));
 }
 
+TEST(SharedContentTest, ReturnLeavesWithWhatIsHeldAndIsNoReasonToReadLess) {
+    SessionConfig config = sharingConfig(Role::Engine);
+    config.maxPendingAnswers = 1;
+    SharingWithBytes pair(std::move(config));
+    pair.peer->writeWith(sharedQuestion(77, 0, mebi), {anonymousMemory(mebi, mebi, allSeals).get()});
+    pair.saw.waitForLines(1);
+    auto question = pair.saw.lastQuestion();
+    // The recorder keeps the latest question only.
+    pair.peer->write(wire::tagged(2, 1, true, questionTag, "next"));
+    pair.saw.waitForLines(2);
+    const std::uint64_t before = pair.session->traffic().written;
+    pair.session->send(0, notice("held"), Session::Urgency::Held);
+    question.reset();
+    EXPECT_EQ(pair.session->traffic().written, before);
+    pair.peer->write(wire::tagged(3, 1, true, questionTag, "?") + wire::tagged(4, 1, true, questionTag, "still read"));
+    EXPECT_EQ(pair.saw.waitForLines(4).back(), "question 4 still read");
+    pair.session->sendHeld();
+    EXPECT_EQ(pair.peer->read(24 + 11 + 4 + 24), wire::tagged(0, 1, true, noticeTag, "held") + wire::giveBack(77));
+}
+
 TEST(SharedContentTest, DescriptorsMayComeBeforeTheirFrames) {
     SharingWithBytes pair(sharingConfig(Role::Engine));
     const auto first = anonymousMemory(mebi, mebi, allSeals);

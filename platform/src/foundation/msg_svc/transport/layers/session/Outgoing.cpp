@@ -35,10 +35,11 @@ std::vector<OutgoingPieces> Outgoing::push(OutgoingPieces&& message, Hold hold) 
     if (!isOpen()) {
         return done;
     }
+    const bool held = hold == Hold::Yes || (hold == Hold::WithOthers && !queue_.empty());
     unwritten_ += message.bytes();
     answersOwed_ += message.answer() ? 1 : 0;
     queue_.push(std::move(message));
-    if (!writerAwake_ && (hold == Hold::No || unwritten_ >= Session::heldBytes)) {
+    if (!writerAwake_ && (!held || unwritten_ >= Session::heldBytes)) {
         write(done);
     }
     if (!queue_.empty()) {

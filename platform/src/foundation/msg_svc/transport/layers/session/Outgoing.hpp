@@ -43,7 +43,11 @@ class Outgoing {
     /// Whether messages are taken. False after an error and after finish().
     bool isOpen() const noexcept { return state_.load(std::memory_order_acquire) == State::Open; }
 
-    enum class Hold { No, Yes };
+    enum class Hold {
+        No,
+        Yes,
+        WithOthers,  ///< only when something is held already: somebody will send that
+    };
 
     /// Writes a message behind those that are held, or puts it behind those that are unwritten. With Hold::Yes it is
     /// held, until Session::heldBytes are. Returns what has been written at once, for the caller to drop where it holds
@@ -60,8 +64,9 @@ class Outgoing {
     /// The same until all is written that was handed over before the call.
     bool waitUntilWritten(int interrupt);
 
-    /// Messages posted as answers that are unwritten.
-    std::size_t answersOwed() const noexcept { return answersOwed_.load(std::memory_order_relaxed); }
+    /// Messages posted as answers that the stream has not taken. Those that are merely held are not owed: nobody knows
+    /// yet whether the peer reads.
+    std::size_t answersOwed() const noexcept { return writerAwake_ ? answersOwed_.load() : 0; }
 
     /// Bytes that the stream has taken.
     std::uint64_t written() const;
@@ -115,13 +120,13 @@ class Outgoing {
     std::atomic<int> descriptor_;
     // Changed with the mutex held.
     std::atomic<State> state_{State::Open};
-    std::atomic<std::size_t> answersOwed_{0};
+    std::atomic<std::size_t> answersOwed_{0};  ///< unwritten ones
+    std::atomic<bool> writerAwake_{false};     ///< the I/O thread writes; without it, what is in the queue is held
 
     mutable std::mutex mutex_;
     OutgoingQueue queue_;
     std::size_t unwritten_ = 0;
-    std::size_t awaited_ = 0;   ///< of these, what was there when somebody began to wait for it
-    bool writerAwake_ = false;  ///< the I/O thread writes; without it, what is in the queue is held
+    std::size_t awaited_ = 0;  ///< of these, what was there when somebody began to wait for it
 };
 
 }  // namespace foundation::msg_svc::transport::layers::session

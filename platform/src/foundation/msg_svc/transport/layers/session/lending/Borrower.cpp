@@ -56,7 +56,8 @@ class Borrower::Core {
         }
         const std::lock_guard lock(mutex_);
         if (outgoing_ != nullptr) {
-            done = outgoing_->push(OutgoingPieces::giveBack(number, kept));
+            // The peer needs its memory for the next message only, so this does not wake it up by itself.
+            done = outgoing_->push(OutgoingPieces::giveBack(number, kept), Outgoing::Hold::WithOthers);
         }
     }
 
