@@ -184,6 +184,13 @@ std::vector<Array> outputsOf(const py::object& value, const std::string& name, s
     if (wanted == 0) {
         return results;
     }
+    if (isEngineFunction(name) && PyTuple_CheckExact(value.ptr()) &&
+        wanted < static_cast<std::uint64_t>(PyTuple_GET_SIZE(value.ptr()))) {
+        const auto count = static_cast<Py_ssize_t>(wanted);
+        const py::object fewer =
+            owned(count == 1 ? PySequence_GetItem(value.ptr(), 0) : PyTuple_GetSlice(value.ptr(), 0, count));
+        return outputsOf(fewer, name, wanted, releases);
+    }
     const bool several = PyTuple_Check(value.ptr()) || PyList_Check(value.ptr());
     const auto given = several ? static_cast<std::uint64_t>(PySequence_Fast_GET_SIZE(value.ptr())) : 1;
     if (wanted == 1) {

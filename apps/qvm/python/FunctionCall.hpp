@@ -37,6 +37,7 @@ pybind11::object callWithArrays(const pybind11::object& function, const std::str
 ///     1          anything but None                      the value itself; a tuple of numbers is an array of them
 ///     n > 1      a tuple or list of exactly n           its elements
 ///
+/// Of the tuple that a function of the engine's own module returns, the first ones are taken when fewer are wanted.
 /// Each is converted as toArray() does. Throws py::error_already_set: ValueError for another number of outputs (it
 /// tells both), TypeError for an output that cannot be sent, and what NumPy raises. `name` is for texts.
 std::vector<foundation::korveldata::Array> outputsOf(const pybind11::object& value, const std::string& name,

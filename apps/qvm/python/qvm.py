@@ -563,6 +563,33 @@ def complete(text, cursor):
     return begin, end, "\n".join(candidates)
 
 
+def inspect(text, cursor):
+    """Parameters and documentation of the name at the cursor, or of the function in whose call the cursor is.
+
+    The result is empty when nothing is known. No code of the user's runs for it: defaults that only a __repr__ could
+    show are dots.
+
+    >>> print(qvm.inspect("divmod(7, 2", 11))
+    divmod(x, y, /)
+    <BLANKLINE>
+    Return the tuple (x//y, x%y).  Invariant: div*y + mod == x.
+    """
+    import qvm_inspection
+    return qvm_inspection.inspect(text, max(0, min(_index(cursor), len(text))), _scopes())
+
+
+def is_complete(text):
+    """Whether the code is "complete", "incomplete" or "invalid", and the indentation of a line that continues it.
+
+    As at Python's own prompt, an indented block is complete when a line behind it is empty. Nothing runs.
+
+    >>> qvm.is_complete("if x:")
+    ('incomplete', '    ')
+    """
+    import qvm_inspection
+    return qvm_inspection.is_complete(text)
+
+
 def _after_sending(leave):
     """What leaves the program at once, with what it has printed sent before."""
     def send_and_leave(*arguments, **options):
