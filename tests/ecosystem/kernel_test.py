@@ -1,5 +1,7 @@
 """The notebook kernel, as the real jupyter_client and nbclient see it."""
 
+import base64
+import io
 import json
 import os
 import queue
@@ -10,6 +12,7 @@ import sys
 import time
 import unittest
 
+import matplotlib.image
 import nbformat
 from jupyter_client.manager import KernelManager
 from jupyter_client.kernelspec import KernelSpecManager
@@ -128,6 +131,7 @@ class CellsTest(WithKernel):
         self.assertEqual(cell.reply["status"], "ok")
         self.assertEqual(self.run_cell("x = 5").of("execute_result"), [])
         self.assertEqual(self.run_cell("x + 1").value, "6")
+        self.assertEqual(self.run_cell("x + 1; ").of("execute_result"), [])
         self.assertEqual(self.run_cell("print('a' * 3_000_000)").text("stdout"), "a" * 3_000_000 + "\n")
 
     def test_the_language_process_is_the_engine(self):
@@ -142,6 +146,39 @@ class CellsTest(WithKernel):
         self.assertEqual(cell.reply["user_expressions"]["good"],
                          {"status": "ok", "data": {"text/plain": "2"}, "metadata": {}})
         self.assertEqual(cell.reply["user_expressions"]["bad"]["ename"], "ZeroDivisionError")
+
+    def test_a_plot(self):
+        cell = self.run_cell("import matplotlib.pyplot as plt\nprint('before')\nplt.plot([1, 2])\nplt.show()\n"
+                             "print('after')")
+        kinds = [kind for kind, _ in cell.published if kind not in ("status", "execute_input")]
+        self.assertEqual(kinds, ["stream", "display_data", "stream", "update_display_data"])
+        place, picture = cell.of("display_data")[0], cell.of("update_display_data")[0]
+        self.assertEqual(place["transient"], picture["transient"])
+        self.assertRegex(place["data"]["text/plain"], r"\A\[picture [0-9]+: image/png, 640 x 480\]\Z")
+        self.assertEqual(list(picture["data"]), ["image/png"])
+        self.assertTrue(base64.b64decode(picture["data"]["image/png"]).startswith(b"\x89PNG"))
+
+    def test_a_value_with_html(self):
+        cell = self.run_cell("class Red:\n    def __repr__(self): return 'red'\n"
+                             "    def _repr_html_(self): return '<b>red</b>'\nRed()")
+        self.assertEqual([content["data"] for content in cell.of("execute_result")],
+                         [{"text/plain": "red", "text/html": "<b>red</b>"}])
+        self.assertEqual(cell.of("display_data"), [])
+
+    def test_a_figure_behind_a_value(self):
+        cell = self.run_cell("import matplotlib.pyplot as plt\nlen(plt.plot([1, 2]))")
+        self.assertEqual(cell.value, "1")
+        self.assertEqual(list(cell.of("execute_result")[0]["data"]), ["text/plain"])
+        self.assertEqual([list(content["data"]) for content in cell.of("update_display_data")], [["image/png"]])
+
+    def test_completion(self):
+        self.run_cell("zwölf_monate = 12")
+        code = "'😀'; 1 + zwölf_m"
+        answer = self.answer(self.client.complete(code, len(code)))
+        self.assertEqual((answer["status"], answer["matches"], answer["cursor_start"], answer["cursor_end"]),
+                         ("ok", ["zwölf_monate"], len(code) - 7, len(code)))
+        answer = self.answer(self.client.complete("nothing_of_this_name", 20))
+        self.assertEqual((answer["status"], answer["matches"]), ("ok", []))
 
     def test_errors_have_colours(self):
         cell = self.run_cell("def f():\n    return 1 / 0\ntry:\n    f()\nexcept ZeroDivisionError as e:\n"
@@ -280,6 +317,16 @@ class NotebookTest(unittest.TestCase):
         self.assertEqual(notebook.cells[1].outputs, [{"output_type": "stream", "name": "stdout", "text": "15.0\n"}])
         self.assertEqual(notebook.cells[2].outputs[0]["data"], {"text/plain": "(3, 2)"})
         self.assertEqual(notebook.metadata["language_info"]["name"], "python")
+
+    def test_a_notebook_that_plots(self):
+        notebook = nbformat.v4.new_notebook(cells=[nbformat.v4.new_code_cell(
+            "import matplotlib.pyplot as plt\nfigure = plt.figure(figsize=(2, 1), dpi=100, facecolor='red')")])
+        NotebookClient(notebook, kernel_name="krutil", timeout=PATIENCE).execute()
+        outputs = notebook.cells[0].outputs
+        self.assertEqual(outputs[-1].output_type, "display_data")
+        picture = matplotlib.image.imread(io.BytesIO(base64.b64decode(outputs[-1].data["image/png"])))
+        self.assertEqual(picture.shape, (100, 200, 4))
+        self.assertEqual(picture[50, 100].tolist(), [1, 0, 0, 1])
 
     def test_a_notebook_that_fails(self):
         notebook = nbformat.v4.new_notebook(cells=[nbformat.v4.new_code_cell(code) for code in ("1 / 0", "2")])

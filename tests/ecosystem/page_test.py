@@ -1,6 +1,7 @@
 """The notebook kernel in the page of a real Jupyter Notebook, in a browser without a screen."""
 
 import glob
+import io
 import json
 import os
 import shutil
@@ -10,6 +11,7 @@ import tempfile
 import time
 import unittest
 
+import matplotlib.image
 import nbformat
 from selenium import webdriver
 from selenium.webdriver.chrome.service import Service
@@ -86,6 +88,21 @@ class PageTest(unittest.TestCase):
         self.assertTrue(error.text.endswith("\nZeroDivisionError: division by zero"), error.text)
         red = error.find_element(By.CSS_SELECTOR, ".ansi-red-fg")
         self.assertEqual(red.text, "ZeroDivisionError")
+
+    def test_a_plot(self):
+        self.open("import matplotlib.pyplot as plt\n"
+                  "figure = plt.figure(figsize=(3, 2), dpi=100, facecolor='red')\nfigure.add_axes([0.25, 0.25, 0.5, 0.5],"
+                  " facecolor='blue', xticks=[], yticks=[])\nplt.show()")
+        self.wait("const picture = document.querySelector('.output_area img');"
+                  "return !!picture && picture.complete && picture.naturalWidth === 300")
+        picture = self.browser.find_element(By.CSS_SELECTOR, ".output_area img")
+        # What a person sees: red around blue, in these proportions.
+        seen = matplotlib.image.imread(io.BytesIO(picture.screenshot_as_png))
+        height, width = seen.shape[:2]
+        self.assertEqual((width, height), (300, 200))
+        for place, colour in (((0.1, 0.1), [1, 0, 0]), ((0.5, 0.5), [0, 0, 1]), ((0.9, 0.5), [1, 0, 0]),
+                              ((0.3, 0.7), [0, 0, 1])):
+            self.assertEqual(seen[int(place[1] * height), int(place[0] * width), :3].tolist(), colour, place)
 
 
 if __name__ == "__main__":

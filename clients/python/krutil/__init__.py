@@ -7,6 +7,7 @@ machine or at the far end of an `ssh`.
 """
 
 from . import aio
+from .displays import Display, DisplayLine
 from .errors import Aborted, Cancelled, Error, Lost, Refused, RemoteError, RemoteFrame
 from .pool import Pool
 from .prompts import Prompt, Question
@@ -18,6 +19,6 @@ from .wire import Limits
 for _each in (Aborted, Cancelled, Error, Lost, Refused, RemoteError):
     _each.__module__ = __name__
 
-__all__ = ["Aborted", "CancelAnswer", "Cancelled", "Error", "Limits", "Lost", "Pool", "Prompt", "Question", "Refused",
-           "RemoteError", "RemoteFrame", "Request", "Result", "Session", "State", "Text", "Value", "Warned", "aio", "connect",
-           "start"]
+__all__ = ["Aborted", "CancelAnswer", "Cancelled", "Display", "DisplayLine", "Error", "Limits", "Lost", "Pool",
+           "Prompt", "Question", "Refused", "RemoteError", "RemoteFrame", "Request", "Result", "Session", "State",
+           "Text", "Value", "Warned", "aio", "connect", "start"]

@@ -20,6 +20,7 @@ from typing import Any, AsyncIterator, Generator, Generic, Optional, TypeVar
 
 from . import requests
 from . import session as threaded
+from .displays import Display, OnDisplay
 from .prompts import OnDebug, OnInput
 from .requests import CancelAnswer, Event, OnText, Result, Text, Warned
 from .session import Command
@@ -95,6 +96,11 @@ class Request(Generic[T]):
         return self._request.value
 
     @property
+    def displays(self) -> tuple[Display, ...]:
+        """The pictures and other forms of values that have come so far; they come at the end."""
+        return self._request.displays
+
+    @property
     def warnings(self) -> tuple[Warned, ...]:
         """The warnings so far."""
         return self._request.warnings
@@ -168,19 +174,21 @@ class Session:
 
 @contextlib.asynccontextmanager
 async def start(command: Optional[Command] = None, *, on_input: Optional[OnInput] = None,
-                on_debug: Optional[OnDebug] = None, on_text: Optional[OnText] = None, limits: Limits = Limits(),
+                on_debug: Optional[OnDebug] = None, on_text: Optional[OnText] = None,
+                on_display: Optional[OnDisplay] = None, limits: Limits = Limits(),
                 timeout: float = 10) -> AsyncIterator[Session]:
     """Starts an engine, and a session with it for a block of code. The arguments are those of `krutil.start()`."""
     begun = await asyncio.to_thread(threaded.start, command, on_input=on_input, on_debug=on_debug, on_text=on_text,
-                                    limits=limits, timeout=timeout)
+                                    on_display=on_display, limits=limits, timeout=timeout)
     async with Session(begun) as session:
         yield session
 
 
 @contextlib.asynccontextmanager
 async def connect(path: "str | os.PathLike[str]", *, on_input: Optional[OnInput] = None,
-                  on_debug: Optional[OnDebug] = None, on_text: Optional[OnText] = None, limits: Limits = Limits(),
-                  timeout: float = 10) -> AsyncIterator[Session]:
+                  on_debug: Optional[OnDebug] = None, on_text: Optional[OnText] = None,
+                  on_display: Optional[OnDisplay] = None, limits: Limits = Limits(),
+                timeout: float = 10) -> AsyncIterator[Session]:
     """Begins a session with an engine that listens, for a block of code. The arguments are those of `krutil.start()`.
 
     >>> async def main():
@@ -190,7 +198,7 @@ async def connect(path: "str | os.PathLike[str]", *, on_input: Optional[OnInput]
     2
     """
     begun = await asyncio.to_thread(threaded.connect, path, on_input=on_input, on_debug=on_debug, on_text=on_text,
-                                    limits=limits, timeout=timeout)
+                                    on_display=on_display, limits=limits, timeout=timeout)
     async with Session(begun) as session:
         yield session
 

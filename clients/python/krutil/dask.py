@@ -65,10 +65,10 @@ class Engine(WorkerPlugin):
 def call(function: str, *arguments: Any, outputs: int = 1) -> Any:
     """Calls a function in the engine of the worker that runs this, as `krutil.Session.call()` does.
 
-    A task of Dask: `client.submit(krutil.dask.call, "numpy.linalg.inv", x)`, or `client.map` with it. Dask takes tasks with
-    equal arguments for one; with `pure=False` they are not. When the engine is lost, the task fails with `krutil.Lost`, and
-    the next one here begins with a new engine. When the worker is lost, Dask runs its tasks again on another one, unless
-    it is told otherwise.
+    A task of Dask: `client.submit(krutil.dask.call, "numpy.linalg.inv", x)`, or `client.map` with it. Dask takes tasks
+    with equal arguments for one; with `pure=False` they are not. When the engine is lost, the task fails with
+    `krutil.Lost`, and the next one here begins with a new engine. When the worker is lost, Dask runs its tasks again on
+    another one, unless it is told otherwise.
     """
     plugin = get_worker().plugins.get(_NAME)
     if not isinstance(plugin, Engine):

@@ -9,6 +9,7 @@ from concurrent.futures import Future
 from typing import TYPE_CHECKING, Any, Callable, Iterable, Optional, TypeVar, Union
 
 from .arrays import take_value
+from .displays import DisplayLine, OnDisplay, displays_from
 from .errors import Aborted, Error, Lost, as_text, error_from, remote_frames
 from .handshake import Settled
 from .prompts import KINDS, OnDebug, OnInput, Prompt
@@ -45,14 +46,14 @@ class Dispatch:
 
     def __init__(self, session: "Session", connection: socket.socket, process: "Optional[subprocess.Popen[bytes]]",
                  reader: Reader, limits: Limits, settled: Settled, on_input: Optional[OnInput],
-                 on_debug: Optional[OnDebug], on_text: Optional[OnText]) -> None:
+                 on_debug: Optional[OnDebug], on_text: Optional[OnText], on_display: Optional[OnDisplay]) -> None:
         self._session = session
         self._socket = connection
         self._process = process
         self._reader = reader
         self._limits = limits
         self._settled = settled
-        self._on_input, self._on_debug, self._on_text = on_input, on_debug, on_text
+        self._on_input, self._on_debug, self._on_text, self._on_display = on_input, on_debug, on_text, on_display
         self._numbers = itertools.count(1)
         self._lock = threading.Lock()
         # By stream ID, under the lock.
@@ -63,6 +64,8 @@ class Dispatch:
         # Of the thread that reads alone.
         self._running: list[Request[Any]] = []
         self._prompts: list[tuple[int, Prompt]] = []
+        # By number of the display, of which there was a line.
+        self._displayed: dict[int, Request[Any]] = {}
         self._shut_down = False
         self._handlers: dict[str, Callable[[Message, Optional[Exchange]], None]] = {
             "krutil:TextBaseEvent": self._text, "krutil:SinkTextEvent": self._sink_text,
@@ -234,13 +237,46 @@ class Dispatch:
                 error = error_from(result.exception, request._error_text)
             if not result.HasField("id"):
                 raise message.unreadable("Required field is missing: protobuf::IIPResult.id")
-        return lambda: request._finish(error, values)
+        return lambda: self._after_displays(request, lambda: request._finish(error, values))
 
     def _cancel_reply(self, message: Message, answer: "Future[CancelAnswer]") -> Callable[[], None]:
         status = message.take_root(IIPCancelReply).status
         if status not in CancelAnswer._value2member_map_:
             raise message.unreadable(f"the answer to a cancel: expected 0 to 3, got {status}")
         return lambda: answer.set_result(CancelAnswer(status))
+
+    # Displays: the engine keeps them until it is asked.
+
+    def _after_displays(self, request: Request[Any], finish: Callable[[], None]) -> None:
+        """Finishes a request that has its reply, when its displays have come."""
+        if request not in self._displayed.values():
+            finish()
+            return
+        try:
+            # Before all that waits; or at the prompt at which the request ran.
+            asked = self._session._submit_call("qvm.take_displays", [], 2,
+                                               "DEQUEUE_AT_PPE" if self._prompts else "DEQUEUE_AT_BOOTSTRAP")
+        except Error:  # The session ends, and takes no more requests.
+            finish()
+            return
+        asked.add_done_callback(lambda _: self._take_displays(request, asked, finish))
+
+    def _take_displays(self, request: Request[Any], asked: Request[Any], finish: Callable[[], None]) -> None:
+        try:
+            for display in displays_from(asked.result(0)):
+                # Displays of other requests that have ended meanwhile come along.
+                owner = self._displayed.pop(display.number, None)
+                if owner is None or self._on_display is None:
+                    continue
+                owner._add(display)
+                try:
+                    self._on_display(display)
+                except Exception:
+                    sys.excepthook(*sys.exc_info())
+        except Exception as error:  # Whatever the engine has returned, whoever waits must not wait for ever.
+            request._add(Warned("RuntimeWarning", f"the pictures are lost: {error}", ()))
+        self._displayed = {number: owner for number, owner in self._displayed.items() if owner is not request}
+        finish()
 
     # Events.
 
@@ -262,7 +298,11 @@ class Dispatch:
         event = message.take_root(SinkTextEvent)
         stream = _stream(message.root, event.stream)
         if isinstance(exchange, Request):
-            exchange._add(Value(event.text) if stream == "output" else Text(event.text, stream))
+            line = DisplayLine.of(event.text) if self._on_display and stream == "output" else None
+            if line is not None:
+                self._displayed[line.number] = exchange
+            exchange._add(line if line is not None else
+                          Value(event.text) if stream == "output" else Text(event.text, stream))
 
     def _state(self, message: Message, exchange: Optional[Exchange]) -> None:
         state = _STATES[message.root]

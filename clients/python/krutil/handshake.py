@@ -17,6 +17,7 @@ BUILD = "krutil for Python 0.1.0"
 
 # Capabilities by their numbers in a first message.
 INTERACTIVE_COMMAND_LINE = 0
+WEB_WINDOW = 4
 DEBUGGING = 6
 
 _ENGINE = 1

@@ -21,8 +21,8 @@ def install(arguments: Sequence[str]) -> None:
     """Makes the kernel known to Jupyter."""
     parser = argparse.ArgumentParser(prog="python3 -m krutil.kernel install", description=install.__doc__)
     parser.add_argument("--engine", metavar="COMMAND",
-                        help="what runs the engine, such as 'ssh somewhere krutil-qvm --stdio'; otherwise krutil-qvm from "
-                             "the PATH, with the packages of the virtual environment that is active")
+                        help="what runs the engine, such as 'ssh somewhere krutil-qvm --stdio'; otherwise krutil-qvm "
+                             "from the PATH, with the packages of the virtual environment that is active")
     parser.add_argument("--prefix", help="below which directory; otherwise for this user alone")
     parser.add_argument("--name", default="krutil", help="by which programs name the kernel (%(default)s)")
     parser.add_argument("--display-name", default="Python (krutil)", help="which a page shows (%(default)s)")

@@ -1,9 +1,10 @@
 """What answers Jupyter: one engine, asked for what cells, completion and inspection need.
 
-This process is started by Jupyter, as `krutil.kernel` says. Three threads of it serve Jupyter: the main thread runs cells,
-one after another; the control thread interrupts and ends; a third one publishes output.
+This process is started by Jupyter, as `krutil.kernel` says. Three threads of it serve Jupyter: the main thread runs
+cells, one after another; the control thread interrupts and ends; a third one publishes output.
 """
 
+import base64
 import platform
 import re
 import sys
@@ -12,9 +13,10 @@ from typing import Any, Callable, Optional, Sequence
 
 from ipykernel.kernelbase import Kernel
 
+from .displays import Display, DisplayLine
 from .errors import Cancelled, Error, Lost, RemoteError
 from .prompts import Question
-from .requests import Request, Text, Warned
+from .requests import Request, Text, Value, Warned
 from .session import Session, start
 
 # What the engine has for an answer about code, in seconds. It may be far away, but a person waits.
@@ -57,12 +59,13 @@ class EngineKernel(Kernel):
                    *, cell_id: Optional[str] = None) -> dict[str, Any]:
         self._may_ask = allow_stdin
         try:
-            value = self._run(code, silent)
-            if value is not None and not silent:
-                self._publish("execute_result", {"execution_count": self.execution_count, "metadata": {},
-                                                 "data": {"text/plain": value}})
+            data = self._run(code, silent)
+            # As in other notebooks, a semicolon at the end hides the value.
+            if data and not silent and not code.rstrip().endswith(";"):
+                self._publish("execute_result", {"execution_count": self.execution_count, "metadata": {}, "data": data})
+            expressions = {name: self._expression(text) for name, text in (user_expressions or {}).items()}
             return {"status": "ok", "execution_count": self.execution_count, "payload": [],
-                    "user_expressions": {name: self._expression(text) for name, text in (user_expressions or {}).items()}}
+                    "user_expressions": expressions}
         except (Error, OSError) as error:
             content = self._error(error)
             if not silent:
@@ -72,8 +75,8 @@ class EngineKernel(Kernel):
     def do_complete(self, code: str, cursor_pos: int) -> dict[str, Any]:
         answer = self._ask("qvm.complete", code, cursor_pos, outputs=3)
         begin, end, candidates = answer if answer else (cursor_pos, cursor_pos, "")
-        return {"status": "ok", "matches": str(candidates).split("\n") if candidates else [], "cursor_start": int(begin),
-                "cursor_end": int(end), "metadata": {}}
+        return {"status": "ok", "matches": str(candidates).split("\n") if candidates else [],
+                "cursor_start": int(begin), "cursor_end": int(end), "metadata": {}}
 
     def do_inspect(self, code: str, cursor_pos: int, detail_level: int = 0,
                    omit_sections: Sequence[str] = ()) -> dict[str, Any]:
@@ -119,13 +122,17 @@ class EngineKernel(Kernel):
 
     def _session(self) -> Session:
         if self._engine is None:
-            self._engine = start(self.command, on_input=self._answer, on_text=self._background, timeout=60)
+            self._engine = start(self.command, on_input=self._answer, on_text=self._background,
+                                 on_display=lambda display: None, timeout=60)
         return self._engine
 
-    def _run(self, code: str, silent: bool) -> Optional[str]:
-        """Runs a cell and publishes what it writes, as it comes. Returns the text of its value."""
+    def _run(self, code: str, silent: bool) -> dict[str, str]:
+        """Runs a cell and publishes what it writes and shows, as it comes. Returns the forms of its value."""
         self._interrupted = False
         request = self._running = self._session().submit(code)
+        forms: dict[str, str] = {}
+        of_value = 0
+        before: Any = None
         try:
             for event in request.events():
                 if silent:
@@ -134,6 +141,17 @@ class EngineKernel(Kernel):
                     (sys.stderr if event.stream == "error" else sys.stdout).write(event)
                 elif isinstance(event, Warned):
                     sys.stderr.write(_warning_text(event))
+                elif isinstance(event, DisplayLine):
+                    # Behind a value is what the value has beside its text. A PNG alone may as well be a figure.
+                    if isinstance(before, Value) and event.types != ("image/png",):
+                        of_value = event.number
+                    else:
+                        self._show("display_data", event.number, {"text/plain": event.rstrip()})
+                elif isinstance(event, Display) and event.number == of_value:
+                    forms = _bundle(event)
+                elif isinstance(event, Display):
+                    self._show("update_display_data", event.number, _bundle(event))
+                before = event
             result = request.result()
         finally:
             self._running = None
@@ -141,11 +159,11 @@ class EngineKernel(Kernel):
             sys.stderr.flush()
         if self._interrupted and not silent:
             sys.stderr.write("The interrupt had no effect: the code has caught it, or was done before.\n")
-        return result.value
+        return {"text/plain": result.value, **forms} if result.value is not None else forms
 
     def _expression(self, code: str) -> dict[str, Any]:
         try:
-            return {"status": "ok", "data": {"text/plain": self._run(code, True) or "None"}, "metadata": {}}
+            return {"status": "ok", "data": self._run(code, True) or {"text/plain": "None"}, "metadata": {}}
         except Error as error:
             return {"status": "error", **self._error(error)}
 
@@ -187,6 +205,13 @@ class EngineKernel(Kernel):
     def _publish(self, kind: str, content: dict[str, Any]) -> None:
         self.send_response(self.iopub_socket, kind, content)
 
+    def _show(self, kind: str, number: int, data: dict[str, str]) -> None:
+        """Keeps the place of a display in the output, where its line stands, or fills it."""
+        sys.stdout.flush()
+        sys.stderr.flush()
+        self._publish(kind, {"data": data, "metadata": {},
+                             "transient": {"display_id": f"{self.ident}-{self.execution_count}-{number}"}})
+
     @staticmethod
     def _background(text: str) -> None:
         sys.stdout.write(text)
@@ -225,6 +250,12 @@ def coloured(text: str) -> list[str]:
             line = f"{line[:at]}{_RED}{error[1]}{_PLAIN}{error[2] or ''}"
         lines.append(line)
     return lines
+
+
+def _bundle(display: Display) -> dict[str, str]:
+    """The forms of a display as Jupyter has them."""
+    return {kind: base64.b64encode(content).decode() if isinstance(content, bytes) else content
+            for kind, content in display.formats.items()}
 
 
 def _warning_text(warned: Warned) -> str:

@@ -32,15 +32,15 @@ class Pool(Executor):
     """Engines that run calls, each one after another: a `concurrent.futures.Executor`.
 
     `engines` is a number of engines on this machine, or the commands that run them, which may be elsewhere:
-    `Pool(["ssh a krutil-qvm --stdio", "ssh b krutil-qvm --stdio"])`. They are started at once; what hinders one of them is
-    raised here. `timeout` is what each has for its handshake, in seconds.
+    `Pool(["ssh a krutil-qvm --stdio", "ssh b krutil-qvm --stdio"])`. They are started at once; what hinders one of them
+    is raised here. `timeout` is what each has for its handshake, in seconds.
 
-    An engine that is lost fails the call that it was running, with `Lost`. No call is made twice: whether that call may be
-    repeated, only its caller knows. The engine is started again when it has a call to run. If that fails, there is a
+    An engine that is lost fails the call that it was running, with `Lost`. No call is made twice: whether that call may
+    be repeated, only its caller knows. The engine is started again when it has a call to run. If that fails, there is a
     warning, and the others do its work; when none is left, the calls that wait fail with `Lost`, and so do later ones.
 
-    At the end of a block, or with `shutdown()`, all calls have ended and the engines have shut down. Any thread may use a
-    pool.
+    At the end of a block, or with `shutdown()`, all calls have ended and the engines have shut down. Any thread may use
+    a pool.
 
     >>> with krutil.Pool(2) as pool:
     ...     inverse = pool.submit("numpy.linalg.inv", numpy.array([[2.0, 0.0], [0.0, 4.0]]))
@@ -69,8 +69,8 @@ class Pool(Executor):
             thread.start()
 
     def submit(self, function: str, /, *arguments: Any, outputs: int = 1) -> "Future[Any]":  # type: ignore[override]
-        """Has an engine call a function; arguments and outputs are those of `Session.call()`. An argument must stay as it is
-        until the future is done. A call that waits for an engine can be cancelled, and one that runs cannot."""
+        """Has an engine call a function; arguments and outputs are those of `Session.call()`. An argument must stay as
+        it is until the future is done. A call that waits for an engine can be cancelled, and one that runs cannot."""
         call = _Call(function, arguments, outputs)
         with self._changed:
             if self._closed:

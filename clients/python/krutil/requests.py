@@ -5,9 +5,10 @@ import enum
 import threading
 import time
 from concurrent.futures import Future
-from dataclasses import dataclass
+from dataclasses import dataclass, field
 from typing import TYPE_CHECKING, Any, Callable, Generic, Iterator, NamedTuple, Optional, TypeVar, Union
 
+from .displays import Display, DisplayLine
 from .errors import RemoteFrame
 
 if TYPE_CHECKING:
@@ -58,7 +59,7 @@ class Warned(NamedTuple):
     frames: tuple[RemoteFrame, ...]
 
 
-Event = Union[Text, Value, State, Warned]
+Event = Union[Text, Value, State, Warned, DisplayLine, Display]
 
 
 class CancelAnswer(enum.Enum):
@@ -83,6 +84,8 @@ class Result:
     #: The value of a trailing expression as text; None without one, and for the value None.
     value: Optional[str]
     warnings: tuple[Warned, ...]
+    #: Pictures and other forms of values; none without `on_display`.
+    displays: tuple[Display, ...] = field(default=(), repr=False)
 
 
 class Request(Generic[T]):
@@ -145,7 +148,7 @@ class Request(Generic[T]):
         return self._session._submit_cancel(self._identifier, even_if_running)
 
     def events(self, timeout: Optional[float] = None) -> Iterator[Event]:
-        """What happens, as it happens: `Text`, `Value`, `Warned` and `State`, up to the reply.
+        """What happens, as it happens: `Text`, `Value`, `Warned`, `State`, `DisplayLine` and `Display`, up to the end.
 
         Each call begins at the first event. Raises `TimeoutError` if the reply has not come within the timeout, in
         seconds from the first step. What the reply says is left to `result()`.
@@ -174,13 +177,21 @@ class Request(Generic[T]):
     def value(self) -> Optional[str]:
         """The value of a trailing expression as text, if there is one."""
         # What is shown before a prompt is where the code stands; its value comes at its end.
-        shown = "".join(event for event in self._since_prompt() if isinstance(event, Value))
+        # A line that stands for no display is the text of a value that looks like one.
+        numbers = {display.number for display in self.displays}
+        shown = "".join(event for event in self._since_prompt() if isinstance(event, Value)
+                        or (isinstance(event, DisplayLine) and event.number not in numbers))
         return shown[:-1] if shown.endswith("\n") else shown or None
 
     @property
     def warnings(self) -> tuple[Warned, ...]:
         """The warnings so far."""
         return tuple(event for event in self._so_far() if isinstance(event, Warned))
+
+    @property
+    def displays(self) -> tuple[Display, ...]:
+        """The pictures and other forms of values that have come so far; they come at the end."""
+        return tuple(event for event in self._so_far() if isinstance(event, Display))
 
     def _so_far(self, position: int = 0) -> list[Event]:
         with self._changed:

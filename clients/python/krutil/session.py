@@ -14,8 +14,9 @@ from typing import Any, Callable, Optional, Sequence, TypeVar, Union
 
 from . import arrays
 from .dispatch import Dispatch
+from .displays import OnDisplay
 from .errors import Refused
-from .handshake import DEBUGGING, INTERACTIVE_COMMAND_LINE, shake_hands
+from .handshake import DEBUGGING, INTERACTIVE_COMMAND_LINE, WEB_WINDOW, shake_hands
 from .prompts import OnDebug, OnInput
 from .requests import CancelAnswer, OnText, Request, Result, Text
 from .schema import EvalIIP, FEvalIIP, IIPCancelMessage, IIPEnqueueMessage, WhenToDequeue
@@ -37,19 +38,23 @@ class Session:
 
     def __init__(self, connection: socket.socket, process: "Optional[subprocess.Popen[bytes]]" = None, *,
                  on_input: Optional[OnInput] = None, on_debug: Optional[OnDebug] = None,
-                 on_text: Optional[OnText] = None, limits: Limits = Limits(), timeout: float = 10) -> None:
+                 on_text: Optional[OnText] = None, on_display: Optional[OnDisplay] = None, limits: Limits = Limits(),
+                 timeout: float = 10) -> None:
         """A session over a connected stream socket, which it owns from now on, with its engine's process if that ends
         with it. The arguments are told under `start()`."""
         capabilities = [INTERACTIVE_COMMAND_LINE] if on_input else []
         if on_debug:
             capabilities.append(DEBUGGING)
+        if on_display:
+            capabilities.append(WEB_WINDOW)
         reader = Reader(connection)
         self._process = process
         settled = shake_hands(connection, reader, limits, capabilities, timeout)
         self._zero_copy = settled.zero_copy
         # The upper half of all identifiers; the lower one counts.
         self._identity = secrets.randbits(64)
-        self._dispatch = Dispatch(self, connection, process, reader, limits, settled, on_input, on_debug, on_text)
+        self._dispatch = Dispatch(self, connection, process, reader, limits, settled, on_input, on_debug, on_text,
+                                  on_display)
 
     def eval(self, code: str, *, on_text: Optional[OnText] = None, timeout: Optional[float] = None) -> Result:
         """Evaluates code, and returns its output and the value of a trailing expression as text.
@@ -99,11 +104,7 @@ class Session:
         ...     session.submit_call("numpy.arange", 3).result()
         array([0, 1, 2])
         """
-        frames: list[Frame] = []
-        indexes = [arrays.add_argument(frames, argument, self._zero_copy) for argument in arguments]
-        request = FEvalIIP(functionName=function, nlhs=outputs, dataIDs=indexes,
-                           clientQvmID=_ANY_ENGINE, serverQvmID=_ANY_ENGINE)
-        return self._enqueue(frames, "krutil:FEvalIIP", request, "DEQUEUE_AT_IDLE", _call_result(outputs))
+        return self._submit_call(function, arguments, outputs, "DEQUEUE_AT_IDLE")
 
     def close(self, timeout: Optional[float] = None) -> None:
         """Says goodbye, and waits until the engine has answered all requests and has shut down.
@@ -155,6 +156,13 @@ class Session:
     def _submit_eval(self, code: str, mode: str) -> "Request[Result]":
         return self._enqueue([], "krutil:EvalIIP", EvalIIP(cmd=code), mode, _eval_result)
 
+    def _submit_call(self, function: str, arguments: Sequence[Any], outputs: int, mode: str) -> "Request[Any]":
+        frames: list[Frame] = []
+        indexes = [arrays.add_argument(frames, argument, self._zero_copy) for argument in arguments]
+        request = FEvalIIP(functionName=function, nlhs=outputs, dataIDs=indexes,
+                           clientQvmID=_ANY_ENGINE, serverQvmID=_ANY_ENGINE)
+        return self._enqueue(frames, "krutil:FEvalIIP", request, mode, _call_result(outputs))
+
     def _submit_cancel(self, identifier: tuple[int, int], even_if_running: bool) -> "Future[CancelAnswer]":
         message = IIPCancelMessage(evenIfRunning=even_if_running)
         message.iipid.hi, message.iipid.lo = identifier
@@ -191,7 +199,8 @@ class Session:
 
 
 def start(command: Optional[Command] = None, *, on_input: Optional[OnInput] = None, on_debug: Optional[OnDebug] = None,
-          on_text: Optional[OnText] = None, limits: Limits = Limits(), timeout: float = 10) -> Session:
+          on_text: Optional[OnText] = None, on_display: Optional[OnDisplay] = None, limits: Limits = Limits(),
+          timeout: float = 10) -> Session:
     """Starts an engine as a child of this process, and a session with it. Both end together.
 
     `command` is what to run: a list of words, or text that is taken apart as a shell does. Its standard input and
@@ -201,7 +210,9 @@ def start(command: Optional[Command] = None, *, on_input: Optional[OnInput] = No
     `on_input` answers code that reads a line: it gets the text of the prompt, and returns the line, or None for the end
     of input. `on_debug` serves code that stops: it gets a `Prompt`. Each is called in a thread of its own. Without them
     the engine never asks. `on_text` gets text that comes while no request runs, in the thread that reads, so it must
-    return soon. `limits` is what this end accepts. `timeout` is what the engine has for its handshake, in seconds.
+    return soon. `on_display` gets each `Display`, in that thread too, before the result of its request is there;
+    without it, code shows no pictures. `limits` is what this end accepts. `timeout` is what the engine has for its
+    handshake, in seconds.
 
     Raises `Refused`, `Aborted` or `Lost` when there is no session, and `FileNotFoundError` when there is no program.
 
@@ -221,8 +232,8 @@ def start(command: Optional[Command] = None, *, on_input: Optional[OnInput] = No
         process = subprocess.Popen(["/bin/sh", "-c", 'trap "" INT; exec "$@"', "sh", program, *words[1:]],
                                    stdin=theirs.fileno(), stdout=theirs.fileno())
     try:
-        return Session(ours, process, on_input=on_input, on_debug=on_debug, on_text=on_text, limits=limits,
-                       timeout=timeout)
+        return Session(ours, process, on_input=on_input, on_debug=on_debug, on_text=on_text,
+                       on_display=on_display, limits=limits, timeout=timeout)
     except BaseException:
         ours.close()
         process.kill()
@@ -231,7 +242,8 @@ def start(command: Optional[Command] = None, *, on_input: Optional[OnInput] = No
 
 
 def connect(path: "str | os.PathLike[str]", *, on_input: Optional[OnInput] = None, on_debug: Optional[OnDebug] = None,
-            on_text: Optional[OnText] = None, limits: Limits = Limits(), timeout: float = 10) -> Session:
+            on_text: Optional[OnText] = None, on_display: Optional[OnDisplay] = None, limits: Limits = Limits(),
+          timeout: float = 10) -> Session:
     """Begins a session with an engine that listens (`krutil-qvm --listen PATH`). The arguments are those of `start()`.
 
     Raises `OSError` when nothing listens there.
@@ -243,15 +255,15 @@ def connect(path: "str | os.PathLike[str]", *, on_input: Optional[OnInput] = Non
     connection = socket.socket(socket.AF_UNIX)
     try:
         connection.connect(os.fspath(path))
-        return Session(connection, on_input=on_input, on_debug=on_debug, on_text=on_text, limits=limits,
-                       timeout=timeout)
+        return Session(connection, on_input=on_input, on_debug=on_debug, on_text=on_text,
+                       on_display=on_display, limits=limits, timeout=timeout)
     except BaseException:
         connection.close()
         raise
 
 
 def _eval_result(request: "Request[Any]", _: Any) -> Result:
-    return Result(request.output, request.value, request.warnings)
+    return Result(request.output, request.value, request.warnings, request.displays)
 
 
 def _call_result(outputs: int) -> Callable[["Request[Any]", Any], Any]:

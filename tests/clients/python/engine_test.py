@@ -23,6 +23,18 @@ from scripted import PATIENCE
 
 KiB, MiB = 1 << 10, 1 << 20
 
+PNG = b"\x89PNG\r\n\x1a\n\x00\x00\x00\rIHDR\x00\x00\x00\x02\x00\x00\x00\x01 the rest"
+PICTURES = f"""
+class Html:
+    def __repr__(self): return 'h'
+    def _repr_html_(self): return '<i>h</i>'
+
+class Both:
+    def __repr__(self): return 'a value'
+    def _repr_png_(self): return {PNG}
+    def _repr_html_(self): return '<b>zwölf</b>'
+"""
+
 
 class Listener:
     """An engine that listens below a directory of its own."""
@@ -87,6 +99,49 @@ class Behaviour:
             warned, = result.warnings
             self.assertEqual(warned[:2], ("FutureWarning", "careful"))
             self.assertEqual([frame[1:] for frame in warned.frames], [("<module>", 4), ("f", 3)])
+
+    def test_displays(self):
+        shown = []
+        with self.begin(on_display=shown.append) as session:
+            session.eval(PICTURES, timeout=PATIENCE)
+            result = session.eval("print('before'); Both()", timeout=PATIENCE)
+            self.assertEqual((result.output, result.value), ("before\n", "a value"))
+            display, = result.displays
+            self.assertEqual(display, krutil.Display(1, {"image/png": PNG, "text/html": "<b>zwölf</b>"}))
+            self.assertEqual(shown, [display])
+            # Of two requests that run before the engine is asked, each has its own.
+            requests = [session.submit(code) for code in ("Html()", "1", "Html(); Html(); Html()", "Html(); 1 / 0")]
+            self.assertEqual([request.result(PATIENCE).value for request in requests[:3]], ["h", "1", "h"])
+            self.assertRaises(krutil.RemoteError, requests[3].result, PATIENCE)
+            self.assertEqual([[display.number for display in request.displays] for request in requests], [[2], [], [3], []])
+
+    def test_displays_of_a_request_that_fails(self):
+        with self.begin(on_display=lambda display: None) as session:
+            session.eval(PICTURES, timeout=PATIENCE)
+            request = session.submit("import sys; sys.displayhook(Html()); 1 / 0")
+            self.assertRaises(krutil.RemoteError, request.result, PATIENCE)
+            self.assertEqual([display.formats for display in request.displays], [{"text/html": "<i>h</i>"}])
+
+    def test_displays_at_a_prompt(self):
+        seen = []
+        with self.begin(on_display=lambda display: None,
+                        on_debug=lambda prompt: seen.append(prompt.eval("Html()", timeout=PATIENCE).displays)) as session:
+            session.eval(PICTURES, timeout=PATIENCE)
+            outer = session.eval("breakpoint(); Both()", timeout=PATIENCE)
+        self.assertEqual([[display.number for display in each] for each in (*seen, outer.displays)], [[1], [2]])
+
+    def test_a_value_that_looks_like_a_display(self):
+        code = "class Trick:\n  def __repr__(self): return '[picture 9: image/png, 1 x 1]'\nTrick()"
+        for options in {"on_display": lambda display: None}, {}:
+            with self.begin(**options) as session:
+                result = session.eval(code, timeout=PATIENCE)
+                self.assertEqual((result.value, result.displays), ("[picture 9: image/png, 1 x 1]", ()))
+
+    def test_without_on_display_nothing_is_shown(self):
+        with self.begin() as session:
+            session.eval(PICTURES, timeout=PATIENCE)
+            result = session.eval("Both()", timeout=PATIENCE)
+            self.assertEqual((result.value, result.displays), ("a value", ()))
 
     def test_an_error_with_its_cause(self):
         code = "def f():\n    1 / 0\ntry:\n    f()\nexcept ZeroDivisionError as e:\n    raise ValueError('no') from e"

@@ -399,7 +399,7 @@ class ViolationTest(unittest.TestCase):
 class UnusualTest(unittest.TestCase):
     """What is within the protocol, but not what the engine of this repository does."""
 
-    def with_engine(self, script):
+    def with_engine(self, script, **options):
         def whole(engine):
             engine.greet()
             script(engine)
@@ -408,7 +408,7 @@ class UnusualTest(unittest.TestCase):
 
         engine = ScriptedEngine(whole)
         self.addCleanup(engine.join)
-        return krutil.Session(engine.connection, timeout=PATIENCE)
+        return krutil.Session(engine.connection, timeout=PATIENCE, **options)
 
     def test_replies_in_any_order(self):
         def script(engine):
@@ -457,6 +457,46 @@ class UnusualTest(unittest.TestCase):
 
         with self.with_engine(script) as session:
             self.assertEqual(session.eval("", timeout=PATIENCE).warnings, (krutil.Warned("\ufffd\ufffd", "\ufffd", ()),))
+
+    def test_displays_that_are_none(self):
+        answers = {
+            "no": "Expecting value: line 1 column 1 (char 0)",
+            "[{}]": "a description without what it must have (KeyError('formats'))",
+            '[{"number": 1, "formats": [{"type": "image/png", "bytes": 5}]}]': "a picture of 5 bytes, where 4 are left",
+            '[{"number": 1, "formats": [{"type": "image/png", "bytes": -1}]}]': "a picture of -1 bytes, where 4 are left",
+            "[" * 100_000: "maximum recursion depth exceeded while decoding a JSON array from a unicode string",
+        }
+        for answer, told in answers.items():
+            def script(engine):
+                stream = engine.read_message().stream
+                line = schema.SinkTextEvent(text="[picture 1: image/png, 2 x 2]\n")
+                engine.send(message(stream, ("krutil:SinkTextEvent", line)) + message(stream, *DONE))
+                asked = engine.read_message()
+                text = array(elementType=2, dimensions=[1, len(answer)], inlineElements=answer.encode("utf-16-le"))
+                data = array(elementType=7, dimensions=[4], inlineElements=b"data")
+                engine.send(call_reply(("krutil:QDA", text), ("krutil:QDA", data), ids=(1, 2), stream=asked.stream))
+
+            with self.subTest(answer=answer[:50]), self.with_engine(script, on_display=lambda display: None) as session:
+                done = session.eval("", timeout=PATIENCE)
+                self.assertEqual((done.displays, done.warnings), ((), (krutil.Warned(
+                    "RuntimeWarning", f"the pictures are lost: {told}", ()),)))
+                # What the line stood for is not there, so it is the text of a value.
+                self.assertEqual(done.value, "[picture 1: image/png, 2 x 2]")
+
+    def test_displays_when_the_session_ends_before_they_come(self):
+        def script(engine):
+            engine.greet()
+            stream = engine.read_message().stream
+            line = schema.SinkTextEvent(text="[picture 1: image/png, 2 x 2]\n")
+            engine.send(message(stream, ("krutil:SinkTextEvent", line)) + message(stream, *DONE) + SHUTDOWN)
+
+        engine = ScriptedEngine(script)
+        session = krutil.Session(engine.connection, on_display=lambda display: None, timeout=PATIENCE)
+        done = session.eval("", timeout=PATIENCE)
+        self.assertEqual([warned.message for warned in done.warnings],
+                         ["the pictures are lost: the engine has ended the session"])
+        session.close(PATIENCE)
+        engine.join()
 
     def test_an_engine_that_ends_by_itself(self):
         def script(engine):
