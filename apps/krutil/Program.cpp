@@ -24,7 +24,9 @@
 #include "krutil/display/JsonPrinter.hpp"
 #include "krutil/display/PersonPrinter.hpp"
 #include "krutil/session/Client.hpp"
+#include "krutil/terminal/EngineHelp.hpp"
 #include "krutil/terminal/LineEditor.hpp"
+#include "krutil/terminal/LineHistory.hpp"
 #include "krutil/terminal/LineReader.hpp"
 #include "krutil/terminal/Prompts.hpp"
 
@@ -75,6 +77,7 @@ class AskingClient {
                  std::string history = {})
         : client_(options.connection, options.display, printer, terminal.out, terminal.err, terminal.interrupt,
                   interactive),
+          help_(client_),
           terminal_(terminal),
           history_(std::move(history)),
           edits_(interactive && terminal.out.hasCursor() && !options.display.json),
@@ -110,13 +113,17 @@ class AskingClient {
             }
             // Most commands end without a question.
             if (!editor_) {
-                editor_.emplace(client_.conversation(), terminal_.out, terminal_.lastLine, history_);
+                editor_.emplace(terminal_.out, terminal_.lastLine, history_);
             }
-            return editor_->read(what, prompt, done);
+            return editor_->read(client_.conversation(), complete_, what, prompt, done);
         };
     }
 
     Client client_;
+    EngineHelp help_;
+    const Complete complete_ = [this](const std::wstring& text, std::size_t cursor) {
+        return help_.complete(text, cursor);
+    };
     Terminal& terminal_;
     const std::string history_;
     const bool edits_;

@@ -1,29 +1,23 @@
 #include "krutil/commands/CallCommand.hpp"
 
 #include <algorithm>
-#include <boost/make_shared.hpp>
 #include <cstdint>
 #include <utility>
 
-#include "cmddistributor/FEvalIIP.hpp"
-#include "cmddistributor/FEvalResult.hpp"
 #include "krutil/arrays/ArgumentLiteral.hpp"
 #include "krutil/base/Text.hpp"
 #include "krutil/display/Progress.hpp"
 #include "krutil/io/SinkTextEvent.hpp"
 #include "krutil/io/TextBaseEvent.hpp"
+#include "krutil/session/FunctionCall.hpp"
 
 namespace krutil_client {
 namespace {
 
-using cmddistributor::FEvalIIP;
-using cmddistributor::FEvalResult;
 using foundation::korveldata::Array;
 using namespace std::chrono_literals;
 
 constexpr auto progressInterval = 100ms;
-// The engine that receives a call is the one that it is for; it has no other name here.
-constexpr krutil::contextmgr::QvmID anyEngine = 1;
 
 std::size_t characters(std::string_view text) {
     return static_cast<std::size_t>(std::count_if(
@@ -80,14 +74,6 @@ Array readArgument(const std::string& argument, std::size_t number) {
     }
 }
 
-krutil::contextmgr::QvmID randomClientID() {
-    krutil::contextmgr::QvmID id = 0;
-    while (id == 0) {
-        id = foundation::msg_svc::exchange::IDType::random().lo();
-    }
-    return id;
-}
-
 // Shows how far the arrays of a call are, as long as the object lives and `err` is a terminal with a cursor.
 class TransferDisplay {
   public:
@@ -137,14 +123,9 @@ class TransferDisplay {
     std::vector<foundation::msg_svc::eventmgr::EventMgr::Subscription> subscriptions_;
 };
 
-// The outputs that a reply holds. Throws Failure for another number than was asked for.
-std::vector<Array> outputsOf(const krutil::cmddistributor::IIPReply& reply, std::size_t asked) {
-    std::vector<Array> outputs;
-    if (const auto* result = dynamic_cast<const FEvalResult*>(reply.getResult().get())) {
-        if (const auto* arrays = boost::get<std::vector<Array>>(&result->getResults())) {
-            outputs = *arrays;
-        }
-    }
+// Throws Failure for another number of outputs than was asked for.
+std::vector<Array> checkedOutputsOf(const krutil::cmddistributor::IIPReply& reply, std::size_t asked) {
+    auto outputs = outputsOf(reply);
     if (outputs.size() != asked) {
         throw Failure(ExitCode::Violation, "the engine returned " + std::to_string(outputs.size()) +
                                                " outputs of the function; " + std::to_string(asked) +
@@ -179,11 +160,7 @@ ExitCode callFunction(Client& client, const CallOptions& options, PreparedCall c
     for (const Array& argument : call.arguments) {
         toSend += argument.sizeInBytes();
     }
-    FEvalIIP::Arguments arguments = krutil::cmddistributor::EDIDataWrapper(std::move(call.arguments));
-    const auto iip = boost::make_shared<const FEvalIIP>(
-        "python", options.function, options.outputs, FEvalIIP::Data::makeClientSideData(std::move(arguments)),
-        cmddistributor::IqmStreamID::ekIqmCmdWinStream, client.outTraits(options.sink), client.errTraits(options.sink),
-        randomClientID(), anyEngine, true);
+    const auto iip = requestOf(client, {options.function, options.outputs, std::move(call.arguments)}, options.sink);
     Answer answer;
     {
         const TransferDisplay display(client, err, toSend);
@@ -192,7 +169,7 @@ ExitCode callFunction(Client& client, const CallOptions& options, PreparedCall c
     if (answer.exitCode != ExitCode::Ok) {
         return answer.exitCode;
     }
-    const auto outputs = outputsOf(*answer.reply, options.outputs);
+    const auto outputs = checkedOutputsOf(*answer.reply, options.outputs);
     for (std::size_t i = 0; i < outputs.size(); ++i) {
         std::string path;
         if (i < call.files.size()) {

@@ -50,7 +50,7 @@ ReadLine readCode(const Prompts::Read& read, Interrupt& interrupt, bool terminal
     }
     try {
         ReadLine code = read(">>> ", never);
-        while (code.end == ReadLine::End::Newline && code.text[0] != ':' && needsMoreLines(code.text)) {
+        while (code.end == ReadLine::End::Newline && !isWhole(code.text)) {
             const ReadLine line = read("... ", never);
             if (line.end != ReadLine::End::Newline) {
                 break;

@@ -11,7 +11,6 @@
 #include "cmddistributor/EvalIIP.hpp"
 #include "cmddistributor/IIPCancelMessage.hpp"
 #include "cmddistributor/IIPCancelReply.hpp"
-#include "cmddistributor/IIPEnqueueMessage.hpp"
 #include "common/Build.hpp"
 #include "common/KrutilSession.hpp"
 #include "common/Precheck.hpp"
@@ -160,13 +159,18 @@ boost::shared_ptr<const cmddistributor::IIP> Client::evaluation(const std::strin
                                                              msg_svc::protobuf::utf8_to_ustring(code), type);
 }
 
+boost::shared_ptr<const cmddistributor::IIPEnqueueMessage> Client::messageOf(
+    const NewRequest& request, const foundation::msg_svc::exchange::IDType& id) {
+    return boost::make_shared<const cmddistributor::IIPEnqueueMessage>(
+        request.iip, id, krutil::contextmgr::QcrID{0}, boost::none, nullptr, request.when,
+        msg_svc::protobuf::utf8_to_ustring(request.name), capabilities::CapabilityList{}, nullptr, request.sparingly);
+}
+
 Client::Sent Client::send(const NewRequest& request) {
     const auto sent = std::make_shared<SentRequest>();
     sent->id = foundation::msg_svc::exchange::IDType::random();
     sent->name = request.name;
-    const auto message = boost::make_shared<const cmddistributor::IIPEnqueueMessage>(
-        request.iip, sent->id, krutil::contextmgr::QcrID{0}, boost::none, nullptr, request.when,
-        msg_svc::protobuf::utf8_to_ustring(request.name), capabilities::CapabilityList{}, nullptr, request.sparingly);
+    const auto message = messageOf(request, sent->id);
     // Requests at prompts are a part of the one that they hold up.
     const bool timed = timing_ && request.when == krutil::cmddistributor::WhenToDequeue::DEQUEUE_AT_IDLE;
     Timing timing;

@@ -10,6 +10,7 @@
 
 #include "cmddistributor/CodeType.hpp"
 #include "cmddistributor/IIP.hpp"
+#include "cmddistributor/IIPEnqueueMessage.hpp"
 #include "foundation/msg_svc/eventmgr/EventMgr.hpp"
 #include "krutil/base/Interrupt.hpp"
 #include "krutil/base/Options.hpp"
@@ -61,6 +62,10 @@ class Client {
     /// A request to evaluate `code`, which is UTF-8.
     boost::shared_ptr<const cmddistributor::IIP> evaluation(const std::string& code, cmddistributor::CodeType type,
                                                             const SinkOptions& options) const;
+
+    /// The message that enqueues a request under this identifier.
+    static boost::shared_ptr<const cmddistributor::IIPEnqueueMessage> messageOf(
+        const NewRequest& request, const foundation::msg_svc::exchange::IDType& id);
 
     using Sent = std::shared_ptr<const SentRequest>;
 

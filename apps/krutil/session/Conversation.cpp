@@ -50,6 +50,17 @@ Conversation::~Conversation() {
 
 void Conversation::send(const boost::shared_ptr<const foundation::msg_svc::exchange::Message>& message,
                         ReplyAction action) {
+    begin(message, std::move(action));
+}
+
+void Conversation::sendQuietly(const boost::shared_ptr<const foundation::msg_svc::exchange::Message>& message,
+                               ReplyAction action) {
+    // What comes of it is delivered on this thread, so not before it is noted.
+    quiet_.insert(begin(message, std::move(action)));
+}
+
+Conversation::StreamID Conversation::begin(
+    const boost::shared_ptr<const foundation::msg_svc::exchange::Message>& message, ReplyAction&& action) {
     const StreamID stream = session_->newStreamID();
     actions_.emplace(stream, std::move(action));
     try {
@@ -58,6 +69,7 @@ void Conversation::send(const boost::shared_ptr<const foundation::msg_svc::excha
         actions_.erase(stream);
         throw;
     }
+    return stream;
 }
 
 Conversation::Reply Conversation::ask(const boost::shared_ptr<const foundation::msg_svc::exchange::Message>& message) {
@@ -135,19 +147,32 @@ bool Conversation::deliverOne() {
     // Taken out first: what is called may itself wait and deliver.
     Arrived next = std::move(taken_.front());
     taken_.pop_front();
-    stopPastime();
+    if (!isQuiet(next)) {
+        stopPastime();
+    }
     deliver(next);
     return true;
 }
 
+bool Conversation::isQuiet(const Arrived& arrived) const {
+    if (const auto* event = std::get_if<ArrivedEvent>(&arrived.what)) {
+        return quiet_.contains(event->stream);
+    }
+    const auto* answer = std::get_if<ArrivedReply>(&arrived.what);
+    return answer != nullptr && quiet_.contains(answer->stream);
+}
+
 void Conversation::deliver(Arrived& arrived) {
-    if (const auto* event = std::get_if<Event>(&arrived.what)) {
-        events_.publish(*event);
+    if (const auto* event = std::get_if<ArrivedEvent>(&arrived.what)) {
+        if (!quiet_.contains(event->stream)) {
+            events_.publish(event->event);
+        }
     } else if (const auto* answer = std::get_if<ArrivedReply>(&arrived.what)) {
         // The session let it through, so the exchange is one of ours.
         const auto found = actions_.find(answer->stream);
         const ReplyAction action = std::move(found->second);
         actions_.erase(found);
+        quiet_.erase(answer->stream);
         action(answer->reply);
     } else {
         end_ = std::get<SessionEnd>(std::move(arrived.what));
@@ -207,12 +232,12 @@ void Conversation::onReply(StreamID stream, const Reply& reply) {
     arrive({ArrivedReply{stream, reply}, bytesOfAnything});
 }
 
-void Conversation::onEvent(StreamID, const Event& event) {
+void Conversation::onEvent(StreamID stream, const Event& event) {
     std::size_t bytes = bytesOfAnything;
     if (const auto* text = dynamic_cast<const krutil::io::TextBase*>(event.get())) {
         bytes += text->getText().size() * sizeof(char16_t);
     }
-    arrive({event, bytes});
+    arrive({ArrivedEvent{stream, event}, bytes});
 }
 
 void Conversation::onEnd(const SessionEnd& end) {

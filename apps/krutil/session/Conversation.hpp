@@ -12,6 +12,7 @@
 #include <mutex>
 #include <optional>
 #include <unordered_map>
+#include <unordered_set>
 #include <utility>
 #include <variant>
 
@@ -65,6 +66,10 @@ class Conversation : private foundation::msg_svc::transport::layers::session::Se
     /// Begins an exchange; `action` is called with the reply, in a run function. Throws what Session::send() throws.
     void send(const boost::shared_ptr<const foundation::msg_svc::exchange::Message>& message, ReplyAction action);
 
+    /// The same for an exchange that nobody is to see anything of: its events are not published, and a pastime goes on.
+    void sendQuietly(const boost::shared_ptr<const foundation::msg_svc::exchange::Message>& message,
+                     ReplyAction action);
+
     /// Begins an exchange and delivers until its reply has come. Throws what send() and run() throw.
     Reply ask(const boost::shared_ptr<const foundation::msg_svc::exchange::Message>& message);
 
@@ -110,8 +115,12 @@ class Conversation : private foundation::msg_svc::transport::layers::session::Se
         StreamID stream;
         Reply reply;
     };
+    struct ArrivedEvent {
+        StreamID stream;
+        Event event;
+    };
     struct Arrived {
-        std::variant<Event, ArrivedReply, SessionEnd> what;
+        std::variant<ArrivedEvent, ArrivedReply, SessionEnd> what;
         std::size_t bytes;  ///< roughly what it holds in memory
     };
 
@@ -120,6 +129,9 @@ class Conversation : private foundation::msg_svc::transport::layers::session::Se
     void onEnd(const SessionEnd& end) override;
 
     void arrive(Arrived&& arrived);
+    StreamID begin(const boost::shared_ptr<const foundation::msg_svc::exchange::Message>& message,
+                   ReplyAction&& action);
+    bool isQuiet(const Arrived& arrived) const;
     bool deliverOne();
     void deliver(Arrived& arrived);
     void stopPastime();
@@ -128,7 +140,8 @@ class Conversation : private foundation::msg_svc::transport::layers::session::Se
     foundation::msg_svc::eventmgr::EventMgr& events_;
     Interrupt& interrupt_;
     std::unordered_map<StreamID, ReplyAction> actions_;
-    std::deque<Arrived> taken_;  ///< arrived and not yet delivered
+    std::unordered_set<StreamID> quiet_;  ///< of those in actions_
+    std::deque<Arrived> taken_;           ///< arrived and not yet delivered
     std::optional<SessionEnd> end_;
     int watched_ = -1;
     std::function<void()> watchAction_;

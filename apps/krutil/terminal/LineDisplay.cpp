@@ -142,6 +142,9 @@ std::string LineDisplay::show(const Line& line, Size size) {
             layout.markCursor();
         }
         layout.put(line.text[i]);
+        if (line.text[i] == L'\n') {
+            layout.putPrompt(line.continuation);
+        }
     }
     if (line.cursor >= line.text.size()) {
         layout.markCursor();

@@ -25,6 +25,8 @@ class LineDisplay {
         std::wstring prompt;  ///< for which measures() is true
         std::wstring text{};
         std::size_t cursor = 0;  ///< the character of `text` that the cursor stands before
+        std::wstring
+            continuation{};  ///< stands before each line of `text` but the first one; measures() is true for it
     };
 
     /// Whether the place of the cursor after this text is known: it has no control characters but tabs and complete

@@ -7,16 +7,19 @@
 #include <cerrno>
 #include <clocale>
 #include <cstdio>
-#include <cstdlib>
 #include <cwchar>
 #include <exception>
-#include <filesystem>
+#include <optional>
 #include <stdexcept>
 #include <string_view>
+#include <vector>
 
 #include "krutil/base/Text.hpp"
+#include "krutil/terminal/EditedText.hpp"
+#include "krutil/terminal/HistorySearch.hpp"
 #include "krutil/terminal/LineDisplay.hpp"
 #include "krutil/terminal/LineHistory.hpp"
+#include "krutil/terminal/PythonInput.hpp"
 #include "krutil/terminal/TerminalRestorer.hpp"
 
 namespace krutil_client {
@@ -29,7 +32,13 @@ constexpr const wchar_t* pasteBegins = L"\x1b[200~";
 constexpr std::wstring_view pasteEnds = L"\x1b[201~";
 constexpr const char* clearTerminal = "\x1b[H\x1b[2J";
 constexpr char endOfInput = 4;
-constexpr const wchar_t* indentation = L"    ";
+constexpr const char* beep = "\a";
+constexpr const wchar_t* olderKey = L"^P";
+constexpr const wchar_t* newerKey = L"^N";
+// What these keys send.
+constexpr const wchar_t* older = L"\x10";
+constexpr const wchar_t* newer = L"\x0e";
+constexpr const wchar_t* continuation = L"... ";
 
 std::string withUtf8(std::string text) {
     std::setlocale(LC_CTYPE, "C.UTF-8");
@@ -51,9 +60,8 @@ struct Close {
 // and takes characters of no width for ones of width one.
 class LineEditor::Impl {
   public:
-    Impl(Conversation& conversation, Output& out, LastLine& lastLine, std::string historyFile)
-        : conversation_(conversation),
-          out_(out),
+    Impl(Output& out, LastLine& lastLine, std::string historyFile)
+        : out_(out),
           lastLine_(lastLine),
           codeHistory_(withUtf8(std::move(historyFile))),
           noHistory_(std::string()),
@@ -70,10 +78,7 @@ class LineEditor::Impl {
         // Signals are the program's own to handle.
         ::el_wset(editor_, EL_SIGNAL, 0);
         ::el_wset(editor_, EL_GETCFN, &Impl::getCharacter);
-        ::el_wset(editor_, EL_BIND, L"^R", L"em-inc-search-prev", nullptr);
-        bind<&Impl::paste>(L"paste", pasteBegins);
-        bind<&Impl::clear>(L"clear-all", L"^L");
-        bind<&Impl::indent>(L"indent", L"\t");
+        bindKeys();
     }
 
     ~Impl() { ::el_end(editor_); }
@@ -81,8 +86,13 @@ class LineEditor::Impl {
     Impl(const Impl&) = delete;
     Impl& operator=(const Impl&) = delete;
 
-    ReadLine read(For what, const std::string& prompt, const std::function<bool()>& done) {
+    ReadLine read(Conversation& conversation, const Complete& complete, For what, const std::string& prompt,
+                  const std::function<bool()>& done) {
+        conversation_ = &conversation;
+        complete_ = &complete;
+        what_ = what;
         done_ = &done;
+        lastTab_.reset();
         doneSeen_ = false;
         error_ = nullptr;
         text_.clear();
@@ -91,8 +101,9 @@ class LineEditor::Impl {
         show(display_.begin(toWide(lastLine_.text()), size()));
         prompt_ = toWide(what == For::Input ? lastLine_.take() + prompt : prompt);
         away_ = false;
-        ::el_wset(editor_, EL_HIST, &::history_w, (what == For::Code ? codeHistory_ : noHistory_).get());
+        ::el_wset(editor_, EL_HIST, &::history_w, history().get());
         const wchar_t* typed = nullptr;
+        int count = 0;
         {
             TerminalRestorer restorer(markNoPastes);
             const Shown shown(*this, restorer);
@@ -102,16 +113,16 @@ class LineEditor::Impl {
                 // The terminal has shown it by itself.
                 display_.doubt();
             }
-            int count = 0;
             typed = ::el_wgets(editor_, &count);
         }
         if (typed != nullptr) {
-            text_ = typed;
+            // What Enter has inserted ends without a null character.
+            text_.assign(typed, static_cast<std::size_t>(count));
+            if (what == For::Code && text_.find_first_not_of(L" \t\n") != std::wstring::npos) {
+                codeHistory_.add(text_.c_str());
+            }
             if (!text_.empty() && text_.back() == L'\n') {
                 text_.pop_back();
-            }
-            if (what == For::Code && text_.find_first_not_of(L" \t\n") != std::wstring::npos) {
-                codeHistory_.add(typed);
             }
         }
         leave();
@@ -130,11 +141,11 @@ class LineEditor::Impl {
       public:
         Shown(Impl& editor, TerminalRestorer& restorer)
             : editor_(editor),
-              before_(editor.conversation_.setPastime({{},
-                                                       nullptr,
-                                                       [&editor] { editor.takeAway(); },
-                                                       [&editor, &restorer] { editor.bringBack(restorer); }})) {}
-        ~Shown() { editor_.conversation_.setPastime(std::move(before_)); }
+              before_(editor.conversation_->setPastime({{},
+                                                        nullptr,
+                                                        [&editor] { editor.takeAway(); },
+                                                        [&editor, &restorer] { editor.bringBack(restorer); }})) {}
+        ~Shown() { editor_.conversation_->setPastime(std::move(before_)); }
         Shown(const Shown&) = delete;
         Shown& operator=(const Shown&) = delete;
 
@@ -149,16 +160,48 @@ class LineEditor::Impl {
         return *static_cast<Impl*>(self);
     }
 
+    // Exceptions must not pass through the library, so they are kept for read().
     template <unsigned char (Impl::*action)()>
-    void bind(const wchar_t* name, const wchar_t* key) {
-        unsigned char (*const function)(EditLine*, wint_t) = [](EditLine* editor, wint_t) {
-            return (of(editor).*action)();
+    void bind(const wchar_t* name, const std::vector<const wchar_t*>& keys) {
+        unsigned char (*const function)(EditLine*, wint_t) = [](EditLine* editor, wint_t) -> unsigned char {
+            Impl& self = of(editor);
+            try {
+                return (self.*action)();
+            } catch (...) {
+                self.error_ = std::current_exception();
+                self.takeText();
+                return CC_EOF;
+            }
         };
         ::el_wset(editor_, EL_ADDFN, name, L"", function);
-        ::el_wset(editor_, EL_BIND, key, name, nullptr);
+        bindTo(name, keys);
     }
 
-    // Exceptions must not pass through the library, so they are kept for read().
+    void bindTo(const wchar_t* name, const std::vector<const wchar_t*>& keys) {
+        for (const wchar_t* const key : keys) {
+            ::el_wset(editor_, EL_BIND, key, name, nullptr);
+        }
+    }
+
+    void bindKeys() {
+        bind<&Impl::paste>(L"paste", {pasteBegins});
+        bind<&Impl::clear>(L"clear-all", {L"^L"});
+        bind<&Impl::enter>(L"enter", {L"^M", L"^J"});
+        bind<&Impl::tab>(L"tab", {L"\t"});
+        bind<&Impl::up>(L"up", {L"\x1b[A", L"\x1bOA"});
+        bind<&Impl::down>(L"down", {L"\x1b[B", L"\x1bOB"});
+        bind<&Impl::toLineBegin>(L"line-begin", {L"^A", L"\x1b[H", L"\x1bOH", L"\x1b[1~"});
+        bind<&Impl::toLineEnd>(L"line-end", {L"^E", L"\x1b[F", L"\x1bOF", L"\x1b[4~"});
+        bind<&Impl::eraseBack>(L"erase-back", {L"^?", L"^H"});
+        bind<&Impl::search>(L"search", {L"^R"});
+        bindTo(L"ed-prev-history", {olderKey});
+        bindTo(L"ed-next-history", {newerKey});
+        bindTo(L"ed-delete-next-char", {L"\x1b[3~"});
+        bindTo(L"ed-prev-word", {L"\x1b[1;5D"});
+        bindTo(L"em-next-word", {L"\x1b[1;5C"});
+    }
+
+    // Exceptions must not pass through here either.
     static int getCharacter(EditLine* editor, wchar_t* character) {
         Impl& self = of(editor);
         int result = -1;
@@ -177,7 +220,7 @@ class LineEditor::Impl {
         passMarks();
         std::mbstate_t state{};
         for (;;) {
-            if (!conversation_.runUntilReadable(STDIN_FILENO, *done_)) {
+            if (!conversation_->runUntilReadable(STDIN_FILENO, *done_)) {
                 doneSeen_ = true;
                 return -1;
             }
@@ -239,7 +282,110 @@ class LineEditor::Impl {
         return CC_NORM;
     }
 
-    unsigned char indent() { return ::el_winsertstr(editor_, indentation) == 0 ? CC_REFRESH : CC_ERROR; }
+    static unsigned char refreshed(bool done) { return done ? CC_REFRESH : CC_ERROR; }
+
+    unsigned char enter() {
+        EditedText edited(editor_);
+        const std::wstring text = edited.text();
+        if (what_ == For::Code && (edited.lineEnd() < text.size() || !isWhole(toUtf8(text)))) {
+            // What comes faster than it is typed has its own indentation.
+            const bool typed = !readable(STDIN_FILENO);
+            const std::string before = toUtf8(text.substr(0, edited.cursor()));
+            return refreshed(edited.insert(L"\n" + (typed ? toWide(indentationAfter(before)) : std::wstring())));
+        }
+        edited.moveTo(text.size());
+        if (edited.lineBegin() > 0 && edited.inIndentation()) {
+            edited.replace(edited.lineBegin(), text.size(), {});
+        }
+        return edited.insert(L"\n") ? CC_NEWLINE : CC_ERROR;
+    }
+
+    unsigned char up() {
+        if (!EditedText(editor_).moveUp()) {
+            ::el_wpush(editor_, older);
+        }
+        return CC_REFRESH;
+    }
+
+    unsigned char down() {
+        if (!EditedText(editor_).moveDown()) {
+            ::el_wpush(editor_, newer);
+        }
+        return CC_REFRESH;
+    }
+
+    unsigned char toLineBegin() {
+        EditedText edited(editor_);
+        edited.moveTo(edited.lineBegin());
+        return CC_REFRESH;
+    }
+
+    unsigned char toLineEnd() {
+        EditedText edited(editor_);
+        edited.moveTo(edited.lineEnd());
+        return CC_REFRESH;
+    }
+
+    unsigned char eraseBack() {
+        EditedText(editor_).eraseBack();
+        return CC_REFRESH;
+    }
+
+    unsigned char tab() {
+        EditedText edited(editor_);
+        const bool asks = what_ == For::Code && *complete_ && !edited.inIndentation();
+        const auto found = asks ? (*complete_)(edited.text(), edited.cursor()) : std::nullopt;
+        if (!found) {
+            return refreshed(edited.indent());
+        }
+        const std::wstring common = commonBeginning(found->candidates);
+        const bool longer = found->candidates.size() == 1 || found->start + common.size() > edited.cursor();
+        if (longer && edited.text().compare(found->start, found->end - found->start, common) != 0) {
+            edited.replace(found->start, found->end, common);
+        } else if (found->candidates.size() > 1 && lastTab_ == edited.text()) {
+            list(found->candidates);
+        } else {
+            show(beep);
+        }
+        lastTab_ = edited.text();
+        return CC_REFRESH;
+    }
+
+    // Above the line, where it stays.
+    void list(const std::vector<std::wstring>& candidates) {
+        takeAway();
+        out_.write((lastLine_.text().empty() ? "" : "\n") + toUtf8(tableOf(candidates, out_.columns())));
+    }
+
+    // Shows what is found until another key comes: Ctrl-G goes back, any other does with the entry what it does.
+    unsigned char search() {
+        constexpr wchar_t giveUp = L'\x07';
+        EditedText edited(editor_);
+        HistorySearch search(history(), edited.text());
+        const std::wstring prompt = prompt_;
+        wchar_t key = L'\0';
+        do {
+            edited.replace(0, edited.text().size(), search.text());
+            edited.moveTo(search.place());
+            prompt_ = search.prompt();
+            if (::el_wgetc(editor_, &key) != 1) {
+                prompt_ = prompt;
+                return CC_EOF;
+            }
+        } while (search.take(key));
+        prompt_ = prompt;
+        if (key == giveUp) {
+            edited.replace(0, edited.text().size(), search.before());
+            return CC_REFRESH;
+        }
+        if (key == L'\r' || key == L'\n') {
+            edited.moveTo(edited.text().size());
+        }
+        ::el_wpush(editor_, std::wstring(1, key).c_str());
+        return CC_REFRESH;
+    }
+
+    LineHistory& history() { return what_ == For::Code ? codeHistory_ : noHistory_; }
 
     LineDisplay::Size size() const { return {out_.columns(), out_.rows()}; }
 
@@ -287,7 +433,8 @@ class LineEditor::Impl {
             show(display_.begin(toWide(lastLine_.text()), size()));
             away_ = false;
         }
-        show(display_.show({toWide(lastLine_.text()) + prompt_, text_, cursor}, size()));
+        show(display_.show({toWide(lastLine_.text()) + prompt_, text_, cursor, what_ == For::Code ? continuation : L""},
+                           size()));
     }
 
     // Shows all of the line once more, and begins a new one.
@@ -309,7 +456,9 @@ class LineEditor::Impl {
         return false;
     }
 
-    Conversation& conversation_;
+    Conversation* conversation_ = nullptr;
+    const Complete* complete_ = nullptr;
+    For what_ = For::Code;
     Output& out_;
     LastLine& lastLine_;
     LineHistory codeHistory_;
@@ -320,31 +469,21 @@ class LineEditor::Impl {
     std::wstring prompt_;
     std::wstring text_;
     std::size_t cursor_ = 0;
-    bool away_ = false;  ///< taken away
+    bool away_ = false;                    ///< taken away
+    std::optional<std::wstring> lastTab_;  ///< what the last Tab has left
     const std::function<bool()>* done_ = nullptr;
     bool doneSeen_ = false;
     std::exception_ptr error_;
 };
 
-LineEditor::LineEditor(Conversation& conversation, Output& out, LastLine& lastLine, std::string historyFile)
-    : impl_(std::make_unique<Impl>(conversation, out, lastLine, std::move(historyFile))) {}
+LineEditor::LineEditor(Output& out, LastLine& lastLine, std::string historyFile)
+    : impl_(std::make_unique<Impl>(out, lastLine, std::move(historyFile))) {}
 
 LineEditor::~LineEditor() = default;
 
-ReadLine LineEditor::read(For what, const std::string& prompt, const std::function<bool()>& done) {
-    return impl_->read(what, prompt, done);
-}
-
-std::string defaultHistoryFile() {
-    const auto variable = [](const char* name) {
-        const char* const value = std::getenv(name);
-        return std::string(value != nullptr ? value : "");
-    };
-    if (const std::string state = variable("XDG_STATE_HOME"); !state.empty() && state[0] == '/') {
-        return (std::filesystem::path(state) / "krutil" / "history").string();
-    }
-    const std::string home = variable("HOME");
-    return home.empty() ? std::string() : (std::filesystem::path(home) / ".local/state/krutil/history").string();
+ReadLine LineEditor::read(Conversation& conversation, const Complete& complete, For what, const std::string& prompt,
+                          const std::function<bool()>& done) {
+    return impl_->read(conversation, complete, what, prompt, done);
 }
 
 }  // namespace krutil_client

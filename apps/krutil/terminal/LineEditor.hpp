@@ -8,6 +8,7 @@
 #include "krutil/base/LastLine.hpp"
 #include "krutil/base/Output.hpp"
 #include "krutil/session/Conversation.hpp"
+#include "krutil/terminal/Completion.hpp"
 #include "krutil/terminal/LineReader.hpp"
 
 namespace krutil_client {
@@ -16,6 +17,9 @@ namespace krutil_client {
 /// is delivered meanwhile: the line is taken away before, and shown again behind it. Ctrl-C is dispatched, Ctrl-Z stops
 /// the program and leaves the terminal as it was. One object a process: it sets the process's character type to UTF-8.
 /// Main thread only.
+///
+/// Code is edited in blocks: Enter begins a line of its own, indented, until the code is whole (isWhole()). Up and Down
+/// move inside the block, and in its first and last line through the history, of which a block is one entry.
 class LineEditor {
   public:
     /// What a line is typed for.
@@ -25,22 +29,20 @@ class LineEditor {
     };
 
     /// Code is remembered in `historyFile`, see LineHistory; empty for none. `out` is the terminal, which has a cursor,
-    /// and which nothing but outputs with this `lastLine` writes to. All must outlive the object.
-    LineEditor(Conversation& conversation, Output& out, LastLine& lastLine, std::string historyFile);
+    /// and which nothing but outputs with this `lastLine` writes to. Both must outlive the object.
+    LineEditor(Output& out, LastLine& lastLine, std::string historyFile);
     ~LineEditor();
     LineEditor(const LineEditor&) = delete;
     LineEditor& operator=(const LineEditor&) = delete;
 
-    /// As LineReader::read() does. Whatever leaves Conversation::run() ends the editing.
-    ReadLine read(For what, const std::string& prompt, const std::function<bool()>& done);
+    /// As LineReader::read() does, while `conversation` goes on. Whatever leaves Conversation::run() ends the editing.
+    /// The key Tab asks `complete`, which may deliver, and inserts blanks when that is empty or returns nothing.
+    ReadLine read(Conversation& conversation, const Complete& complete, For what, const std::string& prompt,
+                  const std::function<bool()>& done);
 
   private:
     class Impl;
     std::unique_ptr<Impl> impl_;
 };
-
-/// Where the history of this user's lines is kept: below $XDG_STATE_HOME, or ~/.local/state; empty when neither is
-/// known.
-std::string defaultHistoryFile();
 
 }  // namespace krutil_client

@@ -110,4 +110,31 @@ void LineHistory::add(const wchar_t* line) {
     }
 }
 
+std::optional<LineHistory::Found> LineHistory::find(const std::wstring& part, std::size_t age) const {
+    HistEventW event{};
+    int more = ::history_w(history_, &event, H_FIRST);
+    for (std::size_t i = 0; more >= 0; ++i, more = ::history_w(history_, &event, H_NEXT)) {
+        std::wstring text = event.str;
+        if (i >= age && text.find(part) != std::wstring::npos) {
+            if (text.ends_with(L'\n')) {
+                text.pop_back();
+            }
+            return Found{i, std::move(text)};
+        }
+    }
+    return std::nullopt;
+}
+
+std::string defaultHistoryFile() {
+    const auto variable = [](const char* name) {
+        const char* const value = std::getenv(name);
+        return std::string(value != nullptr ? value : "");
+    };
+    if (const std::string state = variable("XDG_STATE_HOME"); !state.empty() && state[0] == '/') {
+        return (std::filesystem::path(state) / "krutil" / "history").string();
+    }
+    const std::string home = variable("HOME");
+    return home.empty() ? std::string() : (std::filesystem::path(home) / ".local/state/krutil/history").string();
+}
+
 }  // namespace krutil_client

@@ -193,15 +193,13 @@ std::vector<std::string> Prompts::readPieces(Open& open, const std::string& prom
     const auto closed = [&open] { return open.closed; };
     ReadLine line = read(commands_, prompt, closed);
     std::string code = line.text;
-    std::vector<std::string> pieces = piecesOf(code);
-    while (line.end == ReadLine::End::Newline && !pieces.empty() && needsMoreLines(pieces.back())) {
+    while (line.end == ReadLine::End::Newline && !isWhole(code)) {
         line = read(commands_, "... ", closed);
         code += "\n" + line.text;
-        pieces = piecesOf(code);
     }
     switch (line.end) {
         case ReadLine::End::Newline:
-            return pieces;
+            return piecesOf(code);
         case ReadLine::End::EndOfInput:
             return {":q"};
         case ReadLine::End::Done:

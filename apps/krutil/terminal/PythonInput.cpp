@@ -22,6 +22,7 @@ class Scanner {
                 at_ = std::min(code_.find('\n', at_), code_.size());
             } else if (c == '"' || c == '\'') {
                 if (!passString(c)) {
+                    inString_ = true;
                     return true;
                 }
                 last_ = c;
@@ -39,6 +40,14 @@ class Scanner {
     }
 
     bool block() const { return block_; }
+
+    // Whether the code ends in a string that goes on.
+    bool inString() const { return inString_; }
+
+    // Whether the code ends in a line that goes on deeper: it opens a block or a bracket.
+    bool deeper() const {
+        return ending_ == '(' || ending_ == '[' || ending_ == '{' || (depth_ == 0 && ending_ == ':');
+    }
 
     // Where a line begins that goes on with none before it: outside of brackets and strings.
     struct Start {
@@ -72,6 +81,7 @@ class Scanner {
             block_ = block_ || inHead_;
         }
         decorator_ = false;
+        ending_ = last_;
         last_ = '\0';
     }
 
@@ -104,8 +114,10 @@ class Scanner {
     std::string_view code_;
     std::size_t at_ = 0;
     int depth_ = 0;
-    char last_ = '\0';  // the last character of the line that counts
+    char last_ = '\0';    // the last character of the line that counts
+    char ending_ = '\0';  // the same of the line that ended last
     bool block_ = false;
+    bool inString_ = false;
     bool decorator_ = false;  // the line is one
     bool inHead_ = false;     // the last line that counts begins a block, or decorates what comes
     std::vector<Start> starts_;
@@ -122,14 +134,22 @@ bool hasCode(std::string_view line) {
     return first != std::string_view::npos && line[first] != '#';
 }
 
+std::string_view lastLineOf(std::string_view text) {
+    return text.substr(text.rfind('\n') + 1);
+}
+
+// The word that a line begins with, if it is one of small letters.
+std::string_view wordOf(std::string_view line) {
+    return line.substr(0, line.find_first_not_of("abcdefghijklmnopqrstuvwxyz"));
+}
+
 // Whether a line, outside of brackets, strings and blocks' heads, begins a statement instead of going on with one.
 bool beginsStatement(std::string_view line) {
     if (line.empty() || line[0] == '#' || space.find(line[0]) != std::string_view::npos) {
         return false;
     }
     constexpr std::array<std::string_view, 4> goOn{"else", "elif", "except", "finally"};
-    const std::string_view word = line.substr(0, line.find_first_not_of("abcdefghijklmnopqrstuvwxyz"));
-    return std::find(goOn.begin(), goOn.end(), word) == goOn.end();
+    return std::find(goOn.begin(), goOn.end(), wordOf(line)) == goOn.end();
 }
 
 }  // namespace
@@ -139,10 +159,39 @@ bool needsMoreLines(std::string_view code) {
     if (scanner.openAtEnd()) {
         return true;
     }
-    const auto newline = code.rfind('\n');
-    const std::string_view lastLine = newline == std::string_view::npos ? code : code.substr(newline + 1);
+    const std::string_view lastLine = lastLineOf(code);
     return scanner.block() &&
-           (newline == std::string_view::npos || lastLine.find_first_not_of(space) != std::string_view::npos);
+           (lastLine.size() == code.size() || lastLine.find_first_not_of(space) != std::string_view::npos);
+}
+
+bool isWhole(std::string_view code) {
+    constexpr std::string_view noCode = ":?!";
+    if (!code.empty() && noCode.find(code[0]) != std::string_view::npos && lastLineOf(code).size() == code.size()) {
+        return true;
+    }
+    const auto pieces = piecesOf(code);
+    return pieces.empty() || !needsMoreLines(pieces.back());
+}
+
+std::string indentationAfter(std::string_view code) {
+    constexpr std::string_view step = "    ";
+    constexpr std::array<std::string_view, 5> leave{"return", "pass", "raise", "break", "continue"};
+    Scanner scanner(code);
+    const bool open = scanner.openAtEnd();
+    if (scanner.inString()) {
+        return {};
+    }
+    const std::string_view line = lastLineOf(code);
+    std::string blanks(line.substr(0, std::min(line.find_first_not_of(" \t"), line.size())));
+    if (scanner.deeper()) {
+        return blanks += step;
+    }
+    const bool leaves =
+        !open && std::find(leave.begin(), leave.end(), wordOf(line.substr(blanks.size()))) != leave.end();
+    if (leaves && blanks.ends_with(step)) {
+        blanks.resize(blanks.size() - step.size());
+    }
+    return blanks;
 }
 
 std::vector<std::string> piecesOf(std::string_view code) {

@@ -13,6 +13,14 @@ namespace krutil_client {
 /// engine to say.
 bool needsMoreLines(std::string_view code);
 
+/// Whether `code` may be evaluated as it is: the last of its statements needs no more lines. So may one line
+/// that is no code, because it begins with a colon, a question mark or an exclamation mark.
+bool isWhole(std::string_view code);
+
+/// The blanks that a line behind `code` begins with: one step more than the last line when that begins a block or opens
+/// a bracket, one step less when it leaves a block. None in a string.
+std::string indentationAfter(std::string_view code);
+
 /// The statements of `code`, each with all its lines; comments and empty lines between them belong to the one before. A
 /// line that begins with a colon, where a statement may begin, is a piece of its own. The last piece keeps the empty
 /// lines at its end. None for code without any. As much an estimate as needsMoreLines().

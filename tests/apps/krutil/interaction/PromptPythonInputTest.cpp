@@ -1,6 +1,10 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <string>
+#include <utility>
+#include <vector>
+
 #include "krutil/terminal/PythonInput.hpp"
 
 namespace krutil_client {
@@ -42,6 +46,39 @@ TEST(PythonInputTest, ABlockGoesOnUntilAnEmptyLine) {
 TEST(PythonInputTest, AStringThatALineCannotHoldIsTheEnginesToRefuse) {
     EXPECT_FALSE(needsMoreLines("x = 'a"));
     EXPECT_FALSE(needsMoreLines("x = 'a\ny"));
+}
+
+TEST(PythonInputTest, TheLastStatementDecidesWhetherCodeIsWhole) {
+    for (const char* code : {"", "x = 1", ":c", ":queue:", "? def:", "!for i:", "if x:\n  y\n", "if x:\n  y\nz = 1",
+                             "for i in x:\n  y\n:c"}) {
+        EXPECT_TRUE(isWhole(code)) << code;
+    }
+    for (const char* code : {"if x:", "x = 1\nif x:", ":c\nif x:", "f(", "if x:\n  y\nelse:"}) {
+        EXPECT_FALSE(isWhole(code)) << code;
+    }
+}
+
+TEST(PythonInputTest, ALineIsIndentedByTheOneBefore) {
+    const std::vector<std::pair<std::string, std::string>> cases{
+        {"", ""},
+        {"x = 1", ""},
+        {"if x:", "    "},
+        {"if x:  # why", "    "},
+        {"  x = 1", "  "},
+        {"if x:\n    y = {", "        "},
+        {"    y = {1: 2,", "    "},
+        {"f(a[1:", ""},
+        {"def f():\n    return 1", ""},
+        {"def f():\n    pass", ""},
+        {"def f():\n    returned = 1", "    "},
+        {"def f():\n    return (", "        "},
+        {"return", ""},
+        {"    x = '''a:", ""},
+        {"@decorated", ""},
+    };
+    for (const auto& [code, blanks] : cases) {
+        EXPECT_EQ(indentationAfter(code), blanks) << code;
+    }
 }
 
 TEST(PythonInputTest, PiecesAreStatementsWithAllTheirLines) {

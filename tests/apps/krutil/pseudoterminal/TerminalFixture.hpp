@@ -22,6 +22,23 @@
 
 namespace krutil_client {
 
+// Where the cursor is, and what keys send.
+inline const std::string at = Screen::cursor;
+
+inline constexpr const char* left = "\x1b[D";
+inline constexpr const char* right = "\x1b[C";
+inline constexpr const char* up = "\x1b[A";
+inline constexpr const char* backspace = "\x7f";
+inline constexpr const char* lineBegin = "\x01";
+inline constexpr const char* lineEnd = "\x05";
+inline constexpr const char* down = "\x1b[B";
+inline constexpr const char* searchKey = "\x12";
+inline constexpr const char* clearScreen = "\x0c";
+// Comes when the line that is typed from now on is the program's to show.
+inline constexpr const char* editing = "\x1b[?2004h";
+inline constexpr const char* pasteBegin = "\x1b[200~";
+inline constexpr const char* pasteEnd = "\x1b[201~";
+
 /// Terminals whose programs keep their files in a directory of the test.
 class TerminalTest : public ::testing::Test {
   protected:

@@ -16,9 +16,6 @@ using ::testing::HasSubstr;
 using ::testing::Not;
 using Way = programs_test::Relay::Way;
 
-// Comes when the line that is typed from now on is the program's to show.
-constexpr const char* editing = "\x1b[?2004h";
-
 class TerminalQueueTest : public TerminalReplTest {
   protected:
     static std::string pasted(const std::string& lines) { return "\x1b[200~" + lines + "\x1b[201~\r"; }
