@@ -1,8 +1,12 @@
 #include "krutil/Program.hpp"
 
 #include <fcntl.h>
+#include <poll.h>
+#include <termios.h>
 #include <unistd.h>
 
+#include <array>
+#include <cerrno>
 #include <csignal>
 #include <cstdlib>
 #include <iostream>
@@ -60,6 +64,8 @@ struct Terminal {
     LastLine lastLine{};
     Output out{STDOUT_FILENO, "standard output", interrupt, &lastLine};
     Output err{STDERR_FILENO, "standard error", interrupt, &lastLine};
+    bool edits = false;                  ///< a session has begun whose lines are edited
+    std::optional<LineEditor> editor{};  ///< outlives a session, and with it what it remembers
 };
 
 std::unique_ptr<Printer> makePrinter(const DisplayOptions& options, Output& out, Output& err) {
@@ -88,6 +94,9 @@ class AskingClient {
 
     Client& client() noexcept { return client_; }
 
+    /// Whether lines are edited.
+    bool edits() const noexcept { return edits_; }
+
     /// How code is read. The object must outlive what is returned.
     Prompts::Read readingCode() {
         return [this](const std::string& prompt, const std::function<bool()>& done) {
@@ -112,10 +121,10 @@ class AskingClient {
                 return reader_.read(prompt, done);
             }
             // Most commands end without a question.
-            if (!editor_) {
-                editor_.emplace(terminal_.out, terminal_.lastLine, history_);
+            if (!terminal_.editor) {
+                terminal_.editor.emplace(terminal_.out, terminal_.lastLine, history_);
             }
-            return editor_->read(client_.conversation(), complete_, what, prompt, done);
+            return terminal_.editor->read(client_.conversation(), complete_, what, prompt, done);
         };
     }
 
@@ -128,7 +137,6 @@ class AskingClient {
     const std::string history_;
     const bool edits_;
     LineReader reader_;
-    std::optional<LineEditor> editor_;
     std::optional<Prompts> prompts_;
 };
 
@@ -136,9 +144,10 @@ bool standardInputIsTerminal() {
     return ::isatty(STDIN_FILENO) == 1;
 }
 
-// Does a command's work in the session, and ends that in good order.
-ExitCode inSession(AskingClient& asking, const std::function<ExitCode()>& work) {
-    ExitCode result{};
+// Does a command's work in the session, and ends that in good order. Returns what the work does.
+template <class Work>
+auto inSession(AskingClient& asking, const Work& work) {
+    std::optional<decltype(work())> result;
     try {
         result = work();
     } catch (const Failure& failure) {
@@ -152,7 +161,7 @@ ExitCode inSession(AskingClient& asking, const std::function<ExitCode()>& work) 
         throw;
     }
     asking.finish(Leave::WhenAnswered);
-    return result;
+    return *result;
 }
 
 ExitCode runCommand(const Options& options, const EvalOptions& eval, Printer& printer, Terminal& terminal) {
@@ -161,13 +170,69 @@ ExitCode runCommand(const Options& options, const EvalOptions& eval, Printer& pr
     return inSession(asking, [&] { return evaluate(asking.client(), eval, code); });
 }
 
-ExitCode runCommand(const Options& options, const ReplOptions& repl, Printer& printer, Terminal& terminal) {
+// One session of the line editor, or of lines that come from elsewhere.
+ReplEnd runSession(const Options& options, const ReplOptions& repl, Printer& printer, Terminal& terminal) {
     const bool person = standardInputIsTerminal();
     AskingClient asking(options, printer, terminal, person, repl.noHistory ? std::string() : defaultHistoryFile());
+    terminal.edits = asking.edits();
+    const Person who = !person ? Person::None : asking.edits() ? Person::Edits : Person::Types;
     return inSession(asking, [&] {
-        return readAndEvaluate(asking.client(), repl, asking.readingCode(), person,
+        return readAndEvaluate(asking.client(), repl, asking.readingCode(), who,
                                options.display.json ? terminal.err : terminal.out, terminal.interrupt);
     });
+}
+
+// Returns whether a person wants another session in the place of one that is lost.
+bool wantsAnother(Terminal& terminal) {
+    // What was typed for the session that is lost is no answer.
+    ::tcflush(STDIN_FILENO, TCIFLUSH);
+    terminal.err.write("krutil: what the session held is lost; Enter starts a new one, Ctrl-D leaves ");
+    std::array<char, 256> answer{};
+    ssize_t got = -1;
+    try {
+        while (got < 0) {
+            std::array<pollfd, 2> watched{pollfd{STDIN_FILENO, POLLIN, 0}, pollfd{terminal.interrupt.fd(), POLLIN, 0}};
+            ::poll(watched.data(), watched.size(), -1);
+            terminal.interrupt.dispatch();
+            got = watched[0].revents != 0 ? ::read(STDIN_FILENO, answer.data(), answer.size()) : -1;
+            if (got < 0 && watched[0].revents != 0 && errno != EINTR) {
+                got = 0;
+            }
+        }
+    } catch (const Cancelled&) {
+        got = 0;
+    }
+    if (got > 0) {
+        // The terminal has shown the newline by itself.
+        terminal.lastLine.take();
+        return true;
+    }
+    terminal.err.write("\n");
+    return false;
+}
+
+ExitCode runCommand(const Options& options, const ReplOptions& repl, Printer& printer, Terminal& terminal) {
+    Options next = options;
+    for (;;) {
+        try {
+            const ReplEnd end = runSession(next, repl, printer, terminal);
+            if (!end.restart) {
+                return end.code;
+            }
+            terminal.err.write("krutil: a new session; what the last one held is gone\n");
+        } catch (const Failure& failure) {
+            // An engine that cannot be used at all is no session that was lost.
+            const bool lost = failure.code() == ExitCode::Stream || failure.code() == ExitCode::Cancelled;
+            if (!terminal.edits || !lost) {
+                throw;
+            }
+            terminal.err.write(std::string("krutil: ") + failure.what() + "\n");
+            if (!wantsAnother(terminal)) {
+                return failure.code();
+            }
+        }
+        next.display.traceGoesOn = true;
+    }
 }
 
 ExitCode runCommand(const Options& options, const CallOptions& call, Printer& printer, Terminal& terminal) {

@@ -70,8 +70,9 @@ Client::Client(const ConnectionOptions& connection, const DisplayOptions& displa
       timing_(display.timing),
       throughShell_(connection.engine.has_value()),
       begin_(Conversation::Clock::now()),
-      tracer_(display.trace || display.traceFile ? std::make_unique<Tracer>(display.trace, display.traceFile)
-                                                 : nullptr),
+      tracer_(display.trace || display.traceFile
+                  ? std::make_unique<Tracer>(display.trace, display.traceFile, display.traceGoesOn)
+                  : nullptr),
       engine_(findEngine(connection)) {
     const auto noteTime = [this](const auto&) {
         if (!firstText_) {

@@ -89,12 +89,12 @@ std::string traceLine(const foundation::msg_svc::transport::layers::session::Fra
     return content.empty() ? text : text + ": " + content;
 }
 
-Tracer::Tracer(bool toStandardError, const std::optional<std::string>& file)
+Tracer::Tracer(bool toStandardError, const std::optional<std::string>& file, bool goesOn)
     : toStandardError_(toStandardError), fileName_(file.value_or(std::string())) {
     if (!file) {
         return;
     }
-    file_.reset(::open(fileName_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_APPEND | O_CLOEXEC, 0600));
+    file_.reset(::open(fileName_.c_str(), O_WRONLY | O_CREAT | (goesOn ? 0 : O_TRUNC) | O_APPEND | O_CLOEXEC, 0600));
     if (file_.get() < 0) {
         const std::string reason = std::strerror(errno);
         throw Failure(ExitCode::Usage, "cannot open '" + fileName_ + "' for the trace: " + reason);

@@ -25,8 +25,9 @@ std::string traceLine(const foundation::msg_svc::transport::layers::session::Fra
 /// standard error says so, and the file gets no more of them. May be called from any thread.
 class Tracer {
   public:
-    /// `file` is emptied, or created for this user alone. Throws Failure (Usage) when it cannot be opened.
-    Tracer(bool toStandardError, const std::optional<std::string>& file);
+    /// `file` is emptied, unless the trace of a session before goes on there (`goesOn`), or created for this user
+    /// alone. Throws Failure (Usage) when it cannot be opened.
+    Tracer(bool toStandardError, const std::optional<std::string>& file, bool goesOn = false);
 
     void operator()(const foundation::msg_svc::transport::layers::session::FrameTrace& trace);
 

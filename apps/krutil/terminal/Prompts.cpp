@@ -6,6 +6,8 @@
 #include "cmddistributor/IIPStateEvent.hpp"
 #include "krutil/base/ExitCode.hpp"
 #include "krutil/base/Text.hpp"
+#include "krutil/terminal/Asides.hpp"
+#include "krutil/terminal/PromptCommands.hpp"
 #include "krutil/terminal/PythonInput.hpp"
 #include "krutil/terminal/QueueCommand.hpp"
 
@@ -19,8 +21,6 @@ namespace {
 
 // The command that stands for the end of input.
 constexpr const char* endOfInputCommand = "\x04";
-constexpr const char* goOn = "__import__('qvm').dbcont()";
-constexpr const char* quit = "__import__('qvm').dbquit()";
 
 bool isAnswered(const Client::Sent& request) {
     return request->answer.has_value();
@@ -43,6 +43,7 @@ class Set {
 
 struct Prompts::Open {
     IDType request;
+    bool debugger;
     bool closed = false;
 };
 
@@ -51,6 +52,7 @@ Prompts::Prompts(Client& client, Read input, Read commands, Output& out)
       input_(std::move(input)),
       commands_(std::move(commands)),
       out_(out),
+      help_(client),
       subscriptions_{client.events().subscribe<DebugLoopEvent>([this](const DebugLoopEvent& event) { onLoop(event); }),
                      client.events().subscribe<cmddistributor::IIPStartedEvent>(
                          [this](const cmddistributor::IIPStartedEvent& event) { onStarted(event.getRequestId()); })} {}
@@ -98,7 +100,7 @@ void Prompts::leave(const IDType& request) {
 }
 
 void Prompts::serve(const IDType& request, Loop loop) {
-    Open open{request};
+    Open open{request, loop == InputRequester::mnDEBUG_PROMPT};
     open_.push_back(&open);
     struct Pop {
         std::vector<Open*>& prompts;
@@ -213,21 +215,17 @@ void Prompts::evaluate(Open& open, const std::vector<std::string>& pieces) {
     Client::Sent leaving;
     for (const std::string& piece : pieces) {
         const std::string command = piece.substr(0, piece.find_last_not_of(" \t") + 1);
-        const bool leaves = command == ":c" || command == ":q";
-        if (piece[0] == ':' && !leaves) {
-            if (!obeyQueueCommand(client_, command, out_)) {
-                out_.write("There is no command '" + command +
-                           "' here; :c goes on, :q quits, :queue lists requests.\n");
-            }
+        const auto known = promptCommand(command, open.debugger);
+        if (!known && obey(command, open.debugger)) {
             continue;
         }
-        const std::string code = !leaves ? piece : command == ":c" ? goOn : quit;
-        const Client::Sent request = send(code, nameOfCode(leaves ? command : piece), DEQUEUE_AT_PPE);
+        const Client::Sent request =
+            send(known ? known->code : piece, nameOfCode(known ? command : piece), DEQUEUE_AT_PPE);
         if (!request) {
             break;
         }
         sent.push_back(request);
-        if (leaves) {
+        if (known && known->leaves) {
             leaving = request;
         }
     }
@@ -241,6 +239,20 @@ void Prompts::evaluate(Open& open, const std::vector<std::string>& pieces) {
             leftBehind_.push_back(request);
         }
     }
+}
+
+// Whether a line was for this program itself.
+bool Prompts::obey(const std::string& line, bool debugger) {
+    if (line[0] != ':') {
+        return answerAside(
+            line, [this](const std::string& name) { return help_.inspect(name); }, out_);
+    }
+    if (line == ":help") {
+        out_.write(promptHelp(debugger));
+    } else if (!obeyQueueCommand(client_, line, out_)) {
+        out_.write("There is no command '" + line + "' here; :c goes on, :q quits, :queue lists requests.\n");
+    }
+    return true;
 }
 
 // Null for what is too large, which a person is told.

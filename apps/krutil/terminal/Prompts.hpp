@@ -8,15 +8,17 @@
 #include "cmddistributor/DebugLoopEvent.hpp"
 #include "krutil/prompt/InputRequester.hpp"
 #include "krutil/session/Client.hpp"
+#include "krutil/terminal/EngineHelp.hpp"
 #include "krutil/terminal/LineReader.hpp"
 
 namespace krutil_client {
 
 /// Answers the engine's prompts as long as it lives. At an input prompt a line is read and sent as it is. At a debug or
 /// keyboard prompt code is read and evaluated, until one of its lines leaves the prompt: ":c" goes on, ":q" and Ctrl-D
-/// quit. The statements of several lines, which were pasted, are sent at once; what the prompt leaves behind of them
-/// waits in the engine's queue, and the person is told, also when it runs. At a pause a line goes on. A prompt that the
-/// engine closes ends the reading; an answer that comes too late is taken back. Main thread only.
+/// quit; promptCommand() knows more commands. The statements of several lines, which were pasted, are sent at once;
+/// what the prompt leaves behind of them waits in the engine's queue, and the person is told, also when it runs. At a
+/// pause a line goes on. A prompt that the engine closes ends the reading; an answer that comes too late is taken back.
+/// Main thread only.
 class Prompts {
   public:
     /// Reads a line as LineReader::read() does.
@@ -51,6 +53,7 @@ class Prompts {
     void readCommands(Open& open, const std::string& prompt);
     std::vector<std::string> readPieces(Open& open, const std::string& prompt);
     void evaluate(Open& open, const std::vector<std::string>& pieces);
+    bool obey(const std::string& line, bool debugger);
     Client::Sent send(const std::string& code, const std::string& name,
                       krutil::cmddistributor::WhenToDequeue::WhenToDequeue when);
 
@@ -64,6 +67,7 @@ class Prompts {
     const Read input_;
     const Read commands_;
     Output& out_;
+    EngineHelp help_;
     std::vector<Open*> open_;  ///< the innermost one last
     bool reading_ = false;
     std::vector<Deferred> deferred_;  ///< the innermost one last
