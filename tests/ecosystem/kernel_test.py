@@ -180,6 +180,24 @@ class CellsTest(WithKernel):
         answer = self.answer(self.client.complete("nothing_of_this_name", 20))
         self.assertEqual((answer["status"], answer["matches"]), ("ok", []))
 
+    def test_inspection(self):
+        self.run_cell("def area(radius):\n    'Of a circle.'\n    return 3 * radius ** 2")
+        answer = self.answer(self.client.inspect("1 + area(2)", 7))
+        self.assertEqual((answer["status"], answer["found"]), ("ok", True))
+        self.assertIn("area(radius)", answer["data"]["text/plain"])
+        self.assertIn("Of a circle.", answer["data"]["text/plain"])
+        answer = self.answer(self.client.inspect("nothing_of_this_name", 20))
+        self.assertEqual((answer["status"], answer["found"], answer["data"]), ("ok", False, {}))
+
+    def test_is_complete(self):
+        self.assertEqual([self.answer(self.client.is_complete(code)) for code in ("1 + 1", "for n in x:", "1 +* 1")],
+                         [{"status": "complete"}, {"status": "incomplete", "indent": "    "}, {"status": "invalid"}])
+
+    def test_names_that_hide_the_module_of_the_engine(self):
+        self.run_cell("qvm = 5; answer_of_all = 42")
+        self.assertEqual(self.answer(self.client.complete("answer_of_a", 11))["matches"], ["answer_of_all"])
+        self.run_cell("del qvm")
+
     def test_errors_have_colours(self):
         cell = self.run_cell("def f():\n    return 1 / 0\ntry:\n    f()\nexcept ZeroDivisionError as e:\n"
                              "    raise ValueError('no') from e")
