@@ -13,6 +13,7 @@ from .pool import Pool
 from .prompts import Prompt, Question
 from .requests import CancelAnswer, Request, Result, State, Text, Value, Warned
 from .session import Session, connect, start
+from .shared import empty
 from .wire import Limits
 
 # Tracebacks name an exception by the module in which users find it.
@@ -21,4 +22,4 @@ for _each in (Aborted, Cancelled, Error, Lost, Refused, RemoteError):
 
 __all__ = ["Aborted", "CancelAnswer", "Cancelled", "Display", "DisplayLine", "Error", "Limits", "Lost", "Pool",
            "Prompt", "Question", "Refused", "RemoteError", "RemoteFrame", "Request", "Result", "Session", "State",
-           "Text", "Value", "Warned", "aio", "connect", "start"]
+           "Text", "Value", "Warned", "aio", "connect", "empty", "start"]

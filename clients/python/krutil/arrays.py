@@ -6,6 +6,7 @@ import numpy
 import numpy.typing
 
 from .schema import Array
+from .shared import Place
 from .wire import ARRAY_TAG, Frame, Message
 
 #: What a function returns: an array, or text.
@@ -61,9 +62,10 @@ def add_argument(frames: list[Frame], value: Any, zero_copy: bool) -> int:
         array = numpy.ascontiguousarray(array)
     in_rows = array.flags.c_contiguous
     description = Array(elementType=code, dimensions=array.shape, order=_ROW_MAJOR if in_rows else _COLUMN_MAJOR)
-    elements = (array if in_rows else array.T).reshape(-1).view(numpy.uint8).data
+    flat = (array if in_rows else array.T).reshape(-1).view(numpy.uint8)
+    elements = flat.data
     if zero_copy and elements.nbytes >= _DATA_FRAME_FROM:
-        frames.append(Frame(None, _FRAME_TYPES[code], elements))
+        frames.append(Frame(None, _FRAME_TYPES[code], elements, Place.of(flat)))
         description.dataID = len(frames)
     else:
         description.inlineElements = bytes(elements)

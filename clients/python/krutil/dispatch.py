@@ -16,8 +16,9 @@ from .prompts import KINDS, OnDebug, OnInput, Prompt
 from .requests import CancelAnswer, OnText, Request, State, Text, Value, Warned
 from .schema import (DebugLoopEvent, FEvalResult, IIPCancelReply, IIPReply, IIPResult, IssuedEnabledWarningEvent,
                      PrintableErrorEvent, SinkTextEvent, TextBaseEvent)
+from .shared import Borrower, Lender
 from .wire import (EndOfStream, Frame, Limits, Message, PeerAborted, Reader, Violation, abort_bytes, goodbye_bytes,
-                   message_bytes, read_message)
+                   message_bytes, read_message, return_bytes)
 from .writer import Writer
 
 if TYPE_CHECKING:
@@ -78,7 +79,14 @@ class Dispatch:
         self._error: Optional[Error] = None
         self._told = self._abandoned = False
         self._all_read, self._ended = threading.Event(), threading.Event()
-        self._writer = Writer(connection, self._on_write_failed)
+        self._writer = writer = Writer(connection, self._on_write_failed)
+        self._lender: Optional[Lender] = None
+        self._borrower: Optional[Borrower] = None
+        if settled.shares and reader.descriptors is not None:
+            self._lender = Lender()
+            # An array may end in any thread; what the writer takes is a queue that allows that.
+            self._borrower = Borrower(reader.descriptors,
+                                      lambda number, kept: writer.send([return_bytes(number, kept)]))
         self._thread = threading.Thread(target=self._run, name="krutil-reader", daemon=True)
         self._thread.start()
 
@@ -100,7 +108,7 @@ class Dispatch:
             stream = self._last_stream
             while stream == 0 or stream in self._open or stream == self._last_stream:
                 stream = (stream + 1) % 2**32
-            buffers = message_bytes(stream, frames, self._settled.limits)
+            buffers = message_bytes(stream, frames, self._settled.limits, self._lender)
             self._last_stream = stream
             exchange = make()
             self._open[stream] = exchange
@@ -180,7 +188,8 @@ class Dispatch:
     def _read_one(self) -> bool:
         """Reads a message and does what it says. Returns False at the end. A message is forgotten before the next one
         is waited for: its arrays may be large."""
-        message = read_message(self._reader, self._limits)
+        message = read_message(self._reader, self._limits, self._borrower,
+                               self._lender.take_back if self._lender else None)
         if message is not None and self._shut_down:
             raise Violation("expected nothing after the engine's shutdown event, got another frame")
         if message is not None:

@@ -8,7 +8,8 @@ from typing import Any, NamedTuple
 
 from .errors import Aborted, Lost, Refused
 from .schema import SessionHello, SessionVerdict
-from .wire import EndOfStream, Limits, Reader, Violation
+from .shared import Probe
+from .wire import DescriptorQueue, EndOfStream, Limits, Reader, Violation
 
 MAGIC = b"\x89KRUTIL\n"
 LAYOUT = 1
@@ -21,7 +22,7 @@ WEB_WINDOW = 4
 DEBUGGING = 6
 
 _ENGINE = 1
-_IGNORE, _REQUIRED = 0, 3
+_IGNORE, _OPTIONAL, _REQUIRED = 0, 1, 3
 _NUMBER = struct.Struct("<I")
 
 
@@ -32,6 +33,8 @@ class Settled(NamedTuple):
     zero_copy: bool
     #: What the engine accepts.
     limits: Limits
+    #: Contents may stay in memory that both ends see.
+    shares: bool = False
 
 
 def shake_hands(connection: socket.socket, reader: Reader, limits: Limits, capabilities: list[int],
@@ -44,23 +47,28 @@ def shake_hands(connection: socket.socket, reader: Reader, limits: Limits, capab
     ours = _hello(limits, capabilities)
     reader.deadline = time.monotonic() + timeout
     connection.settimeout(timeout)
+    # From the first byte on: what the engine says after its verdict may come with it, and a descriptor beside that.
+    reader.descriptors = DescriptorQueue()
     try:
         body = ours.SerializeToString()
         _send(connection, MAGIC + _NUMBER.pack(LAYOUT) + _NUMBER.pack(len(body)) + body)
         layout, theirs = _read_hello(reader)
         features, mismatches = settle(ours, layout, theirs)
         _say_verdict(connection, reader, features, mismatches)
+        shares = features.get("SHM") == "descriptors" and _probe(connection, reader, reader.descriptors)
     except Violation as violation:
         raise Aborted(f"the engine broke the protocol: {violation}") from None
     except EndOfStream as end:
         raise Lost(f"the engine has gone during the handshake: {end}") from None
     except TimeoutError:
         raise Lost(f"the engine did not finish the handshake within {timeout:g} seconds") from None
+    if not shares:
+        reader.descriptors = None
     reader.deadline = None
     connection.settimeout(None)
     peer = theirs.limits
     return Settled(features.get("ZEROCOPY") == "enable",
-                   Limits(peer.tag, peer.taggedFrame, peer.arrayMessage, peer.message, peer.frames))
+                   Limits(peer.tag, peer.taggedFrame, peer.arrayMessage, peer.message, peer.frames), shares)
 
 
 def settle(ours: Any, layout: int, theirs: Any) -> tuple[dict[str, str], list[str]]:
@@ -93,6 +101,8 @@ def _hello(limits: Limits, capabilities: list[int]) -> Any:
     # The variable means the same to all programs of this protocol. Without it this end can do either, as it is asked.
     for value in ["disable"] if os.environ.get("QX_DISABLE_ZEROCOPY") else ["enable", "disable"]:
         hello.features.add(name="ZEROCOPY", value=value, handling=_REQUIRED)
+    # Every stream that this package opens is a Unix socket.
+    hello.features.add(name="SHM", value="descriptors", handling=_OPTIONAL)
     hello.limits.tag = limits.tag
     hello.limits.taggedFrame = limits.tagged_frame
     hello.limits.arrayMessage = limits.array_message
@@ -148,6 +158,22 @@ def _say_verdict(connection: socket.socket, reader: Reader, features: dict[str, 
         raise Refused(f"the engine refuses the session: {theirs.refusal}")
     if [(feature.name, feature.value) for feature in theirs.features] != list(features.items()):
         raise Refused("the engine has settled on other features than this end")
+
+
+def _probe(connection: socket.socket, reader: Reader, descriptors: DescriptorQueue) -> bool:
+    """Whether memory arrives in both directions: the stream may lead to a relay, which drops descriptors."""
+    ours = Probe()
+    try:
+        socket.send_fds(connection, [ours.token], ours.descriptors(), socket.MSG_NOSIGNAL)
+    except (BrokenPipeError, ConnectionResetError):
+        pass
+    token = reader.read(8, "the engine's probe of shared memory")
+    shown = Probe.shows(descriptors, token)
+    _send(connection, bytes([shown]))
+    answer = reader.read(1, "the engine's answer to the probe of shared memory")[0]
+    if answer > 1:
+        raise Violation(f"the peer's answer to the probe of shared memory: expected 0 or 1, got {answer}")
+    return shown and answer == 1
 
 
 def _send(connection: socket.socket, data: bytes) -> None:

@@ -3,17 +3,23 @@
 docs/session-wire.md describes every byte. Texts of violations are the ones that are listed there.
 """
 
+import array
+import os
 import socket
 import struct
 import time
+from collections import deque
 from dataclasses import dataclass
-from typing import Any, Optional, Sequence, Union
+from typing import TYPE_CHECKING, Any, Callable, Optional, Sequence, Union
 
 import numpy
 
+if TYPE_CHECKING:
+    from .shared import Borrower, Lender, Place
+
 LONGEST_REASON = 4_096
 
-TAGGED, DATA, GOODBYE, ABORT = 1, 2, 3, 4
+TAGGED, DATA, GOODBYE, ABORT, SHARED_DATA, RETURN = 1, 2, 3, 4, 5, 6
 LAST = 0x80
 HEADER = struct.Struct("<BBHIQQ")
 
@@ -60,6 +66,8 @@ class Frame:
     tag: Optional[str]
     type: int
     content: Buffer
+    #: Where the content lies, if the peer may map it there.
+    place: "Optional[Place]" = None
 
 
 class Message:
@@ -117,6 +125,43 @@ class Message:
         return Violation(f'cannot read "{self.root}": {what}')
 
 
+class DescriptorQueue:
+    """Descriptors that have come beside the bytes, and that no frame has taken yet."""
+
+    MOST = 32
+    SPACE = socket.CMSG_SPACE((MOST + 1) * array.array("i").itemsize)
+
+    def __init__(self) -> None:
+        self._waiting: "deque[int]" = deque()
+
+    def add(self, ancillary: Sequence[tuple[int, int, bytes]], flags: int) -> None:
+        """Takes what came with a read of the stream."""
+        for level, kind, data in ancillary:
+            if (level, kind) == (socket.SOL_SOCKET, socket.SCM_RIGHTS):
+                numbers = array.array("i")
+                numbers.frombytes(data[:len(data) - len(data) % numbers.itemsize])
+                self._waiting.extend(numbers)
+        if flags & socket.MSG_CTRUNC:
+            raise Violation(f"expected at most {self.MOST} descriptors at once, and as many as this process may still "
+                            "open; some are lost")
+        if len(self._waiting) > self.MOST:
+            raise Violation(f"expected at most {self.MOST} descriptors ahead of the frames that need them, "
+                            f"got {len(self._waiting)}")
+
+    def take(self) -> Optional[int]:
+        """The next one, which the caller owns then."""
+        return self._waiting.popleft() if self._waiting else None
+
+    def take_all(self) -> list[int]:
+        taken = list(self._waiting)
+        self._waiting.clear()
+        return taken
+
+    def __del__(self) -> None:
+        for descriptor in self._waiting:
+            os.close(descriptor)
+
+
 class Reader:
     """Reads from a socket: through a buffer what is small, straight into its place what is large."""
 
@@ -129,6 +174,8 @@ class Reader:
         self._unread = self._buffer[:0]
         #: Until when what is asked for must have come, by time.monotonic(). Else `TimeoutError` is raised.
         self.deadline: Optional[float] = None
+        #: What comes beside the bytes. None for an end that takes none: the system closes them then.
+        self.descriptors: Optional[DescriptorQueue] = None
 
     def read(self, size: int, what: str, *numbers: int) -> Buffer:
         """The next `size` bytes, in memory of their own that can be written to. `what`, a format for the numbers, names
@@ -166,7 +213,13 @@ class Reader:
         if self.deadline is not None:
             self._socket.settimeout(max(self.deadline - time.monotonic(), 1e-3))
         try:
-            count = self._socket.recv_into(target)
+            if self.descriptors is None:
+                count = self._socket.recv_into(target)
+            else:
+                count, ancillary, flags, _ = self._socket.recvmsg_into([target], DescriptorQueue.SPACE,
+                                                                       socket.MSG_CMSG_CLOEXEC)
+                if ancillary or flags & socket.MSG_CTRUNC:
+                    self.descriptors.add(ancillary, flags)
         except ConnectionResetError:
             count = 0  # The engine has closed the stream without reading all that was sent to it.
         if count == 0:
@@ -174,8 +227,10 @@ class Reader:
         return count
 
 
-def read_message(reader: Reader, limits: Limits) -> Optional[Message]:
-    """The next message, or None where the stream ends between two messages."""
+def read_message(reader: Reader, limits: Limits, borrower: "Optional[Borrower]" = None,
+                 on_return: Optional[Callable[[int], object]] = None) -> Optional[Message]:
+    """The next message, or None where the stream ends between two messages. In a session with shared memory, `borrower`
+    maps contents, and `on_return` is called with the number of each content that the peer returns meanwhile."""
     frames: list[Frame] = []
     stream = total = 0
     while True:
@@ -188,8 +243,12 @@ def read_message(reader: Reader, limits: Limits) -> Optional[Message]:
             raise
         kind, frame_type, tag_size, its_stream, index, size = HEADER.unpack(header)
         last, kind = kind & LAST, kind & ~LAST
-        if kind not in (TAGGED, DATA):
-            _read_end(reader, kind, (last, frame_type, tag_size, its_stream, index), size, number)
+        if kind == RETURN and on_return:
+            _check_return(frame_type, (last, tag_size, its_stream, size), number)
+            on_return(index)
+            continue
+        if kind not in (TAGGED, DATA) and not (kind == SHARED_DATA and borrower):
+            _read_end(reader, kind, (last, frame_type, tag_size, its_stream, index), size, number, borrower is not None)
         if index != number:
             raise Violation(f"frame index: expected {number}, got {index}")
         if frames and its_stream != stream:
@@ -204,7 +263,14 @@ def read_message(reader: Reader, limits: Limits) -> Optional[Message]:
             name, limit = limits.of_content(tag)
             if size > limit:
                 raise _too_large(f'content of frame {number} with tag "{tag}"', name, limit, f"{size}")
-        frames.append(Frame(tag, frame_type, reader.read(size, "the content of frame %d", number)))
+        content = reader.read(size, "the content of frame %d", number)
+        if kind == SHARED_DATA and borrower:
+            content = borrower.borrow(content, f"frame {number} on stream {stream}")
+            total += len(content) - size
+            if total > limits.message:
+                raise _too_large(f"message with frame {number} on stream {stream}", "message", limits.message,
+                                 f"{total - len(content)} bytes and a content of {len(content)}")
+        frames.append(Frame(tag, frame_type, content))
         if last:
             if tag is None:
                 raise Violation(f"message on stream {stream}: expected a tagged frame as its last one, "
@@ -214,7 +280,7 @@ def read_message(reader: Reader, limits: Limits) -> Optional[Message]:
 
 def _check_sizes(kind: int, number: int, stream: int, tag_size: int, size: int, total: int, limits: Limits) -> None:
     """What a header claims, before memory is asked for."""
-    if kind == DATA and tag_size:
+    if kind != TAGGED and tag_size:
         raise Violation(f"tag of a data frame (frame {number} on stream {stream}): expected none, got {tag_size} bytes")
     if kind == TAGGED and not tag_size:
         raise Violation(f"tag of a tagged frame (frame {number} on stream {stream}): expected at least 1 byte, "
@@ -224,13 +290,24 @@ def _check_sizes(kind: int, number: int, stream: int, tag_size: int, size: int, 
     if number > limits.frames:
         raise Violation(f'number of frames of a message exceeds the limit "frames": expected at most {limits.frames} '
                         f"frames, got {number}")
+    if kind == SHARED_DATA and size != 24:
+        raise Violation(f"content of a shared data frame (frame {number} on stream {stream}): expected 24 bytes, "
+                        f"got {size}")
     if total + tag_size + size > limits.message:
         raise _too_large(f"message with frame {number} on stream {stream}", "message", limits.message,
                          f"{total + tag_size} bytes and a content of {size}")
 
 
-def _read_end(reader: Reader, kind: int, others: tuple[int, ...], size: int, number: int) -> None:
-    """What is neither tagged nor data: always the end of the session."""
+def _check_return(frame_type: int, others: tuple[int, ...], number: int) -> None:
+    if frame_type > 1 or any(others):
+        raise Violation("return frame: expected frame type 0 or 1, and last bit, tag size, stream ID and content size "
+                        "0")
+    if number > 1:
+        raise Violation(f"return frame in the middle of a message: expected frame {number}")
+
+
+def _read_end(reader: Reader, kind: int, others: tuple[int, ...], size: int, number: int, shares: bool) -> None:
+    """What is no part of a message: always the end of the session."""
     if kind == GOODBYE:
         if any(others):
             raise Violation("goodbye frame: expected last bit, frame type, tag size, stream ID and index 0")
@@ -245,18 +322,32 @@ def _read_end(reader: Reader, kind: int, others: tuple[int, ...], size: int, num
         if size > LONGEST_REASON:
             raise Violation(f"abort frame: expected a reason of at most {LONGEST_REASON} bytes, got {size}")
         raise PeerAborted(str(reader.read(size, "the reason of an abort"), "utf-8", "replace"))
-    raise Violation(f"frame kind: expected 1 (tagged), 2 (data), 3 (goodbye) or 4 (abort), got {kind}")
+    kinds = "3 (goodbye), 4 (abort), 5 (shared data) or 6 (return)" if shares else "3 (goodbye) or 4 (abort)"
+    raise Violation(f"frame kind: expected 1 (tagged), 2 (data), {kinds}, got {kind}")
 
 
 def _too_large(what: str, name: str, limit: int, got: str) -> Violation:
     return Violation(f'{what} exceeds the limit "{name}": expected at most {limit} bytes, got {got}')
 
 
-def message_bytes(stream: int, frames: Sequence[Frame], peer: Limits) -> list[Buffer]:
-    """The buffers of a message, to be sent in this order. What the peer does not accept is a `ValueError`."""
+@dataclass
+class HeaderWithDescriptor:
+    """Bytes to be sent with the descriptor beside them."""
+
+    data: bytes
+    descriptor: int
+
+
+Piece = Union[Buffer, HeaderWithDescriptor]
+
+
+def message_bytes(stream: int, frames: Sequence[Frame], peer: Limits, lender: "Optional[Lender]" = None) -> list[Piece]:
+    """The pieces of a message, to be sent in this order. What the peer does not accept is a `ValueError`. Contents that
+    have a place are lent, if there is a lender."""
     if len(frames) > peer.frames:
         raise ValueError(f'the request has {len(frames)} frames; the engine accepts {peer.frames} (its limit "frames")')
-    buffers: list[Buffer] = []
+    buffers: list[Piece] = []
+    lent: list[tuple[int, Frame]] = []
     total = 0
     for index, frame in enumerate(frames, 1):
         tag = (frame.tag or "").encode()
@@ -271,11 +362,22 @@ def message_bytes(stream: int, frames: Sequence[Frame], peer: Limits) -> list[Bu
                                  'limit "tag")')
         total += len(tag) + size
         kind = (DATA if frame.tag is None else TAGGED) | (LAST if index == len(frames) else 0)
+        if frame.place is not None and lender is not None:
+            lent.append((len(buffers), frame))
         buffers.append(HEADER.pack(kind, frame.type, len(tag), stream, index, size) + tag)
         buffers.append(frame.content)
     if total > peer.message:
         raise ValueError(f'the request has {total} bytes; the engine accepts {peer.message} (its limit "message")')
+    for at, frame in lent:
+        assert frame.place is not None and lender is not None
+        content = lender.lend(frame.place)
+        header = HEADER.pack(SHARED_DATA, frame.type, 0, stream, at // 2 + 1, len(content))
+        buffers[at:at + 2] = HeaderWithDescriptor(header, frame.place.memory.descriptor), content
     return buffers
+
+
+def return_bytes(number: int, still_mapped: bool) -> bytes:
+    return HEADER.pack(RETURN, still_mapped, 0, 0, number, 0)
 
 
 def goodbye_bytes() -> bytes:

@@ -1,11 +1,12 @@
 """Sends what a session has to say, in order, without holding up whoever says it."""
 
+import array
 import queue
 import socket
 import threading
 from typing import Callable, Optional, Sequence
 
-from .wire import Buffer
+from .wire import HeaderWithDescriptor, Piece
 
 # As many buffers as one system call takes.
 _MOST_BUFFERS = 1024
@@ -18,15 +19,15 @@ class Writer:
     def __init__(self, connection: socket.socket, on_failure: Callable[[], object]) -> None:
         self._socket = connection
         self._on_failure = on_failure
-        self._queue: "queue.SimpleQueue[Optional[Sequence[Buffer]]]" = queue.SimpleQueue()
+        self._queue: "queue.SimpleQueue[Optional[Sequence[Piece]]]" = queue.SimpleQueue()
         self._thread = threading.Thread(target=self._run, name="krutil-writer", daemon=True)
         self._thread.start()
 
-    def send(self, buffers: Sequence[Buffer]) -> None:
+    def send(self, buffers: Sequence[Piece]) -> None:
         """Takes the buffers, which must stay as they are until they are sent."""
         self._queue.put(buffers)
 
-    def finish(self, last: Sequence[Buffer], timeout: float) -> None:
+    def finish(self, last: Sequence[Piece], timeout: float) -> None:
         """Sends these buffers behind the message that is being written, and nothing else. Waits `timeout` seconds
         at most."""
         while not self._queue.empty():
@@ -44,16 +45,31 @@ class Writer:
             if buffers is None:
                 return
             try:
-                self._write([memoryview(buffer) for buffer in buffers if len(buffer)])
+                self._write(buffers)
             except OSError:
                 self._on_failure()
                 return
             # What was sent is not kept until there is more to send.
             del buffers
 
-    def _write(self, buffers: list[memoryview]) -> None:
+    def _write(self, pieces: Sequence[Piece]) -> None:
+        waiting: list[memoryview] = []
+        descriptor: Optional[int] = None
+        for piece in pieces:
+            if isinstance(piece, HeaderWithDescriptor):
+                # It goes with the first byte of what it is sent with, which is this header's.
+                self._write_together(waiting, descriptor)
+                waiting, descriptor = [memoryview(piece.data)], piece.descriptor
+            elif len(piece):
+                waiting.append(memoryview(piece))
+        self._write_together(waiting, descriptor)
+
+    def _write_together(self, buffers: list[memoryview], descriptor: Optional[int]) -> None:
+        beside = [] if descriptor is None else \
+            [(socket.SOL_SOCKET, socket.SCM_RIGHTS, array.array("i", [descriptor]))]
         while buffers:
-            sent = self._socket.sendmsg(buffers[:_MOST_BUFFERS], [], socket.MSG_NOSIGNAL)
+            sent = self._socket.sendmsg(buffers[:_MOST_BUFFERS], beside, socket.MSG_NOSIGNAL)
+            beside = []
             done = 0
             while done < len(buffers) and sent >= len(buffers[done]):
                 sent -= len(buffers[done])
