@@ -324,9 +324,10 @@ bool Engine::canUse(Capability capability) {
     return requestOfThisThread() != nullptr && capabilities_.lists().inForce.contains(capability);
 }
 
-PromptEnd Engine::prompt(InputRequester loop, PyObject* frame, RequestQueue::Deadline deadline) {
+PromptEnd Engine::prompt(InputRequester loop, const FrameChoice& frame, RequestQueue::Deadline deadline) {
     capture_->drain();
-    return prompts_->takeCommands(loop, deadline, [this, frame](const Request& inner) { return handle(inner, frame); });
+    return prompts_->takeCommands(loop, deadline,
+                                  [this, &frame](const Request& inner) { return handle(inner, frame()); });
 }
 
 PromptEnd Engine::readText(std::u16string& text) {

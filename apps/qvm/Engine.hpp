@@ -72,7 +72,7 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
     void cancel(Announcer::Turn& turn, framing::StreamID stream, const cmddistributor::IIPCancelMessage& message);
 
     bool canUse(::capabilities::Capability capability) override;
-    PromptEnd prompt(krutil::prompt::InputRequester loop, PyObject* frame,
+    PromptEnd prompt(krutil::prompt::InputRequester loop, const FrameChoice& frame,
                      std::optional<std::chrono::steady_clock::time_point> deadline) override;
     PromptEnd readText(std::u16string& text) override;
     bool leavePrompt(PromptEnd end) override;

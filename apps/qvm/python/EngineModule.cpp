@@ -216,12 +216,11 @@ void require(Capability capability) {
     }
 }
 
-const char* commandPrompt(InputRequester loop, const py::object& frame) {
-    if (!PyFrame_Check(frame.ptr())) {
-        raise(PyExc_TypeError, "a frame is required");
-    }
+// `stop` has the frame in which commands are evaluated as an attribute, which they may change.
+const char* commandPrompt(InputRequester loop, const py::object& stop) {
     require(loop == InputRequester::mnDEBUG_PROMPT ? Capability::Debugging : Capability::InteractiveCommandLine);
-    return closed(services->prompt(loop, frame.ptr(), std::nullopt));
+    return closed(services->prompt(
+        loop, [&stop] { return stop.attr("frame").ptr(); }, std::nullopt));
 }
 
 const char* pausePrompt(const std::optional<double>& seconds) {
@@ -233,7 +232,8 @@ const char* pausePrompt(const std::optional<double>& seconds) {
         deadline = std::chrono::steady_clock::now() + std::chrono::duration_cast<std::chrono::steady_clock::duration>(
                                                           std::chrono::duration<double>(*seconds > 0 ? *seconds : 0));
     }
-    return closed(services->prompt(InputRequester::mnPAUSE_PROMPT, nullptr, deadline));
+    return closed(services->prompt(
+        InputRequester::mnPAUSE_PROMPT, []() -> PyObject* { return nullptr; }, deadline));
 }
 
 // The answer with a newline at its end; empty at the end of input.
@@ -285,7 +285,7 @@ py::object compileExpression(const py::str& source, const py::str& file) {
         PyErr_Clear();
         return py::none();
     }
-    PyCompilerFlags flags{PyCF_SOURCE_IS_UTF8 | PyCF_IGNORE_COOKIE, PY_MINOR_VERSION};
+    PyCompilerFlags flags{PyCF_SOURCE_IS_UTF8 | PyCF_IGNORE_COOKIE | PyCF_ALLOW_TOP_LEVEL_AWAIT, PY_MINOR_VERSION};
     auto code = py::reinterpret_steal<py::object>(Py_CompileStringObject(text, file.ptr(), Py_eval_input, &flags, -1));
     if (code) {
         return code;
@@ -331,9 +331,9 @@ PYBIND11_EMBEDDED_MODULE(_qvm, module) {
     module.def("can_show", [] { return canUse(Capability::WebWindow); });
     module.def("can_ask", [] { return canUse(Capability::InteractiveCommandLine); });
     module.def("debug_prompt",
-               [](const py::object& frame) { return commandPrompt(InputRequester::mnDEBUG_PROMPT, frame); });
+               [](const py::object& stop) { return commandPrompt(InputRequester::mnDEBUG_PROMPT, stop); });
     module.def("keyboard_prompt",
-               [](const py::object& frame) { return commandPrompt(InputRequester::mnKEYBOARD_PROMPT, frame); });
+               [](const py::object& stop) { return commandPrompt(InputRequester::mnKEYBOARD_PROMPT, stop); });
     module.def("pause_prompt", &pausePrompt);
     module.def("leave_prompt", &leavePrompt);
     module.def("read_line", &readLine);

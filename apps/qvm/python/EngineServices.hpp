@@ -4,6 +4,7 @@
 #include <Python.h>
 
 #include <chrono>
+#include <functional>
 #include <optional>
 #include <string>
 
@@ -24,9 +25,11 @@ class EngineServices {
     /// Whether the calling code belongs to a request that runs, on the main thread, and the capability is in force.
     virtual bool canUse(::capabilities::Capability capability) = 0;
 
-    /// Holds the running request up at a prompt for commands, which are evaluated in `frame`, or in the session's
-    /// namespace when it is null. Needs canUse().
-    virtual PromptEnd prompt(krutil::prompt::InputRequester loop, PyObject* frame,
+    /// The frame in which the next command is evaluated; null for the session's namespace. The prompt keeps it alive.
+    using FrameChoice = std::function<PyObject*()>;
+
+    /// Holds the running request up at a prompt for commands. Needs canUse().
+    virtual PromptEnd prompt(krutil::prompt::InputRequester loop, const FrameChoice& frame,
                              std::optional<std::chrono::steady_clock::time_point> deadline) = 0;
 
     /// Holds the running request up until the client answers with text, which goes to `text`. Needs canUse().

@@ -94,11 +94,13 @@ long exitStatus(const py::object& exitException) {
 // Where code finds its names.
 class Namespace {
   public:
-    explicit Namespace(const py::dict& globals) : globals_(globals), locals_(globals) {}
+    Namespace(const py::dict& globals, const py::object& runToEnd)
+        : runToEnd_(runToEnd), globals_(globals), locals_(globals) {}
 
     // That of a frame that stands still.
-    explicit Namespace(PyObject* frame)
-        : frame_(reinterpret_cast<PyFrameObject*>(frame)),
+    Namespace(PyObject* frame, const py::object& runToEnd)
+        : runToEnd_(runToEnd),
+          frame_(reinterpret_cast<PyFrameObject*>(frame)),
           globals_(py::reinterpret_steal<py::object>(PyFrame_GetGlobals(frame_))),
           locals_(py::reinterpret_steal<py::object>(PyFrame_GetLocals(frame_))) {}
 
@@ -112,7 +114,7 @@ class Namespace {
     }
 
     // New reference, or null with an exception set.
-    PyObject* run(PyObject* code) const { return assigned(PyEval_EvalCode(code, globals_.ptr(), locals_.ptr())); }
+    PyObject* run(PyObject* code) const { return assigned(evaluated(code, globals_.ptr())); }
 
     // The same for an expression. Functions and comprehensions inside it see the frame's variables as global ones,
     // because they see no others.
@@ -124,7 +126,7 @@ class Namespace {
         if (!merged || PyDict_Update(merged.ptr(), locals_.ptr()) != 0) {
             return nullptr;
         }
-        return assigned(PyEval_EvalCode(code, merged.ptr(), locals_.ptr()));
+        return assigned(evaluated(code, merged.ptr()));
     }
 
   private:
@@ -136,6 +138,17 @@ class Namespace {
             }
         }
         return false;
+    }
+
+    // The value of the code. Code that awaits makes a coroutine, which is run to its end.
+    PyObject* evaluated(PyObject* code, PyObject* globals) const {
+        PyObject* const value = PyEval_EvalCode(code, globals, locals_.ptr());
+        if (value == nullptr || (reinterpret_cast<PyCodeObject*>(code)->co_flags & CO_COROUTINE) == 0) {
+            return value;
+        }
+        PyObject* const result = PyObject_CallOneArg(runToEnd_.ptr(), value);
+        Py_DECREF(value);
+        return result;
     }
 
     // Gives the frame its variables back, which code has assigned in a copy.
@@ -151,6 +164,7 @@ class Namespace {
         return result;
     }
 
+    const py::object& runToEnd_;
     PyFrameObject* frame_ = nullptr;
     py::object globals_;
     py::object locals_;
@@ -162,6 +176,7 @@ struct Interpreter::State {
     py::dict globals;
     py::object module;
     py::object compile;
+    py::object runToEnd;
     py::object finish;
     py::object formatError;
     py::object debuggerQuit;
@@ -188,6 +203,7 @@ Interpreter::Interpreter(const PythonConfig& world, const MessageBounds& bounds)
     const auto module = py::module_::import("qvm");
     state_->module = module;
     state_->compile = module.attr("_compile");
+    state_->runToEnd = module.attr("_run_to_end");
     state_->finish = module.attr("_finish");
     state_->formatError = module.attr("_format_error");
     state_->debuggerQuit = module.attr("DebuggerQuit");
@@ -222,7 +238,8 @@ Interpreter::~Interpreter() {
 
 Interpreter::Ending Interpreter::evaluate(const cmddistributor::EvalIIP& request, const std::string& file,
                                           PyObject* frame) {
-    const Namespace names = frame == nullptr ? Namespace(state_->globals) : Namespace(frame);
+    const Namespace names =
+        frame == nullptr ? Namespace(state_->globals, state_->runToEnd) : Namespace(frame, state_->runToEnd);
     names.forgetWarnings();
     ++evaluations_;
     const std::string name = file.empty() ? "<eval-" + std::to_string(evaluations_) + ">" : file;
@@ -261,7 +278,7 @@ Interpreter::Ending Interpreter::evaluate(const cmddistributor::EvalIIP& request
 }
 
 Interpreter::Ending Interpreter::call(const cmddistributor::FEvalIIP& request, Outputs outputs) {
-    Namespace(state_->globals).forgetWarnings();
+    Namespace(state_->globals, state_->runToEnd).forgetWarnings();
     try {
         const std::string& name = request.getFunctionName();
         const py::object function = findFunction(name, state_->globals, state_->module);

@@ -108,12 +108,7 @@ def _show(value):
         return
     # As Python's own hook does, so that a __repr__ that uses it finds no half-made value.
     _builtins._ = None
-    if _qvm.formats_values():
-        import pprint
-        text = pprint.pformat(value)
-    else:
-        text = repr(value)
-    _qvm.show(text + "\n")
+    _qvm.show(_text_of(value, _shown_elements) + "\n")
     for kind in type(value).__mro__:
         names = kind.__dict__
         if "_repr_png_" in names or "_repr_svg_" in names or "_repr_html_" in names:
@@ -121,6 +116,50 @@ def _show(value):
             qvm_displays.offer(value)
             break
     _builtins._ = value
+
+
+# As many elements of each container are shown; 0 for all.
+_shown_elements = 0
+
+
+def _text_of(value, limit):
+    if limit:
+        import qvm_values
+        return qvm_values.text_of(value, limit, _qvm.formats_values())
+    if _qvm.formats_values():
+        import pprint
+        return pprint.pformat(value)
+    return repr(value)
+
+
+def shorten(limit):
+    """From now on, values are shown with at most limit elements of each list, tuple, set and dict; 0 shows all.
+
+    What is left out is counted. print() and repr() are as ever.
+
+    >>> qvm.shorten(2)
+    >>> [10, 20, 30, 40]
+    [10, 20, ... 2 more]
+    """
+    global _shown_elements
+    limit = _index(limit)
+    if limit < 0:
+        raise ValueError(f"limit must be 0 or more, not {limit}")
+    _shown_elements = limit
+
+
+def full():
+    """Shows the value that was shown last with all its elements.
+
+    >>> qvm.shorten(2)
+    >>> [10, 20, 30, 40]
+    [10, 20, ... 2 more]
+    >>> qvm.full()
+    [10, 20, 30, 40]
+    """
+    value = _builtins.__dict__.get("_")
+    if value is not None:
+        _qvm.show(_text_of(value, 0) + "\n")
 
 
 def take_displays():
@@ -192,16 +231,26 @@ class DebuggerQuit(BaseException):
     """Ends a request whose debug or keyboard prompt was left with dbquit()."""
 
 
-# Where the open prompts evaluate, the innermost last: a frame, or None for the session's namespace.
+class _Stop:
+    """A prompt that holds code up. frame is where it evaluates, None for the session's namespace; inner are the frames
+    that up() has left, the innermost first; way is how the code goes on: None for freely."""
+
+    __slots__ = "frame", "inner", "way"
+
+    def __init__(self, frame):
+        self.frame, self.inner, self.way = frame, [], None
+
+
+# Of the open prompts for commands, the innermost last.
 _stops = []
 _session_names = _sys.modules["__main__"].__dict__
 
 
-def _take_commands(prompt, frame):
+def _take_commands(prompt, stop):
     """Whether the client could be asked to the end."""
-    _stops.append(frame)
+    _stops.append(stop)
     try:
-        end = prompt(frame)
+        end = prompt(stop)
     finally:
         _stops.pop()
     if end == "quit":
@@ -217,12 +266,23 @@ def _breakpoint(*arguments, **options):
     if not _qvm.can_debug():
         _warn("breakpoint() goes on: the client or the engine has no debugger here", RuntimeWarning, 2)
         return
-    import linecache
-    code = frame.f_code
-    line = linecache.getline(code.co_filename, frame.f_lineno).strip()
-    _qvm.show(f"Stopped in {code.co_name} ({code.co_filename}:{frame.f_lineno})\n" + (f"    {line}\n" if line else ""))
-    if not _take_commands(_qvm.debug_prompt, frame):
-        _warn("breakpoint() goes on: the client has no debugger any more", RuntimeWarning, 2)
+    _step_on(_stop_in(frame))
+
+
+def _stop_in(frame):
+    """Opens a debug prompt in the frame; returns how the code goes on."""
+    import qvm_stepping
+    stop = _Stop(frame)
+    _qvm.show("Stopped in " + qvm_stepping.place(frame))
+    if not _take_commands(_qvm.debug_prompt, stop):
+        _warn("breakpoint() goes on: the client has no debugger any more", RuntimeWarning, 3)
+    return stop
+
+
+def _step_on(stop):
+    if stop.way:
+        import qvm_stepping
+        qvm_stepping.Stepper(_stop_in).start(stop)
 
 
 def keyboard():
@@ -230,8 +290,10 @@ def keyboard():
     if not _qvm.can_ask():
         _warn("qvm.keyboard() goes on: the client cannot be asked", RuntimeWarning, 2)
         return
-    if not _take_commands(_qvm.keyboard_prompt, _sys._getframe(1)):
+    stop = _Stop(_sys._getframe(1))
+    if not _take_commands(_qvm.keyboard_prompt, stop):
         _warn("qvm.keyboard() goes on: the client cannot be asked any more", RuntimeWarning, 2)
+    _step_on(stop)
 
 
 def pause(seconds=None):
@@ -239,7 +301,7 @@ def pause(seconds=None):
     if seconds is not None:
         seconds = float(seconds)
     begin = _time.monotonic()
-    _stops.append(None)
+    _stops.append(_Stop(None))
     try:
         way_out = _qvm.pause_prompt(seconds) if _qvm.can_ask() else "withdrawn"
     finally:
@@ -260,6 +322,73 @@ def dbcont():
 def dbquit():
     """At a prompt: ends the code that was held up, once this request has ended."""
     _qvm.leave_prompt(True)
+
+
+def _stopped():
+    if not _stops or _stops[-1].frame is None:
+        raise RuntimeError("no debug or keyboard prompt is open")
+    return _stops[-1]
+
+
+def _step(way):
+    stop = _stopped()
+    _qvm.leave_prompt(False)
+    stop.way = way
+
+
+def step():
+    """At a prompt: lets the code go on up to the next line, also in a function that it calls; a debug prompt opens
+    there.
+
+    >>> qvm.step()
+    """
+    _step("step")
+
+
+def next():
+    """At a prompt: lets the code go on up to the next line of the frame, or of its caller when it returns; a debug
+    prompt opens there.
+
+    >>> qvm.next()
+    """
+    _step("next")
+
+
+def up():
+    """At a prompt: code is evaluated in the caller's frame from now on.
+
+    >>> qvm.up()
+    """
+    import qvm_stepping
+    qvm_stepping.go_up(_stopped())
+
+
+def down():
+    """At a prompt: takes one up() back.
+
+    >>> qvm.down()
+    """
+    import qvm_stepping
+    qvm_stepping.go_down(_stopped())
+
+
+def list():
+    """At a prompt: shows the lines around the one where the frame is.
+
+    >>> qvm.list()
+    """
+    import qvm_stepping
+    qvm_stepping.show_lines(_stopped())
+
+
+def where():
+    """At a prompt: shows the frames of the code that is held up, the outermost first; the one in which code is
+    evaluated is marked.
+
+    >>> qvm.where()
+    """
+    import qvm_stepping
+    qvm_stepping.show_stack(_stopped())
 
 
 def debugger(on=True):
@@ -479,6 +608,16 @@ def _is_statement(line):
     return bool(words) and words[0] in _STATEMENTS
 
 
+# ast.PyCF_ALLOW_TOP_LEVEL_AWAIT: code that awaits at its top level becomes a coroutine.
+_AWAITS = 0x2000
+
+
+def _run_to_end(coroutine):
+    """The value of code that awaits."""
+    import qvm_loop
+    return qvm_loop.run_to_end(coroutine)
+
+
 def _compile_block(source, filename):
     """Code of the statements and of a trailing expression; either may be None."""
     if "\n" not in source.rstrip():
@@ -491,13 +630,13 @@ def _compile_block(source, filename):
     import _ast
     tree = compile(source, filename, "exec", _ast.PyCF_ONLY_AST, True)
     if not tree.body or not isinstance(tree.body[-1], _ast.Expr):
-        return compile(tree, filename, "exec", 0, True), None
-    last = compile(_ast.Expression(tree.body.pop().value), filename, "eval", 0, True)
-    return compile(tree, filename, "exec", 0, True) if tree.body else None, last
+        return compile(tree, filename, "exec", _AWAITS, True), None
+    last = compile(_ast.Expression(tree.body.pop().value), filename, "eval", _AWAITS, True)
+    return compile(tree, filename, "exec", _AWAITS, True) if tree.body else None, last
 
 
 def _compile_program(source, filename):
-    return compile(source, filename, "exec", 0, True), None
+    return compile(source, filename, "exec", _AWAITS, True), None
 
 
 def _compile_statement(source, filename):
@@ -507,7 +646,7 @@ def _compile_statement(source, filename):
         second = tree.body[1]
         raise SyntaxError("multiple statements found while compiling a single statement",
                           (filename, second.lineno, second.col_offset + 1, None))
-    return compile(tree, filename, "single", 0, True), None
+    return compile(tree, filename, "single", _AWAITS, True), None
 
 
 # By code type; one that is not stated is a block.
@@ -542,7 +681,7 @@ def _compile(source, filename, code_type, begins_file):
 
 def _scopes():
     """The namespaces in which code finds its names now, from the innermost."""
-    frame = _stops[-1] if _stops else None
+    frame = _stops[-1].frame if _stops else None
     if frame is None:
         return [_session_names, _builtins.__dict__]
     return [frame.f_locals, frame.f_globals, frame.f_builtins]
