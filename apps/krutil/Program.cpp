@@ -86,6 +86,7 @@ class AskingClient {
           help_(client_),
           terminal_(terminal),
           history_(std::move(history)),
+          color_(wantsColor(options.display.color, terminal.out)),
           edits_(interactive && terminal.out.hasCursor() && !options.display.json),
           reader_(STDIN_FILENO, client_.conversation(),
                   options.display.json || !terminal.out.isTerminal() ? terminal.err : terminal.out),
@@ -122,7 +123,7 @@ class AskingClient {
             }
             // Most commands end without a question.
             if (!terminal_.editor) {
-                terminal_.editor.emplace(terminal_.out, terminal_.lastLine, history_);
+                terminal_.editor.emplace(terminal_.out, terminal_.lastLine, history_, color_);
             }
             return terminal_.editor->read(client_.conversation(), complete_, what, prompt, done);
         };
@@ -135,6 +136,7 @@ class AskingClient {
     };
     Terminal& terminal_;
     const std::string history_;
+    const bool color_;
     const bool edits_;
     LineReader reader_;
     std::optional<Prompts> prompts_;

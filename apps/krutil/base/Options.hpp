@@ -24,7 +24,7 @@ struct ConnectionOptions {
     foundation::msg_svc::transport::layers::session::Limits limits;
 };
 
-/// Whether errors and warnings are coloured.
+/// Whether errors, warnings and code that is typed are coloured.
 enum class Color { Auto, Always, Never };
 
 /// What is shown, and how.

@@ -79,7 +79,8 @@ void addDisplayOptions(CLI::App& app, DisplayOptions& options) {
         {"auto", Color::Auto}, {"always", Color::Always}, {"never", Color::Never}};
     app.add_option_function<std::string>(
            "--color", [&options](const std::string& name) { options.color = colors.at(name); },
-           "Tell errors and warnings apart by colour: auto (on a terminal, unless NO_COLOR is set), always or never")
+           "Colour errors, warnings and code that is typed: auto (on a terminal, unless NO_COLOR is set), always or "
+           "never")
         ->check(CLI::IsMember(&colors).description(""))
         ->type_name("WHEN")
         ->default_str("auto")

@@ -20,6 +20,25 @@ std::size_t styleAt(std::wstring_view text, std::size_t at) {
     return end != std::wstring_view::npos && text[end] == L'm' ? end + 1 - at : 0;
 }
 
+// Each begins anew, whatever was before.
+const char* sequenceOf(Style style) {
+    switch (style) {
+        case Style::Keyword:
+            return "\x1b[0;35m";
+        case Style::Literal:
+            return "\x1b[0;32m";
+        case Style::Number:
+            return "\x1b[0;36m";
+        case Style::Comment:
+            return "\x1b[0;90m";
+        case Style::Match:
+            return "\x1b[0;1;4m";
+        case Style::Plain:
+            break;
+    }
+    return "\x1b[0m";
+}
+
 bool isControl(wchar_t c) {
     return c < L' ' || c == L'\x7f';
 }
@@ -42,8 +61,12 @@ class LineDisplay::Layout {
         }
     }
 
+    // Of the characters from now on.
+    void setStyle(Style style) noexcept { style_ = style; }
+
     void put(wchar_t c) {
         if (c == L'\n') {
+            endStyle();
             picture_.rows.emplace_back();
         } else if (c == L'\t') {
             do {
@@ -68,6 +91,7 @@ class LineDisplay::Layout {
     }
 
     Picture finish() {
+        endStyle();
         if (row().width == columns_) {
             wrap();
         }
@@ -78,6 +102,7 @@ class LineDisplay::Layout {
     Row& row() { return picture_.rows.back(); }
 
     void wrap() {
+        endStyle();
         row().goesOn = true;
         picture_.rows.emplace_back();
     }
@@ -88,11 +113,25 @@ class LineDisplay::Layout {
         if (row().width + width > columns_) {
             wrap();
         }
+        if (written_ != style_) {
+            row().bytes += sequenceOf(style_);
+            written_ = style_;
+        }
         row().bytes += bytes;
         row().width += width;
     }
 
+    // Each row has its styles to itself, because any may be the first one on the terminal.
+    void endStyle() {
+        if (written_ != Style::Plain) {
+            row().bytes += sequenceOf(Style::Plain);
+            written_ = Style::Plain;
+        }
+    }
+
     const std::size_t columns_;
+    Style style_ = Style::Plain;
+    Style written_ = Style::Plain;
     Picture picture_;
 };
 
@@ -141,8 +180,10 @@ std::string LineDisplay::show(const Line& line, Size size) {
         if (i == line.cursor) {
             layout.markCursor();
         }
+        layout.setStyle(i < line.styles.size() ? line.styles[i] : Style::Plain);
         layout.put(line.text[i]);
         if (line.text[i] == L'\n') {
+            layout.setStyle(Style::Plain);
             layout.putPrompt(line.continuation);
         }
     }

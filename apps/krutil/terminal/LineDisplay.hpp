@@ -6,6 +6,8 @@
 #include <string_view>
 #include <vector>
 
+#include "krutil/terminal/Highlight.hpp"
+
 namespace krutil_client {
 
 /// Keeps a prompt and a line behind it shown, over as many rows as they need, or as many of these around the cursor as
@@ -24,9 +26,9 @@ class LineDisplay {
     struct Line {
         std::wstring prompt;  ///< for which measures() is true
         std::wstring text{};
-        std::size_t cursor = 0;  ///< the character of `text` that the cursor stands before
-        std::wstring
-            continuation{};  ///< stands before each line of `text` but the first one; measures() is true for it
+        std::size_t cursor = 0;       ///< the character of `text` that the cursor stands before
+        std::vector<Style> styles{};  ///< of each character of `text`; empty for plain ones
+        std::wstring continuation{};  ///< before each line of `text` but the first one; measures() is true for it
     };
 
     /// Whether the place of the cursor after this text is known: it has no control characters but tabs and complete

@@ -16,6 +16,7 @@
 
 #include "krutil/base/Text.hpp"
 #include "krutil/terminal/EditedText.hpp"
+#include "krutil/terminal/Highlight.hpp"
 #include "krutil/terminal/HistorySearch.hpp"
 #include "krutil/terminal/LineDisplay.hpp"
 #include "krutil/terminal/LineHistory.hpp"
@@ -60,8 +61,9 @@ struct Close {
 // and takes characters of no width for ones of width one.
 class LineEditor::Impl {
   public:
-    Impl(Output& out, LastLine& lastLine, std::string historyFile)
-        : out_(out),
+    Impl(Output& out, LastLine& lastLine, std::string historyFile, bool color)
+        : color_(color),
+          out_(out),
           lastLine_(lastLine),
           codeHistory_(withUtf8(std::move(historyFile))),
           noHistory_(std::string()),
@@ -423,23 +425,28 @@ class LineEditor::Impl {
         // Not between keys that come together, as those of a paste do.
         if (!readable(STDIN_FILENO)) {
             takeText();
-            draw(cursor_);
+            draw(cursor_, cursor_);
         }
     }
 
-    void draw(std::size_t cursor) {
+    // A bracket at `marked` is shown with the one that belongs to it.
+    void draw(std::size_t cursor, std::size_t marked) {
         if (away_) {
             settleLastLine();
             show(display_.begin(toWide(lastLine_.text()), size()));
             away_ = false;
         }
-        show(display_.show({toWide(lastLine_.text()) + prompt_, text_, cursor, what_ == For::Code ? continuation : L""},
-                           size()));
+        LineDisplay::Line line{toWide(lastLine_.text()) + prompt_, text_, cursor};
+        if (what_ == For::Code) {
+            line.continuation = continuation;
+            line.styles = color_ ? stylesOf(text_, marked) : std::vector<Style>();
+        }
+        show(display_.show(line, size()));
     }
 
     // Shows all of the line once more, and begins a new one.
     void leave() {
-        draw(text_.size());
+        draw(text_.size(), std::wstring::npos);
         lastLine_.take();
         show(std::string(markNoPastes) + (wasDropped() ? "^C\n" : "\n"));
     }
@@ -459,6 +466,7 @@ class LineEditor::Impl {
     Conversation* conversation_ = nullptr;
     const Complete* complete_ = nullptr;
     For what_ = For::Code;
+    const bool color_;
     Output& out_;
     LastLine& lastLine_;
     LineHistory codeHistory_;
@@ -476,8 +484,8 @@ class LineEditor::Impl {
     std::exception_ptr error_;
 };
 
-LineEditor::LineEditor(Output& out, LastLine& lastLine, std::string historyFile)
-    : impl_(std::make_unique<Impl>(out, lastLine, std::move(historyFile))) {}
+LineEditor::LineEditor(Output& out, LastLine& lastLine, std::string historyFile, bool color)
+    : impl_(std::make_unique<Impl>(out, lastLine, std::move(historyFile), color)) {}
 
 LineEditor::~LineEditor() = default;
 

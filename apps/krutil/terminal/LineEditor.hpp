@@ -29,8 +29,9 @@ class LineEditor {
     };
 
     /// Code is remembered in `historyFile`, see LineHistory; empty for none. `out` is the terminal, which has a cursor,
-    /// and which nothing but outputs with this `lastLine` writes to. Both must outlive the object.
-    LineEditor(Output& out, LastLine& lastLine, std::string historyFile);
+    /// and which nothing but outputs with this `lastLine` writes to. Both must outlive the object. `color` says that
+    /// code is coloured, and the bracket marked that belongs to the one at the cursor.
+    LineEditor(Output& out, LastLine& lastLine, std::string historyFile, bool color);
     ~LineEditor();
     LineEditor(const LineEditor&) = delete;
     LineEditor& operator=(const LineEditor&) = delete;

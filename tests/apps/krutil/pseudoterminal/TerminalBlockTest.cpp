@@ -124,5 +124,22 @@ TEST_F(TerminalBlockTest, TheHistoryIsSearched) {
     leave();
 }
 
+TEST_F(TerminalBlockTest, CodeIsColouredWhereColoursAreWanted) {
+    terminal = std::make_unique<Terminal>(command({"repl"}), environment(""));
+    expectPrompt();
+    terminal->type("None if f(1) else 'a'");
+    terminal->expect(
+        "\x1b[0;35mNone\x1b[0m \x1b[0;35mif\x1b[0m f(\x1b[0;36m1\x1b[0m) \x1b[0;35melse\x1b[0m \x1b[0;32m'a'");
+    terminal->type(std::string(lineBegin) + "(0)");
+    terminal->expect("\x1b[0;1;4m(\x1b[0;36m0\x1b[0;1;4m)\x1b[0;35mNone");
+    terminal->expectBottom({">>> (0)" + at + "None if f(1) else 'a'"});
+    leave("\x15\x04");
+    begin();
+    terminal->type("None if f(1) else 'a'");
+    terminal->expectBottom({">>> None if f(1) else 'a'" + at});
+    EXPECT_EQ(terminal->sent().find("\x1b[0"), std::string::npos);
+    leave("\x15\x04");
+}
+
 }  // namespace
 }  // namespace krutil_client

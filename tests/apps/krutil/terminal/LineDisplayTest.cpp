@@ -69,6 +69,18 @@ TEST_F(LineDisplayTest, ColoursOfThePromptTakeNoRoom) {
     EXPECT_THAT(screen.lines(), ElementsAre("red> 12345", at));
 }
 
+TEST_F(LineDisplayTest, EachRowHasItsStylesToItself) {
+    display.begin(L"", size);
+    std::vector<Style> styles(12, Style::Literal);
+    styles[0] = Style::Keyword;
+    styles[11] = Style::Plain;
+    EXPECT_EQ(display.show({L"> ", L"abcdefgh\nijk", 12, styles, L". "}, size),
+              "> \x1b[0;35ma\x1b[0;32mbcdefgh\x1b[0m\r\n. \x1b[0;32mij\x1b[0mk");
+    // A row that wraps.
+    EXPECT_EQ(display.show({L"> ", L"0123456789", 10, std::vector<Style>(10, Style::Number)}, size),
+              "\x1b[1A\r> \x1b[0;36m01234567\x1b[0m\x1b[0;36m89\x1b[0m\x1b[J");
+}
+
 TEST_F(LineDisplayTest, ControlCharactersAreShownAsTheirKeys) {
     display.begin(L"", size);
     show(L"\x01\x7f\t.\u0085", 5);
