@@ -32,6 +32,7 @@
 #include "krutil/terminal/LineEditor.hpp"
 #include "krutil/terminal/LineHistory.hpp"
 #include "krutil/terminal/LineReader.hpp"
+#include "krutil/terminal/PictureViewer.hpp"
 #include "krutil/terminal/Prompts.hpp"
 
 namespace krutil_client {
@@ -90,6 +91,11 @@ class AskingClient {
           edits_(interactive && terminal.out.hasCursor() && !options.display.json),
           reader_(STDIN_FILENO, client_.conversation(),
                   options.display.json || !terminal.out.isTerminal() ? terminal.err : terminal.out),
+          pictures_(client_, printer, terminal.out,
+                    options.display.json ? PictureViewer::Way::AllToFiles
+                    : edits_             ? PictureViewer::Way::Drawn
+                                         : PictureViewer::Way::BestToFile,
+                    [this](const std::string& text) { typed_ += text; }),
           prompts_(std::in_place, client_, reading(LineEditor::For::Input), reading(LineEditor::For::Code),
                    options.display.json ? terminal.err : terminal.out) {}
 
@@ -125,6 +131,7 @@ class AskingClient {
             if (!terminal_.editor) {
                 terminal_.editor.emplace(terminal_.out, terminal_.lastLine, history_, color_);
             }
+            terminal_.editor->type(std::exchange(typed_, {}));
             return terminal_.editor->read(client_.conversation(), complete_, what, prompt, done);
         };
     }
@@ -139,6 +146,8 @@ class AskingClient {
     const bool color_;
     const bool edits_;
     LineReader reader_;
+    PictureViewer pictures_;
+    std::string typed_;  ///< by a person, while nobody read
     std::optional<Prompts> prompts_;
 };
 

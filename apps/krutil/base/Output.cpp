@@ -53,6 +53,11 @@ std::size_t Output::rows() const noexcept {
     return ::ioctl(fd_, TIOCGWINSZ, &size) == 0 && size.ws_row != 0 ? size.ws_row : usual;
 }
 
+std::size_t Output::pixelWidth() const noexcept {
+    winsize size{};
+    return ::ioctl(fd_, TIOCGWINSZ, &size) == 0 ? size.ws_xpixel : 0;
+}
+
 void Output::write(std::string_view text) {
     if (terminal_ && lastLine_ != nullptr) {
         lastLine_->add(text);

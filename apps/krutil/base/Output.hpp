@@ -36,6 +36,9 @@ class Output {
     std::size_t columns() const noexcept;
     std::size_t rows() const noexcept;
 
+    /// Width of the terminal in pixels; 0 where it is not known.
+    std::size_t pixelWidth() const noexcept;
+
   private:
     void put(std::string_view text, bool interruptible);
 

@@ -301,6 +301,18 @@ void JsonPrinter::returned(const Returned& output) {
     print(object);
 }
 
+void JsonPrinter::pictured(const Pictured& picture) {
+    ordered_json object{
+        {"event", "picture"}, {"number", picture.picture.number}, {"type", typeName(picture.form.type)}};
+    if (picture.form.type == PictureForm::Type::Png) {
+        const PixelSize size = sizeOfPng(picture.form.content);
+        object["width"] = size.width;
+        object["height"] = size.height;
+    }
+    object["file"] = picture.file;
+    print(object);
+}
+
 void JsonPrinter::replied(const Replied& reply) {
     ordered_json object{{"event", "reply"}, {"request", toString(reply.request)}, {"ok", reply.error == nullptr}};
     if (reply.error != nullptr) {

@@ -28,6 +28,9 @@ namespace krutil_client {
 ///                                 if it is one, or "elements" if they are few: nested lists by index, whatever the
 ///                                 order, complex numbers as [real, imaginary], numbers that JSON does not know as
 ///                                 "nan", "inf" and "-inf"
+///   picture                       "number" of the line that announced it, "type" (image/png, image/svg+xml,
+///                                 text/html), "width" and "height" of a PNG, "file" that it was written to: once for
+///                                 each form of a picture, after the reply to the request that showed it
 ///   reply                         "request", "ok", "error" (absent when ok)
 ///   shutdown
 ///   timing                        "readyMs", "firstOutputMs", "answeredMs", as far as known
@@ -44,6 +47,7 @@ class JsonPrinter : public Printer {
     void connected(const foundation::msg_svc::transport::layers::session::Peer& peer,
                    const std::unordered_map<std::string, std::string>& features) override;
     void returned(const Returned& output) override;
+    void pictured(const Pictured& picture) override;
     void replied(const Replied& reply) override;
     void failed(int exitCode, const std::string& sentence) override;
     void timed(const Timing& timing) override;

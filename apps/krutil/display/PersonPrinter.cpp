@@ -29,7 +29,12 @@ std::string milliseconds(Timing::Duration duration) {
 
 void PersonPrinter::subscribe(foundation::msg_svc::eventmgr::EventMgr& events) {
     events.subscribe<krutil::io::TextBaseEvent>([this](const krutil::io::TextBaseEvent& event) { show(event); });
-    events.subscribe<krutil::io::SinkTextEvent>([this](const krutil::io::SinkTextEvent& event) { show(event); });
+    events.subscribe<krutil::io::SinkTextEvent>([this](const krutil::io::SinkTextEvent& event) {
+        // Of a page the person has the value's text.
+        if (!pictureLine(event.getText()) || announcesImage(event.getText())) {
+            show(event);
+        }
+    });
     // The other event of a warning comes for hidden ones too.
     events.subscribe<korvel::lang::diagnostic::IssuedEnabledWarningEvent>(
         [this](const korvel::lang::diagnostic::IssuedEnabledWarningEvent& event) {
@@ -62,6 +67,10 @@ void PersonPrinter::returned(const Returned& output) {
                           : "output " + std::to_string(output.number) + " of " + std::to_string(output.count) + ": ";
     out_.write(name + (output.file.empty() ? arrayText(output.array)
                                            : arrayHeading(output.array) + " -> " + output.file + "\n"));
+}
+
+void PersonPrinter::pictured(const Pictured& picture) {
+    err_.write("krutil: picture " + std::to_string(picture.picture.number) + " is in " + picture.file + '\n');
 }
 
 void PersonPrinter::replied(const Replied& reply) {

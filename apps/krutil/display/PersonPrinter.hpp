@@ -15,7 +15,8 @@ struct PersonStyle {
 
 /// Text goes to standard output or standard error as it arrives, byte for byte as UTF-8; errors, warnings that are
 /// shown and timing go to standard error. An error is shown as the engine wants it printed, or else as errorText() has
-/// it. Outputs of a function go to standard output, as arrayText() has them or as the file that they are in.
+/// it. Outputs of a function go to standard output, as arrayText() has them or as the file that they are in. Files of
+/// pictures are named on standard error.
 class PersonPrinter : public Printer {
   public:
     /// Both must outlive the object.
@@ -25,6 +26,7 @@ class PersonPrinter : public Printer {
     void connected(const foundation::msg_svc::transport::layers::session::Peer& peer,
                    const std::unordered_map<std::string, std::string>& features) override;
     void returned(const Returned& output) override;
+    void pictured(const Pictured& picture) override;
     void replied(const Replied& reply) override;
     void failed(int exitCode, const std::string& sentence) override;
     void timed(const Timing& timing) override;

@@ -12,6 +12,7 @@
 #include "foundation/msg_svc/eventmgr/EventMgr.hpp"
 #include "foundation/msg_svc/exchange/IDType.hpp"
 #include "foundation/msg_svc/transport/layers/session/Session.hpp"
+#include "krutil/display/Pictures.hpp"
 
 namespace krutil_client {
 
@@ -29,6 +30,13 @@ struct Returned {
     std::size_t count;   ///< of all outputs
     const foundation::korveldata::Array& array;
     const std::string& file;  ///< that it has been written to; empty for none
+};
+
+/// A form of a picture that has been written to a file. The references are valid during the call only.
+struct Pictured {
+    const Picture& picture;
+    const PictureForm& form;
+    const std::string& file;
 };
 
 /// How long things took; what did not happen is empty.
@@ -53,6 +61,9 @@ class Printer {
 
     /// A function call has succeeded; once for each output, in order, after its replied().
     virtual void returned(const Returned& output) = 0;
+
+    /// A picture that a request has shown is in a file.
+    virtual void pictured(const Pictured& picture) = 0;
 
     /// The reply to a request has come.
     virtual void replied(const Replied& reply) = 0;

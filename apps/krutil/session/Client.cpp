@@ -15,6 +15,7 @@
 #include "common/KrutilSession.hpp"
 #include "common/Precheck.hpp"
 #include "krutil/capabilities_api/CapabilitiesChanged.hpp"
+#include "krutil/display/Pictures.hpp"
 #include "krutil/io/SinkTextEvent.hpp"
 #include "krutil/io/TextBaseEvent.hpp"
 #include "msg_svc/protobuf/ustring.hpp"
@@ -47,7 +48,7 @@ EngineProcess findEngine(const ConnectionOptions& options) {
 }
 
 capabilities::CapabilityList capabilitiesHere(const ConnectionOptions& options, bool interactive) {
-    capabilities::CapabilityList list;
+    capabilities::CapabilityList list{capabilities::Capability::WebWindow};
     if (interactive) {
         list |= capabilities::Capability::InteractiveCommandLine;
         list |= capabilities::Capability::Debugging;
@@ -80,7 +81,10 @@ Client::Client(const ConnectionOptions& connection, const DisplayOptions& displa
         }
     };
     events_.subscribe<krutil::io::TextBaseEvent>(noteTime);
-    events_.subscribe<krutil::io::SinkTextEvent>(noteTime);
+    events_.subscribe<krutil::io::SinkTextEvent>([this, noteTime](const krutil::io::SinkTextEvent& event) {
+        noteTime(event);
+        picturesAnnounced_ = picturesAnnounced_ || pictureLine(event.getText());
+    });
     events_.subscribe<krutil::capabilities_api::CapabilitiesChanged>(
         [this](const krutil::capabilities_api::CapabilitiesChanged& event) {
             engineCapabilities_ = event.getQvmCapabilities();
@@ -224,7 +228,14 @@ void Client::wait(const std::vector<Sent>& requests, const std::function<bool()>
 Answer Client::request(const NewRequest& request) {
     const Sent sent = send(request);
     wait({sent}, [&sent] { return sent->answer.has_value(); });
+    showPictures();
     return *sent->answer;
+}
+
+void Client::showPictures() {
+    if (showPictures_ && std::exchange(picturesAnnounced_, false)) {
+        showPictures_();
+    }
 }
 
 Canceller Client::cancelling(std::vector<Sent> requests) {

@@ -77,8 +77,16 @@ class Client {
     /// what printing and Ctrl-C throw.
     void wait(const std::vector<Sent>& requests, const std::function<bool()>& done);
 
-    /// Sends a request and waits for its answer. Throws what both throw.
+    /// Sends a request and waits for its answer; then pictures are shown. Throws what both throw, and what showing
+    /// throws.
     Answer request(const NewRequest& request);
+
+    /// How pictures are shown: `show` asks the engine for them. Called while nothing is printed.
+    void setShowPictures(std::function<void()> show) { showPictures_ = std::move(show); }
+
+    /// Has the pictures shown that have been announced since the last time, if there are any. request() does so by
+    /// itself; it is for who waits in another way. The engine must be idle, or at a prompt that takes code.
+    void showPictures();
 
     /// While the object lives, Ctrl-C cancels those of `requests` that have no answer.
     Canceller cancelling(std::vector<Sent> requests);
@@ -137,6 +145,8 @@ class Client {
     foundation::msg_svc::eventmgr::EventMgr events_;
     std::optional<Conversation::Clock::time_point> firstText_;
     RequestList requests_{events_};
+    std::function<void()> showPictures_;
+    bool picturesAnnounced_ = false;
     capabilities::CapabilityList capabilities_;
     capabilities::CapabilityList engineCapabilities_;
     std::unique_ptr<Tracer> tracer_;

@@ -88,6 +88,8 @@ class LineEditor::Impl {
     Impl(const Impl&) = delete;
     Impl& operator=(const Impl&) = delete;
 
+    void type(const std::string& keys) { ::el_wpush(editor_, toWide(keys).c_str()); }
+
     ReadLine read(Conversation& conversation, const Complete& complete, For what, const std::string& prompt,
                   const std::function<bool()>& done) {
         conversation_ = &conversation;
@@ -492,6 +494,10 @@ LineEditor::~LineEditor() = default;
 ReadLine LineEditor::read(Conversation& conversation, const Complete& complete, For what, const std::string& prompt,
                           const std::function<bool()>& done) {
     return impl_->read(conversation, complete, what, prompt, done);
+}
+
+void LineEditor::type(const std::string& keys) {
+    impl_->type(keys);
 }
 
 }  // namespace krutil_client

@@ -41,6 +41,9 @@ class LineEditor {
     ReadLine read(Conversation& conversation, const Complete& complete, For what, const std::string& prompt,
                   const std::function<bool()>& done);
 
+    /// Takes keys that have been typed and read elsewhere: the next line begins with them.
+    void type(const std::string& keys);
+
   private:
     class Impl;
     std::unique_ptr<Impl> impl_;

@@ -230,6 +230,9 @@ void Prompts::evaluate(Open& open, const std::vector<std::string>& pieces) {
         }
     }
     client_.wait(sent, [&] { return open.closed || std::all_of(sent.begin(), sent.end(), isAnswered); });
+    if (!leaving && !open.closed) {
+        client_.showPictures();
+    }
     if (leaving && isAnswered(leaving) && leaving->answer->exitCode == ExitCode::Ok) {
         client_.conversation().run([&open] { return open.closed; });
     }

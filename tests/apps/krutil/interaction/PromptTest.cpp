@@ -118,9 +118,10 @@ TEST_F(ClientPromptTest, ALineOfInputIsSentAsItIs) {
     EXPECT_EQ(run(peer), ExitCode::Ok);
     EXPECT_THAT(commands, ElementsAre(u"some \u00e4 line "));
     EXPECT_THAT(prompts, ElementsAre(""));
-    EXPECT_EQ(peer.clientCapabilities(), (capabilities::CapabilityList{capabilities::Capability::InteractiveCommandLine,
-                                                                       capabilities::Capability::Debugging,
-                                                                       capabilities::Capability::LocalClient}));
+    EXPECT_EQ(peer.clientCapabilities(),
+              (capabilities::CapabilityList{capabilities::Capability::InteractiveCommandLine,
+                                            capabilities::Capability::Debugging, capabilities::Capability::WebWindow,
+                                            capabilities::Capability::LocalClient}));
 }
 
 TEST_F(ClientPromptTest, AnEmptyLineIsAnEmptyLine) {

@@ -149,7 +149,14 @@ class Screen {
     }
 
     std::size_t showSequence() {
-        const std::size_t end = pending_.find_first_of("ABCDGHJKlhmn", 2);
+        // Strings, such as pictures, up to their end.
+        if (pending_.size() > 1 && (pending_[1] == '_' || pending_[1] == ']')) {
+            const std::size_t stringEnd = pending_.find('\\');
+            const std::size_t bell = pending_[1] == ']' ? pending_.find('\a') : std::string::npos;
+            const std::size_t last = std::min(stringEnd, bell);
+            return last == std::string::npos ? 0 : last + 1;
+        }
+        const std::size_t end = pending_.find_first_of("ABCDGHJKclhmn", 2);
         if (end == std::string::npos) {
             return 0;
         }

@@ -111,10 +111,10 @@ class Terminal {
         waitFor([&] { return condition(screen_.lines()); }, [&] { return "expected " + what; });
     }
 
-    /// Gives the terminal another size, and tells the program.
-    void resize(unsigned short newColumns, unsigned short newRows) {
+    /// Gives the terminal another size, and tells the program. A width in pixels of 0 is none that it knows.
+    void resize(unsigned short newColumns, unsigned short newRows, unsigned short pixels = 0) {
         screen_.resize(newColumns, newRows);
-        const winsize size{newRows, newColumns, 0, 0};
+        const winsize size{newRows, newColumns, pixels, 0};
         ::ioctl(terminal_.get(), TIOCSWINSZ, &size);
     }
 

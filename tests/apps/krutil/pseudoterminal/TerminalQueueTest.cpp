@@ -86,7 +86,7 @@ TEST_F(TerminalQueueTest, TheQueueIsListedAndCancelledByNumber) {
     terminal->expect("   5  requeued  print('never', 6 * 7)\r\n");
     terminal->expect(
         "The engine states InteractiveCommandLine, WebWindow, Debugging; this client states InteractiveCommandLine, "
-        "Debugging.\r\n");
+        "WebWindow, Debugging.\r\n");
     terminal->expect(prompt);
     evaluate(":queue cancel 5", "krutil: cancelled\r\n");
     evaluate(":queue cancel 5", "There is no request '5'; :queue lists those that there are.\r\n");
