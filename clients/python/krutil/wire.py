@@ -170,8 +170,10 @@ class Reader:
 
     def __init__(self, connection: socket.socket) -> None:
         self._socket = connection
-        self._buffer = memoryview(bytearray(self.BUFFERED))
-        self._unread = self._buffer[:0]
+        self._buffer = bytearray(self.BUFFERED)
+        self._view = memoryview(self._buffer)
+        # What is unread lies between these places of the buffer.
+        self._begin = self._end = 0
         #: Until when what is asked for must have come, by time.monotonic(). Else `TimeoutError` is raised.
         self.deadline: Optional[float] = None
         #: What comes beside the bytes. None for an end that takes none: the system closes them then.
@@ -180,17 +182,18 @@ class Reader:
     def read(self, size: int, what: str, *numbers: int) -> Buffer:
         """The next `size` bytes, in memory of their own that can be written to. `what`, a format for the numbers, names
         them when the stream ends before."""
-        if size > len(self._unread):
+        begin, end = self._begin, self._begin + size
+        if end > self._end:
             if size > self._SMALL:
                 return self._read_large(size, what, *numbers)
-            done = len(self._unread)
-            self._buffer[:done] = self._unread
-            while done < size:
-                done += self._receive(self._buffer[done:], done, size, what, *numbers)
-            self._unread = self._buffer[:done]
-        taken = bytearray(self._unread[:size])
-        self._unread = self._unread[size:]
-        return taken
+            done = self._end - begin
+            self._view[:done] = self._view[begin:self._end]
+            self._begin, self._end = 0, done
+            while self._end < size:
+                self._end += self._receive(self._view[self._end:], self._end, size, what, *numbers)
+            begin, end = 0, size
+        self._begin = end
+        return self._buffer[begin:end]
 
     def _read_large(self, size: int, what: str, *numbers: int) -> Buffer:
         # NumPy does not fill this memory, so it is address space only until the bytes have come.
@@ -198,16 +201,16 @@ class Reader:
             target = numpy.empty(size, numpy.uint8).data
         except MemoryError:
             raise Violation(f"there is no memory for {what % numbers}, {size} bytes") from None
-        done = len(self._unread)
-        target[:done] = self._unread
-        self._unread = self._buffer[:0]
+        done = self._end - self._begin
+        target[:done] = self._view[self._begin:self._end]
+        self._begin = self._end = 0
         while done < size:
             done += self._receive(target[done:], done, size, what, *numbers)
         return target
 
     def buffered(self) -> bytes:
         """What has come behind all that was read."""
-        return bytes(self._unread)
+        return bytes(self._view[self._begin:self._end])
 
     def _receive(self, target: memoryview, done: int, size: int, what: str, *numbers: int) -> int:
         if self.deadline is not None:
