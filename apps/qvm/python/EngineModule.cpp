@@ -137,6 +137,7 @@ PyObject* writeMethod(PyObject* /*module*/, PyObject* text) noexcept {
 
 std::array writeMethods{PyMethodDef{"write_output", &writeMethod<TextSource::Output>, METH_O, nullptr},
                         PyMethodDef{"write_error", &writeMethod<TextSource::Error>, METH_O, nullptr},
+                        PyMethodDef{"show", &writeMethod<TextSource::ShownOutput>, METH_O, nullptr},
                         PyMethodDef{nullptr, nullptr, 0, nullptr}};
 
 void flush() {
@@ -317,7 +318,6 @@ PYBIND11_EMBEDDED_MODULE(_qvm, module) {
     if (PyModule_AddFunctions(module.ptr(), writeMethods.data()) != 0) {
         throw py::error_already_set();
     }
-    module.def("show", [](const py::object& text) { write(TextSource::ShownOutput, text.ptr()); });
     module.def("flush", &flush);
     module.def("send_all", &sendAll);
     module.def("keep_last_words", &LastWords::keep);

@@ -6,8 +6,8 @@
 #include <typeinfo>
 
 #include "foundation/msg_svc/transport/layers/message/LastAsked.hpp"
+#include "foundation/msg_svc/transport/layers/session/FrameKinds.hpp"
 #include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
-#include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 namespace {
@@ -47,7 +47,7 @@ void FrameNotes::take(const std::vector<std::unique_ptr<framing::Frame>>& frames
         notes_.resize(count_);
     }
     for (std::size_t i = 0; i < count_; ++i) {
-        const auto* const tagged = dynamic_cast<const framing::TaggedFrame*>(frames[i].get());
+        const auto* const tagged = asTagged(*frames[i]);
         notes_[i].tagged = tagged != nullptr;
         notes_[i].type = frames[i]->type();
         notes_[i].size = frames[i]->size();

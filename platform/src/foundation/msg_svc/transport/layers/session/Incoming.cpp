@@ -9,10 +9,10 @@
 #include <variant>
 
 #include "foundation/msg_svc/transport/layers/message/Message.hpp"
+#include "foundation/msg_svc/transport/layers/session/FrameKinds.hpp"
 #include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
 #include "foundation/msg_svc/transport/layers/session/RefusalTexts.hpp"
 #include "foundation/msg_svc/transport/layers/session/StreamDescriptors.hpp"
-#include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 namespace {
@@ -194,7 +194,7 @@ void Incoming::takeMessage(Frames frames) {
         }
     }
     const framing::StreamID stream = frames.back()->streamID();
-    const auto* const root = dynamic_cast<const framing::TaggedFrame*>(frames.back().get());
+    const auto* const root = asTagged(*frames.back());
     const auto refuse = [stream](const std::string& why) {
         throw ProtocolViolation("message on stream " + std::to_string(stream) + ": " + why);
     };
@@ -226,7 +226,7 @@ void Incoming::takeMessage(Frames frames) {
     }
     if (config_.check) {
         for (const auto& frame : frames) {
-            if (const auto* const tagged = dynamic_cast<const framing::TaggedFrame*>(frame.get())) {
+            if (const auto* const tagged = asTagged(*frame)) {
                 config_.check(*tagged);
             }
         }

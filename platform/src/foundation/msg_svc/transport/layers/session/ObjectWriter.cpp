@@ -7,8 +7,8 @@
 #include <typeinfo>
 #include <utility>
 
+#include "foundation/msg_svc/transport/layers/session/FrameKinds.hpp"
 #include "foundation/msg_svc/transport/layers/session/OutgoingMessage.hpp"
-#include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 namespace {
@@ -26,7 +26,7 @@ void checkFrames(const std::vector<std::unique_ptr<framing::Frame>>& frames, fra
                                               : std::string("none")));
         }
     }
-    if (frames.empty() || dynamic_cast<const framing::TaggedFrame*>(frames.back().get()) == nullptr) {
+    if (frames.empty() || asTagged(*frames.back()) == nullptr) {
         throw std::logic_error("Session::send: expected a serializer to write a tagged frame last");
     }
 }

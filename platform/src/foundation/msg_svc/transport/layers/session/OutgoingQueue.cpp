@@ -5,9 +5,9 @@
 #include <cstring>
 #include <utility>
 
+#include "foundation/msg_svc/transport/layers/session/FrameKinds.hpp"
 #include "foundation/msg_svc/transport/layers/session/StreamDescriptors.hpp"
 #include "foundation/vantor/carrier/framing/DataFrame.hpp"
-#include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 namespace {
@@ -25,14 +25,14 @@ OutgoingPieces::OutgoingPieces(std::vector<std::unique_ptr<framing::Frame>> fram
     headers_.reserve(frames_.size());
     pieces_.reserve(3 * frames_.size());
     for (const auto& frame : frames_) {
-        auto* const data = dynamic_cast<framing::DataFrame*>(frame.get());
-        addFrame(*frame, frame == frames_.back(),
-                 lender != nullptr && data != nullptr ? lender->lend(*data) : std::nullopt);
+        auto* const data =
+            lender == nullptr || asTagged(*frame) != nullptr ? nullptr : dynamic_cast<framing::DataFrame*>(frame.get());
+        addFrame(*frame, frame == frames_.back(), data != nullptr ? lender->lend(*data) : std::nullopt);
     }
 }
 
 void OutgoingPieces::addFrame(const framing::Frame& frame, bool last, std::optional<lending::Loan> loan) {
-    const auto* const tagged = dynamic_cast<const framing::TaggedFrame*>(&frame);
+    const auto* const tagged = asTagged(frame);
     FrameHeader header;
     header.kind = static_cast<std::uint8_t>(tagged != nullptr ? FrameKind::Tagged
                                             : loan            ? FrameKind::SharedData
@@ -140,7 +140,8 @@ void OutgoingPieces::consume(std::size_t& written) {
 
 void OutgoingPieces::detachUnshareable() {
     for (const auto& frame : frames_) {
-        const auto* const data = dynamic_cast<const framing::DataFrame*>(frame.get());
+        const auto* const data =
+            asTagged(*frame) != nullptr ? nullptr : dynamic_cast<const framing::DataFrame*>(frame.get());
         if (data == nullptr || data->shareable()) {
             continue;
         }
@@ -160,8 +161,10 @@ int OutgoingQueue::writeOnce(int descriptor, std::vector<OutgoingPieces>& writte
     pieces_.clear();
     descriptors_.clear();
     GatheredWrite write{std::move(pieces_), std::move(descriptors_), mostBytes, mostPieces};
+    std::size_t gathered = 0;
     for (auto message = messages_.begin(); message != messages_.end() && !write.full(); ++message) {
         message->gather(write);
+        ++gathered;
     }
     pieces_ = std::move(write.pieces);
     descriptors_ = std::move(write.descriptors);
@@ -176,6 +179,7 @@ int OutgoingQueue::writeOnce(int descriptor, std::vector<OutgoingPieces>& writte
     }
     auto left = static_cast<std::size_t>(count);
     written_ += left;
+    written.reserve(gathered);
     while (!messages_.empty()) {
         messages_.front().consume(left);
         if (!messages_.front().done()) {

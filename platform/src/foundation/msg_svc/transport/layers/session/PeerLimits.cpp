@@ -3,9 +3,9 @@
 #include <cstdint>
 #include <utility>
 
+#include "foundation/msg_svc/transport/layers/session/FrameKinds.hpp"
 #include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
 #include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
-#include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 
@@ -15,7 +15,7 @@ PeerLimits::PeerLimits(const Limits& limits, std::string peerName, std::string a
 void PeerLimits::check(const std::vector<std::unique_ptr<framing::Frame>>& frames) const {
     const auto refuse = [&](const char* limit, std::uint64_t accepted, std::uint64_t size, const std::string& what,
                             const char* unit) {
-        const std::string_view root = dynamic_cast<const framing::TaggedFrame&>(*frames.back()).tag();
+        const std::string_view root = asTagged(*frames.back())->tag();
         throw LimitExceeded(quoted(root) + " is larger than " + peerName_ + " accepts: its limit \"" + limit +
                             "\" is " + std::to_string(accepted) + " " + unit + ", " + what + " has " +
                             std::to_string(size));
@@ -26,7 +26,7 @@ void PeerLimits::check(const std::vector<std::unique_ptr<framing::Frame>>& frame
     std::uint64_t total = 0;
     for (const auto& frame : frames) {
         total += frame->size();
-        if (const auto* const tagged = dynamic_cast<const framing::TaggedFrame*>(frame.get())) {
+        if (const auto* const tagged = asTagged(*frame)) {
             if (tagged->tag().size() > limits_.tag) {
                 refuse("tag", limits_.tag, tagged->tag().size(), "the tag of frame " + std::to_string(frame->index()),
                        "bytes");
