@@ -109,13 +109,23 @@ def _show(value):
     # As Python's own hook does, so that a __repr__ that uses it finds no half-made value.
     _builtins._ = None
     _qvm.show(_text_of(value, _shown_elements) + "\n")
+    if id(type(value)) not in _PLAIN_TYPES:
+        _offer_forms(value)
+    _builtins._ = value
+
+
+# Types of which everybody knows that their values have no other form than text, by identity: a type of the user may
+# have a hash and an equality of its own.
+_PLAIN_TYPES = frozenset(map(id, (bool, int, float, complex, str, bytes, list, tuple, dict, set, frozenset)))
+
+
+def _offer_forms(value):
     for kind in type(value).__mro__:
         names = kind.__dict__
         if "_repr_png_" in names or "_repr_svg_" in names or "_repr_html_" in names:
             import qvm_displays
             qvm_displays.offer(value)
             break
-    _builtins._ = value
 
 
 # As many elements of each container are shown; 0 for all.
