@@ -7,7 +7,7 @@
 namespace krutil_client {
 namespace {
 
-constexpr const char* space = " \t";
+constexpr const char* blanksAround = " \t";
 
 std::string trimmed(const std::string& text, const std::string& ends) {
     const auto first = text.find_first_not_of(ends);
@@ -25,9 +25,9 @@ bool isName(const std::string& text) {
 }  // namespace
 
 bool answerAside(const std::string& line, const Inspect& inspect, Output& out) {
-    const std::string text = trimmed(line, space);
+    const std::string text = trimmed(line, blanksAround);
     if (text.starts_with('!')) {
-        const auto command = nlohmann::json(trimmed(text.substr(1), space)).dump();
+        const auto command = nlohmann::json(trimmed(text.substr(1), blanksAround)).dump();
         out.write("Lines are Python. This runs a command where the engine is:\n    import subprocess; subprocess.run(" +
                   command + ", shell=True)\n");
         return true;

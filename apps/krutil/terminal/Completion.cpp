@@ -15,7 +15,7 @@ std::wstring shownName(std::wstring name) {
     return name;
 }
 
-std::size_t widthOf(const std::wstring& name) {
+std::size_t columnsOf(const std::wstring& name) {
     return static_cast<std::size_t>(std::max(::wcswidth(name.c_str(), name.size()), 0));
 }
 
@@ -40,7 +40,7 @@ std::wstring tableOf(const std::vector<std::wstring>& candidates, std::size_t wi
                    shownName);
     std::size_t widest = 0;
     for (const std::wstring& name : names) {
-        widest = std::max(widest, widthOf(name));
+        widest = std::max(widest, columnsOf(name));
     }
     const std::size_t columns = std::max<std::size_t>((width + gap) / (widest + gap), 1);
     const std::size_t rows = (count + columns - 1) / columns;
@@ -50,7 +50,7 @@ std::wstring tableOf(const std::vector<std::wstring>& candidates, std::size_t wi
         for (std::size_t i = row; i < count; i += rows) {
             table += names[i];
             if (i + rows < count) {
-                table.append(widest + gap - widthOf(names[i]), L' ');
+                table.append(widest + gap - columnsOf(names[i]), L' ');
             }
         }
         table += L'\n';

@@ -9,8 +9,8 @@
 
 namespace krutil_client {
 
-/// Asks by quiet calls, each with a time limit. An engine that lacks one of these functions is not asked for it again.
-/// Main thread only. All members throw what callQuietly() throws.
+/// Asks by quiet calls, each with a time limit. An engine that cannot complete is not asked for that again. Main thread
+/// only. All members throw what callQuietly() throws.
 class EngineHelp {
   public:
     /// `client` must outlive the object.

@@ -79,6 +79,48 @@ TEST_F(TerminalCommandsTest, WordsAreCommandsOfTheDebugger) {
     leave();
 }
 
+TEST_F(TerminalCommandsTest, TheEngineTellsAboutNames) {
+    begin();
+    evaluate("?str.join", "Concatenate any number of strings.");
+    evaluate("qvm = 'taken'");
+    evaluate("str.join?", "Concatenate any number of strings.");
+    leave();
+}
+
+TEST_F(TerminalCommandsTest, CodeIsSteppedThrough) {
+    begin();
+    terminal->type(std::string(pasteBegin) +
+                   "def inner(n):\r    k = n + 1\r    return k\r\r"
+                   "def outer(n):\r    breakpoint()\r    m = inner(n)\r    return m\r" +
+                   pasteEnd + "\r");
+    expectPrompt();
+    evaluate("qvm = 'taken'; outer(41)", "    breakpoint()\r\n", "debug> ");
+    evaluate("n", "    m = inner(n)\r\n", "debug> ");
+    evaluate("s", "    k = n + 1\r\n", "debug> ");
+    evaluate("n", "    return k\r\n", "debug> ");
+    evaluate("k", "42\r\n", "debug> ");
+    evaluate("u", "", "debug> ");
+    evaluate("k", "NameError", "debug> ");
+    evaluate("p n", "41\r\n", "debug> ");
+    evaluate("l", "m = inner(n)", "debug> ");
+    evaluate("w", "inner", "debug> ");
+    evaluate("d", "", "debug> ");
+    evaluate("k", "42\r\n", "debug> ");
+    evaluate(":c", "42\r\n");
+    leave();
+}
+
+TEST_F(TerminalCommandsTest, LongValuesAreCutInTheLineEditorOnly) {
+    begin();
+    evaluate("list(range(1200))", "... 200 more");
+    evaluate(":full", "1199]\r\n");
+    evaluate("print(list(range(1200)))", "1199]\r\n");
+    leave();
+    Terminal eval(command({"eval", "list(range(1200))"}), environment());
+    eval.expect("1199]\r\n");
+    EXPECT_EQ(eval.exitCode(), 0);
+}
+
 TEST_F(TerminalCommandsTest, ANewSessionBeginsOnRequest) {
     begin({"repl", "--no-history"});
     evaluate("x = 41");
