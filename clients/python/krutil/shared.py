@@ -26,12 +26,17 @@ _REQUIRED = 2 | 4 | 16 | 1
 _TMPFS = 0x01021994
 _BLOCK = 512  # of st_blocks
 _MAP_NORESERVE = 0x4000
+_MAP_FIXED = 0x10
+_PROT_NONE = 0
+_MADV_COLLAPSE = 25
+_LARGE_PAGE = 2 << 20
 _CONTENT = struct.Struct("<QQQ")
 
 _libc = ctypes.CDLL(None, use_errno=True)
 _libc.mmap.restype = ctypes.c_void_p
 _libc.mmap.argtypes = [ctypes.c_void_p, ctypes.c_size_t, ctypes.c_int, ctypes.c_int, ctypes.c_int, ctypes.c_long]
 _libc.munmap.argtypes = [ctypes.c_void_p, ctypes.c_size_t]
+_libc.madvise.argtypes = [ctypes.c_void_p, ctypes.c_size_t, ctypes.c_int]
 
 # How often this process has forked. A child keeps what was mapped then.
 _forks = 0
@@ -45,33 +50,58 @@ def _count_fork() -> None:
 os.register_at_fork(before=_count_fork)
 
 
-class _Memory(mmap.mmap):
-    """Memory of this process that engines may map. Its descriptor lives as long as it does."""
+def _map_at_large_page(descriptor: int, offset: int, size: int, flags: int) -> int:
+    """Maps memory, to be read and written, where large pages can begin. Raises `OSError`."""
+    size = -(-size // mmap.PAGESIZE) * mmap.PAGESIZE
+    room = size + _LARGE_PAGE
+    begin = _mapped(None, room, _PROT_NONE, mmap.MAP_PRIVATE | mmap.MAP_ANONYMOUS | _MAP_NORESERVE, -1, 0)
+    address = -(-begin // _LARGE_PAGE) * _LARGE_PAGE
+    try:
+        _mapped(address, size, mmap.PROT_READ | mmap.PROT_WRITE, flags | _MAP_FIXED, descriptor, offset)
+    except OSError:
+        _libc.munmap(begin, room)
+        raise
+    if address > begin:
+        _libc.munmap(begin, address - begin)
+    if begin + room > address + size:
+        _libc.munmap(address + size, begin + room - address - size)
+    return address
 
-    descriptor: int
-    address: int
+
+def _mapped(address: Optional[int], size: int, protection: int, flags: int, descriptor: int, offset: int) -> int:
+    made = _libc.mmap(address, size, protection, flags, descriptor, offset)
+    if made in (None, ctypes.c_void_p(-1).value):
+        raise OSError(ctypes.get_errno(), os.strerror(ctypes.get_errno()))
+    return int(made)
+
+
+class _Memory:
+    """Memory of this process that engines may map, as what NumPy makes arrays of. It lives as long as any of these."""
+
+    def __init__(self, size: int) -> None:
+        self.size = size
+        self.descriptor = os.memfd_create("krutil", os.MFD_CLOEXEC | os.MFD_ALLOW_SEALING)
+        try:
+            # Without holes: the receiver refuses these, since reading them would cost its memory.
+            os.posix_fallocate(self.descriptor, 0, size)
+            self.address = _map_at_large_page(self.descriptor, 0, size, mmap.MAP_SHARED)
+        except BaseException:
+            os.close(self.descriptor)
+            self.descriptor = -1
+            raise
+        # Both ends find their way through large pages quicker. Where there are none, small ones do.
+        _libc.madvise(self.address, size - size % _LARGE_PAGE, _MADV_COLLAPSE)
+        fcntl.fcntl(self.descriptor, fcntl.F_ADD_SEALS, _REQUIRED)
+        self.__array_interface__ = {"version": 3, "shape": (size,), "typestr": "|u1", "data": (self.address, False)}
 
     def __del__(self) -> None:
-        os.close(self.descriptor)
+        if self.descriptor >= 0:
+            _libc.munmap(self.address, self.size)
+            os.close(self.descriptor)
 
 
 # By address, from which on they are looked for.
 _memories: "weakref.WeakValueDictionary[int, _Memory]" = weakref.WeakValueDictionary()
-
-
-def _allocate(size: int) -> _Memory:
-    descriptor = os.memfd_create("krutil", os.MFD_CLOEXEC | os.MFD_ALLOW_SEALING)
-    try:
-        # Without holes: the receiver refuses these, since reading them would cost its memory.
-        os.posix_fallocate(descriptor, 0, size)
-        memory = _Memory(descriptor, size, mmap.MAP_SHARED)
-    except BaseException:
-        os.close(descriptor)
-        raise
-    memory.descriptor = descriptor
-    memory.address = numpy.frombuffer(memory, numpy.uint8).ctypes.data
-    fcntl.fcntl(descriptor, fcntl.F_ADD_SEALS, _REQUIRED)
-    return memory
 
 
 def empty(shape: Union[int, Sequence[int]], dtype: Any = float, order: str = "C") -> numpy.typing.NDArray[Any]:
@@ -95,10 +125,10 @@ def empty(shape: Union[int, Sequence[int]], dtype: Any = float, order: str = "C"
     if model.nbytes < SMALLEST or model.dtype.hasobject:
         return model  # type: ignore[no-any-return]
     try:
-        memory = _allocate(-(-model.nbytes // mmap.PAGESIZE) * mmap.PAGESIZE)
+        memory = _Memory(-(-model.nbytes // mmap.PAGESIZE) * mmap.PAGESIZE)
     except OSError as error:
         raise MemoryError(f"there is no shared memory for {model.nbytes} bytes: {error.strerror}") from None
-    array: Any = numpy.ndarray(model.shape, model.dtype, memory, order="F" if model.flags.fnc else "C")
+    array: Any = numpy.ndarray(model.shape, model.dtype, numpy.asarray(memory), order="F" if model.flags.fnc else "C")
     _memories[memory.address] = memory
     return array  # type: ignore[no-any-return]
 
@@ -117,7 +147,7 @@ class Place:
         address = elements.ctypes.data
         for memory in list(_memories.values()):
             offset = address - memory.address
-            if 0 <= offset <= len(memory) - elements.nbytes and offset % mmap.PAGESIZE == 0:
+            if 0 <= offset <= memory.size - elements.nbytes and offset % mmap.PAGESIZE == 0:
                 return Place(memory, offset, elements.nbytes)
         return None
 
@@ -186,11 +216,10 @@ class Borrower:
 def _map(descriptor: int, offset: int, size: int, what: str) -> int:
     """Maps memory that keeps to the rules. What is written to it stays in this process."""
     _check(descriptor, offset, size, what)
-    address = _libc.mmap(None, size, mmap.PROT_READ | mmap.PROT_WRITE, mmap.MAP_PRIVATE | _MAP_NORESERVE, descriptor,
-                         offset)
-    if address in (None, ctypes.c_void_p(-1).value):
-        raise Violation(f"{what}: expected memory that can be mapped, got {os.strerror(ctypes.get_errno())}")
-    return int(address)
+    try:
+        return _map_at_large_page(descriptor, offset, size, mmap.MAP_PRIVATE | _MAP_NORESERVE)
+    except OSError as error:
+        raise Violation(f"{what}: expected memory that can be mapped, got {error.strerror}") from None
 
 
 def _check(descriptor: int, offset: int, size: int, what: str) -> None:
@@ -227,8 +256,8 @@ class Probe:
         self.token = os.urandom(8)
         self._memory: Optional[_Memory] = None
         try:
-            self._memory = _allocate(mmap.PAGESIZE)
-            self._memory[:8] = self.token
+            self._memory = _Memory(mmap.PAGESIZE)
+            ctypes.memmove(self._memory.address, self.token, 8)
         except OSError:
             pass  # Then no descriptor is sent, and the session goes without.
 

@@ -104,6 +104,14 @@ class EngineTest(unittest.TestCase):
                 self.assertEqual((result.dtype, lend.call_count), (argument.dtype, lent))
                 self.assertTrue((result == argument).all())
 
+    def test_memory_begins_where_large_pages_can_begin(self):
+        a = krutil.empty(2 * SIZE, numpy.uint8)
+        with krutil.start() as session:
+            # The first result of a size comes as bytes.
+            session.call("numpy.negative", a, timeout=PATIENCE)
+            result = session.call("numpy.negative", a, timeout=PATIENCE)
+        self.assertEqual([each.ctypes.data % (2 * MiB) for each in (a, result)], [0, 0])
+
     def test_what_is_small_is_an_array_like_any_other(self):
         self.assertIs(krutil.empty(3).base, None)
         self.assertEqual(krutil.empty((2, 0, 3)).shape, (2, 0, 3))
