@@ -108,7 +108,8 @@ def _show(value):
         return
     # As Python's own hook does, so that a __repr__ that uses it finds no half-made value.
     _builtins._ = None
-    _qvm.show(_text_of(value, _shown_elements) + "\n")
+    plain = not _shown_elements and not _qvm.formats_values()
+    _qvm.show((repr(value) if plain else _text_of(value, _shown_elements)) + "\n")
     if id(type(value)) not in _PLAIN_TYPES:
         _offer_forms(value)
     _builtins._ = value

@@ -141,6 +141,16 @@ TEST_F(InspectionTest, CodeIsCompleteIncompleteOrInvalid) {
     EXPECT_EQ(ask("qvm.is_complete", {text(u"if x:")}, 1)[0], "incomplete");
 }
 
+TEST_F(InspectionTest, ExamplesInTheDocumentationHold) {
+    EXPECT_EQ(client()
+                  .eval("import doctest, qvm, sys\n"
+                        "sys.__displayhook__ = lambda value: value is None or print(repr(value))\n"
+                        "for each in qvm.complete, qvm.inspect, qvm.is_complete:\n"
+                        "    doctest.run_docstring_examples(each, {'qvm': qvm})")
+                  .output(),
+              "");
+}
+
 TEST_F(InspectionTest, WhetherCodeIsCompleteIsToldWithoutAWarning) {
     run("import warnings; before = warnings.filters[:]; warnings.simplefilter('error')");
     EXPECT_EQ(complete("'\\d' is 1"), "complete:");
