@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <cstdint>
 #include <cstring>
 #include <fstream>
@@ -151,6 +152,22 @@ TEST_F(BufferAllocatorTest, LatestBufferIsKeptInPlaceOfOlderOnes) {
     char* const again = BufferAllocator::allocate(200 * mebi);
     EXPECT_EQ(again, latest);
     BufferAllocator::release(again);
+}
+
+TEST_F(BufferAllocatorTest, WhatIsKeptIsGivenBackWhenNobodyHasUsedItForLong) {
+    BufferAllocator::trim({});
+    const std::size_t before = BufferAllocator::largeBytes();
+    char* const used = BufferAllocator::allocate(5 * mebi);
+    char* const kept = BufferAllocator::allocate(16 * mebi);
+    std::memset(kept, 1, 16 * mebi);
+    BufferAllocator::release(kept);
+    const std::size_t resident = residentBytes();
+    BufferAllocator::trim(std::chrono::hours(1));
+    EXPECT_EQ(BufferAllocator::largeBytes(), before + 21 * mebi);
+    BufferAllocator::trim({});
+    EXPECT_EQ(BufferAllocator::largeBytes(), before + 5 * mebi);
+    EXPECT_LE(residentBytes(), resident - 15 * mebi);
+    BufferAllocator::release(used);
 }
 #endif
 

@@ -38,6 +38,18 @@ TEST_F(SegmentPoolTest, WhatWasGivenBackIsUsedAgainForItsSizeClass) {
     EXPECT_EQ(pool_.inUse(), 3U);
 }
 
+TEST_F(SegmentPoolTest, SegmentsThatNobodyHasUsedForLongAreGivenBack) {
+    const auto begin = std::chrono::steady_clock::now();
+    char* const used = pool_.take(mebi);
+    pool_.giveBack(pool_.take(mebi));
+    pool_.trim(begin - std::chrono::hours(1));
+    EXPECT_EQ(pool_.bytes(), 2 * mebi);
+    pool_.trim(std::chrono::steady_clock::now());
+    EXPECT_EQ(pool_.bytes(), mebi);
+    EXPECT_EQ(pool_.size(), 1U);
+    pool_.giveBack(used);
+}
+
 TEST_F(SegmentPoolTest, NumberOfSegmentsIsBounded) {
     char* const first = pool_.take(mebi);
     pool_.take(mebi);

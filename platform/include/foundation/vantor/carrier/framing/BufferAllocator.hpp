@@ -1,6 +1,7 @@
 // Buffers of data frames.
 #pragma once
 
+#include <chrono>
 #include <cstddef>
 #include <optional>
 
@@ -16,9 +17,12 @@ enum class Adoption {
 };
 
 /// Hands out the buffers that data frames are received into and that arrays live in, and knows each one's size by its
-/// address: a receiver can compare what a peer announced with what it sent. Addresses are 64-byte aligned. Pages of a
-/// large buffer are not touched before its user touches them; large buffers are recycled, up to a bound. All members
+/// address: a receiver can compare what a peer announced with what it sent. Addresses are 64-byte aligned. All members
 /// may be called from any thread.
+///
+/// Buffers of 1 MiB and more have pages of their own, which are not touched before their user touches them. Faulting
+/// such pages in takes longer than filling them once more, so released buffers are kept for others of their size: 256
+/// MiB at most, the latest first, until trim(). The same holds for shared memory that nobody uses.
 class BufferAllocator {
   public:
     /// A buffer of `size` bytes, uninitialised; never null, for size 0 either. Throws std::bad_alloc.
@@ -54,6 +58,13 @@ class BufferAllocator {
 
     /// allocate() wrapped as a frame's buffer, with &BufferAllocator::release as deleter.
     static FrameBuffer makeFrameBuffer(std::size_t size);
+
+    /// Bytes of memory for large buffers that this process has, in use or kept.
+    static std::size_t largeBytes();
+
+    /// Gives kept memory back to the system that has not been used for so long. Sessions call this, as
+    /// SessionConfig::keepMemory says; a process that has none may.
+    static void trim(std::chrono::steady_clock::duration unused);
 
     /// Number of buffers in use, adopted ones included; for tests that look for leaks.
     static std::size_t inUse();

@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <array>
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <cstdlib>
 #include <iterator>
@@ -22,6 +23,7 @@
 namespace foundation::vantor::carrier::framing {
 namespace {
 
+using Clock = std::chrono::steady_clock;
 using shared_memory::SegmentPool;
 
 constexpr std::size_t alignment = 64;
@@ -56,6 +58,7 @@ struct Shard {
 struct Kept {
     char* buffer;
     std::size_t capacity;
+    Clock::time_point since;
 };
 
 // The latest first. At most recycleBound / largeSize elements, so a search from the front is quick.
@@ -77,11 +80,34 @@ Recycled& recycled() {
 }
 
 std::atomic<std::size_t> buffersInUse{0};
+std::atomic<std::size_t> bytesMapped{0};  // in use or kept
 
 Shard& shardOf(const char* address) {
     // Small buffers differ in the bits above the alignment, large ones in those above the page.
     const auto bits = reinterpret_cast<std::uintptr_t>(address);
     return shards()[(bits / alignment ^ bits / pageSize ^ bits / largeSize) % shards().size()];
+}
+
+char* map(std::size_t capacity) {
+    // No swap is reserved: a size is only what a peer claims until the bytes have come.
+    void* const memory =
+        ::mmap(nullptr, capacity, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE, -1, 0);
+    if (memory == MAP_FAILED) {
+        throw std::bad_alloc();
+    }
+    bytesMapped.fetch_add(capacity, std::memory_order_relaxed);
+    return static_cast<char*>(memory);
+}
+
+void unmap(char* memory, std::size_t capacity) {
+    ::munmap(memory, capacity);
+    bytesMapped.fetch_sub(capacity, std::memory_order_relaxed);
+}
+
+void unmap(const std::list<Kept>& all) {
+    for (const Kept& each : all) {
+        unmap(each.buffer, each.capacity);
+    }
 }
 
 char* takeRecycled(std::size_t capacity) {
@@ -98,28 +124,34 @@ char* takeRecycled(std::size_t capacity) {
     return buffer;
 }
 
-// Keeps a buffer in place of those that have waited longest; returns what must be unmapped for it, perhaps itself.
-std::list<Kept> keep(Kept fresh) {
-    std::list<Kept> node;
-    try {
-        node.push_back(fresh);
-    } catch (const std::bad_alloc&) {
-        ::munmap(fresh.buffer, fresh.capacity);
-        return node;
-    }
+// Takes out what has waited longest, as long as that is to be evicted. With the mutex held.
+template <class Condition>
+std::list<Kept> evict(Recycled& all, Condition condition) {
     std::list<Kept> evicted;
-    Recycled& all = recycled();
-    const std::lock_guard lock(all.mutex);
-    if (fresh.capacity > recycleBound) {
-        return node;
-    }
-    all.kept.splice(all.kept.begin(), node);
-    all.bytes += fresh.capacity;
-    while (all.bytes > recycleBound) {
+    while (!all.kept.empty() && condition(all.kept.back())) {
         all.bytes -= all.kept.back().capacity;
         evicted.splice(evicted.begin(), all.kept, std::prev(all.kept.end()));
     }
     return evicted;
+}
+
+// Keeps a buffer in place of those that have waited longest; returns what must be unmapped for it, perhaps itself.
+std::list<Kept> keep(char* buffer, std::size_t capacity) {
+    std::list<Kept> node;
+    try {
+        node.push_back({buffer, capacity, Clock::now()});
+    } catch (const std::bad_alloc&) {
+        unmap(buffer, capacity);
+        return node;
+    }
+    if (capacity > recycleBound) {
+        return node;
+    }
+    Recycled& all = recycled();
+    const std::lock_guard lock(all.mutex);
+    all.kept.splice(all.kept.begin(), node);
+    all.bytes += capacity;
+    return evict(all, [&all](const Kept&) { return all.bytes > recycleBound; });
 }
 
 char* obtain(std::size_t size, std::size_t& capacity) {
@@ -139,13 +171,7 @@ char* obtain(std::size_t size, std::size_t& capacity) {
     if (char* const buffer = takeRecycled(capacity)) {
         return buffer;
     }
-    // No swap is reserved: a size is only what a peer claims until the bytes have come.
-    void* const memory =
-        ::mmap(nullptr, capacity, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE, -1, 0);
-    if (memory == MAP_FAILED) {
-        throw std::bad_alloc();
-    }
-    return static_cast<char*>(memory);
+    return map(capacity);
 }
 
 void giveBack(char* buffer, std::size_t capacity) {
@@ -153,9 +179,7 @@ void giveBack(char* buffer, std::size_t capacity) {
         std::free(buffer);
         return;
     }
-    for (const Kept& evicted : keep({buffer, capacity})) {
-        ::munmap(evicted.buffer, evicted.capacity);
-    }
+    unmap(keep(buffer, capacity));
 }
 
 void enter(const char* address, const Record& record) {
@@ -264,6 +288,20 @@ bool BufferAllocator::isForeign(const char* buffer) {
 
 FrameBuffer BufferAllocator::makeFrameBuffer(std::size_t size) {
     return {std::unique_ptr<char[], std::function<void(char*)>>(allocate(size), &BufferAllocator::release), size};
+}
+
+std::size_t BufferAllocator::largeBytes() {
+    return bytesMapped.load(std::memory_order_relaxed) + SegmentPool::ofProcess().bytes();
+}
+
+void BufferAllocator::trim(Clock::duration unused) {
+    const Clock::time_point before = Clock::now() - unused;
+    SegmentPool::ofProcess().trim(before);
+    Recycled& all = recycled();
+    std::unique_lock lock(all.mutex);
+    const std::list<Kept> evicted = evict(all, [before](const Kept& kept) { return kept.since <= before; });
+    lock.unlock();
+    unmap(evicted);
 }
 
 std::size_t BufferAllocator::inUse() {

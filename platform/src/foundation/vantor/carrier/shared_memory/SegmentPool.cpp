@@ -92,8 +92,7 @@ char* SegmentPool::takeIdle(std::size_t capacity, std::size_t size, Accept accep
 char* SegmentPool::addSegment(std::unique_lock<std::mutex>& lock, std::size_t capacity, std::size_t size) {
     Entries doomed;
     if (segments_ >= bounds_.segments && !idle_.empty()) {
-        idleBytes_ -= idle_.back().segment->size();
-        forget(idle_, std::prev(idle_.end()), doomed);
+        forgetOldestIdle(doomed);
     }
     if (segments_ >= bounds_.segments) {
         return nullptr;
@@ -128,6 +127,11 @@ void SegmentPool::forget(Entries& from, Entries::iterator entry, Entries& doomed
     doomed.splice(doomed.end(), from, entry);
 }
 
+void SegmentPool::forgetOldestIdle(Entries& doomed) {
+    idleBytes_ -= idle_.back().segment->size();
+    forget(idle_, std::prev(idle_.end()), doomed);
+}
+
 void SegmentPool::giveBack(char* memory) {
     Entries doomed;
     const std::lock_guard lock(mutex_);
@@ -139,10 +143,18 @@ void SegmentPool::giveBack(char* memory) {
         return;
     }
     idleBytes_ += entry->segment->size();
+    entry->idleSince = std::chrono::steady_clock::now();
     idle_.splice(idle_.begin(), used_, entry);
     while (idleBytes_ > bounds_.idleBytes) {
-        idleBytes_ -= idle_.back().segment->size();
-        forget(idle_, std::prev(idle_.end()), doomed);
+        forgetOldestIdle(doomed);
+    }
+}
+
+void SegmentPool::trim(std::chrono::steady_clock::time_point before) {
+    Entries doomed;  // unmapped without the lock
+    const std::lock_guard lock(mutex_);
+    while (!idle_.empty() && idle_.back().idleSince <= before) {
+        forgetOldestIdle(doomed);
     }
 }
 

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <list>
@@ -59,6 +60,9 @@ class SegmentPool {
     /// Nobody reads or writes the memory any more, viewers included.
     void giveBack(char* memory);
 
+    /// Gives segments back to the system that nobody has used since `before`.
+    void trim(std::chrono::steady_clock::time_point before);
+
     /// The descriptor of memory that was taken, by which `viewer` may see it from now on. None for memory that is not
     /// of this pool or must not be shown to this one.
     Segment::Descriptor show(const char* memory, Viewer viewer);
@@ -66,6 +70,9 @@ class SegmentPool {
     /// Somebody will go on looking at this memory, unknown for how long: it is neither shown nor used again, and what
     /// is written to it from now on is hidden.
     void hide(const char* memory);
+
+    /// Bytes of all segments. Without a lock.
+    std::size_t bytes() const noexcept { return bytes_.load(std::memory_order_relaxed); }
 
     /// Segments that exist, and how many of them are used; for tests.
     std::size_t size() const;
@@ -77,6 +84,7 @@ class SegmentPool {
         Viewer viewer = 0;      // 0: nobody has seen it
         std::size_t dirty = 0;  // bytes from the start that may have been written to
         bool hidden = false;
+        std::chrono::steady_clock::time_point idleSince;
     };
     using Entries = std::list<Entry>;
 
@@ -85,6 +93,7 @@ class SegmentPool {
     char* addSegment(std::unique_lock<std::mutex>& lock, std::size_t capacity, std::size_t size);
     char* use(Entries& from, Entries::iterator entry, std::size_t size);
     void forget(Entries& from, Entries::iterator entry, Entries& doomed);
+    void forgetOldestIdle(Entries& doomed);
 
     const Bounds bounds_;
     std::atomic<bool> wantsArrays_{false};
@@ -96,9 +105,9 @@ class SegmentPool {
     std::unordered_map<const char*, Entries::iterator> byAddress_;  // of used_
     Entries idle_;                                                  // the latest first
     std::size_t idleBytes_ = 0;
-    std::size_t segments_ = 0;        // that exist or are being made
-    std::size_t bytes_ = 0;           // of all of these
-    std::set<std::size_t> askedFor_;  // capacities of copies that were not made
+    std::size_t segments_ = 0;           // that exist or are being made
+    std::atomic<std::size_t> bytes_{0};  // of all of these; changed with the mutex held
+    std::set<std::size_t> askedFor_;     // capacities of copies that were not made
 };
 
 }  // namespace foundation::vantor::carrier::shared_memory

@@ -75,6 +75,10 @@ struct SessionConfig {
     /// asks without reading, and nothing more is read from it until it has read some.
     std::size_t maxPendingAnswers = 1024;
 
+    /// How long memory of large arrays is kept for others while this process does not use it; see BufferAllocator. It
+    /// is given back within twice that time after its last use.
+    std::chrono::milliseconds keepMemory{10'000};
+
     /// Called with every frame, on the thread that sends or receives it. Empty for no trace.
     std::function<void(const FrameTrace&)> trace;
 

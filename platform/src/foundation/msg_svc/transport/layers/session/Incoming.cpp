@@ -33,6 +33,7 @@ Incoming::Incoming(asio::io_context& io, core::posix::OwnedDescriptor& descripto
       owner_(owner),
       stream_(io),
       reader_(config.limits, arrayTag, shared == nullptr ? nullptr : &shared->borrower),
+      keptMemory_(io, config.keepMemory),
       arrayTag_(arrayTag),
       descriptor_(descriptor.get()) {
     stream_.assign(descriptor.get());
@@ -65,6 +66,7 @@ void Incoming::stop() {
 void Incoming::close() {
     state_ = State::Stopped;
     descriptor_ = -1;
+    keptMemory_.stop();
     ErrorCode ignored;
     stream_.close(ignored);
 }
@@ -150,6 +152,7 @@ void Incoming::takeItems() {
         }
         contentArrived_ = reader_.contentArrived();
         contentSize_ = reader_.contentSize();
+        keptMemory_.watch();
     } catch (const std::exception& failure) {
         owner_.onViolation(failure.what());
     } catch (...) {

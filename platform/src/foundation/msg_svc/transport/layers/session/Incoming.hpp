@@ -17,6 +17,7 @@
 #include "foundation/msg_svc/transport/layers/session/Asio.hpp"
 #include "foundation/msg_svc/transport/layers/session/Exchanges.hpp"
 #include "foundation/msg_svc/transport/layers/session/FrameNotes.hpp"
+#include "foundation/msg_svc/transport/layers/session/KeptMemory.hpp"
 #include "foundation/msg_svc/transport/layers/session/MessageReader.hpp"
 #include "foundation/msg_svc/transport/layers/session/ObjectWriter.hpp"
 #include "foundation/msg_svc/transport/layers/session/Outgoing.hpp"
@@ -103,6 +104,7 @@ class Incoming {
     asio::posix::stream_descriptor stream_;
     MessageReader reader_;
     FrameNotes notes_;
+    KeptMemory keptMemory_;
     const std::string arrayTag_;
     SessionHandler* handler_ = nullptr;
     State state_ = State::Waiting;
