@@ -29,6 +29,10 @@ using shared_memory::SegmentPool;
 constexpr std::size_t alignment = 64;
 constexpr std::size_t pageSize = 4096;
 
+// From this size on a buffer is put into pages of 2 MiB: one fault instead of 512, and fewer searches for where a page
+// is.
+constexpr std::size_t largePagesFrom = 4U << 20;
+
 // Bytes kept for recycling, in whole buffers. In sanitized builds nothing is kept, so that a use after release is seen.
 #ifdef KRUTIL_SANITIZED
 constexpr std::size_t recycleBound = 0;
@@ -96,6 +100,10 @@ char* map(std::size_t capacity) {
         throw std::bad_alloc();
     }
     bytesMapped.fetch_add(capacity, std::memory_order_relaxed);
+    if (capacity >= largePagesFrom) {
+        // As far as the system has them to give.
+        ::madvise(memory, capacity, MADV_HUGEPAGE);
+    }
     return static_cast<char*>(memory);
 }
 
