@@ -232,9 +232,9 @@ ExitCode runCommand(const Options& options, const ReplOptions& repl, Printer& pr
             }
             terminal.err.write("krutil: a new session; what the last one held is gone\n");
         } catch (const Failure& failure) {
-            // An engine that cannot be used at all is no session that was lost.
+            // An engine that cannot be used at all is no session that was lost. The question is for who sees it.
             const bool lost = failure.code() == ExitCode::Stream || failure.code() == ExitCode::Cancelled;
-            if (!terminal.edits || !lost) {
+            if (!terminal.edits || !terminal.err.isTerminal() || !lost) {
                 throw;
             }
             terminal.err.write(std::string("krutil: ") + failure.what() + "\n");
