@@ -71,7 +71,17 @@ void loading(const std::function<void()>& act) {
 void startPython(const PythonConfig& world) {
     if (Py_IsInitialized() == 0) {
         initialize(world);
-        loading([] { py::module_::import("qvm"); });
+        loading([] {
+            const int collects = PyGC_Disable();
+            py::module_::import("qvm");
+            // All of it stays. It goes to the oldest generation at once, without a search for what could be freed.
+            const py::module_ collector = py::module_::import("gc");
+            collector.attr("freeze")();
+            collector.attr("unfreeze")();
+            if (collects != 0) {
+                PyGC_Enable();
+            }
+        });
     }
 }
 
