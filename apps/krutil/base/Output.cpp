@@ -41,21 +41,15 @@ bool Output::hasCursor() const noexcept {
     return terminal_ && !name.empty() && name != "dumb" && name != "emacs";
 }
 
-std::size_t Output::columns() const noexcept {
-    winsize size{};
-    constexpr std::size_t usual = 80;
-    return ::ioctl(fd_, TIOCGWINSZ, &size) == 0 && size.ws_col != 0 ? size.ws_col : usual;
-}
-
-std::size_t Output::rows() const noexcept {
-    winsize size{};
-    constexpr std::size_t usual = 24;
-    return ::ioctl(fd_, TIOCGWINSZ, &size) == 0 && size.ws_row != 0 ? size.ws_row : usual;
-}
-
-std::size_t Output::pixelWidth() const noexcept {
-    winsize size{};
-    return ::ioctl(fd_, TIOCGWINSZ, &size) == 0 ? size.ws_xpixel : 0;
+TerminalSize Output::terminalSize() const noexcept {
+    TerminalSize size;
+    winsize said{};
+    if (::ioctl(fd_, TIOCGWINSZ, &said) == 0) {
+        size.columns = said.ws_col != 0 ? said.ws_col : size.columns;
+        size.rows = said.ws_row != 0 ? said.ws_row : size.rows;
+        size.pixelWidth = said.ws_xpixel;
+    }
+    return size;
 }
 
 void Output::write(std::string_view text) {

@@ -9,6 +9,13 @@ namespace krutil_client {
 class Interrupt;
 class LastLine;
 
+/// How large a terminal is.
+struct TerminalSize {
+    std::size_t columns = 80;    ///< at least 1; 80 where it is not known
+    std::size_t rows = 24;       ///< at least 1; 24 where it is not known
+    std::size_t pixelWidth = 0;  ///< 0 where it is not known
+};
+
 /// One of the program's own output descriptors. Nothing is buffered: text is with the reader, as far as it takes it,
 /// when write() returns. Ctrl-C is dispatched meanwhile, so that neither a reader that does not read nor text without
 /// end holds it up. Main thread only.
@@ -32,12 +39,8 @@ class Output {
     /// Whether that terminal is known to have a cursor that can be moved, and to erase.
     bool hasCursor() const noexcept;
 
-    /// Columns and rows of the terminal; 80 and 24 where they are not known.
-    std::size_t columns() const noexcept;
-    std::size_t rows() const noexcept;
-
-    /// Width of the terminal in pixels; 0 where it is not known.
-    std::size_t pixelWidth() const noexcept;
+    /// What the terminal says now. The numbers belong together: it may say others a moment later.
+    TerminalSize terminalSize() const noexcept;
 
   private:
     void put(std::string_view text, bool interruptible);

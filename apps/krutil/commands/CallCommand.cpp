@@ -104,7 +104,8 @@ class TransferDisplay {
     void update() {
         // The line would go over what the function has written so far.
         if (!lineUnfinished_) {
-            write(progress_.update(client_.conversation().session().traffic(), Progress::Clock::now(), err_.columns()));
+            write(progress_.update(client_.conversation().session().traffic(), Progress::Clock::now(),
+                                   err_.terminalSize().columns));
         }
     }
 

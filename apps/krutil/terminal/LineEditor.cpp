@@ -358,7 +358,7 @@ class LineEditor::Impl {
     // Above the line, where it stays.
     void list(const std::vector<std::wstring>& candidates) {
         takeAway();
-        out_.write((lastLine_.text().empty() ? "" : "\n") + toUtf8(tableOf(candidates, out_.columns())));
+        out_.write((lastLine_.text().empty() ? "" : "\n") + toUtf8(tableOf(candidates, out_.terminalSize().columns)));
     }
 
     // Shows what is found until another key comes: Ctrl-G goes back, any other does with the entry what it does.
@@ -391,7 +391,10 @@ class LineEditor::Impl {
 
     LineHistory& history() { return what_ == For::Code ? codeHistory_ : noHistory_; }
 
-    LineDisplay::Size size() const { return {out_.columns(), out_.rows()}; }
+    LineDisplay::Size size() const {
+        const TerminalSize now = out_.terminalSize();
+        return {now.columns, now.rows};
+    }
 
     void show(const std::string& text) {
         if (!text.empty()) {

@@ -142,9 +142,10 @@ std::optional<AskedTerminal> askTerminal(Output& out, std::chrono::milliseconds 
 }
 
 std::string drawing(ImageProtocol protocol, const std::string& png, std::size_t width, const Output& out) {
-    const bool tooWide = out.pixelWidth() != 0 && width > out.pixelWidth();
+    const TerminalSize size = out.terminalSize();
+    const bool tooWide = size.pixelWidth != 0 && width > size.pixelWidth;
     if (protocol == ImageProtocol::Kitty) {
-        return kittyDrawing(base64(png), tooWide ? ",c=" + std::to_string(out.columns()) : "");
+        return kittyDrawing(base64(png), tooWide ? ",c=" + std::to_string(size.columns) : "");
     }
     return "\x1b]1337;File=inline=1;size=" + std::to_string(png.size()) + (tooWide ? ";width=100%" : "") + ":" +
            base64(png) + "\a\n";
