@@ -148,7 +148,7 @@ bool LineDisplay::measures(std::wstring_view text) {
     return true;
 }
 
-std::string LineDisplay::begin(const std::wstring& written, Size size) {
+std::string LineDisplay::begin(const std::wstring& written, TerminalSize size) {
     size_ = size;
     Layout layout(size_.columns);
     layout.putPrompt(written);
@@ -163,8 +163,8 @@ std::string LineDisplay::begin(const std::wstring& written, Size size) {
     return filled ? " \r" : "";
 }
 
-std::string LineDisplay::show(const Line& line, Size size) {
-    const bool resized = !(size == size_);
+std::string LineDisplay::show(const Line& line, TerminalSize size) {
+    const bool resized = size.columns != size_.columns || size.rows != size_.rows;
     const bool certain = std::exchange(certain_, true) && !resized;
     const std::size_t cursorRow = resized ? rowAfterResize(size.columns) : picture_.cursorRow - first_;
     const bool atEnd =

@@ -6,6 +6,7 @@
 #include <string_view>
 #include <vector>
 
+#include "krutil/base/Output.hpp"
 #include "krutil/terminal/Highlight.hpp"
 
 namespace krutil_client {
@@ -16,12 +17,6 @@ namespace krutil_client {
 /// terminal wraps lines and knows the usual sequences to move the cursor and to erase. A value.
 class LineDisplay {
   public:
-    struct Size {
-        std::size_t columns;  ///< at least 1
-        std::size_t rows;     ///< at least 1
-        bool operator==(const Size& other) const noexcept { return columns == other.columns && rows == other.rows; }
-    };
-
     /// What to show. Control characters of the text are shown as ^A and the like.
     struct Line {
         std::wstring prompt;  ///< for which measures() is true
@@ -37,14 +32,14 @@ class LineDisplay {
 
     /// The terminal has `written` in the row of the cursor, and in rows above if it is longer, and the cursor behind
     /// it; measures() must be true for it. Returns what to write to make sure of that.
-    std::string begin(const std::wstring& written, Size size);
+    std::string begin(const std::wstring& written, TerminalSize size);
 
     /// The terminal may have more behind the cursor than begin() was told: the next show() writes all of the line.
     void doubt() noexcept { certain_ = false; }
 
     /// What to write to have `line` shown instead of what was shown before; empty when nothing changes. When the size
     /// is another one than before, the terminal is taken to have filled its rows anew, as most do.
-    std::string show(const Line& line, Size size);
+    std::string show(const Line& line, TerminalSize size);
 
   private:
     struct Row {
@@ -64,7 +59,7 @@ class LineDisplay {
     void scrollToCursor();
     std::size_t rowAfterResize(std::size_t columns) const;
 
-    Size size_{80, 24};
+    TerminalSize size_;
     Picture picture_;
     std::size_t first_ = 0;  // row of the picture that is the first one on the terminal
     std::string painted_;

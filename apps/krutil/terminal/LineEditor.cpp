@@ -51,10 +51,6 @@ bool readable(int descriptor) {
     return ::poll(&watched, 1, 0) == 1;
 }
 
-struct Close {
-    void operator()(FILE* file) const noexcept { std::fclose(file); }
-};
-
 }  // namespace
 
 // The library does what keys mean. What it would write goes nowhere: it cannot take its line away and show it again,
@@ -67,7 +63,7 @@ class LineEditor::Impl {
           lastLine_(lastLine),
           codeHistory_(withUtf8(std::move(historyFile))),
           noHistory_(std::string()),
-          nowhere_(std::fopen("/dev/null", "we")) {
+          nowhere_(std::fopen("/dev/null", "we"), &std::fclose) {
         if (nowhere_) {
             editor_ = ::el_init_fd("krutil", stdin, nowhere_.get(), nowhere_.get(), STDIN_FILENO, STDOUT_FILENO,
                                    STDERR_FILENO);
@@ -102,7 +98,7 @@ class LineEditor::Impl {
         text_.clear();
         cursor_ = 0;
         settleLastLine();
-        show(display_.begin(toWide(lastLine_.text()), size()));
+        show(display_.begin(toWide(lastLine_.text()), out_.terminalSize()));
         prompt_ = toWide(what == For::Input ? lastLine_.take() + prompt : prompt);
         away_ = false;
         ::el_wset(editor_, EL_HIST, &::history_w, history().get());
@@ -282,7 +278,7 @@ class LineEditor::Impl {
 
     unsigned char clear() {
         lastLine_.take();
-        show(clearTerminal + display_.begin({}, size()));
+        show(clearTerminal + display_.begin({}, out_.terminalSize()));
         return CC_NORM;
     }
 
@@ -391,11 +387,6 @@ class LineEditor::Impl {
 
     LineHistory& history() { return what_ == For::Code ? codeHistory_ : noHistory_; }
 
-    LineDisplay::Size size() const {
-        const TerminalSize now = out_.terminalSize();
-        return {now.columns, now.rows};
-    }
-
     void show(const std::string& text) {
         if (!text.empty()) {
             out_.show(text);
@@ -413,7 +404,7 @@ class LineEditor::Impl {
     // Leaves the terminal as it would be without the line, for what is written next.
     void takeAway() {
         if (!away_) {
-            show(display_.show({toWide(lastLine_.text())}, size()));
+            show(display_.show({toWide(lastLine_.text())}, out_.terminalSize()));
             away_ = true;
         }
     }
@@ -424,7 +415,7 @@ class LineEditor::Impl {
             ::el_wset(editor_, EL_PREP_TERM, 0);
             ::el_wset(editor_, EL_PREP_TERM, 1);
             lastLine_.take();
-            show(markPastes + display_.begin({}, size()));
+            show(markPastes + display_.begin({}, out_.terminalSize()));
             away_ = false;
         }
         // Not between keys that come together, as those of a paste do.
@@ -438,7 +429,7 @@ class LineEditor::Impl {
     void draw(std::size_t cursor, std::size_t marked) {
         if (away_) {
             settleLastLine();
-            show(display_.begin(toWide(lastLine_.text()), size()));
+            show(display_.begin(toWide(lastLine_.text()), out_.terminalSize()));
             away_ = false;
         }
         LineDisplay::Line line{toWide(lastLine_.text()) + prompt_, text_, cursor};
@@ -446,7 +437,7 @@ class LineEditor::Impl {
             line.continuation = continuation;
             line.styles = color_ ? stylesOf(text_, marked) : std::vector<Style>();
         }
-        show(display_.show(line, size()));
+        show(display_.show(line, out_.terminalSize()));
     }
 
     // Shows all of the line once more, and begins a new one.
@@ -476,7 +467,7 @@ class LineEditor::Impl {
     LastLine& lastLine_;
     LineHistory codeHistory_;
     LineHistory noHistory_;
-    std::unique_ptr<FILE, Close> nowhere_;
+    std::unique_ptr<FILE, int (*)(FILE*)> nowhere_;
     EditLine* editor_ = nullptr;
     LineDisplay display_;
     std::wstring prompt_;

@@ -30,7 +30,7 @@ class LineDisplayTest : public ::testing::Test {
         return bytes;
     }
 
-    LineDisplay::Size size{10, 4};
+    TerminalSize size{10, 4, 0};
     LineDisplay display;
     Screen screen{10, 4};
 };
