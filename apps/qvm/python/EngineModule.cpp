@@ -18,6 +18,7 @@
 #include "qvm/process/AppendFile.hpp"
 #include "qvm/process/ForkedChild.hpp"
 #include "qvm/process/LastWords.hpp"
+#include "qvm/python/PrintFunction.hpp"
 #include "qvm/python/PythonText.hpp"
 #include "qvm/python/WarningRecord.hpp"
 #include "qvm/requests/Cancellation.hpp"
@@ -94,6 +95,19 @@ PlainStream& plainStream(TextSource source) {
     return source == TextSource::Error ? plainError : plainOutput;
 }
 
+// What was written to descriptors 1 and 2 before comes before Python's next text.
+void drainBeforeText() {
+    if (services->drainDescriptors()) {
+        waitForRoom();
+    }
+}
+
+void hand(TextSource source, const std::u16string& units) {
+    if (output->write(source, units)) {
+        waitForRoom();
+    }
+}
+
 std::size_t write(TextSource source, PyObject* text) {
     if (!PyUnicode_Check(text)) {
         throw py::type_error(std::string("write() argument must be str, not ") + Py_TYPE(text)->tp_name);
@@ -103,26 +117,23 @@ std::size_t write(TextSource source, PyObject* text) {
         plainStream(source).write(text);
         return length;
     }
-    if (services->drainDescriptors()) {
-        waitForRoom();
-    }
+    drainBeforeText();
     // Guarded by the interpreter lock, and used up before that is let go.
     static std::u16string units;
     for (std::size_t begin = 0; begin < length; begin += piecePoints) {
-        toUtf16(text, begin, piecePoints, units);
-        if (output->write(source, units)) {
-            waitForRoom();
-        }
+        units.clear();
+        appendUtf16(text, begin, piecePoints, units);
+        hand(source, units);
     }
     return length;
 }
 
-// A line is several writes, so these are plain functions of Python's: a call through pybind11 takes longer than the
-// rest of a write.
-template <TextSource source>
-PyObject* writeMethod(PyObject* /*module*/, PyObject* text) noexcept {
+// Runs `action`; false if it threw, with Python's exception set.
+template <typename Action>
+bool succeeds(const Action& action) noexcept {
     try {
-        return PyLong_FromSize_t(write(source, text));
+        action();
+        return true;
     } catch (py::error_already_set& error) {
         error.restore();
     } catch (const py::builtin_exception& error) {
@@ -132,7 +143,22 @@ PyObject* writeMethod(PyObject* /*module*/, PyObject* text) noexcept {
     } catch (const std::exception& error) {
         PyErr_SetString(PyExc_RuntimeError, error.what());
     }
-    return nullptr;
+    return false;
+}
+
+// Text often comes in small pieces, so these are plain functions of Python's: a call through pybind11 takes longer than
+// the rest of a write.
+template <TextSource source>
+PyObject* writeMethod(PyObject* /*module*/, PyObject* text) noexcept {
+    std::size_t length = 0;
+    return succeeds([&] { length = write(source, text); }) ? PyLong_FromSize_t(length) : nullptr;
+}
+
+bool takePrinted(const std::u16string& text) noexcept {
+    return succeeds([&] {
+        drainBeforeText();
+        hand(TextSource::Output, text);
+    });
 }
 
 std::array writeMethods{PyMethodDef{"write_output", &writeMethod<TextSource::Output>, METH_O, nullptr},
@@ -318,6 +344,9 @@ PYBIND11_EMBEDDED_MODULE(_qvm, module) {
     if (PyModule_AddFunctions(module.ptr(), writeMethods.data()) != 0) {
         throw py::error_already_set();
     }
+    module.def("gather_prints", [](const py::object& stream) {
+        gatherPrints(stream.ptr(), &writeMethod<TextSource::Output>, &isApart, &takePrinted);
+    });
     module.def("flush", &flush);
     module.def("send_all", &sendAll);
     module.def("keep_last_words", &LastWords::keep);

@@ -97,7 +97,7 @@ class Builder {
         }
         take(bytes);
         std::u16string units;
-        toUtf16(text, 0, count, units);
+        appendUtf16(text, 0, count, units);
         if (count < length) {
             const std::string note = "... (" + std::to_string(length - count) + " more characters)";
             take(note.size());

@@ -11,7 +11,7 @@ constexpr char16_t replacement = 0xFFFD;
 
 }  // namespace
 
-void toUtf16(PyObject* text, std::size_t begin, std::size_t count, std::u16string& units) {
+void appendUtf16(PyObject* text, std::size_t begin, std::size_t count, std::u16string& units) {
     const auto length = static_cast<std::size_t>(PyUnicode_GET_LENGTH(text));
     begin = std::min(begin, length);
     const std::size_t end = begin + std::min(count, length - begin);
@@ -19,11 +19,10 @@ void toUtf16(PyObject* text, std::size_t begin, std::size_t count, std::u16strin
     const void* data = PyUnicode_DATA(text);
     if (kind == PyUnicode_1BYTE_KIND) {
         const auto* const points = static_cast<const Py_UCS1*>(data);
-        units.assign(points + begin, points + end);
+        units.append(points + begin, points + end);
         return;
     }
-    units.clear();
-    units.reserve(end - begin);
+    units.reserve(units.size() + (end - begin));
     for (std::size_t i = begin; i < end; ++i) {
         const Py_UCS4 point = PyUnicode_READ(kind, data, i);
         if (point >= 0x10000) {
@@ -39,7 +38,7 @@ void toUtf16(PyObject* text, std::size_t begin, std::size_t count, std::u16strin
 
 std::u16string utf16Of(PyObject* text) {
     std::u16string units;
-    toUtf16(text, 0, static_cast<std::size_t>(PyUnicode_GET_LENGTH(text)), units);
+    appendUtf16(text, 0, static_cast<std::size_t>(PyUnicode_GET_LENGTH(text)), units);
     return units;
 }
 

@@ -8,11 +8,11 @@
 
 namespace qvm {
 
-/// Makes `units` the UTF-16 text of the code points [begin, begin + count) of a str, as far as there are so many. A
-/// surrogate, which a str may hold and text may not, becomes U+FFFD.
-void toUtf16(PyObject* text, std::size_t begin, std::size_t count, std::u16string& units);
+/// Adds the UTF-16 text of the code points [begin, begin + count) of a str, as far as there are so many. A surrogate,
+/// which a str may hold and text may not, becomes U+FFFD.
+void appendUtf16(PyObject* text, std::size_t begin, std::size_t count, std::u16string& units);
 
-/// The same for the whole str.
+/// UTF-16 text of the whole str, with the same replacement.
 std::u16string utf16Of(PyObject* text);
 
 /// A str of UTF-16 text, an unpaired surrogate as U+FFFD. Null with an exception set when there is no memory.

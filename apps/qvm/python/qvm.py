@@ -772,6 +772,7 @@ if not _sys.flags.safe_path:
     _sys.path.insert(0, _path_entry)
 _sys.stdout = _sys.__stdout__ = _TextStream("<stdout>", 1, _qvm.write_output)
 _sys.stderr = _sys.__stderr__ = _TextStream("<stderr>", 2, _qvm.write_error)
+_qvm.gather_prints(_sys.stdout)
 _sys.displayhook = _sys.__displayhook__ = _show
 _sys.stdin = _sys.__stdin__ = _InputStream()
 _sys.breakpointhook = _sys.__breakpointhook__ = _breakpoint
