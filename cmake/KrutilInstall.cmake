@@ -6,6 +6,8 @@
 #   lib/pkgconfig/                         krutil_protobuf.pc, krutil_platform.pc
 #   include/krutil_{protobuf,platform}/    headers, generated message classes beside them
 #   share/krutil_{protobuf,platform}/proto the schema
+#   share/man/, share/bash-completion/, share/zsh/, share/fish/
+#                                          manual pages and completions
 #
 # Nothing in it holds the prefix: the tree may be installed to one place and used from another.
 
@@ -74,3 +76,15 @@ foreach(program IN ITEMS krutil_client krutil-qvm)
         install(TARGETS ${program} RUNTIME)
     endif()
 endforeach()
+
+if(TARGET krutil_manuals)
+    set(made "${PROJECT_BINARY_DIR}/apps/manuals/made")
+    install(FILES "${made}/krutil.1" "${made}/krutil-qvm.1" DESTINATION "${CMAKE_INSTALL_MANDIR}/man1")
+    install(FILES "${made}/krutil-protocol.7" DESTINATION "${CMAKE_INSTALL_MANDIR}/man7")
+    foreach(program IN ITEMS krutil krutil-qvm)
+        install(FILES "${made}/${program}.bash" RENAME "${program}"
+                DESTINATION "${CMAKE_INSTALL_DATADIR}/bash-completion/completions")
+        install(FILES "${made}/_${program}" DESTINATION "${CMAKE_INSTALL_DATADIR}/zsh/site-functions")
+        install(FILES "${made}/${program}.fish" DESTINATION "${CMAKE_INSTALL_DATADIR}/fish/vendor_completions.d")
+    endforeach()
+endif()

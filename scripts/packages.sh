@@ -20,6 +20,7 @@ test_packages=(
     python3-protobuf                                    # the client for Python
     mypy python3-pip python3-setuptools python3-wheel   # its types and its wheel
     python3-matplotlib                                  # figures, which an engine shows
+    mandoc man-db zsh fish                              # manual pages and completions
 )
 # What draws the pictures of benchmarks.
 bench_packages=(python3-matplotlib)

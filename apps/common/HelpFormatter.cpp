@@ -30,6 +30,15 @@ std::string wrapped(const std::string& text) {
 
 }  // namespace
 
+std::string valueName(const CLI::Option& option) {
+    if (option.get_type_size() == 0) {
+        return {};
+    }
+    // Checks add what they accept to the name of the type, behind a colon.
+    const std::string type = option.get_type_name();
+    return type.substr(0, type.find(':'));
+}
+
 HelpFormatter::HelpFormatter() {
     column_width(firstColumn);
 }
@@ -43,10 +52,8 @@ std::string HelpFormatter::make_help(const CLI::App* app, std::string name, CLI:
 }
 
 std::string HelpFormatter::make_option_opts(const CLI::Option* option) const {
-    // Checks add what they accept to the name of the type, behind a colon.
-    const std::string type = option->get_type_name();
-    const std::string name = type.substr(0, type.find(':'));
-    return option->get_type_size() == 0 || name.empty() ? std::string() : " " + name;
+    const std::string name = valueName(*option);
+    return name.empty() ? std::string() : " " + name;
 }
 
 std::string HelpFormatter::make_option_desc(const CLI::Option* option) const {

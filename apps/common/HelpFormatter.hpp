@@ -16,4 +16,7 @@ class HelpFormatter : public CLI::Formatter {
     std::string make_option_desc(const CLI::Option* option) const override;
 };
 
+/// The name of the value that an option takes, such as FILE; empty for a flag.
+std::string valueName(const CLI::Option& option);
+
 }  // namespace apps

@@ -12,17 +12,22 @@ namespace {
 
 constexpr int usageError = 2;
 
-}  // namespace
+// All options, and what parsing fills in.
+struct OptionTable {
+    OptionTable();
 
-Options parseOptions(int argc, const char* const* argv) {
     Options options;
-    CLI::App app(
+    double timeoutSeconds = std::chrono::duration<double>(options.handshakeTimeout).count();
+    CLI::App app{
         "The krutil engine: runs Python code that clients send over the krutil protocol.\n"
         "\n"
         "An engine runs whatever its clients send, with the rights of the user who started it. It serves\n"
         "one client on its standard input and output (--stdio), or any number of clients of the same user\n"
         "on a Unix socket (--listen), each in a process of its own.",
-        "krutil-qvm");
+        "krutil-qvm"};
+};
+
+OptionTable::OptionTable() {
     app.formatter(std::make_shared<apps::HelpFormatter>());
     app.set_version_flag("--version", apps::buildString("krutil-qvm"));
 
@@ -33,7 +38,6 @@ Options parseOptions(int argc, const char* const* argv) {
         ->type_name("PATH")
         ->group(where);
 
-    double timeoutSeconds = std::chrono::duration<double>(options.handshakeTimeout).count();
     const std::string sessions = "Sessions";
     app.add_option("--max-sessions", options.maxSessions, "Sessions at a time of a listening engine")
         ->check(CLI::Range(1, 10'000))
@@ -85,18 +89,33 @@ Options parseOptions(int argc, const char* const* argv) {
     apps::addLimitOptions(app, options.limits);
 
     app.footer(
-        "Exit codes: 0 the session ended as agreed, 2 wrong usage, 3 cannot serve or the client was lost,\n"
-        "4 the client broke the protocol, 5 version or feature refused.");
+        "Exit codes:\n"
+        "  0  the session ended as agreed\n"
+        "  2  wrong usage\n"
+        "  3  cannot serve, or the client was lost\n"
+        "  4  the client broke the protocol\n"
+        "  5  version or feature refused");
+}
+
+}  // namespace
+
+void describeCommandLine(const std::function<void(const CLI::App&)>& describe) {
+    describe(OptionTable().app);
+}
+
+Options parseOptions(int argc, const char* const* argv) {
+    OptionTable table;
+    Options& options = table.options;
     try {
-        app.parse(argc, argv);
+        table.app.parse(argc, argv);
         if (options.stdio != options.listen.empty()) {
             throw CLI::ValidationError("Exactly one of --stdio and --listen is required");
         }
     } catch (const CLI::ParseError& error) {
-        const int status = app.exit(error);
+        const int status = table.app.exit(error);
         std::exit(status == 0 ? EXIT_SUCCESS : usageError);
     }
-    options.handshakeTimeout = std::chrono::milliseconds(static_cast<long>(timeoutSeconds * 1000.0));
+    options.handshakeTimeout = std::chrono::milliseconds(static_cast<long>(table.timeoutSeconds * 1000.0));
     return options;
 }
 

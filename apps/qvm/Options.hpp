@@ -3,11 +3,16 @@
 
 #include <chrono>
 #include <cstddef>
+#include <functional>
 #include <string>
 
 #include "foundation/msg_svc/transport/layers/session/Limits.hpp"
 #include "qvm/python/PythonChoice.hpp"
 #include "qvm/requests/RequestQueue.hpp"
+
+namespace CLI {
+class App;
+}
 
 namespace qvm {
 
@@ -29,5 +34,9 @@ struct Options {
 /// Reads the command line. Prints help, the version or what is wrong and ends the process (0, or 2 for wrong usage)
 /// when there is nothing to run.
 Options parseOptions(int argc, const char* const* argv);
+
+/// Shows `describe` the options that parseOptions() knows, for manual pages and completion. They exist until it
+/// returns.
+void describeCommandLine(const std::function<void(const CLI::App&)>& describe);
 
 }  // namespace qvm

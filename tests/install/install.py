@@ -142,6 +142,13 @@ class InstalledTree(unittest.TestCase):
             self.uses_the_installed_libraries(program)
         self.assertEqual(run(krutil, "eval", "1 + 1", env=dict(os.environ, PATH="/usr/bin:/bin")), "2\n")
 
+    @unittest.skipUnless(os.path.exists(os.path.join(BUILD, "bin/krutil")), "the programs are not built")
+    def test_manual_pages_and_completions_are_where_shells_look(self):
+        for path in ("share/man/man1/krutil.1", "share/man/man1/krutil-qvm.1", "share/man/man7/krutil-protocol.7",
+                     "share/bash-completion/completions/krutil", "share/bash-completion/completions/krutil-qvm",
+                     "share/zsh/site-functions/_krutil", "share/fish/vendor_completions.d/krutil.fish"):
+            self.installed(path)
+
 
 if __name__ == "__main__":
     for tool in ("nm", "readelf", "pkg-config", "protoc"):

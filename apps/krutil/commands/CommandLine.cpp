@@ -81,7 +81,7 @@ void addDisplayOptions(CLI::App& app, DisplayOptions& options) {
            "--color", [&options](const std::string& name) { options.color = colors.at(name); },
            "Colour errors, warnings and code that is typed: auto (on a terminal, unless NO_COLOR is set), always or "
            "never")
-        ->check(CLI::IsMember(&colors).description(""))
+        ->check(CLI::IsMember(&colors))
         ->type_name("WHEN")
         ->default_str("auto")
         ->group("Display");
@@ -121,7 +121,7 @@ void addEval(CLI::App& app, Options& options, EvalOptions& eval, bool twoDashes)
             "How the code is read: block (statements; the value of a trailing expression is shown), script (a whole "
             "file) "
             "or conventional (one statement)")
-        ->check(CLI::IsMember(&types).description(""))
+        ->check(CLI::IsMember(&types))
         ->type_name("TYPE")
         ->default_str("block")
         ->group("Request");
@@ -265,29 +265,44 @@ void addCall(CLI::App& app, Options& options, CallOptions& call) {
     });
 }
 
-}  // namespace
+// All commands and options, and what parsing fills in.
+struct OptionTable {
+    // Words tell whether two dashes come.
+    explicit OptionTable(const std::vector<std::string>& words);
 
-std::variant<Options, Finished> parseCommandLine(int argc, const char* const* argv) {
     Options options;
     EvalOptions eval;
     CallOptions call;
     EvalOptions run;
     ReplOptions repl;
-    options.command = repl;
-    CLI::App app(
+    CLI::App app{
         "Evaluates code on an engine in another process. Without a command, code is read line by line; the options are "
         "those of repl.",
-        "krutil");
+        "krutil"};
+};
+
+OptionTable::OptionTable(const std::vector<std::string>& words) {
+    options.command = repl;
     app.set_version_flag("--version", apps::buildString("krutil"), "Print the version and exit");
     app.set_help_flag("-h,--help", "Print this help and exit");
     app.require_subcommand(0, 1);
     app.footer(exitCodes);
     app.formatter(std::make_shared<apps::HelpFormatter>());
-    const std::vector<std::string> words(argv, argv + argc);
     addEval(app, options, eval, std::find(words.begin(), words.end(), "--") != words.end());
     addCall(app, options, call);
     addRun(app, options, run);
     addRepl(app, options, repl);
+}
+
+}  // namespace
+
+void describeCommandLine(const std::function<void(const CLI::App&)>& describe) {
+    describe(OptionTable({}).app);
+}
+
+std::variant<Options, Finished> parseCommandLine(int argc, const char* const* argv) {
+    OptionTable table(std::vector<std::string>(argv, argv + argc));
+    CLI::App& app = table.app;
     try {
         auto arguments = withLiteralsKept(app, argc, argv);
         if (!arguments.empty() && beginsOptionsOfRepl(arguments.front())) {
@@ -306,7 +321,7 @@ std::variant<Options, Finished> parseCommandLine(int argc, const char* const* ar
         return Finished{
             ExitCode::Usage, {}, std::string("krutil: ") + error.what() + "\nRun krutil --help for help.\n"};
     }
-    return options;
+    return table.options;
 }
 
 }  // namespace krutil_client

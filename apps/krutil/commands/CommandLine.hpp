@@ -1,11 +1,16 @@
 // The command line, read into options.
 #pragma once
 
+#include <functional>
 #include <string>
 #include <variant>
 
 #include "krutil/base/ExitCode.hpp"
 #include "krutil/base/Options.hpp"
+
+namespace CLI {
+class App;
+}
 
 namespace krutil_client {
 
@@ -18,5 +23,9 @@ struct Finished {
 
 /// Reads the command line. Nothing is printed and no file is read.
 std::variant<Options, Finished> parseCommandLine(int argc, const char* const* argv);
+
+/// Shows `describe` the commands and options that parseCommandLine() knows, for manual pages and completion. They exist
+/// until it returns.
+void describeCommandLine(const std::function<void(const CLI::App&)>& describe);
 
 }  // namespace krutil_client
