@@ -1,15 +1,17 @@
-# What `cmake --install` lays out below its prefix:
+# What `cmake --install` lays out below its prefix, and the component that each part belongs to:
 #
-#   bin/                                   krutil, krutil-qvm
-#   lib/                                   libkrutil_protobuf.so, libkrutil_platform.so
-#   lib/cmake/krutil_{protobuf,platform}/  find_package(krutil_protobuf CONFIG): krutil::protobuf, krutil::platform
-#   lib/pkgconfig/                         krutil_protobuf.pc, krutil_platform.pc
-#   include/krutil_{protobuf,platform}/    headers, generated message classes beside them
-#   share/krutil_{protobuf,platform}/proto the schema
+#   bin/                                   tools              krutil, krutil-qvm
+#   lib/                                   library, platform  libkrutil_protobuf.so, libkrutil_platform.so
+#   lib/cmake/krutil_{protobuf,platform}/                     find_package(krutil_protobuf CONFIG)
+#   lib/pkgconfig/                                            krutil_protobuf.pc, krutil_platform.pc
+#   include/krutil_{protobuf,platform}/                       headers, generated message classes beside them
+#   share/krutil_{protobuf,platform}/proto schema             the schema
+#   share/krutil_protobuf/                                    krutil_protobuf.desc, the same as a descriptor set
 #   share/man/, share/bash-completion/, share/zsh/, share/fish/
-#                                          manual pages and completions
+#                                          tools              manual pages and completions
 #
-# Nothing in it holds the prefix: the tree may be installed to one place and used from another.
+# find_package() knows the same components. Nothing in the tree holds the prefix: it may be installed to one place and used
+# from another.
 
 option(KRUTIL_INSTALL "Generate install rules" ${PROJECT_IS_TOP_LEVEL})
 if(NOT KRUTIL_INSTALL)
@@ -18,73 +20,96 @@ endif()
 
 include(CMakePackageConfigHelpers)
 
-# krutil_install_library(NAME SUMMARY): the library target krutil_NAME and all that its users need.
-function(krutil_install_library name summary)
-    cmake_parse_arguments(arg "" "REQUIRES;CFLAGS" "HEADER_DIRECTORIES;PROTO_DIRECTORIES" ${ARGN})
+# krutil_install_library(NAME COMPONENT SUMMARY): the library target krutil_NAME and all that its users need.
+function(krutil_install_library name component summary)
+    cmake_parse_arguments(arg "" "REQUIRES;REQUIRES_PRIVATE;CFLAGS" "HEADER_DIRECTORIES;PC_VARIABLES" ${ARGN})
     set(package krutil_${name})
     set_target_properties(${package} PROPERTIES INSTALL_RPATH "$ORIGIN")
-    install(TARGETS ${package} EXPORT ${package}Targets LIBRARY)
+    install(TARGETS ${package} EXPORT ${package}Targets LIBRARY COMPONENT ${component})
     foreach(directory IN LISTS arg_HEADER_DIRECTORIES)
-        install(DIRECTORY "${directory}/" DESTINATION "${CMAKE_INSTALL_INCLUDEDIR}/${package}"
+        install(DIRECTORY "${directory}/" DESTINATION "${CMAKE_INSTALL_INCLUDEDIR}/${package}" COMPONENT ${component}
                 FILES_MATCHING PATTERN "*.hpp" PATTERN "*.pb.h")
     endforeach()
-    foreach(directory IN LISTS arg_PROTO_DIRECTORIES)
-        install(DIRECTORY "${directory}/" DESTINATION "${CMAKE_INSTALL_DATADIR}/${package}/proto"
-                FILES_MATCHING PATTERN "*.proto")
-    endforeach()
-
-    set(config_directory "${CMAKE_INSTALL_LIBDIR}/cmake/${package}")
-    install(EXPORT ${package}Targets NAMESPACE krutil:: DESTINATION "${config_directory}")
-    configure_package_config_file("${PROJECT_SOURCE_DIR}/cmake/${package}Config.cmake.in"
-        "${PROJECT_BINARY_DIR}/${package}Config.cmake" INSTALL_DESTINATION "${config_directory}"
-        NO_SET_AND_CHECK_MACRO)
-    write_basic_package_version_file("${PROJECT_BINARY_DIR}/${package}ConfigVersion.cmake"
-        COMPATIBILITY SameMinorVersion)
-    install(FILES "${PROJECT_BINARY_DIR}/${package}Config.cmake" "${PROJECT_BINARY_DIR}/${package}ConfigVersion.cmake"
-            DESTINATION "${config_directory}")
+    install(EXPORT ${package}Targets NAMESPACE krutil:: DESTINATION "${CMAKE_INSTALL_LIBDIR}/cmake/${package}"
+            COMPONENT ${component})
 
     set(pkgconfig_directory "${CMAKE_INSTALL_PREFIX}/${CMAKE_INSTALL_LIBDIR}/pkgconfig")
     cmake_path(RELATIVE_PATH CMAKE_INSTALL_PREFIX BASE_DIRECTORY "${pkgconfig_directory}" OUTPUT_VARIABLE pc_to_prefix)
     set(pc_name "${package}")
     set(pc_summary "${summary}")
     set(pc_requires "${arg_REQUIRES}")
+    set(pc_requires_private "${arg_REQUIRES_PRIVATE}")
     set(pc_cflags "${arg_CFLAGS}")
+    list(JOIN arg_PC_VARIABLES "\n" pc_variables)
     configure_file("${PROJECT_SOURCE_DIR}/cmake/package.pc.in" "${PROJECT_BINARY_DIR}/${package}.pc" @ONLY)
-    install(FILES "${PROJECT_BINARY_DIR}/${package}.pc" DESTINATION "${CMAKE_INSTALL_LIBDIR}/pkgconfig")
+    install(FILES "${PROJECT_BINARY_DIR}/${package}.pc" DESTINATION "${CMAKE_INSTALL_LIBDIR}/pkgconfig"
+            COMPONENT ${component})
 endfunction()
 
+# krutil_install_config(PACKAGE COMPONENT...): what find_package() reads first; each of the components needs it.
+function(krutil_install_config package)
+    set(directory "${CMAKE_INSTALL_LIBDIR}/cmake/${package}")
+    set(schema_directory "${CMAKE_INSTALL_DATADIR}")
+    configure_package_config_file("${PROJECT_SOURCE_DIR}/cmake/${package}Config.cmake.in"
+        "${PROJECT_BINARY_DIR}/${package}Config.cmake" INSTALL_DESTINATION "${directory}" PATH_VARS schema_directory
+        NO_SET_AND_CHECK_MACRO)
+    write_basic_package_version_file("${PROJECT_BINARY_DIR}/${package}ConfigVersion.cmake"
+        COMPATIBILITY SameMinorVersion)
+    foreach(component IN LISTS ARGN)
+        install(FILES "${PROJECT_BINARY_DIR}/${package}Config.cmake" "${PROJECT_BINARY_DIR}/${package}ConfigVersion.cmake"
+                DESTINATION "${directory}" COMPONENT ${component})
+    endforeach()
+endfunction()
+
+# krutil_install_schema(NAME DIRECTORY): the schema files of krutil_NAME.
+function(krutil_install_schema name directory)
+    install(DIRECTORY "${directory}/" DESTINATION "${CMAKE_INSTALL_DATADIR}/krutil_${name}/proto" COMPONENT schema
+            FILES_MATCHING PATTERN "*.proto")
+endfunction()
+
+set(platform_package "")
 if(KRUTIL_BUILD_PLATFORM)
-    krutil_install_library(platform "Reference host platform of the krutil protocol"
-        REQUIRES "protobuf >= 3.6"
+    set(platform_package "krutil_platform = ${PROJECT_VERSION}, ")
+    krutil_install_library(platform platform "Reference host platform of the krutil protocol"
+        REQUIRES "protobuf >= 3.6" REQUIRES_PRIVATE "icu-uc"
         HEADER_DIRECTORIES "${PROJECT_SOURCE_DIR}/platform/include" "${PROJECT_BINARY_DIR}/platform/proto_generated"
-        PROTO_DIRECTORIES "${PROJECT_SOURCE_DIR}/platform/proto")
+        PC_VARIABLES "protodir=\${prefix}/${CMAKE_INSTALL_DATADIR}/krutil_platform/proto")
+    krutil_install_config(krutil_platform platform)
+    krutil_install_schema(platform "${PROJECT_SOURCE_DIR}/platform/proto")
 endif()
 
-krutil_install_library(protobuf "${PROJECT_DESCRIPTION}"
-    REQUIRES "krutil_platform, protobuf >= 3.6"
+krutil_install_library(protobuf library "${PROJECT_DESCRIPTION}"
+    REQUIRES "${platform_package}protobuf >= 3.6"
     CFLAGS "-DKRUTIL_PROTOBUF_EXPORT="
     HEADER_DIRECTORIES "${PROJECT_BINARY_DIR}/proto_generated"
-    PROTO_DIRECTORIES "${PROJECT_SOURCE_DIR}/src/qvm_services/krutil_protobuf/proto")
+    PC_VARIABLES "protodir=\${prefix}/${CMAKE_INSTALL_DATADIR}/krutil_protobuf/proto"
+                 "descriptor_set=\${prefix}/${CMAKE_INSTALL_DATADIR}/krutil_protobuf/krutil_protobuf.desc")
+krutil_install_config(krutil_protobuf library schema tools)
+krutil_install_schema(protobuf "${PROJECT_SOURCE_DIR}/src/qvm_services/krutil_protobuf/proto")
 install(FILES "${PROJECT_SOURCE_DIR}/src/qvm_services/krutil_protobuf/KrutilProtocol.hpp"
-        DESTINATION "${CMAKE_INSTALL_INCLUDEDIR}/krutil_protobuf")
+        DESTINATION "${CMAKE_INSTALL_INCLUDEDIR}/krutil_protobuf" COMPONENT library)
+install(FILES "${PROJECT_BINARY_DIR}/krutil_protobuf.desc"
+        DESTINATION "${CMAKE_INSTALL_DATADIR}/krutil_protobuf" COMPONENT schema)
 
-cmake_path(RELATIVE_PATH CMAKE_INSTALL_FULL_LIBDIR BASE_DIRECTORY "${CMAKE_INSTALL_FULL_BINDIR}"
-           OUTPUT_VARIABLE programs_to_libraries)
-foreach(program IN ITEMS krutil_client krutil-qvm)
-    if(TARGET ${program})
-        set_target_properties(${program} PROPERTIES INSTALL_RPATH "$ORIGIN/${programs_to_libraries}")
-        install(TARGETS ${program} RUNTIME)
-    endif()
-endforeach()
+if(KRUTIL_BUILD_APPS)
+    cmake_path(RELATIVE_PATH CMAKE_INSTALL_FULL_LIBDIR BASE_DIRECTORY "${CMAKE_INSTALL_FULL_BINDIR}"
+               OUTPUT_VARIABLE programs_to_libraries)
+    set_target_properties(krutil_client krutil-qvm PROPERTIES INSTALL_RPATH "$ORIGIN/${programs_to_libraries}")
+    set_target_properties(krutil_client PROPERTIES EXPORT_NAME krutil)
+    install(TARGETS krutil_client krutil-qvm EXPORT krutil_toolsTargets RUNTIME COMPONENT tools)
+    install(EXPORT krutil_toolsTargets NAMESPACE krutil:: DESTINATION "${CMAKE_INSTALL_LIBDIR}/cmake/krutil_protobuf"
+            COMPONENT tools)
+endif()
 
 if(TARGET krutil_manuals)
     set(made "${PROJECT_BINARY_DIR}/apps/manuals/made")
-    install(FILES "${made}/krutil.1" "${made}/krutil-qvm.1" DESTINATION "${CMAKE_INSTALL_MANDIR}/man1")
-    install(FILES "${made}/krutil-protocol.7" DESTINATION "${CMAKE_INSTALL_MANDIR}/man7")
+    install(FILES "${made}/krutil.1" "${made}/krutil-qvm.1" DESTINATION "${CMAKE_INSTALL_MANDIR}/man1" COMPONENT tools)
+    install(FILES "${made}/krutil-protocol.7" DESTINATION "${CMAKE_INSTALL_MANDIR}/man7" COMPONENT tools)
     foreach(program IN ITEMS krutil krutil-qvm)
         install(FILES "${made}/${program}.bash" RENAME "${program}"
-                DESTINATION "${CMAKE_INSTALL_DATADIR}/bash-completion/completions")
-        install(FILES "${made}/_${program}" DESTINATION "${CMAKE_INSTALL_DATADIR}/zsh/site-functions")
-        install(FILES "${made}/${program}.fish" DESTINATION "${CMAKE_INSTALL_DATADIR}/fish/vendor_completions.d")
+                DESTINATION "${CMAKE_INSTALL_DATADIR}/bash-completion/completions" COMPONENT tools)
+        install(FILES "${made}/_${program}" DESTINATION "${CMAKE_INSTALL_DATADIR}/zsh/site-functions" COMPONENT tools)
+        install(FILES "${made}/${program}.fish" DESTINATION "${CMAKE_INSTALL_DATADIR}/fish/vendor_completions.d"
+                COMPONENT tools)
     endforeach()
 endif()

@@ -21,6 +21,7 @@ test_packages=(
     mypy python3-pip python3-setuptools python3-wheel   # its types and its wheel
     python3-matplotlib                                  # figures, which an engine shows
     mandoc man-db zsh fish                              # manual pages and completions
+    clang                                               # users of the installed tree have it or g++
 )
 # What draws the pictures of benchmarks.
 bench_packages=(python3-matplotlib)
@@ -40,7 +41,7 @@ ecosystem_packages=(
     python3-distributed                                                         # clusters
     python3-matplotlib
 )
-clang_packages=(clang libclang-rt-14-dev)
+clang_packages=(libclang-rt-14-dev)
 tidy_packages=(clang-tidy)
 
 # say TEXT...: a heading.

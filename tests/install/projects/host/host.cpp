@@ -30,9 +30,10 @@ int main() {
 
     const Event event = boost::make_shared<const krutil::io::TextBaseEvent>(
         foundation::msg_svc::exchange::IDType(1, 2), krutil::io::StreamTypeEnum::OUTPUT_STREAM, u"zwölf");
+    const BaseEvent& raised = *event;
     const auto serializer =
         std::dynamic_pointer_cast<const layers::serialization::SerializerAPI<BaseEvent, Event, Event>>(
-            registry->find(std::type_index(typeid(*event))));
+            registry->find(std::type_index(typeid(raised))));
     const auto stream = std::make_shared<LastFrame>();
     serializer->serialize(event, 7, 1, stream, registry, {});
 

@@ -1,0 +1,89 @@
+"""Builds other projects against the installed tree, in each way and with each compiler that users have. None of them sets
+a language level for CMake: that comes with the targets."""
+
+import os
+import re
+import tempfile
+import unittest
+
+from tree import CHECKOUT, COMPILERS, LINK_FLAGS, PREFIX, PROJECTS, library_directory, loaded_libraries, main, run
+
+HOST = os.path.join(PROJECTS, "host")
+ANSWER = re.compile(r"version 1\.0, \d+ serializers, krutil:TextBaseEvent: zwölf\n")
+
+
+def pkg_config(*options):
+    environment = dict(os.environ, PKG_CONFIG_PATH=os.path.join(library_directory(), "pkgconfig"))
+    return run("pkg-config", *options, env=environment).split()
+
+
+class Consumers(unittest.TestCase):
+    @classmethod
+    def setUpClass(cls):
+        directory = tempfile.TemporaryDirectory()
+        cls.addClassCleanup(directory.cleanup)
+        cls.scratch = directory.name
+
+    def configure(self, project, build, *definitions):
+        build = os.path.join(self.scratch, build)
+        return build, run("cmake", "-G", "Ninja", "-S", project, "-B", build, *definitions)
+
+    def works(self, program):
+        self.assertEqual(loaded_libraries(program), {os.path.realpath(library_directory())})
+        self.assertRegex(run(program), ANSWER)
+
+    def test_a_project_builds_with_find_package(self):
+        for compiler in COMPILERS:
+            with self.subTest(compiler):
+                build, _ = self.configure(HOST, f"package-{os.path.basename(compiler)}", f"-DCMAKE_PREFIX_PATH={PREFIX}",
+                                          f"-DCMAKE_CXX_COMPILER={compiler}", f"-DCMAKE_CXX_FLAGS={LINK_FLAGS}")
+                run("cmake", "--build", build)
+                self.works(os.path.join(build, "host"))
+
+    def test_a_project_builds_with_pkg_config(self):
+        options = pkg_config("--cflags", "--libs", "krutil_protobuf")
+        self.assertIn("-DKRUTIL_PROTOBUF_EXPORT=", options)
+        self.assertNotIn("-licuuc", options)
+        for compiler in COMPILERS:
+            with self.subTest(compiler):
+                program = os.path.join(self.scratch, f"host-{os.path.basename(compiler)}")
+                run(compiler, "-std=c++20", *LINK_FLAGS.split(), os.path.join(HOST, "host.cpp"), "-o", program, *options,
+                    f"-Wl,-rpath,{library_directory()}")
+                self.works(program)
+
+    def test_a_project_compiles_with_the_sources_below_its_own(self):
+        # The library itself is built that way, as a whole, by the tests of the foreign platform.
+        for compiler in COMPILERS:
+            with self.subTest(compiler):
+                build, _ = self.configure(HOST, f"sources-{os.path.basename(compiler)}", f"-DKRUTIL_CHECKOUT={CHECKOUT}",
+                                          f"-DCMAKE_CXX_COMPILER={compiler}")
+                run("cmake", "--build", build, "--target", "CMakeFiles/host.dir/host.cpp.o")
+                with open(os.path.join(build, "CMakeCache.txt"), encoding="utf-8") as cache:
+                    self.assertIn("CMAKE_BUILD_TYPE:STRING=\n", cache.read(), "the build type is the host's to choose")
+
+    def test_the_schema_and_the_programs_are_found_without_a_compiler(self):
+        _, said = self.configure(os.path.join(PROJECTS, "components"), "components", f"-DCMAKE_PREFIX_PATH={PREFIX}",
+                                 "-DWANTED=schema;tools")
+        share = os.path.realpath(os.path.join(PREFIX, "share"))
+        self.assertIn(f"-- schema: {share}/krutil_protobuf/proto;{share}/krutil_platform/proto\n", said)
+        self.assertIn(f"-- descriptor set: {share}/krutil_protobuf/krutil_protobuf.desc\n", said)
+        for program in ("krutil", "krutil-qvm"):
+            self.assertIn(f"-- {program}: {os.path.realpath(PREFIX)}/bin/{program}\n", said)
+
+    def test_an_unknown_component_is_refused(self):
+        with self.assertRaisesRegex(AssertionError, "krutil_protobuf_FOUND to FALSE"):
+            self.configure(os.path.join(PROJECTS, "components"), "unknown", f"-DCMAKE_PREFIX_PATH={PREFIX}",
+                           "-DWANTED=schema;nothing")
+
+    def test_pkg_config_knows_where_the_schema_is(self):
+        share = os.path.realpath(os.path.join(PREFIX, "share"))
+        for package, variable, path in (("krutil_protobuf", "protodir", "krutil_protobuf/proto"),
+                                        ("krutil_protobuf", "descriptor_set", "krutil_protobuf/krutil_protobuf.desc"),
+                                        ("krutil_platform", "protodir", "krutil_platform/proto")):
+            [said] = pkg_config(f"--variable={variable}", package)
+            self.assertEqual(os.path.realpath(said), os.path.join(share, path))
+            self.assertTrue(os.path.exists(said), said)
+
+
+if __name__ == "__main__":
+    main("cmake", "ninja", "ldd", "pkg-config")
