@@ -1,6 +1,6 @@
 """What the engine offers to the code that it runs.
 
-Names without an underscore are for that code; the others are the engine's own.
+Names without an underscore are for that code; the others are the engine's own, and so are the modules qvm_*.
 
 Only modules that are quick to import are imported here, since every session waits for that. The others are imported
 where they are first needed.
@@ -8,25 +8,29 @@ where they are first needed.
 
 import atexit as _atexit
 import builtins as _builtins
-import codecs as _codecs
 import gc as _gc
 import io as _io
 import os as _os
 import posix as _posix
 import sys as _sys
-import time as _time
 import warnings as _warnings
 import _signal
-import _warnings as _c_warnings
-from _collections import OrderedDict as _OrderedDict
-from errno import EINVAL as _EINVAL
 from os import path as _path
-from os import strerror as _strerror
 from _frozen_importlib_external import PathFinder as _PathFinder
 from _operator import index as _index
-from _thread import _local as _Local
 
 import _qvm
+import qvm_code as _code
+import qvm_prompts as _prompts
+import qvm_streams as _streams
+import qvm_warnings as _issued
+from qvm_code import compile_code as _compile
+from qvm_prompts import (DebuggerQuit, dbcont, dbquit, debugger, down, keyboard, list, next, pause, step, up, where)
+from qvm_warnings import warning
+
+# What code may use says that it is from here, whichever of the engine's files it is in.
+for _each in [value for name, value in globals().items() if not name.startswith("_")]:
+    _each.__module__ = __name__
 
 
 def link(text, target):
@@ -38,68 +42,6 @@ def link(text, target):
     target = "".join(c if c.isprintable() and c != " " else "".join(f"%{b:02X}" for b in c.encode("utf-8", "replace"))
                      for c in target)
     return f"\x1b]8;;{target}\x1b\\{text}\x1b]8;;\x1b\\"
-
-
-class _TextStream(_io.TextIOBase):
-    """sys.stdout or sys.stderr: hands text to the engine, which sends it to the client."""
-
-    encoding = "utf-8"
-    errors = "replace"
-    newlines = None
-    line_buffering = True
-    write_through = False
-    mode = "w"
-
-    def __init__(self, name, descriptor, write):
-        self.name = name
-        self._descriptor = descriptor
-        self.write = write
-        self.flush = _qvm.flush
-        self.buffer = _ByteStream(self)
-
-    def writable(self):
-        return True
-
-    def fileno(self):
-        # Of the plain descriptor, so that child processes can be given it.
-        return self._descriptor
-
-    def reconfigure(self, **options):
-        """Accepted for programs that ask for UTF-8 or line buffering, which this stream has anyway."""
-
-    def close(self):
-        self.flush()
-
-    def __repr__(self):
-        return f"<engine stream {self.name}>"
-
-
-class _ByteStream(_io.BufferedIOBase):
-    """The buffer attribute of a text stream: bytes that are UTF-8 text."""
-
-    mode = "wb"
-
-    def __init__(self, text):
-        self.name = text.name
-        self._text = text
-        self._decoder = _codecs.getincrementaldecoder("utf-8")("replace")
-
-    def writable(self):
-        return True
-
-    def write(self, data):
-        data = bytes(memoryview(data))
-        self._text.write(self._decoder.decode(data))
-        return len(data)
-
-    def flush(self):
-        self._text.flush()
-
-    def fileno(self):
-        return self._text.fileno()
-
-    def close(self):
-        self.flush()
 
 
 def _show(value):
@@ -194,331 +136,6 @@ def _end_request():
         action()
 
 
-class _InputStream(_io.TextIOBase):
-    """sys.stdin: asks the client for lines."""
-
-    encoding = "utf-8"
-    errors = "replace"
-    newlines = None
-    line_buffering = True
-    mode = "r"
-    name = "<stdin>"
-
-    def __init__(self):
-        self._rest = ""
-
-    def readable(self):
-        return True
-
-    def fileno(self):
-        return 0
-
-    def readline(self, size=-1):
-        if size == 0:
-            return ""
-        if not self._rest:
-            self._rest = _qvm.read_line()
-        end = self._rest.find("\n") + 1 or len(self._rest)
-        if size is not None and 0 < size < end:
-            end = size
-        line, self._rest = self._rest[:end], self._rest[end:]
-        return line
-
-    def read(self, size=-1):
-        # Fewer characters than asked for, as from a terminal.
-        return "".join(iter(self.readline, "")) if size is None or size < 0 else self.readline(size)
-
-    def reconfigure(self, **options):
-        """As for the other streams."""
-
-    def close(self):
-        """The client cannot be closed from here."""
-
-    def __repr__(self):
-        return "<engine stream <stdin>>"
-
-
-class DebuggerQuit(BaseException):
-    """Ends a request whose debug or keyboard prompt was left with dbquit()."""
-
-
-class _Stop:
-    """A prompt that holds code up. frame is where it evaluates, None for the session's namespace; inner are the frames
-    that up() has left, the innermost first; way is how the code goes on: None for freely."""
-
-    __slots__ = "frame", "inner", "way"
-
-    def __init__(self, frame):
-        self.frame, self.inner, self.way = frame, [], None
-
-
-# Of the open prompts for commands, the innermost last.
-_stops = []
-_session_names = _sys.modules["__main__"].__dict__
-
-
-def _take_commands(prompt, stop):
-    """Whether the client could be asked to the end."""
-    _stops.append(stop)
-    try:
-        end = prompt(stop)
-    finally:
-        _stops.pop()
-    if end == "quit":
-        raise DebuggerQuit("The debugger was left with quit.")
-    if end == "exit":
-        raise SystemExit
-    return end != "withdrawn"
-
-
-def _breakpoint(*arguments, **options):
-    """sys.breakpointhook: opens a debug prompt in the code that called breakpoint()."""
-    frame = _sys._getframe(1)
-    if not _qvm.can_debug():
-        _warn("breakpoint() goes on: the client or the engine has no debugger here", RuntimeWarning, 2)
-        return
-    _step_on(_stop_in(frame))
-
-
-def _stop_in(frame):
-    """Opens a debug prompt in the frame; returns how the code goes on."""
-    import qvm_stepping
-    stop = _Stop(frame)
-    _qvm.show("Stopped in " + qvm_stepping.place(frame))
-    if not _take_commands(_qvm.debug_prompt, stop):
-        _warn("breakpoint() goes on: the client has no debugger any more", RuntimeWarning, 3)
-    return stop
-
-
-def _step_on(stop):
-    if stop.way:
-        import qvm_stepping
-        qvm_stepping.Stepper(_stop_in).start(stop)
-
-
-def keyboard():
-    """Holds the running code up and evaluates what the client sends, where keyboard() was called, until dbcont()."""
-    if not _qvm.can_ask():
-        _warn("qvm.keyboard() goes on: the client cannot be asked", RuntimeWarning, 2)
-        return
-    stop = _Stop(_sys._getframe(1))
-    if not _take_commands(_qvm.keyboard_prompt, stop):
-        _warn("qvm.keyboard() goes on: the client cannot be asked any more", RuntimeWarning, 2)
-    _step_on(stop)
-
-
-def pause(seconds=None):
-    """Holds the running code up until the client says to go on, or for so many seconds."""
-    if seconds is not None:
-        seconds = float(seconds)
-    begin = _time.monotonic()
-    _stops.append(_Stop(None))
-    try:
-        way_out = _qvm.pause_prompt(seconds) if _qvm.can_ask() else "withdrawn"
-    finally:
-        _stops.pop()
-    if way_out == "exit":
-        raise SystemExit
-    if way_out == "withdrawn" and seconds is None:
-        _warn("qvm.pause() goes on: the client cannot be asked", RuntimeWarning, 2)
-    elif way_out == "withdrawn":
-        _time.sleep(max(begin + seconds - _time.monotonic(), 0))
-
-
-def dbcont():
-    """At a prompt: lets the code that was held up go on, once this request has ended."""
-    _qvm.leave_prompt(False)
-
-
-def dbquit():
-    """At a prompt: ends the code that was held up, once this request has ended."""
-    _qvm.leave_prompt(True)
-
-
-def _stopped():
-    if not _stops or _stops[-1].frame is None:
-        raise RuntimeError("no debug or keyboard prompt is open")
-    return _stops[-1]
-
-
-def _step(way):
-    stop = _stopped()
-    _qvm.leave_prompt(False)
-    stop.way = way
-
-
-def step():
-    """At a prompt: lets the code go on up to the next line, also in a function that it calls; a debug prompt opens
-    there.
-
-    >>> qvm.step()
-    """
-    _step("step")
-
-
-def next():
-    """At a prompt: lets the code go on up to the next line of the frame, or of its caller when it returns; a debug
-    prompt opens there.
-
-    >>> qvm.next()
-    """
-    _step("next")
-
-
-def up():
-    """At a prompt: code is evaluated in the caller's frame from now on.
-
-    >>> qvm.up()
-    """
-    import qvm_stepping
-    qvm_stepping.go_up(_stopped())
-
-
-def down():
-    """At a prompt: takes one up() back.
-
-    >>> qvm.down()
-    """
-    import qvm_stepping
-    qvm_stepping.go_down(_stopped())
-
-
-def list():
-    """At a prompt: shows the lines around the one where the frame is.
-
-    >>> qvm.list()
-    """
-    import qvm_stepping
-    qvm_stepping.show_lines(_stopped())
-
-
-def where():
-    """At a prompt: shows the frames of the code that is held up, the outermost first; the one in which code is
-    evaluated is marked.
-
-    >>> qvm.where()
-    """
-    import qvm_stepping
-    qvm_stepping.show_stack(_stopped())
-
-
-def debugger(on=True):
-    """States whether this engine offers a debugger; without, breakpoint() goes on."""
-    _qvm.set_debugging(bool(on))
-
-
-# Frames of a warning's stack; the innermost are kept.
-_MAX_FRAMES = 200
-
-
-def _stack(frame):
-    """File, function and line of the frames of user code, from the outermost to this one."""
-    prompts = (_take_commands.__code__, pause.__code__, _InputStream.readline.__code__)
-    frames = []
-    while frame is not None and len(frames) < _MAX_FRAMES:
-        code = frame.f_code
-        if code in prompts:
-            break  # what lies beyond belongs to the request that the prompt holds up
-        if code.co_filename != "<qvm>":
-            frames.append((code.co_filename, code.co_name, frame.f_lineno or 0))
-        frame = frame.f_back
-    frames.reverse()
-    return frames
-
-
-def warning(identifier, format, *arguments):
-    """Issues a warning to the client, with the text format % arguments. Without arguments the format is the text."""
-    identifier, format = str(identifier), str(format)
-    message = format % arguments if arguments else format
-    if _qvm.is_apart():
-        _sys.stderr.write(f"{identifier}: {message}\n")
-    else:
-        _qvm.issue_warning(identifier, format, [_plain(each) for each in arguments], message,
-                           _stack(_sys._getframe(1)), False)
-
-
-def _plain(value):
-    import numbers
-    if isinstance(value, numbers.Integral):
-        return int(value)
-    if isinstance(value, numbers.Real):
-        return float(value)
-    return str(value)
-
-
-# The warning that warnings.warn() or warn_explicit() of this thread is about to let through, as a list that gets it.
-_issuing = _Local()
-_show_warning = _warnings._showwarnmsg
-_print_warning = _warnings._showwarnmsg_impl
-
-
-def _issue(message, category, stack, shown):
-    if isinstance(message, Warning):
-        category = type(message)
-    elif category is None:
-        category = UserWarning
-    identifier = type.__getattribute__(category, "__qualname__")
-    module = type.__getattribute__(category, "__module__")
-    if module != "builtins":
-        identifier = f"{module}.{identifier}"
-    text = str(message)
-    _qvm.issue_warning(identifier, text, [], text, stack, not shown)
-
-
-def _on_shown(message):
-    """warnings._showwarnmsg: what a filter lets through comes here."""
-    taken = (_warnings.showwarning is not _warnings._showwarning_orig
-             or _warnings._showwarnmsg_impl is not _print_warning)
-    if taken or _qvm.is_apart():
-        _show_warning(message)
-    lets_through = getattr(_issuing, "shown", None)
-    if lets_through is not None:
-        lets_through.append(not taken)
-    elif not _qvm.is_apart():
-        # C code has raised it. Its place is that of a frame, or of code that is being compiled.
-        frame = _sys._getframe(1)
-        while frame is not None and (frame.f_code.co_filename != message.filename or frame.f_lineno != message.lineno):
-            frame = frame.f_back
-        stack = _stack(frame or _sys._getframe(1))
-        if frame is None:
-            stack.append((message.filename, "", message.lineno))
-        _issue(message.message, message.category, stack, not taken)
-
-
-def _raise_warning(raise_it):
-    """Whether a filter let the warning through and nobody took it."""
-    before = getattr(_issuing, "shown", None)
-    _issuing.shown = shown = []
-    try:
-        raise_it()
-    finally:
-        _issuing.shown = before
-    return shown == [True]
-
-
-def _warn(message, category=None, stacklevel=1, source=None):
-    """warnings.warn"""
-    level = max(_index(stacklevel), 1)
-    # Three frames of this module lie between the caller and Python's own function.
-    shown = _raise_warning(lambda: _c_warnings.warn(message, category, level + 3, source))
-    if _qvm.is_apart():
-        return
-    frame = _sys._getframe(1)
-    while level > 1 and frame is not None:
-        frame = frame.f_back
-        level -= 1
-    _issue(message, category, _stack(frame), shown)
-
-
-def _warn_explicit(message, category, filename, lineno, *arguments, **options):
-    """warnings.warn_explicit"""
-    shown = _raise_warning(lambda: _c_warnings.warn_explicit(message, category, filename, lineno, *arguments,
-                                                             **options))
-    if not _qvm.is_apart():
-        _issue(message, category, [*_stack(_sys._getframe(1)), (str(filename), "", min(max(lineno, 0), 0xFFFFFFFF))],
-               shown)
-
-
 def _safe_string(value, what, func=str):
     """traceback._safe_string: as Python's own, but an interrupt ends the formatting."""
     try:
@@ -569,7 +186,8 @@ def _format_error(error, limit):
 # The signal that carries cancels is to code what SIGKILL is: it can be neither handled nor blocked.
 def _set_user_handler(signalnum, handler):
     if signalnum == _qvm.interrupt_signal:
-        raise OSError(_EINVAL, _strerror(_EINVAL))
+        from errno import EINVAL
+        raise OSError(EINVAL, _os.strerror(EINVAL))
     before = _set_handler(signalnum, handler)
     if not callable(handler):
         _qvm.keep_last_words()
@@ -580,122 +198,10 @@ def _set_user_mask(how, mask):
     return _set_mask(how, [each for each in mask if each != _qvm.interrupt_signal])
 
 
-# Sources of evaluated code, for tracebacks and inspection: the newest, by number and by length.
-_MAX_SOURCES = 1000
-_MAX_SOURCE_LENGTH = 16 << 20
-_source_lengths = _OrderedDict()  # a plain one is searched for its first entry
-_source_length = 0
-# What linecache.cache is, once that module is imported.
-_source_lines = {}
-
-
-def _remember(filename, source):
-    global _source_length
-    _source_length -= _source_lengths.pop(filename, 0)
-    _source_lengths[filename] = len(source)
-    _source_length += len(source)
-    while len(_source_lengths) > _MAX_SOURCES or _source_length > _MAX_SOURCE_LENGTH:
-        oldest, length = _source_lengths.popitem(last=False)
-        _source_length -= length
-        _source_lines.pop(oldest, None)
-    if filename in _source_lengths:
-        # Without a modification time an entry is never looked up in the file system.
-        _source_lines[filename] = (len(source), None, source.splitlines(True), filename)
-
-
-# Keywords that only statements begin with.
-_STATEMENTS = frozenset(("assert", "break", "class", "continue", "def", "del", "for", "from", "global", "if", "import",
-                         "nonlocal", "pass", "raise", "return", "try", "while", "with"))
-
-
-def _is_statement(line):
-    """Whether the begin of a line shows that it is one statement and no expression, if it is well-formed at all."""
-    if ";" in line or "\r" in line:
-        return False
-    name, equals, value = line.partition("=")
-    if equals and not value.startswith("=") and name.strip().isidentifier():
-        return True
-    words = line.split(None, 1)
-    return bool(words) and words[0] in _STATEMENTS
-
-
-# ast.PyCF_ALLOW_TOP_LEVEL_AWAIT: code that awaits at its top level becomes a coroutine.
-_AWAITS = 0x2000
-
-
 def _run_to_end(coroutine):
     """The value of code that awaits."""
     import qvm_loop
     return qvm_loop.run_to_end(coroutine)
-
-
-def _compile_block(source, filename):
-    """Code of the statements and of a trailing expression; either may be None."""
-    if "\n" not in source.rstrip():
-        if _is_statement(source):
-            # Quicker than to try it as an expression, and to look at its tree then.
-            return _compile_program(source, filename)
-        expression = _qvm.compile_expression(source, filename)
-        if expression is not None:
-            return None, expression
-    import _ast
-    tree = compile(source, filename, "exec", _ast.PyCF_ONLY_AST, True)
-    if not tree.body or not isinstance(tree.body[-1], _ast.Expr):
-        return compile(tree, filename, "exec", _AWAITS, True), None
-    last = compile(_ast.Expression(tree.body.pop().value), filename, "eval", _AWAITS, True)
-    return compile(tree, filename, "exec", _AWAITS, True) if tree.body else None, last
-
-
-def _compile_program(source, filename):
-    return compile(source, filename, "exec", _AWAITS, True), None
-
-
-def _compile_statement(source, filename):
-    import _ast
-    tree = compile(source + "\n", filename, "single", _ast.PyCF_ONLY_AST, True)
-    if len(tree.body) != 1:
-        second = tree.body[1]
-        raise SyntaxError("multiple statements found while compiling a single statement",
-                          (filename, second.lineno, second.col_offset + 1, None))
-    return compile(tree, filename, "single", _AWAITS, True), None
-
-
-# By code type; one that is not stated is a block.
-_COMPILERS = (_compile_block, _compile_program, _compile_statement, _compile_block)
-
-
-# What the engine has put at the begin of sys.path, as Python does for code (an empty text, the current directory) and
-# for a file (its directory).
-_path_entry = ""
-
-
-def _begin_file(filename):
-    """Lets code of a file find what it finds when Python runs the file. It stays until the next file."""
-    global _path_entry
-    _sys.modules["__main__"].__file__ = filename
-    if _sys.flags.safe_path:
-        return
-    directory = _path.dirname(_path.realpath(filename))
-    if _sys.path[:1] == [_path_entry]:
-        _sys.path[0] = directory
-    else:
-        _sys.path.insert(0, directory)
-    _path_entry = directory
-
-
-def _compile(source, filename, code_type, begins_file):
-    if begins_file:
-        _begin_file(filename)
-    _remember(filename, source)
-    return _COMPILERS[code_type](source, filename)
-
-
-def _scopes():
-    """The namespaces in which code finds its names now, from the innermost."""
-    frame = _stops[-1].frame if _stops else None
-    if frame is None:
-        return [_session_names, _builtins.__dict__]
-    return [frame.f_locals, frame.f_globals, frame.f_builtins]
 
 
 def complete(text, cursor):
@@ -709,7 +215,7 @@ def complete(text, cursor):
     (7, 12, 'itertools')
     """
     import qvm_completion
-    begin, end, candidates = qvm_completion.complete(text, max(0, min(_index(cursor), len(text))), _scopes())
+    begin, end, candidates = qvm_completion.complete(text, max(0, min(_index(cursor), len(text))), _prompts.scopes())
     return begin, end, "\n".join(candidates)
 
 
@@ -725,7 +231,7 @@ def inspect(text, cursor):
     Return the tuple (x//y, x%y).  Invariant: div*y + mod == x.
     """
     import qvm_inspection
-    return qvm_inspection.inspect(text, max(0, min(_index(cursor), len(text))), _scopes())
+    return qvm_inspection.inspect(text, max(0, min(_index(cursor), len(text))), _prompts.scopes())
 
 
 def is_complete(text):
@@ -769,13 +275,13 @@ def _prepare():
 
 
 if not _sys.flags.safe_path:
-    _sys.path.insert(0, _path_entry)
-_sys.stdout = _sys.__stdout__ = _TextStream("<stdout>", 1, _qvm.write_output)
-_sys.stderr = _sys.__stderr__ = _TextStream("<stderr>", 2, _qvm.write_error)
+    _sys.path.insert(0, _code.path_entry)
+_sys.stdout = _sys.__stdout__ = _streams.TextStream("<stdout>", 1, _qvm.write_output)
+_sys.stderr = _sys.__stderr__ = _streams.TextStream("<stderr>", 2, _qvm.write_error)
 _qvm.gather_prints(_sys.stdout)
 _sys.displayhook = _sys.__displayhook__ = _show
-_sys.stdin = _sys.__stdin__ = _InputStream()
-_sys.breakpointhook = _sys.__breakpointhook__ = _breakpoint
+_sys.stdin = _sys.__stdin__ = _streams.InputStream()
+_sys.breakpointhook = _sys.__breakpointhook__ = _prompts.on_breakpoint
 _sys.excepthook = _sys.__excepthook__ = _print_error
 _sys.unraisablehook = _qvm.on_unraisable
 
@@ -797,14 +303,14 @@ _set_handler(_qvm.interrupt_signal, _qvm.on_interrupt_signal)
 for _name in "_exit", "execv", "execve":
     _replace(_posix, _name, _after_sending(getattr(_posix, _name)))
     setattr(_os, _name, getattr(_posix, _name))
-_warnings._showwarnmsg = _on_shown
-_replace(_warnings, "warn", _warn)
-_replace(_warnings, "warn_explicit", _warn_explicit)
+_warnings._showwarnmsg = _issued.on_shown
+_replace(_warnings, "warn", _issued.warn)
+_replace(_warnings, "warn_explicit", _issued.warn_explicit)
 
 
 def _adapt_linecache(linecache):
-    _source_lines.update(linecache.cache)
-    linecache.cache = _source_lines
+    _code.source_lines.update(linecache.cache)
+    linecache.cache = _code.source_lines
 
 
 def _adapt_traceback(traceback):

@@ -8,7 +8,7 @@ import json as _json
 import sys as _sys
 
 import _qvm
-from qvm import _warn, warning as _issue_warning
+from qvm_warnings import warn as _warn, warning as _issue_warning
 
 # What is kept for a client that does not take it.
 _MAX_COUNT = 100

@@ -408,6 +408,19 @@ TEST(SinkTest, TraitsWithoutFilesHaveNoEffect) {
     EXPECT_EQ(engine.process.stderrText(), "");
 }
 
+TEST_F(EvaluationTest, WhatTheEngineOffersIsInOneModule) {
+    const std::string code =
+        "import qvm\n"
+        "offered = [name for name in dir(qvm) if not name.startswith('_')]\n"
+        "print(*offered)\n"
+        "{getattr(qvm, name).__module__ for name in offered}";
+    const Evaluation result = client().eval(code);
+    EXPECT_EQ(result.output(),
+              "DebuggerQuit complete dbcont dbquit debugger down full inspect is_complete keyboard link list next "
+              "pause shorten step take_displays up warning where\n");
+    EXPECT_EQ(result.shown(), "{'qvm'}\n");
+}
+
 TEST(SinkTest, EventsFitWhatTheClientAccepts) {
     session::Limits limits;
     limits.taggedFrame = 512;
