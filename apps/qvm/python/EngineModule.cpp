@@ -327,10 +327,18 @@ py::object compileExpression(const py::str& source, const py::str& file) {
 // Those whose type is one of the types or derives from one, whatever they themselves say about it.
 py::list instances(const py::list& things, const py::tuple& types) {
     py::list found;
-    for (const py::handle thing : things) {
+    const PyTypeObject* other = nullptr;  // the type that was seen last, and is none of them
+    for (Py_ssize_t i = 0; i < PyList_GET_SIZE(things.ptr()); ++i) {
+        PyObject* const thing = PyList_GET_ITEM(things.ptr(), i);
+        // Many things of one type often follow each other.
+        if (Py_TYPE(thing) == other) {
+            continue;
+        }
+        other = Py_TYPE(thing);
         for (const py::handle type : types) {
-            if (PyObject_TypeCheck(thing.ptr(), reinterpret_cast<PyTypeObject*>(type.ptr())) != 0) {
+            if (PyObject_TypeCheck(thing, reinterpret_cast<PyTypeObject*>(type.ptr())) != 0) {
                 found.append(thing);
+                other = nullptr;
                 break;
             }
         }
