@@ -1,5 +1,8 @@
 // Contents in shared memory, with an end that is played byte by byte.
+#include <pthread.h>
 #include <sys/socket.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cctype>
@@ -9,6 +12,7 @@
 #include <ostream>
 #include <string>
 #include <system_error>
+#include <utility>
 
 #include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
 #include "foundation/vantor/carrier/shared_memory/SegmentPool.hpp"
@@ -146,6 +150,36 @@ TEST(SharedContentTest, DescriptorsMayComeBeforeTheirFrames) {
     EXPECT_THAT(pair.saw.waitForLines(1), ElementsAre("question 1 two"));
     EXPECT_EQ(pair.saw.lastQuestion()->received.size(), 2U);
     EXPECT_EQ(memoryDescriptors(), descriptors + 1) << "the last one waits for its frame";
+}
+
+// Called by the next fork of this process before it happens, if it is set.
+std::function<void()> beforeFork;
+
+TEST(SharedContentTest, IsGivenBackAsKeptWhenTheProcessForkedWhileItCame) {
+    // Registered before the session's own watch, so that it is called after that.
+    ASSERT_EQ(::pthread_atfork(
+                  [] {
+                      if (beforeFork) {
+                          std::exchange(beforeFork, nullptr)();
+                      }
+                  },
+                  nullptr, nullptr),
+              0);
+    SharingWithBytes pair(sharingConfig(Role::Engine));
+    const auto memory = anonymousMemory(mebi, mebi, allSeals);
+    beforeFork = [&] {
+        pair.peer->writeWith(sharedQuestion(77, 0, mebi), {memory.get()});
+        pair.saw.waitForLines(1);
+    };
+    const pid_t child = ::fork();
+    if (child == 0) {
+        ::_exit(0);
+    }
+    EXPECT_EQ(::waitpid(child, nullptr, 0), child);
+    pair.saw.lastQuestion().reset();
+    // The recorder keeps the latest question only.
+    pair.peer->write(wire::tagged(2, 1, true, questionTag, "next"));
+    EXPECT_EQ(pair.peer->read(24), wire::giveBack(77, true));
 }
 
 TEST(SharedContentTest, OutlivesTheSession) {
