@@ -7,6 +7,7 @@
 #   include/krutil_{protobuf,platform}/                       headers, generated message classes beside them
 #   share/krutil_{protobuf,platform}/proto schema             the schema
 #   share/krutil_protobuf/                                    krutil_protobuf.desc, the same as a descriptor set
+#   share/krutil/                          tools              the schema of what krutil --json prints
 #   share/man/, share/bash-completion/, share/zsh/, share/fish/
 #                                          tools              manual pages and completions
 #
@@ -99,9 +100,9 @@ if(KRUTIL_BUILD_APPS)
     install(TARGETS krutil_client krutil-qvm EXPORT krutil_toolsTargets RUNTIME COMPONENT tools)
     install(EXPORT krutil_toolsTargets NAMESPACE krutil:: DESTINATION "${CMAKE_INSTALL_LIBDIR}/cmake/krutil_protobuf"
             COMPONENT tools)
-endif()
 
-if(TARGET krutil_manuals)
+    install(FILES "${PROJECT_SOURCE_DIR}/apps/krutil/display/krutil-events.schema.json"
+            DESTINATION "${CMAKE_INSTALL_DATADIR}/krutil" COMPONENT tools)
     set(made "${PROJECT_BINARY_DIR}/apps/manuals/made")
     install(FILES "${made}/krutil.1" "${made}/krutil-qvm.1" DESTINATION "${CMAKE_INSTALL_MANDIR}/man1" COMPONENT tools)
     install(FILES "${made}/krutil-protocol.7" DESTINATION "${CMAKE_INSTALL_MANDIR}/man7" COMPONENT tools)

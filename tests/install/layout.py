@@ -57,10 +57,11 @@ class Layout(unittest.TestCase):
         self.assertEqual(run(krutil, "eval", "1 + 1", env=dict(os.environ, PATH="/usr/bin:/bin")), "2\n")
 
     @unittest.skipUnless(os.path.exists(os.path.join(BUILD, "bin/krutil")), "the programs are not built")
-    def test_manual_pages_and_completions_are_where_shells_look(self):
+    def test_manual_pages_completions_and_schema_are_where_programs_look(self):
         for path in ("share/man/man1/krutil.1", "share/man/man1/krutil-qvm.1", "share/man/man7/krutil-protocol.7",
                      "share/bash-completion/completions/krutil", "share/bash-completion/completions/krutil-qvm",
-                     "share/zsh/site-functions/_krutil", "share/fish/vendor_completions.d/krutil.fish"):
+                     "share/zsh/site-functions/_krutil", "share/fish/vendor_completions.d/krutil.fish",
+                     "share/krutil/krutil-events.schema.json"):
             self.installed(path)
 
 
