@@ -44,6 +44,7 @@ ecosystem_packages=(
 )
 clang_packages=(libclang-rt-14-dev)
 tidy_packages=(clang-tidy)
+reference_packages=(doxygen)
 
 # say TEXT...: a heading.
 say() {

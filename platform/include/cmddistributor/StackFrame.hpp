@@ -5,6 +5,7 @@
 
 namespace cmddistributor {
 
+/// A place in code, as an error tells it.
 struct StackFrame {
     std::u16string file;  ///< source file, UTF-16
     std::string func;     ///< function name, UTF-8

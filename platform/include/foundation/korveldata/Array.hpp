@@ -44,6 +44,7 @@ inline constexpr std::size_t maxDimensions = 32;
 /// of bytes is above 2^63 - 1.
 std::uint64_t checkedSizeInBytes(ElementType type, std::span<const std::uint64_t> dimensions);
 
+/// Elements of one type, with their dimensions and their order. Copies share the elements.
 class Array final {
   public:
     /// 0 x 0 doubles.

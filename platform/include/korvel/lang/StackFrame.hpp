@@ -6,6 +6,7 @@
 
 namespace korvel::lang {
 
+/// A place in code, as a warning tells it.
 struct StackFrame {
     StackFrame(std::u16string fileName, std::u16string functionName, unsigned int lineNumber)
         : file(std::move(fileName)), name(std::move(functionName)), line(lineNumber) {}

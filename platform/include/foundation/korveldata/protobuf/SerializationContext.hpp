@@ -31,6 +31,7 @@ inline constexpr std::size_t outOfLineThreshold = 2048;
 /// An empty message, to be filled and given to SerializationContext::convertFromProtobuf().
 std::unique_ptr<KORVEL_Array> createKORVEL_Array();
 
+/// Converts the arrays of one message: to their messages and back.
 class SerializationContext : public SerializationContextBase {
   public:
     using StringTable = std::unordered_map<std::string, std::string>;

@@ -38,6 +38,7 @@ std::ostream& operator<<(std::ostream& out, const IDType& id);
 
 }  // namespace foundation::msg_svc::exchange
 
+/// Lets identifiers be keys of unordered containers.
 template <>
 struct std::hash<foundation::msg_svc::exchange::IDType> {
     std::size_t operator()(const foundation::msg_svc::exchange::IDType& id) const noexcept {

@@ -30,6 +30,7 @@ using ProtocolConfiguration = std::function<std::vector<FeatureRequest>()>;
 /// Process-wide table of protocols by name. All members may be called from any thread.
 class ProtocolRegistry {
   public:
+    /// What a protocol has registered.
     struct Protocol {
         ProtocolInitializer initialize;
         ProtocolConfiguration configuration;
