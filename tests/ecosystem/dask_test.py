@@ -3,7 +3,6 @@
 import os
 import signal
 import tempfile
-import time
 import unittest
 
 import dask
@@ -12,7 +11,7 @@ import numpy
 
 import krutil
 import krutil.dask
-from jupyter import PATIENCE
+from eventually import PATIENCE, eventually
 
 MODULE = """
 import os, signal, time
@@ -54,10 +53,7 @@ class ClusterTest(unittest.TestCase):
         return [int(name[len(begin):]) for name in os.listdir(self.directory) if name.startswith(begin)]
 
     def await_files(self, begin, count):
-        end = time.monotonic() + PATIENCE
-        while len(self.begun(begin)) < count:
-            self.assertLess(time.monotonic(), end)
-            time.sleep(0.005)
+        eventually(lambda: len(self.begun(begin)) >= count, f"file number {count} of {begin}")
 
     def create(self, name):
         open(self.path(name), "w").close()
@@ -110,10 +106,7 @@ class ClusterTest(unittest.TestCase):
         self.await_files("begun-", 2)
         self.create("go")
         self.assertNotEqual(int(task.result(PATIENCE)), before)
-        end = time.monotonic() + PATIENCE
-        while os.path.exists(f"/proc/{before}"):
-            self.assertLess(time.monotonic(), end)
-            time.sleep(0.01)
+        eventually(lambda: not os.path.exists(f"/proc/{before}"), f"the end of process {before}")
 
     @staticmethod
     def parent(pid):

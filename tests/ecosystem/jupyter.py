@@ -5,9 +5,6 @@ import subprocess
 import sys
 import tempfile
 
-# Longer than anything takes that ends at all, on a machine with other work.
-PATIENCE = 120
-
 
 def install(test):
     """Installs the kernel "krutil" and points Jupyter at it, until the test class is done. Returns the directory."""

@@ -20,7 +20,7 @@ from nbclient import NotebookClient
 from nbclient.exceptions import CellExecutionError
 
 import jupyter
-from jupyter import PATIENCE
+from eventually import PATIENCE, eventually
 
 COLOURS = re.compile(r"\x1b\[[0-9;]*m")
 
@@ -317,10 +317,7 @@ class EndsTest(WithKernel):
         self.assertEqual(self.run_cell("6 * 7").value, "42")
 
     def assert_gone(self, pid):
-        end = time.monotonic() + PATIENCE
-        while os.path.exists(f"/proc/{pid}"):
-            self.assertLess(time.monotonic(), end, f"process {pid} is still there")
-            time.sleep(0.01)
+        eventually(lambda: not os.path.exists(f"/proc/{pid}"), f"the end of process {pid}")
 
 
 class NotebookTest(unittest.TestCase):

@@ -7,8 +7,6 @@ import os
 import shutil
 import socket
 import subprocess
-import tempfile
-import time
 import unittest
 
 import matplotlib.image
@@ -19,7 +17,7 @@ from selenium.webdriver.common.by import By
 from selenium.webdriver.support.ui import WebDriverWait
 
 import jupyter
-from jupyter import PATIENCE
+from eventually import PATIENCE, eventually
 
 
 class PageTest(unittest.TestCase):
@@ -53,8 +51,7 @@ class PageTest(unittest.TestCase):
     @classmethod
     def find_server(cls):
         """The server writes a file when it listens."""
-        end = time.monotonic() + PATIENCE
-        while True:
+        def look():
             for path in glob.glob(os.path.join(os.environ["JUPYTER_RUNTIME_DIR"], "nbserver-*.json")):
                 with open(path, encoding="utf-8") as file:
                     try:
@@ -62,10 +59,12 @@ class PageTest(unittest.TestCase):
                         return said["url"], said["token"]
                     except ValueError:
                         pass  # It is being written.
-            if cls.server.poll() is not None or time.monotonic() > end:
+            if cls.server.poll() is not None:
                 with open(os.path.join(cls.directory, "server"), encoding="utf-8") as file:
                     raise AssertionError(file.read())
-            time.sleep(0.05)
+            return None
+
+        return eventually(look, "the server's file")
 
     def open(self, *cells):
         """Opens a notebook with these cells, and runs all of them."""

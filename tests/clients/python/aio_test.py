@@ -7,7 +7,8 @@ import unittest
 import krutil
 import numpy
 from engine_test import set_zero_copy
-from scripted import DONE, GREETING, PATIENCE, SHUTDOWN, ScriptedEngine, message
+from eventually import PATIENCE
+from scripted import DONE, GREETING, SHUTDOWN, ScriptedEngine, message
 
 
 class AioTest(unittest.IsolatedAsyncioTestCase):

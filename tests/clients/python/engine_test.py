@@ -12,14 +12,13 @@ import subprocess
 import sys
 import tempfile
 import threading
-import time
 import traceback
 import tracemalloc
 import unittest
 
 import krutil
 import numpy
-from scripted import PATIENCE
+from eventually import PATIENCE, eventually
 
 KiB, MiB = 1 << 10, 1 << 20
 
@@ -262,10 +261,7 @@ class Behaviour:
 
     def await_memory_below(self, size):
         """The threads of the session may be a moment behind."""
-        end = time.monotonic() + PATIENCE
-        while tracemalloc.get_traced_memory()[0] > size and time.monotonic() < end:
-            threading.Event().wait(0.001)
-        self.assertLess(tracemalloc.get_traced_memory()[0], size)
+        eventually(lambda: tracemalloc.get_traced_memory()[0] < size, f"memory below {size} bytes")
 
     def test_many_threads(self):
         with self.begin() as session:

@@ -6,8 +6,9 @@ import unittest
 
 import krutil
 from krutil import schema
-from scripted import (DONE, GREETING, MAGIC, PATIENCE, SHUTDOWN, ScriptedEngine, body, first, frame, hello, message, reply,
-                      result, verdict)
+from eventually import PATIENCE
+from scripted import (DONE, GREETING, MAGIC, SHUTDOWN, ScriptedEngine, first, frame, hello, message, reply, result,
+                      verdict)
 
 KiB, MiB = 1 << 10, 1 << 20
 

@@ -4,14 +4,13 @@ import os
 import stat
 import tempfile
 import threading
-import time
 import unittest
 import warnings
 from concurrent.futures import CancelledError, wait
 
 import krutil
 import numpy
-from scripted import PATIENCE
+from eventually import PATIENCE, eventually
 
 # Calls that tell which engine runs them, or end it.
 MODULE = """
@@ -70,10 +69,8 @@ class PoolTest(unittest.TestCase):
             self.assertEqual(len({int(each.result(PATIENCE)) for each in waiting}), 3)
 
     def await_files(self, begin, count):
-        end = time.monotonic() + PATIENCE
-        while sum(name.startswith(begin) for name in os.listdir(self.directory)) < count:
-            self.assertLess(time.monotonic(), end)
-            time.sleep(0.005)
+        eventually(lambda: sum(name.startswith(begin) for name in os.listdir(self.directory)) >= count,
+                   f"file number {count} of {begin}")
 
     def test_a_lost_engine_fails_its_own_call_only(self):
         with krutil.Pool(2) as pool:
@@ -152,10 +149,11 @@ class PoolTest(unittest.TestCase):
 
     def await_warning(self, pool, told):
         """The engine is found missing when its thread takes a call, and either thread may take one."""
-        end = time.monotonic() + PATIENCE
-        while not told:
-            self.assertLess(time.monotonic(), end)
+        def look():
             pool.submit("abs", 1).result(PATIENCE)
+            return told
+
+        eventually(look, "the warning")
         self.assertTrue(str(told[0].message).startswith("an engine of the pool cannot be started again: the engine has gone"))
 
     def test_no_engine_is_left(self):

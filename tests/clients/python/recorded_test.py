@@ -19,7 +19,8 @@ import krutil
 import numpy
 from krutil import wire
 from engine_test import joined, set_zero_copy
-from scripted import PATIENCE, ScriptedEngine
+from eventually import PATIENCE
+from scripted import ScriptedEngine
 
 DIRECTORY = os.path.join(os.path.dirname(os.path.abspath(__file__)), "recorded")
 BYTES_IN_A_LINE = 48

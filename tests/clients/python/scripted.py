@@ -5,10 +5,8 @@ import struct
 import threading
 
 import krutil
+from eventually import PATIENCE
 from krutil import schema, wire
-
-# Longer than anything takes that ends at all, on a machine with other work and with a sanitizer's engine.
-PATIENCE = 120
 
 MAGIC = b"\x89KRUTIL\n"
 

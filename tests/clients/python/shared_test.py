@@ -5,7 +5,6 @@ import mmap
 import os
 import socket
 import struct
-import time
 import unittest
 from unittest import mock
 
@@ -13,7 +12,8 @@ import krutil
 import numpy
 from krutil import schema, shared, wire
 from krutil.writer import Writer
-from scripted import DONE, PATIENCE, SHUTDOWN, ScriptedEngine, first, frame, hello, message, reply, verdict
+from eventually import PATIENCE, eventually
+from scripted import DONE, SHUTDOWN, ScriptedEngine, first, frame, hello, message, reply, verdict
 
 KiB, MiB = 1 << 10, 1 << 20
 SIZE = 2 * MiB
@@ -135,10 +135,11 @@ class EngineTest(unittest.TestCase):
             self.await_returns(session)
 
     def await_returns(self, session):
-        end = time.monotonic() + PATIENCE
-        while session._dispatch._lender._lent:
-            self.assertLess(time.monotonic(), end)
+        def look():
             session.eval("1", timeout=PATIENCE)
+            return not session._dispatch._lender._lent
+
+        eventually(look, "what was lent")
 
 
 def memory(size=SIZE, seals=1 | 2 | 4 | 16, filled=True, content=b""):
