@@ -28,10 +28,10 @@ Exchange = Union[Request[Any], "Future[CancelAnswer]"]
 E = TypeVar("E", Request[Any], "Future[CancelAnswer]")
 
 _REPLY, _CANCEL_REPLY, _SHUTDOWN = "krutil:IIPReply", "krutil:IIPCancelReply", "krutil:QVMShutdownEvent"
-_STATES = {"krutil:IIPStartedEvent": "started", "krutil:IIPSuspendedEvent": "suspended",
-           "krutil:IIPResumedEvent": "resumed", "krutil:IIPDiscardedEvent": "discarded",
-           "krutil:IIPRequeuedEvent": "requeued", "krutil:IIPReactivatedEvent": "reactivated",
-           "krutil:IIPCompletedEvent": "completed", "krutil:detail::LastIIPEvent": "last"}
+_STATES = {"krutil:IIPStartedEvent": State("started"), "krutil:IIPSuspendedEvent": State("suspended"),
+           "krutil:IIPResumedEvent": State("resumed"), "krutil:IIPDiscardedEvent": State("discarded"),
+           "krutil:IIPRequeuedEvent": State("requeued"), "krutil:IIPReactivatedEvent": State("reactivated"),
+           "krutil:IIPCompletedEvent": State("completed"), "krutil:detail::LastIIPEvent": State("last")}
 _TO_ENGINES = {"krutil:IIPEnqueueMessage", "krutil:IIPCancelMessage"}
 _REFERRED_TO = {"krutil:EvalIIP", "krutil:FEvalIIP", "krutil:IIPResult", "krutil:FEvalResult", "krutil:QDA"}
 # Of no use here: each warning that is shown has an event of its own, and an engine refuses what it cannot do.
@@ -57,7 +57,7 @@ class Dispatch:
         self._on_input, self._on_debug, self._on_text, self._on_display = on_input, on_debug, on_text, on_display
         self._numbers = itertools.count(1)
         self._lock = threading.Lock()
-        # By stream ID, under the lock.
+        # By stream ID. It is changed under the lock; the thread that reads looks into it without.
         self._open: dict[int, Exchange] = {}
         self._last_stream = 0
         self._closing = False
@@ -86,7 +86,7 @@ class Dispatch:
             self._lender = Lender()
             # An array may end in any thread; what the writer takes is a queue that allows that.
             self._borrower = Borrower(reader.descriptors,
-                                      lambda number, kept: writer.send([return_bytes(number, kept)]))
+                                      lambda number, kept: writer.send_return(return_bytes(number, kept)))
         self._thread = threading.Thread(target=self._run, name="krutil-reader", daemon=True)
         self._thread.start()
 
@@ -106,13 +106,13 @@ class Dispatch:
             if self._over or self._closing:
                 raise self._copy_of_end() if self._over else Lost("the session is closed")
             stream = self._last_stream
-            while stream == 0 or stream in self._open or stream == self._last_stream:
+            while stream == 0 or stream == self._last_stream or stream in self._open:
                 stream = (stream + 1) % 2**32
-            buffers = message_bytes(stream, frames, self._settled.limits, self._lender)
+            buffers, size = message_bytes(stream, frames, self._settled.limits, self._lender)
             self._last_stream = stream
             exchange = make()
             self._open[stream] = exchange
-            self._writer.send(buffers)
+            self._writer.send(buffers, size)
         return exchange
 
     def cancel_all(self, requests: Optional[Iterable[Request[Any]]] = None) -> None:
@@ -134,7 +134,8 @@ class Dispatch:
         with self._lock:
             if not self._closing and not self._over:
                 self._closing = True
-                self._writer.send([goodbye_bytes()])
+                goodbye = goodbye_bytes()
+                self._writer.send([goodbye], len(goodbye))
         return self._ended.wait(timeout)
 
     def abandon(self) -> None:
@@ -190,9 +191,9 @@ class Dispatch:
         is waited for: its arrays may be large."""
         message = read_message(self._reader, self._limits, self._borrower,
                                self._lender.take_back if self._lender else None)
-        if message is not None and self._shut_down:
-            raise Violation("expected nothing after the engine's shutdown event, got another frame")
         if message is not None:
+            if self._shut_down:
+                raise Violation("expected nothing after the engine's shutdown event, got another frame")
             self._handle(message)
             return True
         if not self._shut_down:
@@ -201,12 +202,15 @@ class Dispatch:
 
     def _handle(self, message: Message) -> None:
         tag, stream = message.root, message.stream
-        place = f"message on stream {stream}"
-        with self._lock:
-            exchange = self._open.get(stream)
-        if tag in (_REPLY, _CANCEL_REPLY):
+        exchange = self._open.get(stream)
+        handler = self._handlers.get(tag)
+        if handler is not None:
+            if stream and exchange is None:
+                raise _misplaced(message, "is an event: expected the stream ID 0 or that of an open exchange")
+            handler(message, exchange)
+        elif tag == _REPLY or tag == _CANCEL_REPLY:
             if exchange is None or isinstance(exchange, Request) != (tag == _REPLY):
-                raise Violation(f'{place}: "{tag}" is a reply: expected the stream ID of an open exchange')
+                raise _misplaced(message, "is a reply: expected the stream ID of an open exchange")
             finish = self._reply(message, exchange) if isinstance(exchange, Request) else \
                 self._cancel_reply(message, exchange)
             with self._lock:
@@ -214,16 +218,12 @@ class Dispatch:
             if isinstance(exchange, Request) and exchange in self._running:
                 self._running.remove(exchange)
             finish()
-        elif tag in self._handlers:
-            if stream and exchange is None:
-                raise Violation(f'{place}: "{tag}" is an event: expected the stream ID 0 or that of an open exchange')
-            self._handlers[tag](message, exchange)
         elif tag in _TO_ENGINES:
-            raise Violation(f'{place}: "{tag}" goes to an engine, not to a client')
+            raise _misplaced(message, "goes to an engine, not to a client")
         elif tag in _REFERRED_TO:
-            raise Violation(f'{place}: "{tag}" is only ever referred to and cannot be the last frame')
+            raise _misplaced(message, "is only ever referred to and cannot be the last frame")
         else:
-            raise Violation(f'{place}: no serializer is registered for its tag "{tag}"')
+            raise Violation(f'message on stream {stream}: no serializer is registered for its tag "{tag}"')
 
     # Replies: what they bring is read first, so nothing of a bad message reaches whoever waits.
 
@@ -246,7 +246,8 @@ class Dispatch:
                 error = error_from(result.exception, request._error_text)
             if not result.HasField("id"):
                 raise message.unreadable("Required field is missing: protobuf::IIPResult.id")
-        return lambda: self._after_displays(request, lambda: request._finish(error, values))
+        finish = lambda: request._finish(error, values)
+        return (lambda: self._after_displays(request, finish)) if request in self._displayed.values() else finish
 
     def _cancel_reply(self, message: Message, answer: "Future[CancelAnswer]") -> Callable[[], None]:
         status = message.take_root(IIPCancelReply).status
@@ -257,10 +258,7 @@ class Dispatch:
     # Displays: the engine keeps them until it is asked.
 
     def _after_displays(self, request: Request[Any], finish: Callable[[], None]) -> None:
-        """Finishes a request that has its reply, when its displays have come."""
-        if request not in self._displayed.values():
-            finish()
-            return
+        """Finishes a request that has its reply, when its displays have come, of which it has some."""
         try:
             # Before all that waits; or at the prompt at which the request ran.
             asked = self._session._submit_call("qvm.take_displays", [], 2,
@@ -320,7 +318,7 @@ class Dispatch:
                 self._running.append(exchange)
             elif state == "completed" and exchange in self._running:
                 self._running.remove(exchange)
-            exchange._add(State(state))
+            exchange._add(state)
 
     def _warning(self, message: Message, exchange: Optional[Exchange]) -> None:
         warning = message.take_root(IssuedEnabledWarningEvent, frame_type=27).warningEvent.warning
@@ -385,6 +383,10 @@ class Dispatch:
             self._socket.shutdown(socket.SHUT_RDWR)
         except OSError:
             pass  # It is closed already.
+
+
+def _misplaced(message: Message, what: str) -> Violation:
+    return Violation(f'message on stream {message.stream}: "{message.root}" {what}')
 
 
 def _stream(tag: str, number: int) -> str:

@@ -4,6 +4,7 @@ import contextlib
 import enum
 import threading
 import time
+from collections import defaultdict
 from concurrent.futures import Future
 from dataclasses import dataclass, field
 from typing import TYPE_CHECKING, Any, Callable, Generic, Iterator, NamedTuple, Optional, TypeVar, Union
@@ -88,6 +89,17 @@ class Result:
     displays: tuple[Display, ...] = field(default=(), repr=False)
 
 
+class _Outcome(Future[T]):
+    """Is not cancelled by itself: what becomes of a request, the engine says."""
+
+    def cancel(self) -> bool:
+        return False
+
+
+# Held while listeners come or go. An iterator over events may end anywhere, also in a thread that holds it already.
+_listeners_lock = threading.RLock()
+
+
 class Request(Generic[T]):
     """A request that the engine was given, and what comes of it: a future.
 
@@ -104,12 +116,14 @@ class Request(Generic[T]):
         self._session = session
         self._identifier = identifier
         self._make_result = make_result
-        # Not to be cancelled by itself: what becomes of a request, the engine says.
-        self._future: "Future[T]" = Future()
-        self._future.set_running_or_notify_cancel()
-        self._changed = threading.Condition()
+        self._future: "Future[T]" = _Outcome()
+        # Only the thread that reads appends to these; any thread may look at them meanwhile.
         self._events: list[Event] = []
-        self._listeners: list[Callable[[], object]] = []
+        self._by_kind: "defaultdict[type, list[Any]]" = defaultdict(list)
+        # Replaced as a whole, so that whoever calls them needs no lock.
+        self._listeners: tuple[Callable[[], object], ...] = ()
+        # Where the events begin that have come since the last prompt was closed.
+        self._resumed = 0
         self._error_text = ""
 
     def result(self, timeout: Optional[float] = None) -> T:
@@ -154,80 +168,75 @@ class Request(Generic[T]):
         seconds from the first step. What the reply says is left to `result()`.
         """
         end = None if timeout is None else time.monotonic() + timeout
+        changed = threading.Event()
         position = 0
-        while True:
-            with self._changed:
-                while position == len(self._events) and not self._future.done():
-                    left = None if end is None else end - time.monotonic()
-                    if left is not None and left <= 0:
-                        raise TimeoutError("there is no reply yet")
-                    self._changed.wait(left)
-                arrived = self._events[position:]
-            if not arrived:
-                return
-            position += len(arrived)
-            yield from arrived
+        with self._listening(changed.set):
+            while True:
+                changed.clear()
+                # In this order: what comes before the reply is there once the reply is.
+                done = self.done()
+                arrived = self._so_far(position)
+                position += len(arrived)
+                yield from arrived
+                if done:
+                    return
+                if not arrived and not changed.wait(None if end is None else end - time.monotonic()):
+                    raise TimeoutError("there is no reply yet")
 
     @property
     def output(self) -> str:
         """What the code has written so far."""
-        return "".join(event for event in self._so_far() if isinstance(event, Text))
+        return "".join(self._by_kind[Text])
 
     @property
     def value(self) -> Optional[str]:
         """The value of a trailing expression as text, if there is one."""
         # What is shown before a prompt is where the code stands; its value comes at its end.
         # A line that stands for no display is the text of a value that looks like one.
-        numbers = {display.number for display in self.displays}
-        shown = "".join(event for event in self._since_prompt() if isinstance(event, Value)
-                        or (isinstance(event, DisplayLine) and event.number not in numbers))
+        displayed = [display.number for display in self._by_kind[Display]]
+        shown = "".join([event for event in self._events[self._resumed:] if isinstance(event, Value)
+                         or (isinstance(event, DisplayLine) and event.number not in displayed)])
         return shown[:-1] if shown.endswith("\n") else shown or None
 
     @property
     def warnings(self) -> tuple[Warned, ...]:
         """The warnings so far."""
-        return tuple(event for event in self._so_far() if isinstance(event, Warned))
+        return tuple(self._by_kind[Warned])
 
     @property
     def displays(self) -> tuple[Display, ...]:
         """The pictures and other forms of values that have come so far; they come at the end."""
-        return tuple(event for event in self._so_far() if isinstance(event, Display))
+        return tuple(self._by_kind[Display])
 
     def _so_far(self, position: int = 0) -> list[Event]:
-        with self._changed:
-            return self._events[position:]
+        return self._events[position:]
 
     @contextlib.contextmanager
     def _listening(self, listener: Callable[[], object]) -> Iterator[None]:
         """Has the listener called whenever there is more to see, in the thread that reads; it must not wait or fail."""
-        with self._changed:
-            self._listeners.append(listener)
+        with _listeners_lock:
+            self._listeners += (listener,)
         try:
             yield
         finally:
-            with self._changed:
-                self._listeners.remove(listener)
+            with _listeners_lock:
+                self._listeners = tuple(each for each in self._listeners if each is not listener)
 
     # For the thread that reads:
 
     def _prompted(self) -> tuple[str, str]:
         """At a prompt that has just opened: the line that was begun, and what the engine has shown."""
-        events = self._since_prompt()
+        events = self._so_far(self._resumed)
         text = "".join(event for event in events if isinstance(event, Text))
         return text.rpartition("\n")[2], "".join(event for event in events if isinstance(event, Value))
 
     def _add(self, event: Event) -> None:
-        with self._changed:
-            self._events.append(event)
-            self._notify()
-
-    def _since_prompt(self) -> list[Event]:
-        """What has come since the last prompt was closed."""
-        events = self._so_far()
-        for place in range(len(events), 0, -1):
-            if isinstance(events[place - 1], State) and events[place - 1] == "resumed":
-                return events[place:]
-        return events
+        self._events.append(event)
+        self._by_kind[type(event)].append(event)
+        if isinstance(event, State) and event == "resumed":
+            self._resumed = len(self._events)
+        for listener in self._listeners:
+            listener()
 
     def _finish(self, error: Optional[BaseException], answer: Any = None) -> None:
         """Ends the request, with an error or with what the reply brought."""
@@ -239,10 +248,5 @@ class Request(Generic[T]):
             self._future.set_exception(error)
         else:
             self._future.set_result(result)  # type: ignore[arg-type]
-        with self._changed:
-            self._notify()
-
-    def _notify(self) -> None:
-        self._changed.notify_all()
         for listener in self._listeners:
             listener()

@@ -28,6 +28,10 @@ Command = Union[str, Sequence[str]]
 # The engine need not know who asks, but refuses 0.
 _ANY_ENGINE = 1
 
+# What all evaluations and calls begin with. Serialized messages can be joined, and to serialize this each time takes
+# longer than all the rest of them.
+_CORE = EvalIIP(iip={"pluginType": "python", "outTraits": {}, "errTraits": {}}).SerializeToString()
+
 
 class Session:
     """A session with an engine. `start()` and `connect()` make one.
@@ -173,13 +177,12 @@ class Session:
 
     def _enqueue(self, frames: list[Frame], tag: str, request: Any, mode: str,
                  make_result: Callable[["Request[Any]", Any], Any]) -> "Request[Any]":
-        request.iip.pluginType = "python"
-        request.iip.outTraits.SetInParent()
-        request.iip.errTraits.SetInParent()
-        frames.append(Frame(tag, 29, request.SerializeToString()))
+        # Partial: no field is required, so nobody need look for one that is missing.
+        frames.append(Frame(tag, 29, _CORE + request.SerializePartialToString()))
+        identifier = self._identity, self._dispatch.next_number()
         enqueue = IIPEnqueueMessage(iipHandle=len(frames), dequeueMode=WhenToDequeue[mode])
-        enqueue.iipid.hi, enqueue.iipid.lo = identifier = (self._identity, self._dispatch.next_number())
-        frames.append(Frame("krutil:IIPEnqueueMessage", 27, enqueue.SerializeToString()))
+        enqueue.iipid.hi, enqueue.iipid.lo = identifier
+        frames.append(Frame("krutil:IIPEnqueueMessage", 27, enqueue.SerializePartialToString()))
         made: "Request[Any]" = self._dispatch.begin(
             lambda: Request(self, identifier, make_result), frames)
         return made

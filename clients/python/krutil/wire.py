@@ -59,7 +59,7 @@ class Limits:
         return ("arrayMessage", self.array_message) if tag == ARRAY_TAG else ("taggedFrame", self.tagged_frame)
 
 
-@dataclass
+@dataclass(slots=True)
 class Frame:
     """One frame. `tag` is None for a data frame."""
 
@@ -80,7 +80,7 @@ class Message:
 
     def take_root(self, kind: Any, frame_type: int = 29) -> Any:
         """The object of the root. Each frame can be taken once."""
-        return self.take(len(self._frames), {self.root: kind}, frame_type)[1]
+        return self._parsed(len(self._frames), self._take(len(self._frames)), self.root, kind, frame_type)
 
     def take(self, index: int, kinds: dict[str, Any], frame_type: int = 29) -> tuple[str, Any]:
         """Tag and object of the tagged frame at the index, which comes from the peer. `kinds` are the messages that it
@@ -91,9 +91,7 @@ class Message:
         if frame.tag not in kinds:
             raise self.unreadable(f'frame {index}: expected an object that "{self.root}" can refer to, '
                                    f'got one with tag "{frame.tag}"')
-        if frame.type != frame_type:
-            raise self.unreadable(f'frame {index}: expected the frame type of "{frame.tag}", got {frame.type}')
-        return frame.tag, self.parse(kinds[frame.tag], frame.content, frame.tag)
+        return frame.tag, self._parsed(index, frame, frame.tag, kinds[frame.tag], frame_type)
 
     def take_data(self, index: int) -> Buffer:
         """The bytes of the data frame at the index, where they were received."""
@@ -111,11 +109,13 @@ class Message:
         self._frames[index - 1] = None
         return frame
 
-    def parse(self, kind: Any, content: Buffer, tag: str) -> Any:
-        """Bytes as a message of Protocol Buffers. Bytes that are cut are refused: no engine sends them."""
+    def _parsed(self, index: int, frame: Frame, tag: str, kind: Any, frame_type: int) -> Any:
+        """The content as a message of Protocol Buffers. Bytes that are cut are refused: no engine sends them."""
+        if frame.type != frame_type:
+            raise self.unreadable(f'frame {index}: expected the frame type of "{tag}", got {frame.type}')
         made = kind()
         try:
-            made.MergeFromString(content)
+            made.MergeFromString(frame.content)
         except Exception as error:  # DecodeError, and others in some versions
             raise self.unreadable(f'the content of "{tag}" does not parse ({error})') from None
         return made
@@ -208,6 +208,28 @@ class Reader:
             done += self._receive(target[done:], done, size, what, *numbers)
         return target
 
+    def usual_message(self, limits: Limits) -> Optional[Message]:
+        """The next message, if nothing about it is special: one tagged frame that is small, has arrived whole, and keeps
+        to all rules. Otherwise None, and nothing is taken; `read_message()` reads any message, and knows what is wrong
+        with it. Waits until something has arrived."""
+        if self._begin == self._end:
+            self._begin = 0
+            self._end = self._receive(self._view, 0, HEADER.size, "the header of frame %d", 1)
+        tag_begin = self._begin + HEADER.size
+        if tag_begin > self._end:
+            return None
+        kind, frame_type, tag_size, stream, index, size = HEADER.unpack_from(self._buffer, self._begin)
+        content_begin = tag_begin + tag_size
+        end = content_begin + size
+        if kind != TAGGED | LAST or index != 1 or end > self._end or not 0 < tag_size <= limits.tag \
+                or size > limits.tagged_frame or tag_size + size > limits.message or limits.frames < 1:
+            return None
+        tag = str(self._buffer[tag_begin:content_begin], "utf-8", "replace")
+        if tag == ARRAY_TAG:
+            return None  # It has a limit of its own.
+        self._begin = end
+        return Message(stream, [Frame(tag, frame_type, self._buffer[content_begin:end])])
+
     def buffered(self) -> bytes:
         """What has come behind all that was read."""
         return bytes(self._view[self._begin:self._end])
@@ -239,6 +261,9 @@ def read_message(reader: Reader, limits: Limits, borrower: "Optional[Borrower]" 
     while True:
         number = len(frames) + 1
         try:
+            message = None if frames else reader.usual_message(limits)
+            if message is not None:
+                return message
             header = reader.read(HEADER.size, "the header of frame %d", number)
         except EndOfStream as end:
             if end.done == 0 and not frames:
@@ -246,12 +271,14 @@ def read_message(reader: Reader, limits: Limits, borrower: "Optional[Borrower]" 
             raise
         kind, frame_type, tag_size, its_stream, index, size = HEADER.unpack(header)
         last, kind = kind & LAST, kind & ~LAST
-        if kind == RETURN and on_return:
-            _check_return(frame_type, (last, tag_size, its_stream, size), number)
-            on_return(index)
-            continue
-        if kind not in (TAGGED, DATA) and not (kind == SHARED_DATA and borrower):
-            _read_end(reader, kind, (last, frame_type, tag_size, its_stream, index), size, number, borrower is not None)
+        if kind != TAGGED and kind != DATA:
+            if kind == RETURN and on_return:
+                _check_return(frame_type, (last, tag_size, its_stream, size), number)
+                on_return(index)
+                continue
+            if kind != SHARED_DATA or not borrower:
+                _read_end(reader, kind, (last, frame_type, tag_size, its_stream, index), size, number,
+                          borrower is not None)
         if index != number:
             raise Violation(f"frame index: expected {number}, got {index}")
         if frames and its_stream != stream:
@@ -344,18 +371,19 @@ class HeaderWithDescriptor:
 Piece = Union[Buffer, HeaderWithDescriptor]
 
 
-def message_bytes(stream: int, frames: Sequence[Frame], peer: Limits, lender: "Optional[Lender]" = None) -> list[Piece]:
-    """The pieces of a message, to be sent in this order. What the peer does not accept is a `ValueError`. Contents that
-    have a place are lent, if there is a lender."""
+def message_bytes(stream: int, frames: Sequence[Frame], peer: Limits,
+                  lender: "Optional[Lender]" = None) -> tuple[list[Piece], int]:
+    """The pieces of a message, to be sent in this order, and how many bytes they have, lent ones included. What the peer
+    does not accept is a `ValueError`. Contents that have a place are lent, if there is a lender."""
     if len(frames) > peer.frames:
         raise ValueError(f'the request has {len(frames)} frames; the engine accepts {peer.frames} (its limit "frames")')
     buffers: list[Piece] = []
     lent: list[tuple[int, Frame]] = []
     total = 0
     for index, frame in enumerate(frames, 1):
-        tag = (frame.tag or "").encode()
-        size = len(frame.content)
+        tag, size = b"", len(frame.content)
         if frame.tag is not None:
+            tag = frame.tag.encode()
             name, limit = peer.of_content(frame.tag)
             if size > limit:
                 raise ValueError(f'a part of the request ("{frame.tag}") has {size} bytes; the engine accepts {limit} '
@@ -376,7 +404,7 @@ def message_bytes(stream: int, frames: Sequence[Frame], peer: Limits, lender: "O
         content = lender.lend(frame.place)
         header = HEADER.pack(SHARED_DATA, frame.type, 0, stream, at // 2 + 1, len(content))
         buffers[at:at + 2] = HeaderWithDescriptor(header, frame.place.memory.descriptor), content
-    return buffers
+    return buffers, total + len(frames) * HEADER.size
 
 
 def return_bytes(number: int, still_mapped: bool) -> bytes:

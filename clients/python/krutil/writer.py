@@ -4,6 +4,7 @@ import array
 import queue
 import socket
 import threading
+from collections import deque
 from typing import Callable, Optional, Sequence
 
 from .wire import HeaderWithDescriptor, Piece
@@ -11,21 +12,41 @@ from .wire import HeaderWithDescriptor, Piece
 # As many buffers as one system call takes.
 _MOST_BUFFERS = 1024
 
+# A Unix socket takes so many bytes whole or not at all, however small its buffer is.
+_WHOLE = 2_048
+
 
 class Writer:
-    """A thread that writes to a socket. An exception such as KeyboardInterrupt cannot hit it in the middle of a
-    message, and the thread that reads may use it without ever waiting for the peer."""
+    """Writes to a socket. A small message is written by whoever sends it, when nothing waits before it; a thread writes
+    all else. So an exception such as KeyboardInterrupt cannot hit the middle of a message, and nobody who sends waits
+    for the peer."""
 
     def __init__(self, connection: socket.socket, on_failure: Callable[[], object]) -> None:
         self._socket = connection
         self._on_failure = on_failure
         self._queue: "queue.SimpleQueue[Optional[Sequence[Piece]]]" = queue.SimpleQueue()
+        self._writes_whole = connection.family == socket.AF_UNIX
+        # One entry for each that the thread was given and has not written yet. Any thread may add one at any time.
+        self._unwritten: "deque[None]" = deque()
         self._thread = threading.Thread(target=self._run, name="krutil-writer", daemon=True)
         self._thread.start()
 
-    def send(self, buffers: Sequence[Piece]) -> None:
-        """Takes the buffers, which must stay as they are until they are sent."""
-        self._queue.put(buffers)
+    def send(self, buffers: Sequence[Piece], size: int) -> None:
+        """Takes the buffers of a message, of so many bytes, which must stay as they are until they are sent. For one
+        caller at a time."""
+        if size <= _WHOLE and self._writes_whole and not self._unwritten:
+            try:
+                # Nothing so small comes with a descriptor.
+                self._socket.sendmsg(buffers, [], socket.MSG_NOSIGNAL | socket.MSG_DONTWAIT)  # type: ignore[arg-type]
+                return
+            except OSError:
+                pass  # The thread waits for room, and knows what to do when the stream has ended.
+        self._hand_over(buffers)
+
+    def send_return(self, frame: bytes) -> None:
+        """Takes a frame that may be sent between any two messages. Any thread may call it at any time: an array may end
+        in the middle of `send()`."""
+        self._hand_over([frame])
 
     def finish(self, last: Sequence[Piece], timeout: float) -> None:
         """Sends these buffers behind the message that is being written, and nothing else. Waits `timeout` seconds
@@ -35,9 +56,13 @@ class Writer:
                 self._queue.get_nowait()
             except queue.Empty:
                 break
-        self._queue.put(last)
+        self._hand_over(last)
         self._queue.put(None)
         self._thread.join(timeout)
+
+    def _hand_over(self, buffers: Sequence[Piece]) -> None:
+        self._unwritten.append(None)
+        self._queue.put(buffers)
 
     def _run(self) -> None:
         while True:
@@ -51,6 +76,7 @@ class Writer:
                 return
             # What was sent is not kept until there is more to send.
             del buffers
+            self._unwritten.pop()
 
     def _write(self, pieces: Sequence[Piece]) -> None:
         waiting: list[memoryview] = []

@@ -111,9 +111,9 @@ class ScriptedEngine:
         return wire.read_message(self._reader, krutil.Limits())
 
     def read_abort(self):
-        """Reads up to the client's abort, and returns its text."""
+        """Reads up to the client's abort, and returns its text. The client may return before what it was lent."""
         try:
-            while self.read_message() is not None:
+            while wire.read_message(self._reader, krutil.Limits(), on_return=lambda number: None) is not None:
                 pass
         except wire.PeerAborted as abort:
             return str(abort)
