@@ -4,6 +4,7 @@ import dataclasses
 import json
 import os
 import subprocess
+import sys
 
 import processes
 
@@ -74,6 +75,34 @@ def beside_jupyter(run):
     return [{"label": "", "size": None, "times": [{"name": name, "seconds": all} for name, all in times.items()]}]
 
 
+def python_client(contests, fewer=1):
+    """Asks the client for Python. `contests` are triples: a question to the C++ client, what is put before its labels, and
+    what the client for Python does for them. They have their turns one after the other. The C++ client answers all of its
+    question each time, so a long one is asked by so many times `fewer`."""
+    def measure(run):
+        import python_client as client
+        sys.path.insert(0, run.program("python"))
+        run = dataclasses.replace(run, repetitions=max(3, run.repetitions // fewer))
+        return [row for question, label, make in contests for row in _beside_cpp(run, client, question, label, make)]
+    return measure
+
+
+def _beside_cpp(run, client, question, label, make):
+    times = {}
+    with getattr(client, make)(run) as works:
+        for work in works.values():
+            client.seconds_of(work, run.batch)
+        for _ in range(run.repetitions):
+            for row in engine(question)(dataclasses.replace(run, repetitions=1, largest=1 << 26)):
+                if row["label"] in works:
+                    baseline, ours = times.setdefault(row["label"], ([], []))
+                    baseline += [each["seconds"][0] for each in row["times"] if each["name"] == "krutil"]
+                    ours.append(client.seconds_of(works[row["label"]], run.batch))
+    return [{"label": label + case, "size": None,
+             "times": [{"name": "C++", "seconds": baseline}, {"name": "krutil", "seconds": ours}]}
+            for case, (baseline, ours) in times.items()]
+
+
 def codec(prefix):
     """Asks the program that measures what one thread does. The prefix of its comparisons is the question."""
     def measure(run):
@@ -85,6 +114,7 @@ def codec(prefix):
 
 RAW = "a raw framed round trip of the same bytes, from process to process"
 RAW_ARRAY = "the same bytes sent raw, from process to process, each of which uses one buffer all the time"
+CPP_CLIENT = "the C++ client, which does the same with another engine"
 BARE_CODE = "bare Protocol Buffers code for the same object"
 ICU = "one call of ICU, with room for the longest result"
 REUSED = "The array is the same each time; what the engine and the client do with memory is up to them."
@@ -105,6 +135,11 @@ QUESTIONS = [
     Question("burst", "1,000 requests (`pass`) sent at once, each of them", RAW, engine("burst")),
     Question("lines", "10,000 lines printed in one request, each of them", "one write of 16 bytes to a socket",
              engine("lines")),
+    Question("python-evaluation", "Evaluation of `1+1` by the client for Python", CPP_CLIENT,
+             python_client([("evaluation", "", "evaluations")])),
+    Question("python-arrays", "Calls with 64 MiB by the client for Python", CPP_CLIENT,
+             python_client([("arrays", "over the socket, ", "arrays"),
+                            ("shared-arrays", "in shared memory, ", "shared_arrays")], fewer=3), conditions=REUSED),
     Question("lines-shown", "200,000 lines printed and shown by `krutil`, the whole process",
              "`python3 -u` that prints them", processes.lines_shown, conditions=FILES),
     Question("start", "`krutil eval 1+1` with an engine of its own, the whole process", "`python3 -c 1+1`",
