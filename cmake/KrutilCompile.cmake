@@ -14,6 +14,15 @@ endif()
 
 find_package(Threads REQUIRED)
 
+# krutil_export_by(TARGET FILE): what a shared library exports is what FILE, a version script, says.
+#
+# A library that has been loaded stays. Its message classes are known to Protocol Buffers for as long as the process lives,
+# so it cannot be unloaded: loaded again, it would register them a second time, which aborts.
+function(krutil_export_by target file)
+    target_link_options(${target} PRIVATE "LINKER:--version-script=${file}" LINKER:-z,nodelete)
+    set_property(TARGET ${target} APPEND PROPERTY LINK_DEPENDS "${file}")
+endfunction()
+
 add_library(krutil_generated_options INTERFACE)
 if(KRUTIL_SANITIZE)
     target_compile_options(krutil_generated_options INTERFACE
