@@ -61,6 +61,15 @@ class Consumers(unittest.TestCase):
                 with open(os.path.join(build, "CMakeCache.txt"), encoding="utf-8") as cache:
                     self.assertIn("CMAKE_BUILD_TYPE:STRING=\n", cache.read(), "the build type is the host's to choose")
 
+    def test_a_schema_that_imports_the_workspace_messages_exchanges_what_the_document_shows(self):
+        build, _ = self.configure(os.path.join(PROJECTS, "workspace"), "workspace", f"-DCMAKE_PREFIX_PATH={PREFIX}",
+                                  f"-DCMAKE_CXX_COMPILER={COMPILERS[0]}", f"-DCMAKE_CXX_FLAGS={LINK_FLAGS}")
+        run("cmake", "--build", build)
+        with open(os.path.join(CHECKOUT, "docs/protocol.md"), encoding="utf-8") as document:
+            section = document.read().split("\n## Messages without a serializer\n")[1]
+        [shown] = re.findall(r"^```\n(.*?)^```\n", section, re.MULTILINE | re.DOTALL)
+        self.assertEqual(run(os.path.join(build, "workspace")), shown)
+
     def test_plug_ins_are_unloaded_and_loaded_again(self):
         # Loading the messages twice ends the process: "File already exists in database".
         said = {name: f'{name}: 8 bytes, known, text: "hello"\n' for name in ("libreader.so", "libwriter.so")}
