@@ -1,5 +1,5 @@
-"""Builds other projects against the installed tree, in each way and with each compiler that users have. None of them sets
-a language level for CMake: that comes with the targets."""
+"""Builds other projects against the installed tree, in each way that users have, and with both compilers where these could
+differ. None of the projects sets a language level for CMake: that comes with the targets."""
 
 import os
 import re
@@ -44,22 +44,17 @@ class Consumers(unittest.TestCase):
         options = pkg_config("--cflags", "--libs", "krutil_protobuf")
         self.assertIn("-DKRUTIL_PROTOBUF_EXPORT=", options)
         self.assertNotIn("-licuuc", options)
-        for compiler in COMPILERS:
-            with self.subTest(compiler):
-                program = os.path.join(self.scratch, f"host-{os.path.basename(compiler)}")
-                run(compiler, "-std=c++20", *LINK_FLAGS.split(), os.path.join(HOST, "host.cpp"), "-o", program, *options,
-                    f"-Wl,-rpath,{library_directory()}")
-                self.works(program)
+        program = os.path.join(self.scratch, "host-pkg-config")
+        run(COMPILERS[-1], "-std=c++20", *LINK_FLAGS.split(), os.path.join(HOST, "host.cpp"), "-o", program, *options,
+            f"-Wl,-rpath,{library_directory()}")
+        self.works(program)
 
     def test_a_project_compiles_with_the_sources_below_its_own(self):
         # The library itself is built that way, as a whole, by the tests of the foreign platform.
-        for compiler in COMPILERS:
-            with self.subTest(compiler):
-                build, _ = self.configure(HOST, f"sources-{os.path.basename(compiler)}", f"-DKRUTIL_CHECKOUT={CHECKOUT}",
-                                          f"-DCMAKE_CXX_COMPILER={compiler}")
-                run("cmake", "--build", build, "--target", "CMakeFiles/host.dir/host.cpp.o")
-                with open(os.path.join(build, "CMakeCache.txt"), encoding="utf-8") as cache:
-                    self.assertIn("CMAKE_BUILD_TYPE:STRING=\n", cache.read(), "the build type is the host's to choose")
+        build, _ = self.configure(HOST, "sources", f"-DKRUTIL_CHECKOUT={CHECKOUT}", f"-DCMAKE_CXX_COMPILER={COMPILERS[-1]}")
+        run("cmake", "--build", build, "--target", "CMakeFiles/host.dir/host.cpp.o")
+        with open(os.path.join(build, "CMakeCache.txt"), encoding="utf-8") as cache:
+            self.assertIn("CMAKE_BUILD_TYPE:STRING=\n", cache.read(), "the build type is the host's to choose")
 
     def test_a_schema_that_imports_the_workspace_messages_exchanges_what_the_document_shows(self):
         build, _ = self.configure(os.path.join(PROJECTS, "workspace"), "workspace", f"-DCMAKE_PREFIX_PATH={PREFIX}",
