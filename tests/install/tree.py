@@ -14,6 +14,8 @@ CHECKOUT = os.environ["KRUTIL_CHECKOUT"]
 LINK_FLAGS = os.environ["KRUTIL_LINK_FLAGS"]
 # A sanitizer's libraries are loaded by programs of the same compiler only.
 COMPILERS = [os.environ["KRUTIL_COMPILER"]] if LINK_FLAGS else ["g++", "clang++"]
+# Whether this build is one as whose symbols and ABI have been recorded.
+COMPARE_WITH_RECORDED = os.environ["KRUTIL_COMPARE_WITH_RECORDED"] == "1"
 PROJECTS = os.path.join(os.path.dirname(os.path.abspath(__file__)), "projects")
 LIBRARIES = ("libkrutil_protobuf.so", "libkrutil_platform.so")
 
