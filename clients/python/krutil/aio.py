@@ -123,6 +123,12 @@ class Session:
         """
         return await self._wait(self.submit(code), on_text, timeout)
 
+    async def run(self, path: "str | os.PathLike[str]", *arguments: str, on_text: Optional[OnText] = None,
+                  timeout: Optional[float] = None) -> Result:
+        """Runs a file, as `krutil.Session.run()` does."""
+        request = await asyncio.to_thread(self._session._submit_file, path, arguments)
+        return await self._wait(Request(request), on_text, timeout)
+
     async def call(self, function: str, *arguments: Any, outputs: int = 1, on_text: Optional[OnText] = None,
                    timeout: Optional[float] = None) -> Any:
         """Calls a function with arrays, numbers and texts, as `krutil.Session.call()` does.

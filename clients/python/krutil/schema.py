@@ -53,6 +53,7 @@ DebugLoopEvent = _message("krutil.protobuf.DebugLoopEvent")
 IssuedEnabledWarningEvent = _message("krutil.protobuf.IssuedEnabledWarningEvent")
 PrintableErrorEvent = _message("krutil.protobuf.PrintableErrorEvent")
 
+CodeType = _numbers("krutil.protobuf.CodeType")
 WhenToDequeue = _numbers("krutil.protobuf.WhenToDequeue")
 InputRequester = _numbers("krutil.protobuf.InputRequester")
 ExecutionStatus = _numbers("krutil.protobuf.ExecutionStatus")

@@ -8,6 +8,7 @@ import socket
 import subprocess
 import threading
 import time
+import tokenize
 from concurrent.futures import Future
 from types import TracebackType
 from typing import Any, Callable, Optional, Sequence, TypeVar, Union
@@ -19,7 +20,7 @@ from .errors import Refused
 from .handshake import DEBUGGING, INTERACTIVE_COMMAND_LINE, WEB_WINDOW, shake_hands
 from .prompts import OnDebug, OnInput
 from .requests import CancelAnswer, OnText, Request, Result, Text
-from .schema import EvalIIP, FEvalIIP, IIPCancelMessage, IIPEnqueueMessage, WhenToDequeue
+from .schema import CodeType, EvalIIP, FEvalIIP, IIPCancelMessage, IIPEnqueueMessage, WhenToDequeue
 from .wire import Frame, Limits, Reader
 
 T = TypeVar("T")
@@ -72,6 +73,23 @@ class Session:
         Result(output='hello\\n', value='42', warnings=())
         """
         return self._wait(self.submit(code), on_text, timeout)
+
+    def run(self, path: "str | os.PathLike[str]", *arguments: str, on_text: Optional[OnText] = None,
+            timeout: Optional[float] = None) -> Result:
+        """Runs a file of this machine as `python3 PATH ARGUMENT...` does, among the names of the session.
+
+        Tracebacks name the file, modules beside it are found, and `sys.argv` has the arguments. The file is read here,
+        so an engine elsewhere need not have it. No value of an expression is shown. `on_text` and `timeout` are those
+        of `eval()`. Raises `OSError` when the file cannot be read, and `SyntaxError` when it is not in the encoding
+        that it states.
+
+        >>> import tempfile
+        >>> with tempfile.NamedTemporaryFile("w", suffix=".py") as file, krutil.start() as session:
+        ...     print("import sys; print('hello', *sys.argv[1:])", file=file, flush=True)
+        ...     session.run(file.name, "world").output
+        'hello world\\n'
+        """
+        return self._wait(self._submit_file(path, arguments), on_text, timeout)
 
     def call(self, function: str, *arguments: Any, outputs: int = 1, on_text: Optional[OnText] = None,
              timeout: Optional[float] = None) -> Any:
@@ -160,6 +178,14 @@ class Session:
     def _submit_eval(self, code: str, mode: str) -> "Request[Result]":
         return self._enqueue([], "krutil:EvalIIP", EvalIIP(cmd=code), mode, _eval_result)
 
+    def _submit_file(self, path: "str | os.PathLike[str]", arguments: Sequence[str]) -> "Request[Result]":
+        with tokenize.open(path) as file:
+            code = file.read()
+        # A request of its own: the file may begin with what must be the first statement.
+        self.submit(f"__import__('sys').argv = {[os.fspath(path), *arguments]!r}")
+        request = EvalIIP(cmd=code, codeType=CodeType["ScriptType"])
+        return self._enqueue([], "krutil:EvalIIP", request, "DEQUEUE_AT_IDLE", _eval_result, os.path.abspath(path))
+
     def _submit_call(self, function: str, arguments: Sequence[Any], outputs: int, mode: str) -> "Request[Any]":
         frames: list[Frame] = []
         indexes = [arrays.add_argument(frames, argument, self._zero_copy) for argument in arguments]
@@ -176,11 +202,11 @@ class Session:
         return answer
 
     def _enqueue(self, frames: list[Frame], tag: str, request: Any, mode: str,
-                 make_result: Callable[["Request[Any]", Any], Any]) -> "Request[Any]":
+                 make_result: Callable[["Request[Any]", Any], Any], name: str = "") -> "Request[Any]":
         # Partial: no field is required, so nobody need look for one that is missing.
         frames.append(Frame(tag, 29, _CORE + request.SerializePartialToString()))
         identifier = self._identity, self._dispatch.next_number()
-        enqueue = IIPEnqueueMessage(iipHandle=len(frames), dequeueMode=WhenToDequeue[mode])
+        enqueue = IIPEnqueueMessage(iipHandle=len(frames), dequeueMode=WhenToDequeue[mode], name=name)
         enqueue.iipid.hi, enqueue.iipid.lo = identifier
         frames.append(Frame("krutil:IIPEnqueueMessage", 27, enqueue.SerializePartialToString()))
         made: "Request[Any]" = self._dispatch.begin(

@@ -209,9 +209,9 @@ class Reader:
         return target
 
     def usual_message(self, limits: Limits) -> Optional[Message]:
-        """The next message, if nothing about it is special: one tagged frame that is small, has arrived whole, and keeps
-        to all rules. Otherwise None, and nothing is taken; `read_message()` reads any message, and knows what is wrong
-        with it. Waits until something has arrived."""
+        """The next message, if nothing about it is special: one tagged frame that is small, has arrived whole, and
+        keeps to all rules. Otherwise None, and nothing is taken; `read_message()` reads any message, and knows what is
+        wrong with it. Waits until something has arrived."""
         if self._begin == self._end:
             self._begin = 0
             self._end = self._receive(self._view, 0, HEADER.size, "the header of frame %d", 1)
@@ -373,8 +373,8 @@ Piece = Union[Buffer, HeaderWithDescriptor]
 
 def message_bytes(stream: int, frames: Sequence[Frame], peer: Limits,
                   lender: "Optional[Lender]" = None) -> tuple[list[Piece], int]:
-    """The pieces of a message, to be sent in this order, and how many bytes they have, lent ones included. What the peer
-    does not accept is a `ValueError`. Contents that have a place are lent, if there is a lender."""
+    """The pieces of a message, to be sent in this order, and how many bytes they have, lent ones included. What the
+    peer does not accept is a `ValueError`. Contents that have a place are lent, if there is a lender."""
     if len(frames) > peer.frames:
         raise ValueError(f'the request has {len(frames)} frames; the engine accepts {peer.frames} (its limit "frames")')
     buffers: list[Piece] = []

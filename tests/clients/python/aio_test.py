@@ -1,6 +1,7 @@
 """The client for asyncio, with the real engine."""
 
 import asyncio
+import tempfile
 import threading
 import unittest
 
@@ -60,6 +61,13 @@ class AioTest(unittest.IsolatedAsyncioTestCase):
                 await request
             self.assertTrue(request.done())
             self.assertEqual([str(event) async for event in request.events()], seen)
+
+    async def test_a_file_is_run(self):
+        with tempfile.NamedTemporaryFile("w", suffix=".py") as file:
+            print("import sys\nprint(__file__, sys.argv[1:])", file=file, flush=True)
+            async with krutil.aio.start() as session:
+                result = await session.run(file.name, "first", timeout=PATIENCE)
+                self.assertEqual(result, krutil.Result(f"{file.name} ['first']\n", None, ()))
 
     async def test_cancelling_the_task_cancels_the_request(self):
         async with self.begin() as session:

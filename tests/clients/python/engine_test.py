@@ -189,6 +189,27 @@ class Behaviour:
                     "    return int('x') + 1\n"
                     "krutil.RemoteError: ValueError: invalid literal for int() with base 10: 'x'\n"), text)
 
+    def test_a_file_is_run_as_python_runs_it(self):
+        with tempfile.TemporaryDirectory() as directory:
+            path = os.path.join(directory, "script.py")
+            with open(os.path.join(directory, "sibling.py"), "w", encoding="utf-8") as file:
+                file.write("def half(text):\n    return int(text) / 2\n")
+            with open(path, "w", encoding="latin-1") as file:
+                file.write("# coding: latin-1\nfrom __future__ import annotations\nimport sys, sibling\n"
+                           "print('zwölf', __file__, sys.argv)\nsibling.half(sys.argv[1])\n")
+            with self.begin() as session:
+                words = [path, "7", "it's"]
+                result = session.run(*words, timeout=PATIENCE)
+                self.assertEqual(result, krutil.Result(f"zwölf {path} {words}\n", None, ()))
+                with self.assertRaises(krutil.RemoteError) as caught:
+                    session.run(path, "seven", timeout=PATIENCE)
+                self.assertEqual(caught.exception.identifier, "ValueError")
+                self.assertEqual(caught.exception.frames, (
+                    (path, "<module>", 5), (os.path.join(directory, "sibling.py"), "half", 2)))
+                with self.assertRaises(FileNotFoundError):
+                    session.run(os.path.join(directory, "missing.py"))
+                self.assertEqual(session.eval("1 + 1", timeout=PATIENCE).value, "2")
+
     def test_code_that_does_not_compile(self):
         with self.begin() as session:
             with self.assertRaises(krutil.RemoteError) as caught:
