@@ -214,13 +214,11 @@ bool Conversation::waitForSomething(std::optional<Clock::time_point> deadline, i
         }
         return false;
     }
-    if (watched[0].revents != 0 || watched[2].revents != 0) {
-        stopPastime();
-    }
     if (watched[1].revents != 0) {
         interrupt_.dispatch([this] { stopPastime(); });
     }
     if (watched[2].revents != 0) {
+        stopPastime();
         watched_ = -1;
         const auto action = std::move(watchAction_);
         action();

@@ -89,8 +89,8 @@ class Conversation : private foundation::msg_svc::transport::layers::session::Se
     void watch(int descriptor, std::function<void()> action);
 
     /// What to do while a run function waits: `start` is called whenever it begins to wait, `tick` every `interval`
-    /// that passes without a delivery, `stop` before whatever comes is delivered or dispatched. Each may be empty for
-    /// nothing to do.
+    /// that passes without a delivery, `stop` before whatever comes is delivered or dispatched, unless it is of a quiet
+    /// exchange. Each may be empty for nothing to do.
     struct Pastime {
         std::chrono::milliseconds interval{};
         std::function<void()> tick{};

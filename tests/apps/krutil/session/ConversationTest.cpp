@@ -158,6 +158,24 @@ TEST_F(ConversationTest, RepliesGoToWhoeverAsked) {
     EXPECT_EQ(answered, (std::vector<exchange::IDType>{exchange::IDType(1, 1), exchange::IDType(2, 2)}));
 }
 
+TEST_F(ConversationTest, APastimeGoesOnWhileAQuietExchangeIsAnswered) {
+    begin([](TestEngine& peer, auto stream, const auto& id) {
+        peer.text(stream, u"text");
+        peer.reply(stream, id);
+    });
+    int stops = 0;
+    conversation->setPastime({{}, nullptr, [&stops] { ++stops; }, nullptr});
+    bool answered = false;
+    conversation->sendQuietly(enqueue(exchange::IDType(1, 1)), [&answered](const auto&) { answered = true; });
+    conversation->run([&answered] { return answered; });
+    EXPECT_EQ(stops, 0);
+    EXPECT_TRUE(texts.empty());
+    conversation->ask(enqueue(exchange::IDType(2, 2)));
+    EXPECT_EQ(stops, 2) << "one for each delivery";
+    EXPECT_EQ(texts, (std::vector<std::u16string>{u"text"}));
+    conversation->setPastime({});
+}
+
 TEST_F(ConversationTest, FinishingEndsWithTheShutdownEvent) {
     begin([](TestEngine& peer, auto stream, const auto& id) { peer.reply(stream, id); });
     conversation->ask(enqueue(exchange::IDType(1, 1)));
