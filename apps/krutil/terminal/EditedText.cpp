@@ -77,4 +77,21 @@ void EditedText::eraseBack() {
     replace(at - (blanks ? (column - 1) % indentation + 1 : 1), at, {});
 }
 
+void EditedText::eraseToLineBegin() {
+    if (cursor() > 0) {
+        eraseAlong(cursor() == lineBegin() ? L"\x02" : L"\x01");
+    }
+}
+
+void EditedText::eraseToLineEnd() {
+    if (cursor() < text().size()) {
+        eraseAlong(cursor() == lineEnd() ? L"\x06" : L"\x05");
+    }
+}
+
+// From here to where the key `move` leads.
+void EditedText::eraseAlong(const wchar_t* move) {
+    ::el_wpush(editor_, (std::wstring(markKey) + move + eraseToMarkKey).c_str());
+}
+
 }  // namespace krutil_client

@@ -30,6 +30,10 @@ class EditedText {
     /// Inserts at the cursor.
     bool insert(const std::wstring& text) { return replace(cursor(), cursor(), text); }
 
+    /// To the beginning and the end of the cursor's line.
+    void moveToLineBegin() { moveTo(lineBegin()); }
+    void moveToLineEnd() { moveTo(lineEnd()); }
+
     /// Moves to the line above or below, to the same column if that line has it. False when there is none.
     bool moveUp();
     bool moveDown();
@@ -47,7 +51,18 @@ class EditedText {
     /// Erases the character before the cursor; in the indentation, the blanks back to the last step of that.
     void eraseBack();
 
+    /// Erases from the cursor to the beginning or the end of its line; what was erased can be brought back with Ctrl-Y.
+    /// When nothing is there, the newline goes, and with it the line above or below begins or ends here. The library
+    /// does it after the function that a key is bound to, by keys that must be bound to these functions of the library:
+    /// em-set-mark and em-kill-region.
+    void eraseToLineBegin();
+    void eraseToLineEnd();
+    static constexpr const wchar_t* markKey = L"\x1b[9001~";
+    static constexpr const wchar_t* eraseToMarkKey = L"\x1b[9002~";
+
   private:
+    void eraseAlong(const wchar_t* move);
+
     EditLine* editor_;
 };
 

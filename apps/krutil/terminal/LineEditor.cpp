@@ -9,9 +9,12 @@
 #include <cstdio>
 #include <cwchar>
 #include <exception>
+#include <functional>
 #include <optional>
 #include <stdexcept>
 #include <string_view>
+#include <type_traits>
+#include <utility>
 #include <vector>
 
 #include "krutil/base/Text.hpp"
@@ -113,6 +116,10 @@ class LineEditor::Impl {
                 // The terminal has shown it by itself.
                 display_.doubt();
             }
+            if (what == For::Code && !unfinished_.empty()) {
+                // As it would be pasted: newlines in it are no Enter.
+                ::el_wpush(editor_, (pasteBegins + std::exchange(unfinished_, {}) + std::wstring(pasteEnds)).c_str());
+            }
             typed = ::el_wgets(editor_, &count);
         }
         if (typed != nullptr) {
@@ -127,6 +134,9 @@ class LineEditor::Impl {
         }
         leave();
         if (error_) {
+            if (what == For::Code && !isLineDropped(error_)) {
+                unfinished_ = text_;
+            }
             std::rethrow_exception(error_);
         }
         if (typed == nullptr) {
@@ -160,13 +170,20 @@ class LineEditor::Impl {
         return *static_cast<Impl*>(self);
     }
 
-    // Exceptions must not pass through the library, so they are kept for read().
-    template <unsigned char (Impl::*action)()>
+    // A function of this class, or one of EditedText that always succeeds. Exceptions must not pass through the
+    // library, so they are kept for read().
+    template <auto action>
     void bind(const wchar_t* name, const std::vector<const wchar_t*>& keys) {
         unsigned char (*const function)(EditLine*, wint_t) = [](EditLine* editor, wint_t) -> unsigned char {
             Impl& self = of(editor);
             try {
-                return (self.*action)();
+                if constexpr (std::is_invocable_v<decltype(action), EditedText&>) {
+                    EditedText edited(editor);
+                    std::invoke(action, edited);
+                    return CC_REFRESH;
+                } else {
+                    return std::invoke(action, self);
+                }
             } catch (...) {
                 self.error_ = std::current_exception();
                 self.takeText();
@@ -190,9 +207,14 @@ class LineEditor::Impl {
         bind<&Impl::tab>(L"tab", {L"\t"});
         bind<&Impl::up>(L"up", {L"\x1b[A", L"\x1bOA"});
         bind<&Impl::down>(L"down", {L"\x1b[B", L"\x1bOB"});
-        bind<&Impl::toLineBegin>(L"line-begin", {L"^A", L"\x1b[H", L"\x1bOH", L"\x1b[1~"});
-        bind<&Impl::toLineEnd>(L"line-end", {L"^E", L"\x1b[F", L"\x1bOF", L"\x1b[4~"});
-        bind<&Impl::eraseBack>(L"erase-back", {L"^?", L"^H"});
+        bind<&EditedText::moveToLineBegin>(L"line-begin", {L"^A", L"\x1b[H", L"\x1bOH", L"\x1b[1~"});
+        bind<&EditedText::moveToLineEnd>(L"line-end", {L"^E", L"\x1b[F", L"\x1bOF", L"\x1b[4~"});
+        bind<&EditedText::eraseBack>(L"erase-back", {L"^?", L"^H"});
+        bind<&EditedText::eraseToLineBegin>(L"erase-to-line-begin", {L"^U"});
+        bind<&EditedText::eraseToLineEnd>(L"erase-to-line-end", {L"^K"});
+        bindTo(L"em-set-mark", {EditedText::markKey});
+        bindTo(L"em-kill-region", {EditedText::eraseToMarkKey});
+        bindTo(L"ed-delete-prev-word", {L"^W"});
         bind<&Impl::search>(L"search", {L"^R"});
         bindTo(L"ed-prev-history", {olderKey});
         bindTo(L"ed-next-history", {newerKey});
@@ -314,23 +336,6 @@ class LineEditor::Impl {
         return CC_REFRESH;
     }
 
-    unsigned char toLineBegin() {
-        EditedText edited(editor_);
-        edited.moveTo(edited.lineBegin());
-        return CC_REFRESH;
-    }
-
-    unsigned char toLineEnd() {
-        EditedText edited(editor_);
-        edited.moveTo(edited.lineEnd());
-        return CC_REFRESH;
-    }
-
-    unsigned char eraseBack() {
-        EditedText(editor_).eraseBack();
-        return CC_REFRESH;
-    }
-
     unsigned char tab() {
         EditedText edited(editor_);
         const bool asks = what_ == For::Code && *complete_ && !edited.inIndentation();
@@ -444,19 +449,7 @@ class LineEditor::Impl {
     void leave() {
         draw(text_.size(), std::wstring::npos);
         lastLine_.take();
-        show(std::string(markNoPastes) + (wasDropped() ? "^C\n" : "\n"));
-    }
-
-    bool wasDropped() const {
-        try {
-            if (error_) {
-                std::rethrow_exception(error_);
-            }
-        } catch (const LineDropped&) {
-            return true;
-        } catch (...) {
-        }
-        return false;
+        show(std::string(markNoPastes) + (isLineDropped(error_) ? "^C\n" : "\n"));
     }
 
     Conversation* conversation_ = nullptr;
@@ -472,6 +465,7 @@ class LineEditor::Impl {
     LineDisplay display_;
     std::wstring prompt_;
     std::wstring text_;
+    std::wstring unfinished_;  ///< code whose session has ended while it was typed; the next one begins with it
     std::size_t cursor_ = 0;
     bool away_ = false;                    ///< taken away
     std::optional<std::wstring> lastTab_;  ///< what the last Tab has left

@@ -37,6 +37,7 @@ class LineEditor {
     LineEditor& operator=(const LineEditor&) = delete;
 
     /// As LineReader::read() does, while `conversation` goes on. Whatever leaves Conversation::run() ends the editing.
+    /// Code that is half typed when an exception leaves here, but LineDropped, is what the next code begins with.
     /// The key Tab asks `complete`, which may deliver, and inserts blanks when that is empty or returns nothing.
     ReadLine read(Conversation& conversation, const Complete& complete, For what, const std::string& prompt,
                   const std::function<bool()>& done);

@@ -8,6 +8,18 @@
 
 namespace krutil_client {
 
+bool isLineDropped(const std::exception_ptr& error) {
+    try {
+        if (error) {
+            std::rethrow_exception(error);
+        }
+    } catch (const LineDropped&) {
+        return true;
+    } catch (...) {
+    }
+    return false;
+}
+
 LineReader::LineReader(int fd, Conversation& conversation, Output& out)
     : fd_(fd), conversation_(conversation), out_(out), terminal_(::isatty(fd) == 1) {}
 

@@ -16,6 +16,9 @@ class LineDropped : public std::exception {
     const char* what() const noexcept override { return "the line was dropped"; }
 };
 
+/// Whether the exception, if there is one, is that.
+bool isLineDropped(const std::exception_ptr& error);
+
 /// What came of reading a line.
 struct ReadLine {
     enum class End {

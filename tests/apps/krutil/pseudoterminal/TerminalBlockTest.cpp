@@ -7,7 +7,17 @@
 namespace krutil_client {
 namespace {
 
-class TerminalBlockTest : public TerminalReplTest {};
+class TerminalBlockTest : public TerminalReplTest {
+  protected:
+    // With the cursor at the end of a block, which has fewer lines than this erases.
+    void leaveBlock() {
+        std::string keys;
+        for (int i = 0; i < 8; ++i) {
+            keys += std::string(eraseToBegin) + backspace;
+        }
+        leave(keys + "\x04");
+    }
+};
 
 TEST_F(TerminalBlockTest, PastedLinesAreOnePieceOfCode) {
     begin();
@@ -24,11 +34,11 @@ TEST_F(TerminalBlockTest, PastedLinesAreOnePieceOfCode) {
     // Into the last entry, through it, and to the one before.
     terminal->type(std::string(up) + up + up);
     terminal->expectBottom(block);
-    leave("\x15\x04");
+    leaveBlock();
     begin();
     terminal->type(up);
     terminal->expectBottom({">>> f() +\\", "...     1" + at});
-    leave("\x15\x04");
+    leaveBlock();
 }
 
 TEST_F(TerminalBlockTest, ABlockIsOneEntryAndEditedAsOne) {
@@ -62,7 +72,31 @@ TEST_F(TerminalBlockTest, ABlockIsOneEntryAndEditedAsOne) {
     terminal->expectBottom({">>> " + at + "def f(n):", "...     n = 10 * n", "...     return n + 1", "..."});
     terminal->type(std::string(up) + down);
     terminal->expectBottom({">>> def f(n):", "...     n = 10 * n", "...     return n + 1", "... " + at});
-    leave("\x15\x04");
+    leaveBlock();
+}
+
+TEST_F(TerminalBlockTest, WhatIsErasedIsOfOneLine) {
+    begin();
+    terminal->type(std::string(pasteBegin) + "a = 1\rbc = 23\rd = 4" + pasteEnd + up);
+    terminal->expectBottom({">>> a = 1", "... bc = " + at + "23", "... d = 4"});
+    terminal->type(eraseToEnd);
+    terminal->expectBottom({">>> a = 1", "... bc = " + at, "... d = 4"});
+    terminal->type(bringBack);
+    terminal->expectBottom({">>> a = 1", "... bc = 23" + at, "... d = 4"});
+    terminal->type(std::string(left) + eraseToBegin);
+    terminal->expectBottom({">>> a = 1", "... " + at + "3", "... d = 4"});
+    terminal->type(bringBack);
+    terminal->expectBottom({">>> a = 1", "... bc = 2" + at + "3", "... d = 4"});
+    // At the begin or the end of a line the newline goes.
+    terminal->type(std::string(lineEnd) + eraseToEnd);
+    terminal->expectBottom({">>> a = 1", "... bc = 23" + at + "d = 4"});
+    terminal->type(std::string(lineBegin) + eraseToBegin);
+    terminal->expectBottom({">>> a = 1" + at + "bc = 23d = 4"});
+    // Where there is nothing to erase, what was erased last is still there.
+    terminal->type(std::string(lineEnd) + eraseToEnd + lineBegin + eraseToBegin + lineEnd + bringBack + "e" +
+                   eraseWord);
+    terminal->expectBottom({">>> a = 1bc = 23d = 4", "... " + at});
+    leaveBlock();
 }
 
 TEST_F(TerminalBlockTest, LinesAreIndentedAsTheirBlock) {
@@ -133,7 +167,7 @@ TEST_F(TerminalBlockTest, CodeIsColouredWhereColoursAreWanted) {
     terminal->type(std::string(lineBegin) + "(0)");
     terminal->expect("\x1b[0;1;4m(\x1b[0;36m0\x1b[0;1;4m)\x1b[0;35mNone");
     terminal->expectBottom({">>> (0)" + at + "None if f(1) else 'a'"});
-    leave("\x15\x04");
+    leave("\x05\x15\x04");
     begin();
     terminal->type("None if f(1) else 'a'");
     terminal->expectBottom({">>> None if f(1) else 'a'" + at});

@@ -183,6 +183,29 @@ TEST_F(TerminalEditingTest, AnEngineThatGoesIsTalkedAboutAtOnce) {
     EXPECT_EQ(terminal->exitCode(), 3);
 }
 
+TEST_F(TerminalEditingTest, WhatIsHalfTypedIsOfferedToTheNextSession) {
+    beginWaiting("os.kill(os.getpid(), signal.SIGKILL)");
+    terminal->type("dropped");
+    terminal->expectBottom({">>> dropped" + at});
+    terminal->type("\x03");
+    terminal->expectBottom({">>> dropped^C", ">>> " + at});
+    terminal->type("for i in range(2):\r");
+    terminal->expectBottom({">>> for i in range(2):", "...     " + at});
+    terminal->type(std::string("print(i") + left);
+    terminal->expectBottom({">>> for i in range(2):", "...     print(" + at + "i"});
+    happening.happen();
+    terminal->expectBottom(
+        {"...     print(i", "krutil: the engine was killed by signal 9 (Killed) while it was idle", lost});
+    terminal->type("\r");
+    terminal->expectBottom({">>> for i in range(2):", "...     print(i" + at});
+    terminal->type(" + 41)\r\r");
+    terminal->expectBottom({"41", "42", ">>> " + at});
+    // Once, and nothing of what was dropped.
+    terminal->type("7\r");
+    terminal->expectBottom({">>> 7", "7", ">>> " + at});
+    leave();
+}
+
 TEST_F(TerminalEditingTest, AnEngineThatGoesAtAQuestionIsTalkedAboutAtOnce) {
     for (const std::string question : {"input('name? ')", "breakpoint()"}) {
         Happening last(directory / ("happening" + std::to_string(question.size())));

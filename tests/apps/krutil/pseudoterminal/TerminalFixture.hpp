@@ -33,6 +33,10 @@ inline constexpr const char* lineBegin = "\x01";
 inline constexpr const char* lineEnd = "\x05";
 inline constexpr const char* down = "\x1b[B";
 inline constexpr const char* searchKey = "\x12";
+inline constexpr const char* eraseToBegin = "\x15";
+inline constexpr const char* eraseToEnd = "\x0b";
+inline constexpr const char* eraseWord = "\x17";
+inline constexpr const char* bringBack = "\x19";
 inline constexpr const char* clearScreen = "\x0c";
 // Comes when the line that is typed from now on is the program's to show.
 inline constexpr const char* editing = "\x1b[?2004h";
