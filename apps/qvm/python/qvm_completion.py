@@ -6,8 +6,8 @@ from itertools import islice
 from keyword import kwlist as _keywords
 from types import ModuleType
 
-from qvm_look import (ABSENT, MAX_ENTRIES, attribute, attribute_names, entries, field_names, function_of, is_exactly,
-                      is_one_of, look_up, own_names)
+from qvm_look import (ABSENT, MAX_ENTRIES, attribute, attribute_names, column_names, entries, field_names, function_of,
+                      is_exactly, is_one_of, look_up, own_names)
 from qvm_reading import Reading
 
 _MAX_CANDIDATES = 1000
@@ -78,7 +78,7 @@ def _keys(thing):
         return [key for key in islice(thing, MAX_ENTRIES) if is_one_of(key, str, int)]
     if is_exactly(thing, "numpy", "ndarray"):
         return field_names(thing)
-    return []
+    return column_names(thing)
 
 
 def _written(keys, quote):

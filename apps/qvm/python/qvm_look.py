@@ -76,6 +76,7 @@ def attribute_names(thing):
         names.update(name for name, value in entries(own_names(thing)))
     if is_exactly(thing, "numpy", "recarray"):
         names.update(field_names(thing))
+    names.update(name for name in column_names(thing) if name.isidentifier())
     return names
 
 
@@ -114,6 +115,18 @@ def is_exactly(thing, module, name):
 def field_names(array):
     """Names of the fields of a NumPy array."""
     return [name for name in array.dtype.names or () if type(name) is str]
+
+
+def column_names(thing):
+    """Names of the columns of a data frame of pandas; none for anything else. Labels are only taken from where they are
+    when pandas and NumPy keep them, because an index and an array of the user's own have code of their own."""
+    if not is_exactly(thing, "pandas", "DataFrame"):
+        return []
+    index = thing.columns
+    labels = index.values if is_exactly(index, "pandas", "Index") else None
+    if not is_exactly(labels, "numpy", "ndarray"):
+        return []
+    return [name for name in labels[:MAX_ENTRIES].tolist() if type(name) is str]
 
 
 def _has(descriptor, method):

@@ -195,6 +195,35 @@ TEST_F(CompletionTest, ArraysAreAskedBecauseTheirCodeIsNumPys) {
     EXPECT_THAT(candidates("numpy.linalg.svd(a, full"), ElementsAre("full_matrices="));
 }
 
+TEST_F(CompletionTest, DataFramesAreAskedForTheirColumns) {
+    const test_support::TemporaryDirectory directory;
+    // What pandas offers of it, for machines that do not have it.
+    std::ofstream(directory.file("pandas.py")) << "import numpy\n"
+                                                  "class Index:\n"
+                                                  "    def __init__(self, labels): self.labels = labels\n"
+                                                  "    @property\n"
+                                                  "    def values(self): return numpy.array(self.labels, object)\n"
+                                                  "class DataFrame:\n"
+                                                  "    def __init__(self, columns): self._axis = columns\n"
+                                                  "    @property\n"
+                                                  "    def columns(self): return self._axis\n"
+                                                  "    def describe(self): pass\n";
+    run("import sys; sys.path.insert(0, '" + directory.file("") +
+        "')\n"
+        "import pandas\n"
+        "class Mine(pandas.DataFrame):\n    @property\n    def columns(self): raise SystemExit\n"
+        "class Labels(pandas.Index):\n    @property\n    def values(self): raise SystemExit\n"
+        "index = pandas.Index(['depth', 'two words', '_hidden', 7, ('a', 'b')])\n"
+        "df, mine, other = pandas.DataFrame(index), Mine(index), pandas.DataFrame(Labels([]))");
+    EXPECT_THAT(candidates("df."), ElementsAre("columns", "depth", "describe"));
+    EXPECT_THAT(candidates("df._hid"), ElementsAre("_hidden"));
+    EXPECT_THAT(candidates("df['"), ElementsAre("'depth'", "'two words'", "'_hidden'"));
+    // Classes of the user may do anything.
+    EXPECT_THAT(candidates("mine."), ElementsAre("columns", "describe"));
+    EXPECT_THAT(candidates("mine['"), ElementsAre());
+    EXPECT_THAT(candidates("other."), ElementsAre("columns", "describe"));
+}
+
 TEST_F(CompletionTest, AtADebugPromptNamesAreThoseOfTheStoppedFrame) {
     run("outside = 1");
     const IDType stopped = client().enqueue("def f(local):\n    breakpoint()\nf({'key': 1})");
