@@ -42,6 +42,8 @@ ecosystem_packages=(
     python3-distributed                                                         # clusters
     python3-matplotlib
 )
+# The conformance vectors' reader in JavaScript; not asked for where a Node.js from elsewhere has both programs.
+javascript_packages=(nodejs npm)
 clang_packages=(libclang-rt-14-dev)
 tidy_packages=(clang-tidy)
 reference_packages=(doxygen)

@@ -4,7 +4,7 @@ import os
 import sys
 
 # Directories that hold no text of ours: build trees and what tools leave behind.
-SKIPPED = {".git", ".cache", "__pycache__", "build"}
+SKIPPED = {".git", ".cache", "__pycache__", "build", "node_modules"}
 
 
 def files(root, *suffixes):
