@@ -10,6 +10,8 @@
 #   share/krutil/                          tools              the schema of what krutil --json prints
 #   share/man/, share/bash-completion/, share/zsh/, share/fish/
 #                                          tools              manual pages and completions
+#   lib/wireshark/plugins/, share/wireshark/protobuf/
+#                                          tools              dissector, and the schema where Wireshark looks for it
 #
 # find_package() knows the same components. Nothing in the tree holds the prefix: it may be installed to one place and used
 # from another.
@@ -113,4 +115,11 @@ if(KRUTIL_BUILD_APPS)
         install(FILES "${made}/${program}.fish" DESTINATION "${CMAKE_INSTALL_DATADIR}/fish/vendor_completions.d"
                 COMPONENT tools)
     endforeach()
+
+    # Wireshark reads all schema files of that directory, and none of those below it.
+    install(FILES "${PROJECT_SOURCE_DIR}/dissector/krutil.lua" DESTINATION "${CMAKE_INSTALL_LIBDIR}/wireshark/plugins"
+            COMPONENT tools)
+    file(GLOB schema CONFIGURE_DEPENDS "${PROJECT_SOURCE_DIR}/src/qvm_services/krutil_protobuf/proto/*.proto"
+         "${PROJECT_SOURCE_DIR}/platform/proto/*.proto")
+    install(FILES ${schema} DESTINATION "${CMAKE_INSTALL_DATADIR}/wireshark/protobuf" COMPONENT tools)
 endif()

@@ -35,12 +35,13 @@ peer_packages=(
     libgrpc++-dev protobuf-compiler-grpc
     python3-ipykernel python3-jupyter-client
 )
-# What ./scripts/ecosystem tests the client for Python with; nothing else needs these.
+# What ./scripts/ecosystem tests this system with; nothing else needs these.
 ecosystem_packages=(
     python3-ipykernel python3-jupyter-client python3-nbclient jupyter-notebook  # notebooks
     chromium chromium-driver python3-selenium                                   # the page of a notebook
     python3-distributed                                                         # clusters
     python3-matplotlib
+    tshark                                                                      # recordings of sessions
 )
 # The conformance vectors' reader in JavaScript; not asked for where a Node.js from elsewhere has both programs.
 javascript_packages=(nodejs npm)

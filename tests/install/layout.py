@@ -61,8 +61,10 @@ class Layout(unittest.TestCase):
         for path in ("share/man/man1/krutil.1", "share/man/man1/krutil-qvm.1", "share/man/man7/krutil-protocol.7",
                      "share/bash-completion/completions/krutil", "share/bash-completion/completions/krutil-qvm",
                      "share/zsh/site-functions/_krutil", "share/fish/vendor_completions.d/krutil.fish",
-                     "share/krutil/krutil-events.schema.json"):
+                     "share/krutil/krutil-events.schema.json", "share/wireshark/protobuf/krutil.protobuf.EvalIIP.proto",
+                     "share/wireshark/protobuf/msg_svc.protobuf.IDType.proto"):
             self.installed(path)
+        self.assertTrue(os.path.exists(os.path.join(library_directory(), "wireshark/plugins/krutil.lua")))
 
 
 if __name__ == "__main__":
