@@ -77,7 +77,7 @@ class SharingStream final : private Outgoing::Owner {
     SocketPair toReader_;
     SocketPair back_;
     asio::io_context io_;
-    Outgoing outgoing_{io_, back_.near, 1, *this};
+    Outgoing outgoing_{io_, back_.near, 1, nullptr, *this};
     lending::Borrower borrower_{outgoing_};
 };
 

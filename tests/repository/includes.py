@@ -54,6 +54,7 @@ HOST_ONLY = {
     "foundation/msg_svc/transport/layers/session/Session.hpp",
     "foundation/msg_svc/transport/layers/session/SessionConfig.hpp",
     "foundation/msg_svc/transport/layers/session/SessionError.hpp",
+    "foundation/msg_svc/transport/layers/session/SessionRecorder.hpp",
     "foundation/vantor/carrier/framing/BufferAllocator.hpp",
 }
 

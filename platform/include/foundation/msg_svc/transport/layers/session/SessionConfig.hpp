@@ -12,6 +12,7 @@
 #include "capabilities/CapabilityList.hpp"
 #include "foundation/msg_svc/transport/layers/session/Limits.hpp"
 #include "foundation/msg_svc/transport/layers/session/ProtocolRegistry.hpp"
+#include "foundation/msg_svc/transport/layers/session/SessionRecorder.hpp"
 #include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
@@ -81,6 +82,9 @@ struct SessionConfig {
 
     /// Called with every frame, on the thread that sends or receives it. Empty for no trace.
     std::function<void(const FrameTrace&)> trace;
+
+    /// Is given the bytes of the session, from the handshake to the end. Must outlive the session; null for none.
+    SessionRecorder* recorder = nullptr;
 
     /// Called with each received tagged frame before its serializer; may throw ProtocolViolation to close the session.
     /// Empty for no check.

@@ -116,6 +116,7 @@ void receiveBody(HandshakeStream& stream, std::uint32_t size, const std::string&
     }
     std::string body(size, '\0');
     stream.receive(body.data(), body.size(), what);
+    stream.endUnit();
     if (!message.ParseFromString(body)) {
         throw ProtocolViolation(what + ": its " + std::to_string(size) + " bytes are not a message of its type");
     }
@@ -128,7 +129,7 @@ std::uint32_t receiveHello(HandshakeStream& stream, SessionHello& hello) {
         if (got != magic.substr(0, got.size())) {
             throw ProtocolViolation(
                 "the peer does not speak this protocol: expected a first message that begins with " + quoted(magic) +
-                ", got " + quoted(std::string(head.data(), have) + stream.peek(256), 200));
+                ", got " + quoted(std::string(head.data(), have) + stream.takeAvailable(256), 200));
         }
     });
     receiveBody(stream, loadLittleEndian<std::uint32_t>(head.data() + magic.size() + 4), "the peer's hello", hello);
@@ -351,7 +352,7 @@ Settlement shakeHands(int in, int out, const SessionConfig& config) {
     }
     const SessionHello own = ownHello(config, features);
 
-    HandshakeStream stream(in, out, config.handshakeTimeout);
+    HandshakeStream stream(in, out, config.handshakeTimeout, config.recorder);
     stream.send(packHello(own));
     SessionHello peer;
     const std::uint32_t peerLayout = receiveHello(stream, peer);

@@ -22,12 +22,34 @@ std::string errorText(int error) {
 
 }  // namespace
 
-HandshakeStream::HandshakeStream(int in, int out, std::chrono::milliseconds timeout)
-    : in_(in), out_(out), timeout_(timeout), deadline_(Clock::now() + timeout) {}
+HandshakeStream::HandshakeStream(int in, int out, std::chrono::milliseconds timeout, SessionRecorder* recorder)
+    : in_(in), out_(out), timeout_(timeout), deadline_(Clock::now() + timeout), recorder_(recorder) {}
+
+void HandshakeStream::send(const std::string& bytes) {
+    if (recorder_ != nullptr) {
+        const iovec unit{const_cast<char*>(bytes.data()), bytes.size()};
+        recorder_->record(SessionRecorder::Direction::Sent, SessionRecorder::Part::Handshake, std::span(&unit, 1));
+    }
+    unsent_ += bytes;
+}
+
+void HandshakeStream::keep(const char* bytes, std::size_t size) {
+    if (recorder_ != nullptr) {
+        received_.append(bytes, size);
+    }
+}
+
+void HandshakeStream::endUnit() {
+    if (!received_.empty()) {
+        const iovec unit{received_.data(), received_.size()};
+        recorder_->record(SessionRecorder::Direction::Received, SessionRecorder::Part::Handshake, std::span(&unit, 1));
+        received_.clear();
+    }
+}
 
 void HandshakeStream::sendWith(const std::string& bytes, int descriptor) {
     flush();
-    unsent_ = bytes;
+    send(bytes);
     unsentDescriptor_ = descriptor;
 }
 
@@ -48,6 +70,7 @@ void HandshakeStream::receive(char* target, std::size_t size, const std::string&
                                   ? ::readv(in_, &piece, 1)
                                   : lending::receiveWithDescriptors(in_, std::span(&piece, 1), *descriptors);
         if (count > 0) {
+            keep(rest, static_cast<std::size_t>(count));
             have += static_cast<std::size_t>(count);
             if (check) {
                 check(have);
@@ -60,10 +83,11 @@ void HandshakeStream::receive(char* target, std::size_t size, const std::string&
     }
 }
 
-std::string HandshakeStream::peek(std::size_t most) const {
+std::string HandshakeStream::takeAvailable(std::size_t most) {
     std::string bytes(most, '\0');
     const ssize_t count = ::read(in_, bytes.data(), bytes.size());
     bytes.resize(count > 0 ? static_cast<std::size_t>(count) : 0);
+    keep(bytes.data(), bytes.size());
     return bytes;
 }
 

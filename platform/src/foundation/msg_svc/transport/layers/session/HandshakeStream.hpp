@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "foundation/core/posix/OwnedDescriptor.hpp"
+#include "foundation/msg_svc/transport/layers/session/SessionRecorder.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 
@@ -16,10 +17,16 @@ namespace foundation::msg_svc::transport::layers::session {
 /// stay the caller's.
 class HandshakeStream {
   public:
-    HandshakeStream(int in, int out, std::chrono::milliseconds timeout);
+    /// `recorder` is null for none.
+    HandshakeStream(int in, int out, std::chrono::milliseconds timeout, SessionRecorder* recorder = nullptr);
 
-    /// Hands bytes over; they are written while receive() and flush() wait.
-    void send(const std::string& bytes) { unsent_ += bytes; }
+    /// Has recorded what was received of a unit that did not come to its end.
+    ~HandshakeStream() { endUnit(); }
+    HandshakeStream(const HandshakeStream&) = delete;
+    HandshakeStream& operator=(const HandshakeStream&) = delete;
+
+    /// Hands the bytes of one unit over; they are written while receive() and flush() wait.
+    void send(const std::string& bytes);
 
     /// The same with a descriptor that goes with the first of the bytes, over a Unix socket; -1 for none. It stays the
     /// caller's, and is needed until they are written. Throws StreamLost, as flush() does, which comes first.
@@ -35,8 +42,11 @@ class HandshakeStream {
                  const std::function<void(std::size_t)>& check = nullptr,
                  std::vector<core::posix::OwnedDescriptor>* descriptors = nullptr);
 
-    /// What else is there already, for a message that shows it.
-    std::string peek(std::size_t most) const;
+    /// What was received since the last call is one unit of the stream, for the recorder.
+    void endUnit();
+
+    /// Takes what else is there already, for a message that shows it.
+    std::string takeAvailable(std::size_t most);
 
     /// Returns when everything is written. Throws StreamLost.
     void flush();
@@ -45,6 +55,7 @@ class HandshakeStream {
     using Clock = std::chrono::steady_clock;
 
     void wait(bool reading, const std::string& progress);
+    void keep(const char* bytes, std::size_t size);
     void writeSome();
 
     int in_;
@@ -54,6 +65,8 @@ class HandshakeStream {
     std::string unsent_;
     int unsentDescriptor_ = -1;
     int writeError_ = 0;
+    SessionRecorder* const recorder_;
+    std::string received_;  ///< of the unit that is arriving, for the recorder
 };
 
 }  // namespace foundation::msg_svc::transport::layers::session

@@ -32,7 +32,7 @@ Incoming::Incoming(asio::io_context& io, core::posix::OwnedDescriptor& descripto
       shared_(shared),
       owner_(owner),
       stream_(io),
-      reader_(config.limits, arrayTag, shared == nullptr ? nullptr : &shared->borrower),
+      reader_(config.limits, arrayTag, shared == nullptr ? nullptr : &shared->borrower, config.recorder),
       keptMemory_(io, config.keepMemory),
       arrayTag_(arrayTag),
       descriptor_(descriptor.get()) {
@@ -58,6 +58,9 @@ void Incoming::resume() {
 }
 
 void Incoming::stop() {
+    if (state_ != State::Stopped) {
+        reader_.recordUnfinished();
+    }
     state_ = State::Stopped;
     ErrorCode ignored;
     stream_.cancel(ignored);

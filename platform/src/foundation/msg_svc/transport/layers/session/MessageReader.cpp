@@ -31,8 +31,13 @@ namespace {
 
 }  // namespace
 
-MessageReader::MessageReader(const Limits& limits, std::string arrayTag, lending::Borrower* borrower)
-    : limits_(limits), arrayTag_(std::move(arrayTag)), borrower_(borrower), ahead_(new char[mostAhead]) {}
+MessageReader::MessageReader(const Limits& limits, std::string arrayTag, lending::Borrower* borrower,
+                             SessionRecorder* recorder)
+    : limits_(limits),
+      arrayTag_(std::move(arrayTag)),
+      borrower_(borrower),
+      recorder_(recorder),
+      ahead_(new char[mostAhead]) {}
 
 std::span<const iovec> MessageReader::buffers() noexcept {
     std::size_t count = 0;
@@ -229,13 +234,32 @@ void MessageReader::allocateContent() {
 void MessageReader::borrowContent() {
     const lending::SharedContent shared = lending::decodeSharedContent(content_.first.get());
     checkMessageSize(shared.size);
+    framing::FrameBuffer borrowed;
     try {
-        content_ = borrower_->borrow(shared);
+        borrowed = borrower_->borrow(shared);
     } catch (const vantor::carrier::shared_memory::MemoryRefused& refused) {
         throw ProtocolViolation("shared content of " + frameName(header_->index) + " on stream " +
                                 std::to_string(header_->stream) + ": " + refused.what());
     } catch (const std::bad_alloc&) {
         refuseForMemory(header_->index, shared.size);
+    }
+    if (recorder_ != nullptr) {
+        recordFrame({borrowed.first.get(), borrowed.second});
+    }
+    content_ = std::move(borrowed);
+}
+
+// What is there of the frame that is arriving, and the content that it lends.
+void MessageReader::recordFrame(iovec lent) const {
+    const std::array<iovec, 4> unit{iovec{const_cast<char*>(headerBytes_.data()), headerHave_},
+                                    iovec{const_cast<char*>(tag_.data()), tagHave_},
+                                    iovec{content_.first.get(), contentHave_}, lent};
+    recorder_->record(SessionRecorder::Direction::Received, SessionRecorder::Part::Frame, unit);
+}
+
+void MessageReader::recordUnfinished() const {
+    if (recorder_ != nullptr && headerHave_ != 0) {
+        recordFrame({});
     }
 }
 
@@ -252,6 +276,9 @@ std::unique_ptr<framing::Frame> MessageReader::takeFrame() {
 }
 
 std::optional<MessageReader::Item> MessageReader::completeFrame() {
+    if (recorder_ != nullptr && !header_->is(FrameKind::SharedData)) {
+        recordFrame({});
+    }
     std::optional<Item> item;
     if (header_->is(FrameKind::Goodbye)) {
         item = Goodbye{};

@@ -15,6 +15,7 @@
 
 #include "foundation/msg_svc/transport/layers/session/FrameHeader.hpp"
 #include "foundation/msg_svc/transport/layers/session/Limits.hpp"
+#include "foundation/msg_svc/transport/layers/session/SessionRecorder.hpp"
 #include "foundation/msg_svc/transport/layers/session/lending/Borrower.hpp"
 #include "foundation/vantor/carrier/framing/Frame.hpp"
 
@@ -58,8 +59,10 @@ class MessageReader {
     static constexpr std::size_t mostAhead = 65'536;
 
     /// `arrayTag` is the tag to which Limits::arrayMessage applies instead of Limits::taggedFrame. `borrower` has the
-    /// contents that stay in the peer's memory; null when there are none.
-    MessageReader(const Limits& limits, std::string arrayTag, lending::Borrower* borrower = nullptr);
+    /// contents that stay in the peer's memory; null when there are none. `recorder` is given each frame that is
+    /// complete; null for none.
+    MessageReader(const Limits& limits, std::string arrayTag, lending::Borrower* borrower = nullptr,
+                  SessionRecorder* recorder = nullptr);
 
     /// Where the next bytes of the stream belong, in order; never empty. Valid until the next call of next(). To be
     /// called when next() has returned nothing.
@@ -84,6 +87,9 @@ class MessageReader {
     /// What is there of the message that is arriving, for the report of a lost stream.
     std::string position() const;
 
+    /// Gives the recorder what is there of a frame that is not complete, or was refused. Nothing more will arrive.
+    void recordUnfinished() const;
+
   private:
     void take(char* target, std::size_t& have, std::size_t size) noexcept;
     bool straight() const noexcept {
@@ -96,12 +102,14 @@ class MessageReader {
     void checkMessageSize(std::uint64_t contentSize) const;
     void allocateContent();
     void borrowContent();
+    void recordFrame(iovec lent) const;
     std::unique_ptr<framing::Frame> takeFrame();
     std::optional<Item> completeFrame();
 
     Limits limits_;
     std::string arrayTag_;
     lending::Borrower* borrower_;
+    SessionRecorder* recorder_;
 
     // Bytes that have arrived and are not taken yet.
     std::unique_ptr<char[]> ahead_;

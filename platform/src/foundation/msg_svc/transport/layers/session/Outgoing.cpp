@@ -13,8 +13,9 @@
 
 namespace foundation::msg_svc::transport::layers::session {
 
-Outgoing::Outgoing(asio::io_context& io, core::posix::OwnedDescriptor& descriptor, std::size_t roomBytes, Owner& owner)
-    : io_(io), stream_(io), owner_(owner), roomBytes_(roomBytes), descriptor_(descriptor.get()) {
+Outgoing::Outgoing(asio::io_context& io, core::posix::OwnedDescriptor& descriptor, std::size_t roomBytes,
+                   SessionRecorder* recorder, Owner& owner)
+    : io_(io), stream_(io), owner_(owner), roomBytes_(roomBytes), recorder_(recorder), descriptor_(descriptor.get()) {
     stream_.assign(descriptor.get());
     descriptor.release();
     updateEvents();
@@ -36,9 +37,8 @@ std::vector<OutgoingPieces> Outgoing::push(OutgoingPieces&& message, Hold hold) 
         return done;
     }
     const bool held = hold == Hold::Yes || (hold == Hold::WithOthers && !queue_.empty());
-    unwritten_ += message.bytes();
     answersOwed_ += message.answer() ? 1 : 0;
-    queue_.push(std::move(message));
+    enqueue(std::move(message));
     if (!writerAwake_ && (!held || unwritten_ >= Session::heldBytes)) {
         write(done);
     }
@@ -47,6 +47,15 @@ std::vector<OutgoingPieces> Outgoing::push(OutgoingPieces&& message, Hold hold) 
     }
     uncount(totalOf(done));
     return done;
+}
+
+// With the mutex held: the order of what is recorded is the order on the wire.
+void Outgoing::enqueue(OutgoingPieces&& message) {
+    if (recorder_ != nullptr) {
+        message.record(*recorder_);
+    }
+    unwritten_ += message.bytes();
+    queue_.push(std::move(message));
 }
 
 // With the mutex held.
@@ -200,8 +209,7 @@ bool Outgoing::finish(std::optional<OutgoingPieces> lastWord) {
         const bool telling = lastWord && !hasFailed();
         dropped = queue_.takeAll(telling);
         if (telling) {
-            unwritten_ += lastWord->bytes();
-            queue_.push(std::move(*lastWord));
+            enqueue(std::move(*lastWord));
         }
         if (!hasFailed()) {
             state_ = State::Finishing;

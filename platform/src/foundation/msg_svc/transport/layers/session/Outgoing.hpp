@@ -37,8 +37,10 @@ class Outgoing {
         ~Owner() = default;
     };
 
-    /// Takes the descriptor over; it must be non-blocking. `roomBytes` is what may be unwritten while there is room.
-    Outgoing(asio::io_context& io, core::posix::OwnedDescriptor& descriptor, std::size_t roomBytes, Owner& owner);
+    /// Takes the descriptor over; it must be non-blocking. `roomBytes` is what may be unwritten while there is room,
+    /// `recorder` sees all that is handed over; null for none.
+    Outgoing(asio::io_context& io, core::posix::OwnedDescriptor& descriptor, std::size_t roomBytes,
+             SessionRecorder* recorder, Owner& owner);
 
     /// Whether messages are taken. False after an error and after finish().
     bool isOpen() const noexcept { return state_.load(std::memory_order_acquire) == State::Open; }
@@ -105,6 +107,7 @@ class Outgoing {
 
     static bool waitFor(const LevelEvent& event, int interrupt);
     void updateEvents();
+    void enqueue(OutgoingPieces&& message);
     void write(std::vector<OutgoingPieces>& written);
     void uncount(Total written);
     void drop(std::vector<OutgoingPieces>& messages);
@@ -115,6 +118,7 @@ class Outgoing {
     asio::posix::stream_descriptor stream_;
     Owner& owner_;
     const std::size_t roomBytes_;
+    SessionRecorder* const recorder_;
     LevelEvent room_;
     LevelEvent allWritten_;
     std::atomic<int> descriptor_;

@@ -92,6 +92,29 @@ void OutgoingPieces::add(const void* begin, std::size_t size) {
     }
 }
 
+void OutgoingPieces::record(SessionRecorder& recorder) const {
+    const auto give = [&recorder](std::span<const iovec> unit) {
+        recorder.record(SessionRecorder::Direction::Sent, SessionRecorder::Part::Frame, unit);
+    };
+    auto lent = lent_.begin();
+    auto begin = pieces_.begin();
+    for (std::size_t i = 0; i < headers_.size(); ++i) {
+        const void* const next = i + 1 < headers_.size() ? headers_[i + 1].data() : nullptr;
+        const auto end =
+            std::find_if(begin, pieces_.end(), [next](const iovec& piece) { return piece.iov_base == next; });
+        std::vector<iovec> unit(begin, end);
+        const bool isLent = lent != lent_.end() && pieces_.begin() + static_cast<std::ptrdiff_t>(lent->header) == begin;
+        const auto giveWith = [&](iovec content) {
+            unit.push_back(content);
+            give(unit);
+        };
+        if (!isLent || !(lent++)->loan.read(giveWith)) {
+            give(unit);
+        }
+        begin = end;
+    }
+}
+
 void OutgoingPieces::gather(GatheredWrite& write) const {
     auto lent =
         std::find_if(lent_.begin(), lent_.end(), [this](const LentFrame& frame) { return frame.header >= next_; });

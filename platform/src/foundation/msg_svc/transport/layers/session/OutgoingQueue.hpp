@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "foundation/msg_svc/transport/layers/session/FrameHeader.hpp"
+#include "foundation/msg_svc/transport/layers/session/SessionRecorder.hpp"
 #include "foundation/msg_svc/transport/layers/session/lending/DescriptorPassing.hpp"
 #include "foundation/msg_svc/transport/layers/session/lending/Lender.hpp"
 #include "foundation/vantor/carrier/framing/Frame.hpp"
@@ -48,6 +49,9 @@ class OutgoingPieces {
     bool answer() const noexcept { return answer_; }
     bool begun() const noexcept { return begun_; }
     bool done() const noexcept { return next_ == pieces_.size(); }
+
+    /// Gives each frame to the recorder, before anything of the message is written.
+    void record(SessionRecorder& recorder) const;
 
     /// Appends unwritten pieces, and the descriptors that go with them, as far as there is room.
     void gather(GatheredWrite& write) const;

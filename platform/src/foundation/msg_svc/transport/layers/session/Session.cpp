@@ -121,7 +121,7 @@ Session::Impl::Impl(StreamDescriptors& stream, SessionConfig sessionConfig, Sett
               PeerLimits(settlement.peer.limits, config.role == Role::Client ? "the engine" : "the client",
                          settlement.arrayTag)),
       exchanges_(config.role),
-      outgoing_(io_, stream.out, config.roomBytes, *this),
+      outgoing_(io_, stream.out, config.roomBytes, config.recorder, *this),
       shared_(settlement.sharedMemory ? std::make_unique<lending::SharedMemory>(config.role, outgoing_) : nullptr),
       incoming_(io_, stream.in, config, settlement.registry, settlement.arrayTag, exchanges_, outgoing_, shared_.get(),
                 *this) {}

@@ -17,6 +17,10 @@ Loan::~Loan() {
     }
 }
 
+bool Loan::read(const std::function<void(iovec)>& use) const {
+    return lender_->read(content_.number, use);
+}
+
 Lender::Lender(Role role) : pool_(SegmentPool::ofProcess()), viewer_(pool_.addViewer(role == Role::Client)) {}
 
 Lender::~Lender() {
@@ -74,6 +78,16 @@ bool Lender::takeBack(std::uint64_t number, bool kept) {
     if (kept) {
         pool_.hide(buffer.first.get());
     }
+    return true;
+}
+
+bool Lender::read(std::uint64_t number, const std::function<void(iovec)>& use) {
+    const std::lock_guard lock(mutex_);
+    const auto found = lent_.find(number);
+    if (found == lent_.end()) {
+        return false;
+    }
+    use({found->second.first.get(), found->second.second});
     return true;
 }
 

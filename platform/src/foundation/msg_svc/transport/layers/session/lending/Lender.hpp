@@ -1,7 +1,10 @@
 // What the peer of a session may read of this process's memory.
 #pragma once
 
+#include <sys/uio.h>
+
 #include <cstdint>
+#include <functional>
 #include <mutex>
 #include <optional>
 #include <unordered_map>
@@ -27,6 +30,10 @@ class Loan {
     Loan& operator=(Loan&&) = delete;
 
     const SharedContent& content() const noexcept { return content_; }
+
+    /// Calls `use` with the bytes of the content, which stay where they are meanwhile. False, without a call, when a
+    /// peer has given back what it has not got yet.
+    bool read(const std::function<void(iovec)>& use) const;
 
     /// -1 when it has been sent.
     int descriptor() const noexcept { return descriptor_ ? descriptor_->get() : -1; }
@@ -58,6 +65,9 @@ class Lender {
     /// The peer is done with a content. `kept`: but its memory stays mapped there, so it must not be written to again.
     /// False for a number that is not lent.
     bool takeBack(std::uint64_t number, bool kept);
+
+    /// See Loan::read().
+    bool read(std::uint64_t number, const std::function<void(iovec)>& use);
 
     /// The session is over. The peer may go on reading what it has mapped, and sees no further change.
     void close();

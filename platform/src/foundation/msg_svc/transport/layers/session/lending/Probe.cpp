@@ -58,10 +58,12 @@ bool probeSharedMemory(HandshakeStream& stream) {
     Token peers{};
     std::vector<core::posix::OwnedDescriptor> descriptors;
     stream.receive(peers.data(), peers.size(), "the peer's probe of shared memory", nullptr, &descriptors);
+    stream.endUnit();
     const bool shown = shows(descriptors, peers);
     stream.send(std::string(1, shown ? '\1' : '\0'));
     unsigned char answer = 0;
     stream.receive(reinterpret_cast<char*>(&answer), 1, "the peer's answer to the probe of shared memory");
+    stream.endUnit();
     if (answer > 1) {
         throw ProtocolViolation("the peer's answer to the probe of shared memory: expected 0 or 1, got " +
                                 std::to_string(answer));
