@@ -65,8 +65,9 @@ struct Terminal {
     LastLine lastLine{};
     Output out{STDOUT_FILENO, "standard output", interrupt, &lastLine};
     Output err{STDERR_FILENO, "standard error", interrupt, &lastLine};
-    bool edits = false;                  ///< a session has begun whose lines are edited
-    std::optional<LineEditor> editor{};  ///< outlives a session, and with it what it remembers
+    bool edits = false;                          ///< a session has begun whose lines are edited
+    std::optional<LineEditor> editor{};          ///< outlives a session, and with it what it remembers
+    std::optional<apps::Recording> recording{};  ///< of all sessions
 };
 
 std::unique_ptr<Printer> makePrinter(const DisplayOptions& options, Output& out, Output& err) {
@@ -83,7 +84,7 @@ class AskingClient {
     AskingClient(const Options& options, Printer& printer, Terminal& terminal, bool interactive,
                  std::string history = {})
         : client_(options.connection, options.display, printer, terminal.out, terminal.err, terminal.interrupt,
-                  interactive),
+                  interactive, terminal.recording ? &*terminal.recording : nullptr),
           help_(client_),
           terminal_(terminal),
           history_(std::move(history)),
@@ -253,6 +254,19 @@ ExitCode runCommand(const Options& options, const CallOptions& call, Printer& pr
                      [&] { return callFunction(asking.client(), call, std::move(prepared), printer, terminal.err); });
 }
 
+void startRecording(const apps::RecordOptions& options, Terminal& terminal) {
+    if (options.file.empty()) {
+        return;
+    }
+    try {
+        terminal.recording.emplace(options, [](const std::string& sentence) {
+            std::cerr << "krutil: " + sentence + "\n" << std::flush;
+        });
+    } catch (const std::runtime_error& error) {
+        throw Failure(ExitCode::Usage, error.what());
+    }
+}
+
 ExitCode runReporting(const Options& options) {
     Terminal terminal;
     const auto printer = makePrinter(options.display, terminal.out, terminal.err);
@@ -266,8 +280,11 @@ ExitCode runReporting(const Options& options) {
         return code;
     };
     try {
-        return std::visit([&](const auto& command) { return runCommand(options, command, *printer, terminal); },
-                          options.command);
+        startRecording(options.display.record, terminal);
+        const ExitCode code = std::visit(
+            [&](const auto& command) { return runCommand(options, command, *printer, terminal); }, options.command);
+        const bool recorded = !terminal.recording || terminal.recording->isComplete();
+        return code == ExitCode::Ok && !recorded ? ExitCode::Usage : code;
     } catch (const Failure& failure) {
         return report(failure.code(), failure.what());
     } catch (const Cancelled& cancelled) {
@@ -287,6 +304,8 @@ int runProgram(int argc, const char* const* argv) {
     }
     // A reader that has gone is an error of a write, so that the engine is ended in good order first.
     std::signal(SIGPIPE, SIG_IGN);
+    // A file that must not grow any more is one, too.
+    std::signal(SIGXFSZ, SIG_IGN);
     apps::installProtobufLog();
     if (std::get<Options>(parsed).connection.noZeroCopy) {
         // Before the first serializer asks; an engine that is started here inherits it.

@@ -22,6 +22,7 @@
 #include "msg_svc/protobuf/ustring.hpp"
 #include "qvm/process/ForkedChild.hpp"
 #include "qvm/python/EngineModule.hpp"
+#include "qvm/python/PythonText.hpp"
 #include "qvm/requests/MessageBounds.hpp"
 
 namespace qvm {
@@ -57,18 +58,16 @@ RuntimeException interruption(const std::string& text) {
     return {inEXECUTION_CTRLC, msg_svc::protobuf::utf8_to_ustring(text), "KeyboardInterrupt", "", {}, {}, false};
 }
 
-// The command as a person would have typed it at Python's prompt.
-std::u16string promptedLines(const std::u16string& command) {
-    std::u16string text;
-    std::size_t begin = 0;
-    do {
-        const std::size_t end = std::min(command.find(u'\n', begin), command.size());
-        text += begin == 0 ? u">>> " : u"... ";
-        text.append(command, begin, end - begin);
-        text += u'\n';
-        begin = end + 1;
-    } while (begin < command.size());
-    return text;
+// Each session of a listening engine has a file of its own.
+std::unique_ptr<apps::Recording> startRecording(const Options& options, Log& log) {
+    if (options.record.file.empty()) {
+        return nullptr;
+    }
+    apps::RecordOptions record = options.record;
+    if (!options.stdio) {
+        record.file += "." + std::to_string(::getpid());
+    }
+    return std::make_unique<apps::Recording>(record, [&log](const std::string& sentence) { log.say(sentence); });
 }
 
 // A function's result that carries an error would be read without it, so a failed call has a plain one.
@@ -84,6 +83,7 @@ std::unique_ptr<IIPResult> resultOf(const Request& request, Interpreter::Ending 
 Engine::Engine(const Options& options, Log& log)
     : options_(options),
       log_(log),
+      recording_(startRecording(options, log)),
       diary_(options.diary),
       queue_(options.queue),
       capabilities_({Capability::Debugging, Capability::InteractiveCommandLine, Capability::WebWindow}) {}
@@ -136,7 +136,8 @@ ExitCode Engine::run(int in, int out) {
     }
     announcer_->leave();
     session_->close();
-    return exitCode_;
+    const bool recorded = !recording_ || recording_->isComplete();
+    return exitCode_ == ExitCode::Ok && !recorded ? ExitCode::Lost : exitCode_;
 }
 
 // Shakes hands. Returns false, and sets the exit code, when there is no session.
@@ -150,6 +151,10 @@ bool Engine::open(int in, int out) {
         config.check = apps::precheck;
     }
     config.handshakeTimeout = options_.handshakeTimeout;
+    if (recording_) {
+        recording_->beginSession(config.role, config.build);
+        config.recorder = recording_.get();
+    }
     const auto fail = [this](const std::exception& error, ExitCode code) {
         log_.say(error.what());
         exitCode_ = code;

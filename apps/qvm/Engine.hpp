@@ -103,7 +103,8 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
     const Options& options_;
     Log& log_;
     const std::thread::id mainThread_ = std::this_thread::get_id();
-    ExitCode exitCode_ = ExitCode::Ok;  // of the I/O thread, until close() has joined it
+    ExitCode exitCode_ = ExitCode::Ok;                  // of the I/O thread, until close() has joined it
+    const std::unique_ptr<apps::Recording> recording_;  // null without one
     AppendFile diary_;
     RequestQueue queue_;
     Cancellation cancellation_;

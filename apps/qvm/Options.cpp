@@ -6,6 +6,7 @@
 #include "common/Build.hpp"
 #include "common/HelpFormatter.hpp"
 #include "common/LimitOptions.hpp"
+#include "common/RecordOptions.hpp"
 
 namespace qvm {
 namespace {
@@ -86,13 +87,17 @@ OptionTable::OptionTable() {
         ->type_name("FILE")
         ->group(files);
 
+    apps::addRecordOptions(app, options.record, files,
+                           "Record the session in this file, which is emptied first, for Wireshark and other readers "
+                           "of pcapng; with --listen each session in FILE.PID, PID being its process");
+
     apps::addLimitOptions(app, options.limits);
 
     app.footer(
         "Exit codes:\n"
         "  0  the session ended as agreed\n"
         "  2  wrong usage\n"
-        "  3  cannot serve, or the client was lost\n"
+        "  3  cannot serve, the client was lost, or a recording is not complete\n"
         "  4  the client broke the protocol\n"
         "  5  version or feature refused");
 }

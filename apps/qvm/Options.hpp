@@ -6,6 +6,7 @@
 #include <functional>
 #include <string>
 
+#include "common/Recording.hpp"
 #include "foundation/msg_svc/transport/layers/session/Limits.hpp"
 #include "qvm/python/PythonChoice.hpp"
 #include "qvm/requests/RequestQueue.hpp"
@@ -26,9 +27,10 @@ struct Options {
     bool noPrecheck = false;       ///< numbers that end the process are not looked for in what arrives
     std::size_t maxSessions = 64;  ///< sessions at a time of a listening engine
     std::chrono::milliseconds handshakeTimeout{10'000};
-    PythonConfig python;  ///< its program is empty when the command line names none
-    std::string diary;    ///< file that text of sinks with the diary trait is appended to; empty for none
-    std::string log;      ///< file of the engine's own messages and of sinks with the logging trait; empty for none
+    PythonConfig python;         ///< its program is empty when the command line names none
+    std::string diary;           ///< file that text of sinks with the diary trait is appended to; empty for none
+    apps::RecordOptions record;  ///< a listening engine adds the number of a session's process to the file's name
+    std::string log;  ///< file of the engine's own messages and of sinks with the logging trait; empty for none
 };
 
 /// Reads the command line. Prints help, the version or what is wrong and ends the process (0, or 2 for wrong usage)

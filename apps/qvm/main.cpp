@@ -63,6 +63,8 @@ int main(int argc, char** argv) {
     try {
         qvm::holdStandardDescriptors();
         ::signal(SIGPIPE, SIG_IGN);
+        // A file that must not grow any more is an error of a write.
+        ::signal(SIGXFSZ, SIG_IGN);
         qvm::Log log(options.log);
         apps::installProtobufLog();
         if (options.noZeroCopy) {

@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "cmddistributor/CodeType.hpp"
+#include "common/Recording.hpp"
 #include "foundation/msg_svc/transport/layers/session/Limits.hpp"
 
 namespace krutil_client {
@@ -33,6 +34,7 @@ struct DisplayOptions {
     bool trace = false;                    ///< each frame goes to standard error
     std::optional<std::string> traceFile;  ///< each frame goes to this file
     bool traceGoesOn = false;              ///< after those of a session before
+    apps::RecordOptions record;
     bool timing = false;
     bool warningStack = false;  ///< warnings tell where they were issued
     Color color = Color::Auto;

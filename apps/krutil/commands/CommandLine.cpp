@@ -14,6 +14,7 @@
 #include "common/Build.hpp"
 #include "common/HelpFormatter.hpp"
 #include "common/LimitOptions.hpp"
+#include "common/RecordOptions.hpp"
 
 namespace krutil_client {
 namespace {
@@ -21,8 +22,8 @@ namespace {
 constexpr const char* exitCodes = R"(Exit codes:
   0  ok
   1  the code or the function raised an error
-  2  the command line, the code text or a file cannot be used, or an argument is larger than the
-     engine accepts
+  2  the command line, the code text or a file cannot be used, a recording is not complete, or an
+     argument is larger than the engine accepts
   3  no engine could be started or reached, or its stream was lost
   4  the engine broke the protocol
   5  the ends do not fit: protocol version or features
@@ -74,6 +75,9 @@ void addDisplayOptions(CLI::App& app, DisplayOptions& options) {
                    "Write each frame of the session to this file, which is emptied first")
         ->type_name("FILE")
         ->group("Display");
+    apps::addRecordOptions(app, options.record, "Display",
+                           "Record the session in this file, which is emptied first, for Wireshark and other readers "
+                           "of pcapng");
     app.add_flag("--timing", options.timing, "Say how long things took")->group("Display");
     static const std::map<std::string, Color> colors{
         {"auto", Color::Auto}, {"always", Color::Always}, {"never", Color::Never}};

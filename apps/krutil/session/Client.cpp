@@ -63,7 +63,7 @@ capabilities::CapabilityList capabilitiesHere(const ConnectionOptions& options, 
 }  // namespace
 
 Client::Client(const ConnectionOptions& connection, const DisplayOptions& display, Printer& printer, const Output& out,
-               Output& err, Interrupt& interrupt, bool interactive)
+               Output& err, Interrupt& interrupt, bool interactive, apps::Recording* recording)
     : printer_(printer),
       interrupt_(interrupt),
       err_(err),
@@ -90,7 +90,7 @@ Client::Client(const ConnectionOptions& connection, const DisplayOptions& displa
             engineCapabilities_ = event.getQvmCapabilities();
         });
     printer_.subscribe(events_);
-    conversation_ = openConversation(connection, interactive);
+    conversation_ = openConversation(connection, interactive, recording);
     conversation_->watch(engine_.watch(), [this] {
         // The end of the stream follows, and is what ends a request; unless another process holds the stream.
         const bool idle = requests_.unanswered().empty();
@@ -116,7 +116,8 @@ Client::~Client() {
     conversation_.reset();
 }
 
-std::unique_ptr<Conversation> Client::openConversation(const ConnectionOptions& connection, bool interactive) {
+std::unique_ptr<Conversation> Client::openConversation(const ConnectionOptions& connection, bool interactive,
+                                                       apps::Recording* recording) {
     session::SessionConfig config = apps::krutilSession(session::Role::Client);
     config.build = apps::buildString("krutil");
     config.limits = connection.limits;
@@ -129,6 +130,10 @@ std::unique_ptr<Conversation> Client::openConversation(const ConnectionOptions& 
     }
     if (tracer_) {
         config.trace = std::ref(*tracer_);
+    }
+    if (recording != nullptr) {
+        recording->beginSession(config.role, config.build);
+        config.recorder = recording;
     }
     try {
         return std::make_unique<Conversation>(engine_.takeStream(), std::move(config), events_, interrupt_);

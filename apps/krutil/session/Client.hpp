@@ -44,9 +44,10 @@ enum class Leave {
 class Client {
   public:
     /// `interactive` tells the engine that there is a person who can be asked and who can use a debugger. `printer`,
-    /// `err` and `interrupt` must outlive the object. Blocks until the handshake is done. Throws Failure, Cancelled.
+    /// `err`, `interrupt` and `recording` must outlive the object; the last is null for none. Blocks until the
+    /// handshake is done. Throws Failure, Cancelled.
     Client(const ConnectionOptions& connection, const DisplayOptions& display, Printer& printer, const Output& out,
-           Output& err, Interrupt& interrupt, bool interactive);
+           Output& err, Interrupt& interrupt, bool interactive, apps::Recording* recording = nullptr);
     ~Client();
     Client(const Client&) = delete;
     Client& operator=(const Client&) = delete;
@@ -128,7 +129,8 @@ class Client {
     std::string finish(Leave leave = Leave::WhenAnswered);
 
   private:
-    std::unique_ptr<Conversation> openConversation(const ConnectionOptions& connection, bool interactive);
+    std::unique_ptr<Conversation> openConversation(const ConnectionOptions& connection, bool interactive,
+                                                   apps::Recording* recording);
     void answered(SentRequest& request, const Conversation::Reply& answer);
     void awaitAnswers(Leave leave, Conversation::Clock::time_point deadline);
     [[noreturn]] void fail(const Conversation::SessionEnd& end, const std::string& when);

@@ -47,4 +47,17 @@ PyObject* strOf(const std::u16string& text) {
     return PyUnicode_DecodeUTF8(utf8.data(), static_cast<Py_ssize_t>(utf8.size()), "replace");
 }
 
+std::u16string promptedLines(const std::u16string& code) {
+    std::u16string text;
+    std::size_t begin = 0;
+    do {
+        const std::size_t end = std::min(code.find(u'\n', begin), code.size());
+        text += begin == 0 ? u">>> " : u"... ";
+        text.append(code, begin, end - begin);
+        text += u'\n';
+        begin = end + 1;
+    } while (begin < code.size());
+    return text;
+}
+
 }  // namespace qvm

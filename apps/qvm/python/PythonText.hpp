@@ -18,4 +18,8 @@ std::u16string utf16Of(PyObject* text);
 /// A str of UTF-16 text, an unpaired surrogate as U+FFFD. Null with an exception set when there is no memory.
 PyObject* strOf(const std::u16string& text);
 
+/// Code as a person would have typed it at Python's prompts, each line with the prompt before it and a newline behind
+/// it.
+std::u16string promptedLines(const std::u16string& code);
+
 }  // namespace qvm

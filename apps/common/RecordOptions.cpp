@@ -1,0 +1,15 @@
+#include "common/RecordOptions.hpp"
+
+#include "common/LimitOptions.hpp"
+
+namespace apps {
+
+void addRecordOptions(CLI::App& app, RecordOptions& options, const std::string& group, const std::string& fileText) {
+    CLI::Option* const file = app.add_option("--record", options.file, fileText)->type_name("FILE")->group(group);
+    addSizeOption(app, "--record-snap", options.snap, "Record only the first bytes of each frame, its header at least")
+        ->default_str("")
+        ->needs(file)
+        ->group(group);
+}
+
+}  // namespace apps

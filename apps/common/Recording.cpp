@@ -1,0 +1,218 @@
+#include "common/Recording.hpp"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <stdexcept>
+#include <system_error>
+#include <utility>
+
+#include "foundation/core/posix/writeFully.hpp"
+
+namespace apps {
+namespace {
+
+namespace posix = foundation::core::posix;
+
+constexpr std::uint32_t sectionHeader = 0x0A0D0D0A;
+constexpr std::uint32_t byteOrderMagic = 0x1A2B3C4D;
+constexpr std::uint32_t interfaceDescription = 1;
+constexpr std::uint32_t enhancedPacket = 6;
+constexpr std::uint16_t upperPdu = 252;
+
+constexpr std::uint16_t endOfOptions = 0;
+constexpr std::uint16_t comment = 1;
+constexpr std::uint16_t userApplication = 4;  // of a section
+constexpr std::uint16_t interfaceName = 2;    // of an interface
+constexpr std::uint16_t timeResolution = 9;   // of an interface
+constexpr std::uint16_t packetFlags = 2;      // of a packet
+constexpr std::uint32_t inbound = 1;
+constexpr std::uint32_t outbound = 2;
+
+// What readers take for a packet at most.
+constexpr std::uint64_t longestPacket = 262'144;
+
+// So much is always kept of a frame.
+constexpr std::uint64_t frameHeader = 24;
+
+// Which dissector is meant. Numbers of the tags are big-endian.
+constexpr std::string_view tags("\0\x0c\0\x08krutil\0\0\0\0\0\0", 16);
+
+constexpr std::uint64_t largestPart = longestPacket - tags.size();
+
+template <class Number>
+void append(std::string& block, Number number) {
+    for (std::size_t i = 0; i < sizeof(Number); ++i) {
+        block += static_cast<char>(static_cast<unsigned char>(number >> (8 * i)));
+    }
+}
+
+void pad(std::string& block) {
+    block.append((4 - block.size() % 4) % 4, '\0');
+}
+
+void appendOption(std::string& block, std::uint16_t code, std::string_view value) {
+    append(block, code);
+    append(block, static_cast<std::uint16_t>(value.size()));
+    block += value;
+    pad(block);
+}
+
+void beginBlock(std::string& block, std::uint32_t type) {
+    append(block, type);
+    // The length, which endBlock() knows.
+    append(block, std::uint32_t{0});
+}
+
+// The block begins at `begin`, and is the last one.
+void endBlock(std::string& block, std::size_t begin = 0) {
+    append(block, endOfOptions);
+    append(block, std::uint16_t{0});
+    const auto length = static_cast<std::uint32_t>(block.size() - begin + 4);
+    append(block, length);
+    block.replace(begin + 4, 4, block, block.size() - 4, 4);
+}
+
+// `count` bytes of the unit from `first` on.
+void appendBytes(std::string& block, std::span<const iovec> unit, std::uint64_t first, std::uint64_t count) {
+    for (const iovec& piece : unit) {
+        if (first >= piece.iov_len) {
+            first -= piece.iov_len;
+            continue;
+        }
+        const std::uint64_t taken = std::min<std::uint64_t>(count, piece.iov_len - first);
+        block.append(static_cast<const char*>(piece.iov_base) + first, taken);
+        count -= taken;
+        first = 0;
+    }
+}
+
+posix::OwnedDescriptor openRecording(const std::string& path, bool& regular) {
+    const std::string cannot = "cannot record to '" + path + "'";
+    posix::OwnedDescriptor file(
+        ::open(path.c_str(), O_WRONLY | O_CREAT | O_NOFOLLOW | O_NOCTTY | O_CLOEXEC, S_IRUSR | S_IWUSR));
+    struct stat status {};
+    if (!file || ::fstat(file.get(), &status) != 0) {
+        throw std::system_error(errno, std::generic_category(), cannot);
+    }
+    regular = S_ISREG(status.st_mode);
+    if (!S_ISCHR(status.st_mode) && status.st_uid != ::geteuid()) {
+        throw std::runtime_error(cannot + ": it belongs to user " + std::to_string(status.st_uid) +
+                                 "; name a file of your own");
+    }
+    if (regular && status.st_nlink > 1) {
+        throw std::runtime_error(cannot + ": the file has " + std::to_string(status.st_nlink) +
+                                 " names; name a new one");
+    }
+    if (regular && (::ftruncate(file.get(), 0) != 0 || ::fchmod(file.get(), S_IRUSR | S_IWUSR) != 0)) {
+        throw std::system_error(errno, std::generic_category(), cannot);
+    }
+    return file;
+}
+
+timespec now() {
+    timespec time{};
+    ::clock_gettime(CLOCK_REALTIME, &time);
+    return time;
+}
+
+}  // namespace
+
+Recording::Recording(const RecordOptions& options, std::function<void(const std::string&)> complain)
+    : file_(options.file),
+      snap_(std::max(options.snap, frameHeader)),
+      complain_(std::move(complain)),
+      clock_(now),
+      descriptor_(openRecording(options.file, regular_)) {
+    // Nothing that happens while a packet is written needs much memory.
+    block_.reserve(longestPacket + 256);
+}
+
+void Recording::beginSession(Role role, const std::string& build) {
+    const std::lock_guard lock(mutex_);
+    block_.clear();
+    beginBlock(block_, sectionHeader);
+    append(block_, byteOrderMagic);
+    append(block_, std::uint16_t{1});
+    append(block_, std::uint16_t{0});
+    append(block_, std::int64_t{-1});
+    appendOption(block_, userApplication, build);
+    endBlock(block_);
+
+    const std::size_t begin = block_.size();
+    beginBlock(block_, interfaceDescription);
+    append(block_, upperPdu);
+    append(block_, std::uint16_t{0});
+    append(block_, static_cast<std::uint32_t>(longestPacket));
+    appendOption(block_, interfaceName, (role == Role::Client ? "client " : "engine ") + std::to_string(::getpid()));
+    appendOption(block_, timeResolution, "\x09");
+    endBlock(block_, begin);
+    write();
+}
+
+void Recording::record(Direction direction, Part part, std::span<const iovec> unit) noexcept {
+    std::uint64_t size = 0;
+    for (const iovec& piece : unit) {
+        size += piece.iov_len;
+    }
+    const std::uint64_t kept = part == Part::Frame ? std::min(size, snap_) : size;
+    const std::lock_guard lock(mutex_);
+    const timespec time = clock_();
+    const auto nanoseconds =
+        static_cast<std::uint64_t>(time.tv_sec) * 1'000'000'000U + static_cast<std::uint64_t>(time.tv_nsec);
+    for (std::uint64_t first = 0; first < kept && complete_; first += largestPart) {
+        const std::uint64_t count = std::min(kept - first, largestPart);
+        // Only the last packet tells of what is missing.
+        const std::uint64_t missing = first + count == kept ? size - kept : 0;
+        const std::uint64_t original =
+            std::min<std::uint64_t>(tags.size() + count + missing, std::numeric_limits<std::uint32_t>::max());
+        block_.clear();
+        beginBlock(block_, enhancedPacket);
+        append(block_, std::uint32_t{0});
+        append(block_, static_cast<std::uint32_t>(nanoseconds >> 32U));
+        append(block_, static_cast<std::uint32_t>(nanoseconds));
+        append(block_, static_cast<std::uint32_t>(tags.size() + count));
+        append(block_, static_cast<std::uint32_t>(original));
+        block_ += tags;
+        appendBytes(block_, unit, first, count);
+        pad(block_);
+        append(block_, packetFlags);
+        append(block_, std::uint16_t{4});
+        append(block_, direction == Direction::Sent ? outbound : inbound);
+        if (count != size) {
+            appendOption(block_, comment,
+                         "bytes " + std::to_string(first) + "-" + std::to_string(first + count - 1) + " of " +
+                             std::to_string(size));
+        }
+        endBlock(block_);
+        write();
+    }
+}
+
+// With the mutex held.
+void Recording::write() {
+    if (!complete_) {
+        return;
+    }
+    if (posix::writeFully(descriptor_.get(), block_)) {
+        written_ += block_.size();
+        return;
+    }
+    const std::string reason = std::generic_category().message(errno);
+    complete_ = false;
+    // Readers take a part of a block for damage. Where that cannot be undone, they still read what is before it.
+    if (regular_ && ::ftruncate(descriptor_.get(), static_cast<off_t>(written_)) != 0) {
+        regular_ = false;
+    }
+    complain_("cannot write to '" + file_ + "': " + reason + "; the recording ends here");
+}
+
+bool Recording::isComplete() const {
+    const std::lock_guard lock(mutex_);
+    return complete_;
+}
+
+}  // namespace apps

@@ -1,0 +1,66 @@
+// Recordings of sessions, in the format pcapng. docs/recording.md describes the file.
+#pragma once
+
+#include <cstdint>
+#include <ctime>
+#include <functional>
+#include <limits>
+#include <mutex>
+#include <string>
+
+#include "foundation/core/posix/OwnedDescriptor.hpp"
+#include "foundation/msg_svc/transport/layers/session/SessionConfig.hpp"
+
+namespace apps {
+
+/// What a command line asks for about recordings.
+struct RecordOptions {
+    std::string file;  ///< empty for no recording
+    std::uint64_t snap =
+        std::numeric_limits<std::uint64_t>::max();  ///< bytes of a frame that are kept; its header always is
+};
+
+/// Writes the units of sessions to a file, each as soon as it is there: what ends the program ends no recording early.
+/// One session at a time; a second one of the same process begins another section of the file.
+///
+/// When the file cannot be written, `complain` is told once, in a sentence, and the recording ends with its last whole
+/// packet. The session goes on. `complain` must not use the session.
+class Recording final : public foundation::msg_svc::transport::layers::session::SessionRecorder {
+  public:
+    using Role = foundation::msg_svc::transport::layers::session::Role;
+
+    /// Creates the file for this user alone, or empties one that is there. Of what is there already, regular files and
+    /// pipes must belong to this user; symbolic links and files with several names are not followed, so that nobody
+    /// else says where a recording goes. Throws std::system_error and std::runtime_error with a sentence.
+    Recording(const RecordOptions& options, std::function<void(const std::string&)> complain);
+
+    /// A session begins in which this process has that role; `build` names the program. To be called before its
+    /// handshake.
+    void beginSession(Role role, const std::string& build);
+
+    void record(Direction direction, Part part, std::span<const iovec> unit) noexcept override;
+
+    /// Whether all could be written so far. May be called from any thread.
+    bool isComplete() const;
+
+    /// The time of a packet; another one makes packets repeatable.
+    using Clock = std::function<timespec()>;
+    void setClock(Clock clock) { clock_ = std::move(clock); }
+
+  private:
+    void write();
+
+    const std::string file_;
+    const std::uint64_t snap_;
+    const std::function<void(const std::string&)> complain_;
+    Clock clock_;
+    bool regular_ = false;  ///< a file, which can be cut
+    foundation::core::posix::OwnedDescriptor descriptor_;
+
+    mutable std::mutex mutex_;
+    std::string block_;          ///< that is being written; its memory is kept for the next one
+    std::uint64_t written_ = 0;  ///< bytes of whole blocks
+    bool complete_ = true;
+};
+
+}  // namespace apps
