@@ -18,7 +18,7 @@ class _Rest:
 
 
 class _Printer(PrettyPrinter):
-    """Shows so many elements of each container of Python's own types. Subclasses are the user's, and show themselves."""
+    """Shows so many elements of each container of Python's own types. Subclasses, the user's, show themselves."""
 
     def __init__(self, limit, **options):
         super().__init__(**options)
