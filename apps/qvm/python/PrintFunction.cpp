@@ -14,6 +14,8 @@ namespace {
 
 // Longer text gains nothing from one piece.
 constexpr std::size_t longestPrint = 4096;
+// Most lines fit, so that one allocation takes all of their text.
+constexpr std::size_t usualPrint = 120;
 
 struct Printing {
     PyObject* original;  // Python's own print()
@@ -92,7 +94,7 @@ bool gather(PyObject* const* values, Py_ssize_t count, PyObject* names, std::u16
         !readOptions(values + count, names, punctuation)) {
         return false;
     }
-    units.clear();
+    units.reserve(usualPrint);
     for (Py_ssize_t i = 0; i < count; ++i) {
         if (i > 0 && punctuation.separator == nullptr) {
             units += u' ';
@@ -111,8 +113,8 @@ bool gather(PyObject* const* values, Py_ssize_t count, PyObject* names, std::u16
 }
 
 PyObject* print(PyObject* /*module*/, PyObject* const* values, Py_ssize_t count, PyObject* names) noexcept {
-    // Guarded by the interpreter lock, and used up before that is let go.
-    static std::u16string units;
+    // Not one for all calls: before it is written, other threads may print.
+    std::u16string units;
     try {
         if (!gather(values, count, names, units)) {
             return PyErr_Occurred() != nullptr

@@ -86,6 +86,19 @@ TEST_F(PrintTest, ForkedChildPrintsToItsDescriptor) {
     EXPECT_EQ(engine_.client.backgroundText(), "from 1 child\n");
 }
 
+// What a descriptor has received is sent before the text, and other threads run meanwhile.
+TEST_F(PrintTest, ThreadsThatPrintAtOnceKeepTheirOwnText) {
+    const Evaluation result = engine_.client.eval(
+        "import os, threading\ndef lines(text):\n    for _ in range(300):\n        os.write(1, b'x')\n        "
+        "print(text)\n"
+        "other = threading.Thread(target=lines, args=('b' * 20,))\nother.start()\nlines('a' * 20)\nother.join()");
+    std::string expected;
+    for (int i = 0; i < 300; ++i) {
+        expected += std::string(20, 'a') + "\n";
+    }
+    EXPECT_EQ(result.output(), expected);
+}
+
 TEST_F(PrintTest, LooksLikePythonsOwn) {
     EXPECT_EQ(output("import builtins, inspect, pickle\nprint(repr(print), inspect.signature(print))\n"
                      "print(print.__module__, pickle.loads(pickle.dumps(print)) is print)\n"
