@@ -23,6 +23,13 @@ function(krutil_export_by target file)
     set_property(TARGET ${target} APPEND PROPERTY LINK_DEPENDS "${file}")
 endfunction()
 
+# The debug information of the libraries says what their types are, whatever the preset has for other targets: their ABI
+# is read from it.
+set(krutil_library_options $<$<CONFIG:RelWithDebInfo>:-g2>)
+if(KRUTIL_SANITIZE)
+    set(krutil_library_options "")
+endif()
+
 add_library(krutil_generated_options INTERFACE)
 if(KRUTIL_SANITIZE)
     target_compile_options(krutil_generated_options INTERFACE

@@ -22,6 +22,7 @@ test_packages=(
     python3-matplotlib                                  # figures, which an engine shows
     mandoc man-db zsh fish                              # manual pages and completions
     clang                                               # users of the installed tree have it or g++
+    abigail-tools                                       # whether the libraries' ABI has changed
     python3-jsonschema                                  # what --json prints
 )
 # What draws the pictures of benchmarks.
