@@ -107,6 +107,7 @@ if(KRUTIL_BUILD_APPS)
             DESTINATION "${CMAKE_INSTALL_DATADIR}/krutil" COMPONENT tools)
     set(made "${PROJECT_BINARY_DIR}/apps/manuals/made")
     install(FILES "${made}/krutil.1" "${made}/krutil-qvm.1" DESTINATION "${CMAKE_INSTALL_MANDIR}/man1" COMPONENT tools)
+    install(FILES "${made}/krutil-recording.5" DESTINATION "${CMAKE_INSTALL_MANDIR}/man5" COMPONENT tools)
     install(FILES "${made}/krutil-protocol.7" DESTINATION "${CMAKE_INSTALL_MANDIR}/man7" COMPONENT tools)
     foreach(program IN ITEMS krutil krutil-qvm)
         install(FILES "${made}/${program}.bash" RENAME "${program}"

@@ -58,7 +58,8 @@ class Layout(unittest.TestCase):
 
     @unittest.skipUnless(os.path.exists(os.path.join(BUILD, "bin/krutil")), "the programs are not built")
     def test_manual_pages_completions_and_schema_are_where_programs_look(self):
-        for path in ("share/man/man1/krutil.1", "share/man/man1/krutil-qvm.1", "share/man/man7/krutil-protocol.7",
+        for path in ("share/man/man1/krutil.1", "share/man/man1/krutil-qvm.1",
+                     "share/man/man5/krutil-recording.5", "share/man/man7/krutil-protocol.7",
                      "share/bash-completion/completions/krutil", "share/bash-completion/completions/krutil-qvm",
                      "share/zsh/site-functions/_krutil", "share/fish/vendor_completions.d/krutil.fish",
                      "share/krutil/krutil-events.schema.json", "share/wireshark/protobuf/krutil.protobuf.EvalIIP.proto",

@@ -17,7 +17,7 @@ import time
 import unittest
 
 MADE, *PROGRAMS = sys.argv[1:4]
-PAGES = ["krutil.1", "krutil-qvm.1", "krutil-protocol.7"]
+PAGES = ["krutil.1", "krutil-qvm.1", "krutil-recording.5", "krutil-protocol.7"]
 KRUTIL_COMMANDS = re.compile(r"^  (\w+) ", re.MULTILINE)
 OPTION = re.compile(r"^  (?:(-\w),)?(--[\w-]+)(?: ([A-Z:]+))?", re.MULTILINE)
 PATIENCE = 60
