@@ -22,7 +22,9 @@ class EvalIIP : public IIP {
 
     /// The code text, UTF-16.
     const std::u16string& getCommand() const noexcept { return cmd_; }
+    /// How the code text is to be read.
     CodeType getCodeType() const noexcept { return codeType_; }
+    /// The workspace to evaluate in; may be empty, and always is in a request from a peer.
     const boost::shared_ptr<foundation::korveldata::ICustomWorkspace>& getWorkspace() const noexcept {
         return workspace_;
     }

@@ -35,10 +35,13 @@ class FEvalIIP : public IIP {
         /// As the side holds them that asks.
         static boost::shared_ptr<Data> makeClientSideData(Arguments&& arguments);
 
+        /// Valid until takeArrays() or destruction.
         const Arguments& arguments() const noexcept { return arguments_; }
+        /// Whether the arguments came from a peer.
         bool received() const noexcept { return received_; }
-        /// Engines that ask and that run the call; 0 on the side that asks.
+        /// Engine that asks; 0 on the side that asks.
         krutil::contextmgr::QvmID clientQvmID() const noexcept { return clientQvmID_; }
+        /// Engine that runs the call; 0 on the side that asks.
         krutil::contextmgr::QvmID serverQvmID() const noexcept { return serverQvmID_; }
 
         /// Moves the data form out and leaves no arguments. Throws boost::bad_get for the other form.
@@ -67,6 +70,7 @@ class FEvalIIP : public IIP {
     /// The function's name, UTF-8. Throws boost::bad_get for a function that was given as an array.
     const std::string& getFunctionName() const;
 
+    /// Number of outputs that are wanted.
     unsigned long getNlhs() const noexcept { return nlhs_; }
     /// Engine that asks.
     krutil::contextmgr::QvmID getClientQvmID() const noexcept { return clientQvmID_; }
@@ -74,6 +78,7 @@ class FEvalIIP : public IIP {
     krutil::contextmgr::QvmID getQvmID() const noexcept { return serverQvmID_; }
     /// May be empty.
     const boost::shared_ptr<Data>& getData() const noexcept { return data_; }
+    /// Whether the request was made in this process.
     bool isLocal() const noexcept { return local_; }
 
   private:

@@ -29,6 +29,7 @@ class FEvalResult : public IIPResult {
                 boost::optional<RuntimeException> exception);
     ~FEvalResult() override;
 
+    /// The outputs, in the form in which they were given. Valid as long as the result.
     const Results& getResults() const noexcept { return results_; }
 
   private:

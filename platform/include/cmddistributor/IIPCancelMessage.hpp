@@ -9,6 +9,7 @@ namespace cmddistributor {
 /// Begins an exchange of its own, which an IIPCancelReply ends. Immutable.
 class IIPCancelMessage : public foundation::msg_svc::exchange::Message {
   public:
+    /// `id` is that of the request to cancel; see getEvenIfRunning().
     IIPCancelMessage(const foundation::msg_svc::exchange::IDType& id, bool evenIfRunning);
     ~IIPCancelMessage() override;
 

@@ -18,9 +18,11 @@ class IIPCancelReply : public foundation::msg_svc::exchange::Reply {
         PENDING_CANCEL = 3,                    ///< it was told to stop and will end soon
     };
 
+    /// An answer of that status.
     explicit IIPCancelReply(CancelStatus status);
     ~IIPCancelReply() override;
 
+    /// What became of the cancel; from a peer, any number.
     CancelStatus getStatus() const noexcept { return status_; }
 
   private:

@@ -35,12 +35,15 @@ class IIPEnqueueMessage : public foundation::msg_svc::exchange::Message {
     const boost::shared_ptr<const IIP>& getIIP() const& noexcept { return iip_; }
     /// The request's identifier, which its events and its result carry.
     const foundation::msg_svc::exchange::IDType& getID() const& noexcept { return id_; }
+    /// The runtime instance that is meant.
     const krutil::contextmgr::QcrID& getQcrID() const& noexcept { return qcrID_; }
     /// The engine that is meant; empty for whichever receives the message.
     const boost::optional<krutil::contextmgr::QvmID>& getQvmID() const& noexcept { return qvmID_; }
+    /// Publishes the request's events in this process. May be empty, and is in a message from a peer.
     const boost::shared_ptr<foundation::msg_svc::eventmgr::EventMgr>& getEventMgr() const& noexcept {
         return eventMgr_;
     }
+    /// When the queue may hand out the request.
     const krutil::cmddistributor::WhenToDequeue::WhenToDequeue& getDequeueMode() const& noexcept {
         return dequeueMode_;
     }
@@ -48,6 +51,7 @@ class IIPEnqueueMessage : public foundation::msg_svc::exchange::Message {
     const std::u16string& getDynamicName() const& noexcept { return name_; }
     /// Capabilities that the request needs.
     const ::capabilities::CapabilityList& getCapabilities() const& noexcept { return capabilities_; }
+    /// On whose behalf the request runs. May be empty, and is in a message from a peer.
     const std::shared_ptr<krutil::cmddistributor::Impersonable>& getImpersonable() const& noexcept {
         return impersonable_;
     }

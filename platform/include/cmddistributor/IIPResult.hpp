@@ -11,6 +11,7 @@ namespace cmddistributor {
 /// Whose outcome it is and, if the request failed, the error. Base of the results that carry more. Immutable.
 class IIPResult {
   public:
+    /// `id` is that of the request; `exception` is empty when it succeeded.
     IIPResult(const foundation::msg_svc::exchange::IDType& id, boost::optional<RuntimeException> exception);
     virtual ~IIPResult();
 

@@ -19,6 +19,7 @@ class RuntimeException {
                      std::string functionName, std::vector<StackFrame> frames, std::vector<RuntimeException> causes,
                      bool shown);
 
+    /// How the request ended.
     krutil::cmddistributor::inExecutionStatus getExecutionStatus() const noexcept { return status_; }
     /// Message identifier, UTF-8.
     const std::string& GetID() const noexcept { return msgID_; }
@@ -28,10 +29,12 @@ class RuntimeException {
     const std::string& getFunctionName() const noexcept { return functionName_; }
     /// The stack, in the order in which the raiser listed it.
     const std::vector<StackFrame>& getStackFrames() const noexcept { return frames_; }
+    /// The errors that caused this one, in the order in which the raiser listed them.
     const std::vector<RuntimeException>& getCauses() const noexcept { return causes_; }
+    /// Whether the text has been shown to the user already. False in a record from a peer.
     bool getShown() const noexcept { return shown_; }
 
-    bool operator==(const RuntimeException&) const = default;
+    bool operator==(const RuntimeException&) const = default;  ///< the same in every part, causes included
 
   private:
     krutil::cmddistributor::inExecutionStatus status_;

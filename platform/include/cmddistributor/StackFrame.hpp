@@ -11,7 +11,7 @@ struct StackFrame {
     std::string func;     ///< function name, UTF-8
     double line = 0;      ///< line number; 0 when unknown
 
-    bool operator==(const StackFrame&) const = default;
+    bool operator==(const StackFrame&) const = default;  ///< the same in every part
 };
 
 }  // namespace cmddistributor

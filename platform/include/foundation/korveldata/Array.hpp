@@ -26,7 +26,9 @@ namespace foundation::korveldata {
 
 namespace detail {
 class ArrayStorage;
+/// Adds a share in the storage; from any thread.
 void intrusive_ptr_add_ref(ArrayStorage* storage) noexcept;
+/// Drops a share, and the storage with the last one; from any thread.
 void intrusive_ptr_release(ArrayStorage* storage) noexcept;
 }  // namespace detail
 
@@ -53,10 +55,12 @@ class Array final {
 
     /// Shares the elements; cheap for elements of any number.
     Array(const Array& other);
+    /// Shares the elements of `other`, and drops the share in those that it had.
     Array& operator=(const Array& other);
 
     /// Leaves `other` as a default array.
     Array(Array&& other) noexcept;
+    /// Drops the share in the elements that it had, and leaves `other` as a default array.
     Array& operator=(Array&& other) noexcept;
 
     /// An array over memory of another owner, without a copy: `elements` must stay valid and unchanged until `owner` is
@@ -65,11 +69,13 @@ class Array final {
     static Array overMemory(ElementType type, const std::vector<std::uint64_t>& dimensions, MemoryOrder order,
                             const void* elements, std::shared_ptr<const void> owner);
 
+    /// Type of the elements.
     ElementType elementType() const noexcept { return type_; }
 
     /// Extent of each dimension; none for a scalar. Valid until the array is assigned to or destroyed.
     std::span<const std::uint64_t> dimensions() const noexcept { return {dimensions_.data(), dimensions_.size()}; }
 
+    /// How the elements are laid out.
     MemoryOrder order() const noexcept { return order_; }
 
     /// Product of the dimensions: 1 for a scalar.

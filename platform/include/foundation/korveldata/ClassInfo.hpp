@@ -11,7 +11,7 @@ struct ClassInfo {
     std::string name;                        ///< qualified name of the class
     std::vector<std::string> propertyNames;  ///< in declaration order
 
-    bool operator==(const ClassInfo&) const = default;
+    bool operator==(const ClassInfo&) const = default;  ///< the same in every part
 };
 
 }  // namespace foundation::korveldata

@@ -56,6 +56,7 @@ std::string_view elementTypeName(ElementType type) noexcept;
 template <typename T>
 struct ElementTypeOf;
 
+/// An element type as a C++ type, from which ElementTypeOf derives.
 template <ElementType type>
 using ElementTypeConstant = std::integral_constant<ElementType, type>;
 

@@ -9,6 +9,8 @@ namespace krutil::capabilities_api {
 /// Published by whichever side changed. Immutable.
 class CapabilitiesChanged : public foundation::msg_svc::eventmgr::BaseEvent {
   public:
+    /// The capabilities before the change; those of the engine and of the client now; and those that the running
+    /// request asks for.
     CapabilitiesChanged(::capabilities::CapabilityList previous, ::capabilities::CapabilityList qvm,
                         ::capabilities::CapabilityList client, ::capabilities::CapabilityList request);
     ~CapabilitiesChanged() override;

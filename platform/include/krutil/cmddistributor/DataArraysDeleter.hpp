@@ -9,6 +9,7 @@ namespace krutil::cmddistributor {
 
 /// Deleter of the vector that an EDIDataWrapper owns. Null is ignored.
 struct DataArraysDeleter {
+    /// Destroys the arrays and frees the vector.
     void operator()(std::vector<foundation::korveldata::Array>* arrays) const noexcept;
 };
 

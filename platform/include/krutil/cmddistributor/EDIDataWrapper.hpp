@@ -13,6 +13,7 @@ namespace krutil::cmddistributor {
 class EDIDataWrapper {
   public:
     EDIDataWrapper() noexcept = default;
+    /// Moves the arrays in; their elements stay where they are.
     explicit EDIDataWrapper(std::vector<foundation::korveldata::Array>&& arrays);
 
     /// The arrays in argument order; empty for a default wrapper. Valid as long as the wrapper keeps them.

@@ -5,6 +5,7 @@
 
 namespace krutil::contextmgr {
 
+/// 0 where an engine has one instance only.
 using QcrID = std::int32_t;
 
 }  // namespace krutil::contextmgr

@@ -12,8 +12,8 @@ class SinkTraits {
     /// `untransmitted` stays in the process: a copy rebuilt from a stream has it false.
     SinkTraits(bool untransmitted, bool supportsHotlinks, bool needsFormattingForDisplay, bool useDiary, bool useEcho,
                bool useLogging) noexcept;
-    SinkTraits(const SinkTraits&) noexcept = default;
-    SinkTraits& operator=(const SinkTraits&) noexcept = default;
+    SinkTraits(const SinkTraits&) noexcept = default;             ///< copies every trait
+    SinkTraits& operator=(const SinkTraits&) noexcept = default;  ///< copies every trait
     virtual ~SinkTraits();
 
     /// Set by the process that owns the sink; never travels.
@@ -29,6 +29,7 @@ class SinkTraits {
     /// The text is written to the engine's log as well.
     bool getUseLogging() const noexcept { return useLogging_; }
 
+    /// The same in every trait, the one that does not travel included.
     bool operator==(const SinkTraits& other) const noexcept;
 
   private:

@@ -11,10 +11,12 @@ namespace krutil::io {
 /// A piece of text and the stream it belongs to. Immutable.
 class TextBase {
   public:
+    /// `text` is UTF-16.
     TextBase(StreamTypeEnum streamType, std::u16string text) noexcept
         : text_(std::move(text)), streamType_(streamType) {}
     virtual ~TextBase();
 
+    /// The stream that the text belongs to.
     StreamTypeEnum getStreamType() const noexcept { return streamType_; }
     /// UTF-16.
     const std::u16string& getText() const noexcept { return text_; }

@@ -14,6 +14,7 @@ class TextBaseEvent : public foundation::msg_svc::eventmgr::BaseEvent,
                       public TextBase,
                       public ::cmddistributor::RequestIdAdapter {
   public:
+    /// `id` is that of the request; the default one for text of none.
     TextBaseEvent(foundation::msg_svc::exchange::IDType id, StreamTypeEnum streamType, std::u16string text);
     ~TextBaseEvent() override;
 };

@@ -21,6 +21,7 @@ class EventDescriptor {
         }
     }
 
+    /// The descriptor, to wait for. It stays with this object.
     int get() const noexcept { return descriptor_.get(); }
 
     /// Makes it readable. Keeps errno.

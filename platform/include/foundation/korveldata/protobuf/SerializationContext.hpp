@@ -34,9 +34,13 @@ std::unique_ptr<KORVEL_Array> createKORVEL_Array();
 /// Converts the arrays of one message: to their messages and back.
 class SerializationContext : public SerializationContextBase {
   public:
+    /// A name and the name that replaces it.
     using StringTable = std::unordered_map<std::string, std::string>;
+    /// Class names and their ids, found by either.
     using ClassIdTable = boost::bimap<std::string, unsigned>;
+    /// Classes by id.
     using ClassTable = std::map<unsigned, ClassInfo>;
+    /// Object ids of the sender, and those of the receiver for them.
     using ObjectIdTable = std::map<std::uint64_t, std::uint64_t>;
 
     /// `checkContent`: arrays of bool are refused on the way in when a byte is neither 0 nor 1; this reads each byte of
@@ -61,18 +65,25 @@ class SerializationContext : public SerializationContextBase {
     /// its bytes, std::invalid_argument for a null message, and what the reader throws.
     Array convertFromProtobuf(std::unique_ptr<KORVEL_Array> message);
 
+    /// Makes the arrays that are converted from messages.
     ArrayFactory& factory() const noexcept { return factory_; }
+    /// Whether bytes of arrays of bool are looked at on the way in.
     bool checkContent() const noexcept { return checkContent_; }
+    /// Whether the writer gets buffers of any size.
     bool everyBufferOutOfLine() const noexcept { return everyBufferOutOfLine_; }
+    /// Where elements go; may be null.
     const std::shared_ptr<DataFrameWriter>& writer() const noexcept { return writer_; }
+    /// Where elements come from; may be null.
     const std::shared_ptr<DataFrameReader>& reader() const noexcept { return reader_; }
 
-    /// Working tables for arrays of objects: names replaced by others, class names and their ids, the classes by id,
-    /// and object ids of the sender with those of the receiver. Arrays of the types that ArrayFactory builds leave them
-    /// empty.
+    /// Names of the sender that are replaced by others. Like the other three, a working table for arrays of objects:
+    /// arrays of the types that ArrayFactory builds leave it empty.
     const StringTable& replacedNames() const noexcept { return replacedNames_; }
+    /// Class names and their ids in this message.
     const ClassIdTable& classIds() const noexcept { return classIds_; }
+    /// The classes in this message, by id.
     const ClassTable& classes() const noexcept { return classes_; }
+    /// Object ids of the sender, and those of the receiver for them.
     const ObjectIdTable& objectIds() const noexcept { return objectIds_; }
 
   private:

@@ -20,7 +20,9 @@ namespace foundation::msg_svc::eventmgr {
 /// too; a subscriber removed while an event is being delivered may still see that one event.
 class EventMgr {
   public:
+    /// Names a subscription; no number is used twice.
     using Subscription = std::uint64_t;
+    /// What is called with an event. The event may be kept.
     using Callback = std::function<void(const boost::shared_ptr<const BaseEvent>&)>;
 
     /// Calls `callback` with each event whose dynamic type is exactly `EventT`.

@@ -11,9 +11,11 @@ namespace korvel::lang::diagnostic {
 class IssuedEnabledWarningEvent : public foundation::msg_svc::eventmgr::BaseEvent,
                                   public ::cmddistributor::RequestIdAdapter {
   public:
+    /// `id` is that of the request that issued `warning`, which is copied.
     IssuedEnabledWarningEvent(foundation::msg_svc::exchange::IDType id, const Warning& warning);
     ~IssuedEnabledWarningEvent() override;
 
+    /// The warning. Valid as long as the event.
     const Warning& getWarning() const noexcept { return warning_; }
 
   private:

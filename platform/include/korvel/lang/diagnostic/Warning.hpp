@@ -20,6 +20,7 @@ class Warning {
     const std::string& getIdentifier() const noexcept { return identifier_; }
     /// Format text before its arguments are put in.
     const std::u16string& getFormat() const noexcept { return format_; }
+    /// What is put into the format text, in order.
     const std::vector<PrintfArgument>& getArguments() const noexcept { return arguments_; }
     /// The text with its arguments put in.
     const std::u16string& getMessage() const noexcept { return message_; }
@@ -30,7 +31,7 @@ class Warning {
     /// Time of issue, a date number.
     double getTime() const noexcept { return time_; }
 
-    bool operator==(const Warning&) const = default;
+    bool operator==(const Warning&) const = default;  ///< the same in every part
 
   private:
     std::string identifier_;

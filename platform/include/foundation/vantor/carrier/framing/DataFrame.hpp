@@ -15,6 +15,7 @@ class DataFrame final : public Frame {
     DataFrame(FrameType type, unsigned int streamID, FrameBuffer&& buffer, bool shareable, unsigned long frameIndex);
     ~DataFrame() override;
 
+    /// Whether the bytes stay as they are while the frame lives.
     bool shareable() const noexcept { return shareable_; }
 
   private:

@@ -36,8 +36,11 @@ class Frame {
     Frame(const Frame&) = delete;
     Frame& operator=(const Frame&) = delete;
 
+    /// What the content is for.
     FrameType type() const noexcept { return type_; }
+    /// The exchange that the frame belongs to.
     StreamID streamID() const noexcept { return streamID_; }
+    /// Position in its message.
     FrameIndex index() const noexcept { return index_; }
 
     /// First byte of the content; valid until releaseBuffer() or destruction. May be null when size() is 0.
@@ -50,6 +53,7 @@ class Frame {
     FrameBuffer releaseBuffer() noexcept;
 
   protected:
+    /// Takes over `buffer`, which may be null.
     Frame(FrameType type, StreamID streamID, FrameBuffer&& buffer, FrameIndex index) noexcept;
 
   private:

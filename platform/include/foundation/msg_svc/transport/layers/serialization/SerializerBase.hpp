@@ -18,8 +18,11 @@ class SerializerBase {
     SerializerBase(const SerializerBase&) = delete;
     SerializerBase& operator=(const SerializerBase&) = delete;
 
+    /// Also the tag of the objects' frames.
     const std::string& name() const noexcept { return name_; }
+    /// The concrete class whose objects the serializer handles.
     const std::type_info& type() const noexcept { return *type_; }
+    /// (major, minor).
     const std::pair<unsigned int, unsigned int>& version() const noexcept { return version_; }
 
     /// The SerializerAPI that this is; SerializerBase for an object that is none.

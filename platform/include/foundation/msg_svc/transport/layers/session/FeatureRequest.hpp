@@ -16,13 +16,17 @@ enum class FeatureHandling : int {
 /// first.
 class FeatureRequest {
   public:
+    /// One acceptable `value` of the feature `name`. Both are copied.
     FeatureRequest(const std::string& name, const std::string& value, FeatureHandling handling);
 
+    /// Name of the feature.
     const std::string& name() const noexcept { return name_; }
+    /// The value that the protocol can work with.
     const std::string& value() const noexcept { return value_; }
+    /// What a session does about it.
     FeatureHandling handling() const noexcept { return handling_; }
 
-    bool operator==(const FeatureRequest&) const = default;
+    bool operator==(const FeatureRequest&) const = default;  ///< the same in every part
 
   private:
     std::string name_;

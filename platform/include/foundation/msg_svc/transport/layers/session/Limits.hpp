@@ -16,7 +16,7 @@ struct Limits {
     std::uint64_t message = 4ULL << 30;        ///< bytes of all frames of one message, data frames included
     std::uint64_t frames = 65'536;             ///< frames of one message
 
-    bool operator==(const Limits&) const = default;
+    bool operator==(const Limits&) const = default;  ///< the same in every part
 };
 
 }  // namespace foundation::msg_svc::transport::layers::session

@@ -32,8 +32,8 @@ class ProtocolRegistry {
   public:
     /// What a protocol has registered.
     struct Protocol {
-        ProtocolInitializer initialize;
-        ProtocolConfiguration configuration;
+        ProtocolInitializer initialize;       ///< fills the registry of a session
+        ProtocolConfiguration configuration;  ///< lists what a session may negotiate
     };
 
     /// The one registry of the process.

@@ -32,13 +32,14 @@ struct Traffic {
 
 /// Why a session is over.
 struct SessionEnd {
+    /// What has ended it.
     enum class Reason {
         Finished,   ///< both ends were done: the engine's shutdown event was the last message
         Lost,       ///< the byte stream ended or failed early
         Violation,  ///< this end refused what the peer sent, or the peer refused what this end sent
         Closed,     ///< close() was called here
     };
-    Reason reason;
+    Reason reason;     ///< what has ended it
     std::string text;  ///< a sentence for a person; empty for Finished and Closed
 };
 
@@ -81,11 +82,13 @@ class Session {
     Session(const Session&) = delete;
     Session& operator=(const Session&) = delete;
 
+    /// What the handshake told about the other end. Valid as long as the session.
     const Peer& peer() const noexcept;
 
     /// The settled features, name to value.
     const std::unordered_map<std::string, std::string>& features() const noexcept;
 
+    /// The serializers of the settled version.
     const std::shared_ptr<const serialization::Registry>& registry() const noexcept;
 
     /// Starts the I/O thread. Call once. `handler` must outlive the session.
@@ -111,8 +114,10 @@ class Session {
     /// sent either). A message of a new exchange needs a stream ID from newStreamID(); an event needs an open
     /// exchange's ID or 0; a reply closes its exchange.
     void send(framing::StreamID stream, const boost::shared_ptr<const exchange::Message>& message);
+    /// The same for a reply (engines only).
     void send(framing::StreamID stream, const boost::shared_ptr<const exchange::Reply>& reply,
               Urgency urgency = Urgency::Output);
+    /// The same for an event.
     void send(framing::StreamID stream, const boost::shared_ptr<const eventmgr::BaseEvent>& event,
               Urgency urgency = Urgency::Output);
 

@@ -24,15 +24,15 @@ enum class Role { Client, Engine };
 
 /// One frame on its way, as a trace sees it. Valid during the call only.
 struct FrameTrace {
-    bool outgoing;
+    bool outgoing;                ///< sent by this end; else received
     bool last;                    ///< the last frame of its message
     const framing::Frame& frame;  ///< a TaggedFrame or a DataFrame, content included
 };
 
 /// A value of one of the protocol's features that this process cannot work with, though the protocol lists it.
 struct UnusableFeature {
-    std::string name;
-    std::string value;
+    std::string name;   ///< name of the feature
+    std::string value;  ///< the value of it
 
     /// Whether the value is offered to the peer all the same. A session that settles on it is refused.
     bool offered = false;
@@ -41,16 +41,16 @@ struct UnusableFeature {
     /// switched off)", without it begins "(IT_IS_OFF is set) for the client, so it does not accept ...".
     std::string reason;
 
-    bool operator==(const UnusableFeature&) const = default;
+    bool operator==(const UnusableFeature&) const = default;  ///< the same in every part
 };
 
 /// How this end presents itself, what it accepts, and what a session needs to know about its protocol. Both ends of a
 /// session are given the same `shutdownEvent` and `clientEvents`.
 struct SessionConfig {
-    Role role = Role::Client;
-    std::string protocol;  ///< looked up in the ProtocolRegistry
-    ProtocolVersion version{0, 0};
-    std::string build;  ///< free text that names this program and its version to the peer
+    Role role = Role::Client;       ///< which end this is
+    std::string protocol;           ///< looked up in the ProtocolRegistry
+    ProtocolVersion version{0, 0};  ///< the version that this end speaks
+    std::string build;              ///< free text that names this program and its version to the peer
 
     /// The event that is the last message of an engine. Without one a client takes every end of its stream for a loss.
     std::optional<std::type_index> shutdownEvent;
@@ -61,8 +61,11 @@ struct SessionConfig {
     /// What this process cannot do of what the protocol lists, decided before any session.
     std::vector<UnusableFeature> unusableFeatures;
 
+    /// What this end accepts; the peer is told.
     Limits limits;
+    /// What this end can do; the peer is told.
     ::capabilities::CapabilityList capabilities;
+    /// How long Session::open() waits for the peer at most.
     std::chrono::milliseconds handshakeTimeout{10'000};
 
     /// Lets contents of data frames of 1 MiB and more stay in memory that both ends see, where the peer wants that too,
@@ -93,9 +96,9 @@ struct SessionConfig {
 
 /// What the handshake told about the other end.
 struct Peer {
-    std::string build;
-    Limits limits;
-    ::capabilities::CapabilityList capabilities;
+    std::string build;                            ///< what the peer says about its program and version
+    Limits limits;                                ///< what the peer accepts
+    ::capabilities::CapabilityList capabilities;  ///< what the peer can do
 };
 
 }  // namespace foundation::msg_svc::transport::layers::session

@@ -11,7 +11,9 @@ namespace foundation::msg_svc::transport::layers::session {
 /// docs/recording.md says what a unit is, and in which order they come.
 class SessionRecorder {
   public:
+    /// Seen from the end that records.
     enum class Direction { Received, Sent };
+    /// What a unit is: a part of the handshake, the probe included, or a frame.
     enum class Part { Handshake, Frame };
 
     /// The pieces of a unit lie one behind the other on the stream. They are valid during the call. A content in shared
