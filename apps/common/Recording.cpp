@@ -10,6 +10,7 @@
 #include <system_error>
 #include <utility>
 
+#include "common/Pcapng.hpp"
 #include "foundation/core/posix/writeFully.hpp"
 
 namespace apps {
@@ -17,31 +18,10 @@ namespace {
 
 namespace posix = foundation::core::posix;
 
-constexpr std::uint32_t sectionHeader = 0x0A0D0D0A;
-constexpr std::uint32_t byteOrderMagic = 0x1A2B3C4D;
-constexpr std::uint32_t interfaceDescription = 1;
-constexpr std::uint32_t enhancedPacket = 6;
-constexpr std::uint16_t upperPdu = 252;
-
-constexpr std::uint16_t endOfOptions = 0;
-constexpr std::uint16_t comment = 1;
-constexpr std::uint16_t userApplication = 4;  // of a section
-constexpr std::uint16_t interfaceName = 2;    // of an interface
-constexpr std::uint16_t timeResolution = 9;   // of an interface
-constexpr std::uint16_t packetFlags = 2;      // of a packet
-constexpr std::uint32_t inbound = 1;
-constexpr std::uint32_t outbound = 2;
-
-// What readers take for a packet at most.
-constexpr std::uint64_t longestPacket = 262'144;
-
 // So much is always kept of a frame.
 constexpr std::uint64_t frameHeader = 24;
 
-// Which dissector is meant. Numbers of the tags are big-endian.
-constexpr std::string_view tags("\0\x0c\0\x08krutil\0\0\0\0\0\0", 16);
-
-constexpr std::uint64_t largestPart = longestPacket - tags.size();
+constexpr std::uint64_t largestPart = pcapng::longestPacket - pcapng::tags.size();
 
 template <class Number>
 void append(std::string& block, Number number) {
@@ -69,7 +49,7 @@ void beginBlock(std::string& block, std::uint32_t type) {
 
 // The block begins at `begin`, and is the last one.
 void endBlock(std::string& block, std::size_t begin = 0) {
-    append(block, endOfOptions);
+    append(block, pcapng::endOfOptions);
     append(block, std::uint16_t{0});
     const auto length = static_cast<std::uint32_t>(block.size() - begin + 4);
     append(block, length);
@@ -128,27 +108,28 @@ Recording::Recording(const RecordOptions& options, std::function<void(const std:
       clock_(now),
       descriptor_(openRecording(options.file, regular_)) {
     // Nothing that happens while a packet is written needs much memory.
-    block_.reserve(longestPacket + 256);
+    block_.reserve(pcapng::longestPacket + 256);
 }
 
 void Recording::beginSession(Role role, const std::string& build) {
     const std::lock_guard lock(mutex_);
     block_.clear();
-    beginBlock(block_, sectionHeader);
-    append(block_, byteOrderMagic);
+    beginBlock(block_, pcapng::sectionHeader);
+    append(block_, pcapng::byteOrderMagic);
     append(block_, std::uint16_t{1});
     append(block_, std::uint16_t{0});
     append(block_, std::int64_t{-1});
-    appendOption(block_, userApplication, build);
+    appendOption(block_, pcapng::userApplication, build);
     endBlock(block_);
 
     const std::size_t begin = block_.size();
-    beginBlock(block_, interfaceDescription);
-    append(block_, upperPdu);
+    beginBlock(block_, pcapng::interfaceDescription);
+    append(block_, pcapng::upperPdu);
     append(block_, std::uint16_t{0});
-    append(block_, static_cast<std::uint32_t>(longestPacket));
-    appendOption(block_, interfaceName, (role == Role::Client ? "client " : "engine ") + std::to_string(::getpid()));
-    appendOption(block_, timeResolution, "\x09");
+    append(block_, static_cast<std::uint32_t>(pcapng::longestPacket));
+    appendOption(block_, pcapng::interfaceName,
+                 (role == Role::Client ? "client " : "engine ") + std::to_string(::getpid()));
+    appendOption(block_, pcapng::timeResolution, "\x09");
     endBlock(block_, begin);
     write();
 }
@@ -168,22 +149,22 @@ void Recording::record(Direction direction, Part part, std::span<const iovec> un
         // Only the last packet tells of what is missing.
         const std::uint64_t missing = first + count == kept ? size - kept : 0;
         const std::uint64_t original =
-            std::min<std::uint64_t>(tags.size() + count + missing, std::numeric_limits<std::uint32_t>::max());
+            std::min<std::uint64_t>(pcapng::tags.size() + count + missing, std::numeric_limits<std::uint32_t>::max());
         block_.clear();
-        beginBlock(block_, enhancedPacket);
+        beginBlock(block_, pcapng::enhancedPacket);
         append(block_, std::uint32_t{0});
         append(block_, static_cast<std::uint32_t>(nanoseconds >> 32U));
         append(block_, static_cast<std::uint32_t>(nanoseconds));
-        append(block_, static_cast<std::uint32_t>(tags.size() + count));
+        append(block_, static_cast<std::uint32_t>(pcapng::tags.size() + count));
         append(block_, static_cast<std::uint32_t>(original));
-        block_ += tags;
+        block_ += pcapng::tags;
         appendBytes(block_, unit, first, count);
         pad(block_);
-        append(block_, packetFlags);
+        append(block_, pcapng::packetFlags);
         append(block_, std::uint16_t{4});
-        append(block_, direction == Direction::Sent ? outbound : inbound);
+        append(block_, direction == Direction::Sent ? pcapng::outbound : pcapng::inbound);
         if (count != size) {
-            appendOption(block_, comment,
+            appendOption(block_, pcapng::comment,
                          "bytes " + std::to_string(first) + "-" + std::to_string(first + count - 1) + " of " +
                              std::to_string(size));
         }
