@@ -20,15 +20,16 @@ bool equalIgnoringCase(std::string_view left, std::string_view right) {
 
 // The library's own reader of sizes takes a sign, and numbers that wrap around.
 CLI::Option* addNumber(CLI::App& app, const std::string& name, std::uint64_t& number, std::uint64_t largest,
-                       const std::string& description) {
+                       const std::string& description, std::uint64_t smallest = 1) {
     return app
         .add_option_function<std::string>(
             name, [&number](const std::string& text) { number = parseSize(text).value(); }, description)
-        ->check([largest](const std::string& text) {
+        ->check([smallest, largest](const std::string& text) {
             const auto size = parseSize(text);
-            return size && *size >= 1 && *size <= largest ? std::string()
-                                                          : "expected a number from 1 to " + std::to_string(largest) +
-                                                                ", if need be with a unit such as MiB, got " + text;
+            return size && *size >= smallest && *size <= largest
+                       ? std::string()
+                       : "expected a number from " + std::to_string(smallest) + " to " + std::to_string(largest) +
+                             ", if need be with a unit such as MiB, got " + text;
         })
         ->group("Limits");
 }
@@ -62,8 +63,8 @@ std::string sizeText(std::uint64_t bytes) {
 }
 
 CLI::Option* addSizeOption(CLI::App& app, const std::string& name, std::uint64_t& bytes, const std::string& description,
-                           std::uint64_t largest) {
-    return addNumber(app, name, bytes, largest, description)->type_name("SIZE")->default_str(sizeText(bytes));
+                           std::uint64_t largest, std::uint64_t smallest) {
+    return addNumber(app, name, bytes, largest, description, smallest)->type_name("SIZE")->default_str(sizeText(bytes));
 }
 
 void addLimitOptions(CLI::App& app, foundation::msg_svc::transport::layers::session::Limits& limits) {

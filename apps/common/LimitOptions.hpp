@@ -18,10 +18,11 @@ namespace apps {
 /// `limits` must outlive `app`.
 void addLimitOptions(CLI::App& app, foundation::msg_svc::transport::layers::session::Limits& limits);
 
-/// Adds one option in the group "Limits" that takes a size from 1 to `largest` and stores it into `bytes`, whose
-/// present value is shown as the default. `bytes` must outlive `app`.
+/// Adds one option in the group "Limits" that takes a size from `smallest` to `largest` and stores it into `bytes`,
+/// whose present value is shown as the default. `bytes` must outlive `app`.
 CLI::Option* addSizeOption(CLI::App& app, const std::string& name, std::uint64_t& bytes, const std::string& description,
-                           std::uint64_t largest = std::numeric_limits<std::uint64_t>::max());
+                           std::uint64_t largest = std::numeric_limits<std::uint64_t>::max(),
+                           std::uint64_t smallest = 1);
 
 /// A size as addLimitOptions() describes it, in bytes; empty for anything else, for a sign and for what 64 bits cannot
 /// hold.

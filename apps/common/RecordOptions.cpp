@@ -10,6 +10,14 @@ void addRecordOptions(CLI::App& app, RecordOptions& options, const std::string& 
         ->default_str("")
         ->needs(file)
         ->group(group);
+    addSizeOption(
+        app, "--record-size", options.size,
+        "Bound the file: rename it to FILE.1 when it would become larger, in the place of an earlier one, and "
+        "begin another; 1MiB or more",
+        std::numeric_limits<std::uint64_t>::max(), RecordOptions::smallestSize)
+        ->default_str("")
+        ->needs(file)
+        ->group(group);
 }
 
 }  // namespace apps

@@ -6,6 +6,8 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdio>
+#include <filesystem>
 #include <stdexcept>
 #include <system_error>
 #include <utility>
@@ -70,8 +72,9 @@ void appendBytes(std::string& block, std::span<const iovec> unit, std::uint64_t 
     }
 }
 
-posix::OwnedDescriptor openRecording(const std::string& path, bool& regular) {
-    const std::string cannot = "cannot record to '" + path + "'";
+// Errors have the name that the user gave.
+posix::OwnedDescriptor openRecording(const std::string& path, const std::string& name, bool& regular) {
+    const std::string cannot = "cannot record to '" + name + "'";
     posix::OwnedDescriptor file(
         ::open(path.c_str(), O_WRONLY | O_CREAT | O_NOFOLLOW | O_NOCTTY | O_CLOEXEC, S_IRUSR | S_IWUSR));
     struct stat status {};
@@ -99,27 +102,66 @@ timespec now() {
     return time;
 }
 
+// Bytes that so many bytes of a unit take in a file besides themselves, at most.
+std::uint64_t overheadOf(std::uint64_t kept) {
+    return (kept / largestPart + 1) * RecordedState::overhead;
+}
+
+// The memory for frames that are repeated: what is left of a file is most of it.
+std::uint64_t boundOfState(std::uint64_t limit) {
+    return std::min<std::uint64_t>(limit / 4, 4'194'304);
+}
+
 }  // namespace
 
 Recording::Recording(const RecordOptions& options, std::function<void(const std::string&)> complain)
     : file_(options.file),
+      path_(std::filesystem::absolute(options.file)),
       snap_(std::max(options.snap, frameHeader)),
+      limit_(options.size),
       complain_(std::move(complain)),
       clock_(now),
-      descriptor_(openRecording(options.file, regular_)) {
+      descriptor_(openRecording(path_, file_, regular_)) {
+    if (limit_ != 0) {
+        if (!regular_) {
+            throw std::runtime_error(
+                "cannot record to '" + file_ +
+                "': expected a regular file, because its size is bounded; leave out --record-size");
+        }
+        state_.emplace(boundOfState(limit_));
+    }
     // Nothing that happens while a packet is written needs much memory.
     block_.reserve(pcapng::longestPacket + 256);
 }
 
 void Recording::beginSession(Role role, const std::string& build) {
     const std::lock_guard lock(mutex_);
+    role_ = role;
+    build_ = build;
+    try {
+        if (state_) {
+            state_->beginSession(role);
+            makeRoom(build.size() + RecordedState::overhead);
+        }
+        writeSection(std::nullopt);
+    } catch (const std::exception& error) {
+        end(error.what());
+    }
+}
+
+// With the mutex held. The first `repeated` units of the section were in an earlier file; without, a session begins.
+void Recording::writeSection(std::optional<std::size_t> repeated) {
     block_.clear();
     beginBlock(block_, pcapng::sectionHeader);
     append(block_, pcapng::byteOrderMagic);
     append(block_, std::uint16_t{1});
     append(block_, std::uint16_t{0});
     append(block_, std::int64_t{-1});
-    appendOption(block_, pcapng::userApplication, build);
+    if (repeated) {
+        appendOption(block_, pcapng::comment,
+                     "continued: repeats " + std::to_string(*repeated) + " packets of an earlier file");
+    }
+    appendOption(block_, pcapng::userApplication, build_);
     endBlock(block_);
 
     const std::size_t begin = block_.size();
@@ -128,22 +170,79 @@ void Recording::beginSession(Role role, const std::string& build) {
     append(block_, std::uint16_t{0});
     append(block_, static_cast<std::uint32_t>(pcapng::longestPacket));
     appendOption(block_, pcapng::interfaceName,
-                 (role == Role::Client ? "client " : "engine ") + std::to_string(::getpid()));
+                 (role_ == Role::Client ? "client " : "engine ") + std::to_string(::getpid()));
     appendOption(block_, pcapng::timeResolution, "\x09");
     endBlock(block_, begin);
     write();
 }
 
 void Recording::record(Direction direction, Part part, std::span<const iovec> unit) noexcept {
+    const std::lock_guard lock(mutex_);
+    if (!complete_) {
+        return;
+    }
+    try {
+        recordUnit(direction, part, unit);
+    } catch (const std::exception& error) {
+        end(error.what());
+    }
+}
+
+// With the mutex held.
+void Recording::recordUnit(Direction direction, Part part, std::span<const iovec> unit) {
     std::uint64_t size = 0;
     for (const iovec& piece : unit) {
         size += piece.iov_len;
     }
-    const std::uint64_t kept = part == Part::Frame ? std::min(size, snap_) : size;
-    const std::lock_guard lock(mutex_);
+    std::uint64_t kept = part == Part::Frame ? std::min(size, snap_) : size;
     const timespec time = clock_();
     const auto nanoseconds =
         static_cast<std::uint64_t>(time.tv_sec) * 1'000'000'000U + static_cast<std::uint64_t>(time.tv_nsec);
+    if (state_) {
+        if (makeRoom(kept + overheadOf(kept))) {
+            repeatState();
+        }
+        const std::uint64_t room = limit_ - written_;
+        if (kept + overheadOf(kept) > room) {
+            kept = room - overheadOf(room);
+        }
+    }
+    writeUnit(direction, nanoseconds, unit, kept, size);
+    fresh_ = false;
+    if (state_) {
+        state_->note(direction, part, nanoseconds, unit, size);
+    }
+}
+
+// With the mutex held. Begins another file unless so many bytes fit into this one, or it would not help. Returns
+// whether there is another one. Throws what the system refuses.
+bool Recording::makeRoom(std::uint64_t bytes) {
+    if (fresh_ || bytes <= limit_ - written_) {
+        return false;
+    }
+    if (std::rename(path_.c_str(), (path_ + ".1").c_str()) != 0) {
+        throw std::system_error(errno, std::generic_category(), "cannot rename '" + file_ + "' to '" + file_ + ".1'");
+    }
+    descriptor_ = openRecording(path_, file_, regular_);
+    written_ = 0;
+    fresh_ = true;
+    return true;
+}
+
+// With the mutex held. The session goes on in another file.
+void Recording::repeatState() {
+    const auto units = state_->units();
+    writeSection(units.size());
+    for (const RecordedState::Unit* unit : units) {
+        std::string bytes = unit->bytes;
+        const iovec piece{bytes.data(), bytes.size()};
+        writeUnit(unit->direction, unit->nanoseconds, {&piece, 1}, bytes.size(), unit->size);
+    }
+}
+
+// With the mutex held. The first `kept` bytes of a unit of `size` bytes.
+void Recording::writeUnit(Direction direction, std::uint64_t nanoseconds, std::span<const iovec> unit,
+                          std::uint64_t kept, std::uint64_t size) {
     for (std::uint64_t first = 0; first < kept && complete_; first += largestPart) {
         const std::uint64_t count = std::min(kept - first, largestPart);
         // Only the last packet tells of what is missing.
@@ -183,12 +282,18 @@ void Recording::write() {
         return;
     }
     const std::string reason = std::generic_category().message(errno);
-    complete_ = false;
     // Readers take a part of a block for damage. Where that cannot be undone, they still read what is before it.
     if (regular_ && ::ftruncate(descriptor_.get(), static_cast<off_t>(written_)) != 0) {
         regular_ = false;
     }
-    complain_("cannot write to '" + file_ + "': " + reason + "; the recording ends here");
+    end("cannot write to '" + file_ + "': " + reason);
+}
+
+// With the mutex held.
+void Recording::end(const std::string& reason) {
+    if (std::exchange(complete_, false)) {
+        complain_(reason + "; the recording ends here");
+    }
 }
 
 bool Recording::isComplete() const {

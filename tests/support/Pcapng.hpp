@@ -12,6 +12,7 @@
 namespace test_support {
 
 struct RecordedPacket {
+    std::string section;  ///< the comment of the section
     std::string interface;
     std::uint32_t flags = 0;
     std::uint64_t nanoseconds = 0;
@@ -38,6 +39,7 @@ inline std::vector<RecordedPacket> packetsOf(std::string_view file) {
     };
     const std::string_view tags("\0\x0c\0\x08krutil\0\0\0\0\0\0", 16);
     std::vector<RecordedPacket> packets;
+    std::string section;
     std::string interface;
     while (!file.empty()) {
         const std::size_t size = file.size() < 12 ? 0 : number(file, 4);
@@ -48,6 +50,7 @@ inline std::vector<RecordedPacket> packetsOf(std::string_view file) {
         switch (number(file, 0)) {
             case 0x0A0D0D0A:
                 interface.clear();
+                section = options(body.substr(16))[1];
                 break;
             case 1:
                 if (!interface.empty() || number(body, 0) != 252 || number(body, 4) != 262'144) {
@@ -62,6 +65,7 @@ inline std::vector<RecordedPacket> packetsOf(std::string_view file) {
                 }
                 auto found = options(body.substr(20 + (captured + 3) / 4 * 4));
                 RecordedPacket packet;
+                packet.section = section;
                 packet.interface = interface;
                 packet.flags = number(found[2], 0);
                 packet.nanoseconds = std::uint64_t{number(body, 4)} << 32U | number(body, 8);

@@ -109,6 +109,28 @@ TEST_F(ProgramRecordingTest, SnapKeepsBeginnings) {
     EXPECT_EQ(cut, 1U);
 }
 
+TEST_F(ProgramRecordingTest, FileOfBoundedSizeGoesOnInAnother) {
+    const std::string engineFile = directory_.file("engine.pcapng");
+    const Ran ran =
+        runClient({"eval", "for i in range(30): print(str(i) * 50_000, flush=True)", "--record", file_, "--record-size",
+                   "1MiB", "--engine", engine("--record " + engineFile + " --record-size 1MiB")});
+    EXPECT_EQ(ran.exitCode, 0) << ran.err;
+    for (const std::string& file : {file_, engineFile}) {
+        const std::uint32_t fromClient = file == file_ ? outbound : inbound;
+        EXPECT_LE(std::filesystem::file_size(file), 1'048'576U);
+        EXPECT_GT(std::filesystem::file_size(file + ".1"), 900'000U);
+        const auto packets = recorded(file);
+        // First messages, verdicts, tokens and answers; the request, its message, and that it is running.
+        EXPECT_EQ(packets.at(0).section, "continued: repeats 11 packets of an earlier file");
+        const std::string sent = recordedStream(packets, fromClient);
+        EXPECT_THAT(sent, ::testing::StartsWith("\x89KRUTIL\n"));
+        EXPECT_THAT(sent, HasSubstr("for i in range(30)"));
+        EXPECT_THAT(packets.at(10).data, HasSubstr("krutil:IIPStartedEvent"));
+        EXPECT_THAT(packets.at(11).data, HasSubstr("krutil:TextBaseEvent"));
+        EXPECT_THAT(packets.back().data, HasSubstr("krutil:QVMShutdownEvent"));
+    }
+}
+
 TEST_F(ProgramRecordingTest, FullDiskIsSaidOnceAndInTheExitCode) {
     const std::string sentence = "cannot write to '/dev/full': No space left on device; the recording ends here\n";
     const Ran client = runClient({"eval", "1 + 1", "--record", "/dev/full"});

@@ -117,7 +117,10 @@ TEST(CommandLineTest, ErrorsSayWhatIsWrongAndWhereHelpIs) {
         {{"eval", "--engine"}, "krutil: --engine: 1 required COMMAND missing\n"},
         {{"eval", "--handshake-timeout", "0", "x"}, "krutil: --handshake-timeout: "},
         {{"eval", "--handshake-timeout", "soon", "x"}, "krutil: "},
-        {{"eval", "--limit-tag", "65536", "x"}, "krutil: --limit-tag: expected a number from 1 to 65535"}};
+        {{"eval", "--limit-tag", "65536", "x"}, "krutil: --limit-tag: expected a number from 1 to 65535"},
+        {{"eval", "--record", "r", "--record-size", "1023KiB", "x"},
+         "krutil: --record-size: expected a number from 1048576 to "},
+        {{"eval", "--record-size", "1MiB", "x"}, "krutil: --record-size requires --record\n"}};
     for (const auto& [arguments, sentence] : cases) {
         const Finished finished = parseFinished(arguments);
         EXPECT_EQ(finished.code, ExitCode::Usage) << sentence;
