@@ -46,6 +46,8 @@ ecosystem_packages=(
 )
 # The conformance vectors' reader in JavaScript; not asked for where a Node.js from elsewhere has both programs.
 javascript_packages=(nodejs npm)
+# What ./scripts/debian-packages needs besides.
+debian_packages=(debhelper dh-python dpkg-dev python3-all python3-setuptools lintian)
 clang_packages=(libclang-rt-14-dev)
 tidy_packages=(clang-tidy)
 reference_packages=(doxygen)

@@ -5,7 +5,7 @@ import re
 import tempfile
 import unittest
 
-from tree import BUILD, LIBRARIES, PREFIX, find, library_directory, loaded_libraries, main, run
+from tree import BUILD, CHECKOUT, LIBRARIES, PREFIX, find, library_directory, loaded_libraries, main, run
 
 
 class Layout(unittest.TestCase):
@@ -48,6 +48,22 @@ class Layout(unittest.TestCase):
             self.assertEqual(sorted(os.listdir(scratch)), ["lib", "share"])
             self.assertEqual(sorted(os.listdir(os.path.join(scratch, "lib/cmake/krutil_protobuf"))),
                              ["krutil_protobufConfig.cmake", "krutil_protobufConfigVersion.cmake"])
+
+    def test_each_file_belongs_to_a_debian_package(self):
+        directory = os.path.join(CHECKOUT, "debian")
+        patterns = []
+        for name in os.listdir(directory):
+            if name.endswith(".install") and not name.startswith("python3-"):
+                with open(os.path.join(directory, name), encoding="utf-8") as file:
+                    patterns += [(name, pattern) for pattern in file.read().split()]
+        for place, _, names in os.walk(PREFIX):
+            for name in names:
+                path = os.path.join("usr", os.path.relpath(os.path.join(place, name), PREFIX))
+                # Debian has libraries in a directory for each architecture.
+                path = re.sub("^usr/lib/", "usr/lib/any/", path)
+                owners = {owner for owner, pattern in patterns
+                          if re.match(pattern.replace(".", r"\.").replace("*", "[^/]*") + "(/|$)", path)}
+                self.assertEqual(len(owners), 1, f"{path}: expected in one file debian/*.install, got {sorted(owners)}")
 
     @unittest.skipUnless(os.path.exists(os.path.join(BUILD, "bin/krutil")), "the programs are not built")
     def test_the_programs_run_from_the_prefix(self):

@@ -7,6 +7,7 @@ import unittest
 import documents
 import headers
 import includes
+import packages
 import texts
 import wording
 
@@ -254,6 +255,47 @@ class TextsTest(Planted):
     def test_failure_that_is_not_listed(self):
         self.expect(texts.CONVERSIONS + "B.hpp", 'throw std::logic_error("No name in it.");\n',
                     f'{texts.CONVERSIONS}B.hpp: docs/protocol.md does not have "No name in it."')
+
+
+class PackagesTest(Planted):
+    CONTROL = ("Source: krutil-protobuf\nBuild-Depends:\n cmake (>= 3.25),\n debhelper-compat (= 13),\n libicu-dev,\n\n"
+               "Package: libkrutil-platform0\n\nPackage: libkrutil-protobuf0\nDescription: text\n more text\n")
+    BUILD = "build_packages=(\n    g++ cmake\n    libicu-dev  # text\n)\n"
+
+    def setUp(self):
+        super().setUp()
+        self.write("CMakeLists.txt", "project(krutil_protobuf VERSION 0.1.0 LANGUAGES CXX)\n")
+        for path in packages.LIBRARIES.values():
+            self.write(path, "set_target_properties(a PROPERTIES SOVERSION 0)\n")
+        self.write("scripts/packages.sh", self.BUILD)
+        self.write("debian/changelog", "krutil-protobuf (0.1.0) unstable; urgency=medium\n")
+        self.write("debian/control", self.CONTROL)
+
+    def expect(self, path, text, finding):
+        self.assertEqual(packages.check(self.root), [])
+        self.write(path, text)
+        self.assertEqual(packages.check(self.root), [finding])
+
+    def test_version_of_another_release(self):
+        self.expect("CMakeLists.txt", "project(krutil_protobuf VERSION 0.2.0 LANGUAGES CXX)\n",
+                    "debian/changelog: expected version 0.2.0, as CMakeLists.txt has it, got 0.1.0")
+
+    def test_package_of_another_soname(self):
+        path = packages.LIBRARIES["libkrutil-platform"]
+        self.expect(path, "SOVERSION 1)\n",
+                    f"debian/control: expected a package libkrutil-platform1, after the SOVERSION in {path}")
+
+    def test_build_package_that_is_not_asked_for(self):
+        self.expect("scripts/packages.sh", self.BUILD.replace("g++", "g++ libssl-dev"),
+                    "debian/control: Build-Depends lacks libssl-dev, which scripts/packages.sh lists for a build")
+
+    def test_build_package_that_is_no_longer_needed(self):
+        self.expect("scripts/packages.sh", self.BUILD.replace("libicu-dev", ""),
+                    "debian/control: Build-Depends has libicu-dev, which scripts/packages.sh does not list for a build")
+
+    def test_control_file_that_is_none(self):
+        self.expect("debian/control", self.CONTROL + "more\n",
+                    "debian/control: neither a field nor the rest of one: 'more'")
 
 
 if __name__ == "__main__":
