@@ -1,6 +1,7 @@
 """What the installed libraries export, symbol by symbol, and what the product needs of the system.
 
-With --record the lists in exported/ are written anew; the target krutil_record_exports does that.
+The symbols files of the Debian packages list what is exported, and since which version. With --record they are written
+anew; the target krutil_record_exports does that.
 """
 
 import os
@@ -8,7 +9,7 @@ import re
 import sys
 import unittest
 
-from tree import COMPARE_WITH_RECORDED, LIBRARIES, LINK_FLAGS, find, main, run
+from tree import CHECKOUT, COMPARE_WITH_RECORDED, LIBRARIES, LINK_FLAGS, find, main, run
 
 # What C has for the product: its memory, its environment variable, and what each C++ program needs.
 OF_C = re.compile(r"__cxa_\w+|_ITM_\w+|__gmon_start__|_Unwind_Resume|__dynamic_cast|__gxx_personality_v0|__tls_get_addr"
@@ -32,8 +33,32 @@ def exported(name):
     return sorted({symbol for kind, symbol in symbols(find(name), "--defined-only") if kind != "W"})
 
 
-def recorded(name):
-    return os.path.join(os.path.dirname(os.path.abspath(__file__)), "exported", name.replace(".so", ".txt"))
+# A line about one symbol: its name, as C++ has it or as it is, and the version that exported it first.
+LISTED = re.compile(r"^ (?:\(c\+\+\)\"(.*)@Base\"|(\w+)@Base) (\S+)$", re.MULTILINE)
+
+
+def symbols_file(name):
+    soname = re.search(r"SONAME.*\[(\w+)\.so\.(\d+)\]", run("readelf", "--dynamic", find(name)))
+    return os.path.join(CHECKOUT, "debian", f"{soname[1].replace('_', '-')}{soname[2]}.symbols")
+
+
+def listed(text):
+    """Versions by name."""
+    return {match[1] or match[2]: match[3] for match in LISTED.finditer(text)}
+
+
+def record(name):
+    with open(symbols_file(name), encoding="utf-8") as file:
+        text = file.read()
+    with open(os.path.join(CHECKOUT, "CMakeLists.txt"), encoding="utf-8") as file:
+        new = re.search(r"^project\(\S+ VERSION (\S+)", file.read(), re.MULTILINE)[1]
+    versions = listed(text)
+    lines = []
+    for symbol in exported(name):
+        quoted = f"{symbol}@Base" if re.fullmatch(r"\w+", symbol) else f'(c++)"{symbol}@Base"'
+        lines.append(f" {quoted} {versions.get(symbol, new)}\n")
+    with open(symbols_file(name), "w", encoding="utf-8") as file:
+        file.write(re.sub(LISTED.pattern + "\n", "", text, flags=re.MULTILINE) + "".join(lines))
 
 
 @unittest.skipIf(LINK_FLAGS, "sanitizers add symbols of their own")
@@ -43,11 +68,11 @@ class Symbols(unittest.TestCase):
     @unittest.skipUnless(COMPARE_WITH_RECORDED, "the lists are those of an optimised build with GCC")
     def test_exactly_the_recorded_symbols_are_exported(self):
         for name in LIBRARIES:
-            with open(recorded(name), encoding="utf-8") as file:
-                expected = set(file.read().splitlines())
+            with open(symbols_file(name), encoding="utf-8") as file:
+                expected = set(listed(file.read()))
             now = set(exported(name))
             self.assertEqual((sorted(now - expected), sorted(expected - now)), ([], []),
-                             f"{name} exports (more, less) than tests/install/exported says. What is meant to change is "
+                             f"{name} exports (more, less) than {symbols_file(name)} says. What is meant to change is "
                              "stated in the library's exports.map and recorded by the target krutil_record_exports")
 
     def test_nothing_of_other_libraries_is_exported(self):
@@ -72,7 +97,6 @@ class Symbols(unittest.TestCase):
 if __name__ == "__main__":
     if sys.argv[1:] == ["--record"]:
         for library in LIBRARIES:
-            with open(recorded(library), "w", encoding="utf-8") as file:
-                file.write("".join(f"{symbol}\n" for symbol in exported(library)))
+            record(library)
     else:
         main("nm", "readelf")
