@@ -12,7 +12,7 @@ from collections import deque
 from dataclasses import dataclass
 from typing import TYPE_CHECKING, Any, Callable, Optional, Sequence, Union
 
-import numpy
+from .memory import memory_for
 
 if TYPE_CHECKING:
     from .shared import Borrower, Lender, Place
@@ -196,9 +196,8 @@ class Reader:
         return self._buffer[begin:end]
 
     def _read_large(self, size: int, what: str, *numbers: int) -> Buffer:
-        # NumPy does not fill this memory, so it is address space only until the bytes have come.
         try:
-            target = numpy.empty(size, numpy.uint8).data
+            target = memory_for(size)
         except MemoryError:
             raise Violation(f"there is no memory for {what % numbers}, {size} bytes") from None
         done = self._end - self._begin
