@@ -1,4 +1,5 @@
-"""The dissector for Wireshark, with the real tshark and capinfos, on files only."""
+"""The dissector for Wireshark, with the real tshark and capinfos: on files of bytes that a test gives, and on recordings of
+real sessions."""
 
 import json
 import os
@@ -37,6 +38,14 @@ def handshake(recording):
 def manifest():
     with open(os.path.join(recordings.ROOT, "conformance", "manifest.json"), encoding="utf-8") as file:
         return json.load(file)["vectors"]
+
+
+def write_array(path, elements):
+    """A .npy file of so many doubles."""
+    header = f"{{'descr': '<f8', 'fortran_order': False, 'shape': ({elements},), }}"
+    header += " " * (-(len(header) + 11) % 64) + "\n"
+    with open(path, "wb") as file:
+        file.write(b"\x93NUMPY\1\0" + struct.pack("<H", len(header)) + header.encode() + bytes(8 * elements))
 
 
 class DissectorTest(unittest.TestCase):
@@ -178,6 +187,41 @@ class DissectorTest(unittest.TestCase):
         self.assertEqual([(kind, bool(short)) for kind, short in found], [("1", False), ("", True), ("1", False)])
         self.write(recording.bytes())
         self.assertEqual([bool(each) for each, in self.fields("krutil.unknown")[4:]], [False, False, False, True])
+
+    def record(self, *arguments):
+        """Records a real session, which the client makes."""
+        subprocess.run(["krutil", "call", "--record", self.file, *arguments], check=True, stdin=subprocess.DEVNULL,
+                       stdout=subprocess.DEVNULL)
+
+    def check_real(self, expected):
+        """A call with arrays of 1,600,000 bytes, each of which spans packets: the sender and kind of their frames."""
+        content = 1_600_000
+        packets = self.fields("krutil.sender", "krutil.unit", "krutil.kind", "krutil.size", "krutil.shared.size",
+                              "krutil.part", "krutil.gap", "krutil.short", "krutil.unknown", "_ws.malformed")
+        self.assertEqual({packet[6:] for packet in packets}, {("", "", "", "")})
+        large = [packet for packet in packets if str(content) in packet[3:5]]
+        self.assertEqual([(packet[0], packet[2]) for packet in large], expected)
+        for sender, kind in expected:
+            unit = content + (48 if kind == "5" else 24)
+            parts = [packet[5] for packet in packets if packet[0] == sender and packet[5].endswith(f" of {unit}")]
+            self.assertEqual(parts, [f"bytes {first}-{min(first + 262_128, unit) - 1} of {unit}"
+                                     for first in range(0, unit, 262_128)])
+        names = [name.split(",")[0] for name, in self.fields("protobuf.message.name") if name]
+        for name in ("msg_svc.protobuf.SessionHello", "msg_svc.protobuf.SessionVerdict", "krutil.protobuf.FEvalIIP",
+                     "foundation.korveldata.protobuf.KORVEL_Array", "krutil.protobuf.IIPEnqueueMessage",
+                     "krutil.protobuf.IIPReply"):
+            self.assertIn(name, names)
+        self.assertRegex(self.run_tool("capinfos", "-c", "-E", self.file)[0],
+                         rf"Wireshark Upper PDU[^\n]*\n(?:.*\n)*Number of packets: +{len(packets)}\n")
+
+    def test_real_sessions(self):
+        array = os.path.join(self.environment["HOME"], "array.npy")
+        write_array(array, 200_000)
+        # The second one of two results of a size is in shared memory: the first one's was filled as it left.
+        self.record("--nout", "2", "numpy.modf", array)
+        self.check_real([("client", "2"), ("engine", "2"), ("engine", "5")])
+        self.record("--no-shared-memory", "numpy.sum", array)
+        self.check_real([("client", "2")])
 
 
 if __name__ == "__main__":
