@@ -25,6 +25,9 @@ HEADER = struct.Struct("<BBHIQQ")
 
 ARRAY_TAG = "krutil:QDA"
 
+# A number: the socket module's own takes as long to combine with another as a system call.
+_CUT = int(socket.MSG_CTRUNC)
+
 Buffer = Union[bytes, bytearray, memoryview]
 
 
@@ -141,7 +144,7 @@ class DescriptorQueue:
                 numbers = array.array("i")
                 numbers.frombytes(data[:len(data) - len(data) % numbers.itemsize])
                 self._waiting.extend(numbers)
-        if flags & socket.MSG_CTRUNC:
+        if flags & _CUT:
             raise Violation(f"expected at most {self.MOST} descriptors at once, and as many as this process may still "
                             "open; some are lost")
         if len(self._waiting) > self.MOST:
@@ -208,26 +211,36 @@ class Reader:
         return target
 
     def usual_message(self, limits: Limits) -> Optional[Message]:
-        """The next message, if nothing about it is special: one tagged frame that is small, has arrived whole, and
-        keeps to all rules. Otherwise None, and nothing is taken; `read_message()` reads any message, and knows what is
-        wrong with it. Waits until something has arrived."""
+        """The next message, if nothing about it is special: tagged frames that are small, have arrived whole, and keep
+        to all rules. Otherwise None, and nothing is taken; `read_message()` reads any message, and knows what is wrong
+        with it. Waits until something has arrived."""
         if self._begin == self._end:
             self._begin = 0
             self._end = self._receive(self._view, 0, HEADER.size, "the header of frame %d", 1)
-        tag_begin = self._begin + HEADER.size
-        if tag_begin > self._end:
-            return None
-        kind, frame_type, tag_size, stream, index, size = HEADER.unpack_from(self._buffer, self._begin)
-        content_begin = tag_begin + tag_size
-        end = content_begin + size
-        if kind != TAGGED | LAST or index != 1 or end > self._end or not 0 < tag_size <= limits.tag \
-                or size > limits.tagged_frame or tag_size + size > limits.message or limits.frames < 1:
-            return None
-        tag = str(self._buffer[tag_begin:content_begin], "utf-8", "replace")
-        if tag == ARRAY_TAG:
-            return None  # It has a limit of its own.
-        self._begin = end
-        return Message(stream, [Frame(tag, frame_type, self._buffer[content_begin:end])])
+        buffer, begin, arrived = self._buffer, self._begin, self._end
+        frames: list[Frame] = []
+        stream, room = 0, limits.message
+        while begin + HEADER.size <= arrived:
+            kind, frame_type, tag_size, its_stream, index, size = HEADER.unpack_from(buffer, begin)
+            begin += HEADER.size
+            content = begin + tag_size
+            end = content + size
+            if not frames:
+                stream = its_stream
+            room -= tag_size + size
+            if kind | LAST != TAGGED | LAST or index != len(frames) + 1 or its_stream != stream or end > arrived \
+                    or not 0 < tag_size <= limits.tag or size > limits.tagged_frame or room < 0 \
+                    or index > limits.frames:
+                return None
+            tag = str(buffer[begin:content], "utf-8", "replace")
+            if tag == ARRAY_TAG:
+                return None  # It has a limit of its own.
+            frames.append(Frame(tag, frame_type, buffer[content:end]))
+            begin = end
+            if kind & LAST:
+                self._begin = begin
+                return Message(stream, frames)
+        return None
 
     def buffered(self) -> bytes:
         """What has come behind all that was read."""
@@ -242,7 +255,7 @@ class Reader:
             else:
                 count, ancillary, flags, _ = self._socket.recvmsg_into([target], DescriptorQueue.SPACE,
                                                                        socket.MSG_CMSG_CLOEXEC)
-                if ancillary or flags & socket.MSG_CTRUNC:
+                if ancillary or flags & _CUT:
                     self.descriptors.add(ancillary, flags)
         except ConnectionResetError:
             count = 0  # The engine has closed the stream without reading all that was sent to it.

@@ -15,6 +15,9 @@ _MOST_BUFFERS = 1024
 # A Unix socket takes so many bytes whole or not at all, however small its buffer is.
 _WHOLE = 2_048
 
+# A number: what the socket module makes of two of its own takes as long as a system call.
+_AT_ONCE = int(socket.MSG_NOSIGNAL | socket.MSG_DONTWAIT)
+
 
 class Writer:
     """Writes to a socket. A small message is written by whoever sends it, when nothing waits before it; a thread writes
@@ -37,7 +40,7 @@ class Writer:
         if size <= _WHOLE and self._writes_whole and not self._unwritten:
             try:
                 # Nothing so small comes with a descriptor.
-                self._socket.sendmsg(buffers, [], socket.MSG_NOSIGNAL | socket.MSG_DONTWAIT)  # type: ignore[arg-type]
+                self._socket.sendmsg(buffers, [], _AT_ONCE)  # type: ignore[arg-type]
                 return
             except OSError:
                 pass  # The thread waits for room, and knows what to do when the stream has ended.
