@@ -5,6 +5,7 @@ With --record what this build has is written down; the target krutil_record_expo
 """
 
 import os
+import re
 import subprocess
 import sys
 import tempfile
@@ -24,11 +25,12 @@ def write_abi(name, path):
     run("abidw", "--headers-dir", headers, "--drop-private-types", "--exported-interfaces-only", "--no-corpus-path",
         "--no-comp-dir-path", "--no-show-locs", "--no-parameter-names", "--no-elf-needed", "--type-id-style", "hash",
         "--suppressions", os.path.join(RECORDED, "suppressions.ini"), "--out-file", path, find(name))
-    # Sources are named by their places, and those are not of this machine.
+    # Sources are named by their places, absolute or from the build tree; they are recorded from the checkout.
     with open(path, encoding="utf-8") as file:
         text = file.read()
     for place in (os.path.realpath(BUILD), os.path.realpath(CHECKOUT)):
         text = text.replace(f"{place}/", "")
+    text = re.sub(r"(?<= path=')(\.\./)+", "", text)
     with open(path, "w", encoding="utf-8") as file:
         file.write(text)
 
