@@ -97,25 +97,31 @@ install(FILES "${PROJECT_BINARY_DIR}/krutil_protobuf.desc"
 if(KRUTIL_BUILD_APPS)
     cmake_path(RELATIVE_PATH CMAKE_INSTALL_FULL_LIBDIR BASE_DIRECTORY "${CMAKE_INSTALL_FULL_BINDIR}"
                OUTPUT_VARIABLE programs_to_libraries)
-    set_target_properties(krutil_client krutil-qvm PROPERTIES INSTALL_RPATH "$ORIGIN/${programs_to_libraries}")
+    set(programs krutil_client)
+    if(TARGET krutil-qvm)
+        list(APPEND programs krutil-qvm)
+    endif()
+    set_target_properties(${programs} PROPERTIES INSTALL_RPATH "$ORIGIN/${programs_to_libraries}")
     set_target_properties(krutil_client PROPERTIES EXPORT_NAME krutil)
-    install(TARGETS krutil_client krutil-qvm EXPORT krutil_toolsTargets RUNTIME COMPONENT tools)
+    install(TARGETS ${programs} EXPORT krutil_toolsTargets RUNTIME COMPONENT tools)
     install(EXPORT krutil_toolsTargets NAMESPACE krutil:: DESTINATION "${CMAKE_INSTALL_LIBDIR}/cmake/krutil_protobuf"
             COMPONENT tools)
 
     install(FILES "${PROJECT_SOURCE_DIR}/apps/krutil/display/krutil-events.schema.json"
             DESTINATION "${CMAKE_INSTALL_DATADIR}/krutil" COMPONENT tools)
-    set(made "${PROJECT_BINARY_DIR}/apps/manuals/made")
-    install(FILES "${made}/krutil.1" "${made}/krutil-qvm.1" DESTINATION "${CMAKE_INSTALL_MANDIR}/man1" COMPONENT tools)
-    install(FILES "${made}/krutil-recording.5" DESTINATION "${CMAKE_INSTALL_MANDIR}/man5" COMPONENT tools)
-    install(FILES "${made}/krutil-protocol.7" DESTINATION "${CMAKE_INSTALL_MANDIR}/man7" COMPONENT tools)
-    foreach(program IN ITEMS krutil krutil-qvm)
-        install(FILES "${made}/${program}.bash" RENAME "${program}"
-                DESTINATION "${CMAKE_INSTALL_DATADIR}/bash-completion/completions" COMPONENT tools)
-        install(FILES "${made}/_${program}" DESTINATION "${CMAKE_INSTALL_DATADIR}/zsh/site-functions" COMPONENT tools)
-        install(FILES "${made}/${program}.fish" DESTINATION "${CMAKE_INSTALL_DATADIR}/fish/vendor_completions.d"
-                COMPONENT tools)
-    endforeach()
+    if(TARGET krutil_manuals)
+        set(made "${PROJECT_BINARY_DIR}/apps/manuals/made")
+        install(FILES "${made}/krutil.1" "${made}/krutil-qvm.1" DESTINATION "${CMAKE_INSTALL_MANDIR}/man1" COMPONENT tools)
+        install(FILES "${made}/krutil-recording.5" DESTINATION "${CMAKE_INSTALL_MANDIR}/man5" COMPONENT tools)
+        install(FILES "${made}/krutil-protocol.7" DESTINATION "${CMAKE_INSTALL_MANDIR}/man7" COMPONENT tools)
+        foreach(program IN ITEMS krutil krutil-qvm)
+            install(FILES "${made}/${program}.bash" RENAME "${program}"
+                    DESTINATION "${CMAKE_INSTALL_DATADIR}/bash-completion/completions" COMPONENT tools)
+            install(FILES "${made}/_${program}" DESTINATION "${CMAKE_INSTALL_DATADIR}/zsh/site-functions" COMPONENT tools)
+            install(FILES "${made}/${program}.fish" DESTINATION "${CMAKE_INSTALL_DATADIR}/fish/vendor_completions.d"
+                    COMPONENT tools)
+        endforeach()
+    endif()
 
     # Wireshark reads all schema files of that directory, and none of those below it.
     install(FILES "${PROJECT_SOURCE_DIR}/dissector/krutil.lua" DESTINATION "${CMAKE_INSTALL_LIBDIR}/wireshark/plugins"
