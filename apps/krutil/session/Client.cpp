@@ -38,7 +38,7 @@ EngineProcess findEngine(const ConnectionOptions& options) {
         return EngineProcess::connect(*options.socket);
     }
     if (options.engine) {
-        return EngineProcess::start({"/bin/sh", "-c", *options.engine});
+        return EngineProcess::startCommand(*options.engine);
     }
     try {
         return EngineProcess::start(defaultEngineCommand());
@@ -91,6 +91,7 @@ Client::Client(const ConnectionOptions& connection, const DisplayOptions& displa
         });
     printer_.subscribe(events_);
     conversation_ = openConversation(connection, interactive, recording);
+    engine_.takeTerminalBack();
     conversation_->watch(engine_.watch(), [this] {
         // The end of the stream follows, and is what ends a request; unless another process holds the stream.
         const bool idle = requests_.unanswered().empty();
@@ -146,6 +147,12 @@ std::unique_ptr<Conversation> Client::openConversation(const ConnectionOptions& 
     } catch (const session::StreamLost& error) {
         // Ctrl-C during the handshake ends it by shutting the stream down.
         interrupt_.dispatch();
+        if (engine_.hasTerminal()) {
+            const auto end = engine_.waitForEnd(patienceForEnd);
+            if (end && end->wasInterrupted()) {
+                throw Cancelled();
+            }
+        }
         // An engine that was too slow may end now, for want of a stream; that is not what went wrong.
         if (Conversation::Clock::now() - begin_ >= connection.handshakeTimeout) {
             throw Failure(ExitCode::Stream, error.what());

@@ -25,8 +25,15 @@ namespace {
 
 // Runs in the forked child, which shares nothing with this process any more: async-signal-safe calls only. Returns only
 // when the program could not be started, with errno.
-void becomeEngine(int stream, char* const* arguments) {
-    ::signal(SIGINT, SIG_IGN);
+void becomeEngine(int stream, char* const* arguments, const TerminalLoan* loan) {
+    if (loan != nullptr) {
+        ::setpgid(0, 0);
+        // The shell that could let it go on does not know this group.
+        ::signal(SIGTSTP, SIG_IGN);
+        loan->takeInChild();
+    } else {
+        ::signal(SIGINT, SIG_IGN);
+    }
     ::signal(SIGPIPE, SIG_DFL);
     sigset_t none;
     sigemptyset(&none);
@@ -55,6 +62,11 @@ std::string EngineEnd::text() const {
     return "was killed by signal " + std::to_string(number) + " (" + (description ? description : "unknown") + ")";
 }
 
+bool EngineEnd::wasInterrupted() const noexcept {
+    constexpr int ofShells = 128;
+    return signalled ? number == SIGINT : number == ofShells + SIGINT;
+}
+
 EngineProcess::EngineProcess(pid_t pid, posix::OwnedDescriptor pidfd, posix::OwnedDescriptor stream) noexcept
     : pid_(pid), pidfd_(std::move(pidfd)), stream_(std::move(stream)) {}
 
@@ -62,13 +74,22 @@ EngineProcess::EngineProcess(EngineProcess&& other) noexcept
     : pid_(std::exchange(other.pid_, -1)),
       pidfd_(std::move(other.pidfd_)),
       stream_(std::move(other.stream_)),
-      end_(other.end_) {}
+      end_(other.end_),
+      loan_(std::move(other.loan_)) {}
 
 EngineProcess::~EngineProcess() {
     kill();
 }
 
 EngineProcess EngineProcess::start(const std::vector<std::string>& arguments) {
+    return start(arguments, std::nullopt);
+}
+
+EngineProcess EngineProcess::startCommand(const std::string& command) {
+    return start({"/bin/sh", "-c", command}, TerminalLoan());
+}
+
+EngineProcess EngineProcess::start(const std::vector<std::string>& arguments, std::optional<TerminalLoan> loan) {
     const std::string cannot = "cannot start the engine '" + arguments.at(0) + "'";
     int ends[2];
     if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0) {
@@ -95,7 +116,7 @@ EngineProcess EngineProcess::start(const std::vector<std::string>& arguments) {
         fail(cannot, errno);
     }
     if (pid == 0) {
-        becomeEngine(theirs.get(), pointers.data());
+        becomeEngine(theirs.get(), pointers.data(), loan ? &*loan : nullptr);
         const int error = errno;
         [[maybe_unused]] const auto written = ::write(reportWrite.get(), &error, sizeof error);
         ::_exit(127);
@@ -108,6 +129,10 @@ EngineProcess EngineProcess::start(const std::vector<std::string>& arguments) {
         fail(cannot, error);
     }
     EngineProcess engine(pid, std::move(pidfd), std::move(ours));
+    if (loan) {
+        loan->lentTo(pid);
+        engine.loan_.emplace(std::move(*loan));
+    }
     theirs.reset();
     reportWrite.reset();
     int error = 0;
@@ -175,12 +200,18 @@ std::optional<EngineEnd> EngineProcess::waitForEnd(std::chrono::milliseconds pat
     return end_;
 }
 
+void EngineProcess::takeTerminalBack() noexcept {
+    if (loan_) {
+        loan_->takeBack();
+    }
+}
+
 void EngineProcess::kill() noexcept {
     if (pid_ <= 0 || end_) {
         return;
     }
     // Not yet reaped, so the number still belongs to the child.
-    ::kill(pid_, SIGKILL);
+    ::kill(loan_ ? -pid_ : pid_, SIGKILL);
     int status = 0;
     while (::waitpid(pid_, &status, 0) < 0 && errno == EINTR) {
     }

@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "foundation/core/posix/OwnedDescriptor.hpp"
+#include "krutil/session/TerminalLoan.hpp"
 
 namespace krutil_client {
 
@@ -21,16 +22,25 @@ struct EngineEnd {
 
     /// What happened, to follow "the engine": "was killed by signal 9 (Killed)", "exited with code 7".
     std::string text() const;
+
+    /// Whether a Ctrl-C has ended it; shells turn that into an exit code.
+    bool wasInterrupted() const noexcept;
 };
 
-/// Owns the child and the stream to it. A child that still runs when the object goes is killed and reaped. Ctrl-C on a
-/// terminal reaches a child's whole process group; children are started with SIGINT ignored, because it is this program
-/// that decides what a Ctrl-C means. Main thread only.
+/// Owns the child and the stream to it. A child that still runs when the object goes is killed and reaped. It is this
+/// program that decides what a Ctrl-C on its terminal means, so that of a session does not reach the child. Main thread
+/// only.
 class EngineProcess {
   public:
     /// Starts `arguments` (the first is the program, searched on PATH if it holds no slash) with one end of a socket
-    /// pair as its standard input and output; it inherits standard error and nothing else. Throws Failure.
+    /// pair as its standard input and output; it inherits standard error and nothing else. It stays in this program's
+    /// process group, with SIGINT ignored. Throws Failure.
     static EngineProcess start(const std::vector<std::string>& arguments);
+
+    /// The same for `command`, which the shell runs. That may start other programs, which may handle SIGINT as they
+    /// like. So they have a process group of their own, which ends with the child. They have this program's terminal
+    /// until takeTerminalBack(), and may ask a person for a password there. Throws Failure.
+    static EngineProcess startCommand(const std::string& command);
 
     /// Connects to the Unix socket `path`. The process behind it must be this user's. Throws Failure.
     static EngineProcess connect(const std::string& path);
@@ -47,22 +57,30 @@ class EngineProcess {
 
     bool isChild() const noexcept { return pid_ > 0; }
 
+    /// Whether a Ctrl-C goes to the child at present.
+    bool hasTerminal() const noexcept { return loan_ && loan_->isLent(); }
+
+    /// From now on the terminal is this program's again. Happens by itself when the object goes.
+    void takeTerminalBack() noexcept;
+
     /// Readable when the child has ended; -1 for a connection.
     int watch() const noexcept { return pidfd_.get(); }
 
     /// How the child ended, waiting for that up to `patience`; empty while it runs, and for a connection.
     std::optional<EngineEnd> waitForEnd(std::chrono::milliseconds patience);
 
-    /// Kills a child that still runs, and reaps it.
+    /// Kills a child that still runs, with its process group if it has one of its own, and reaps it.
     void kill() noexcept;
 
   private:
     EngineProcess(pid_t pid, posix::OwnedDescriptor pidfd, posix::OwnedDescriptor stream) noexcept;
+    static EngineProcess start(const std::vector<std::string>& arguments, std::optional<TerminalLoan> loan);
 
     pid_t pid_;
     posix::OwnedDescriptor pidfd_;
     posix::OwnedDescriptor stream_;
     std::optional<EngineEnd> end_;
+    std::optional<TerminalLoan> loan_;  ///< of a child with a process group of its own
 };
 
 /// The command for the engine that comes with this program: krutil-qvm in the directory of this program if it is there,

@@ -10,6 +10,7 @@
 #include <filesystem>
 
 #include "krutil/base/ExitCode.hpp"
+#include "programs/support/Program.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 namespace krutil_client {
@@ -77,6 +78,21 @@ TEST(EngineProcessTest, InheritsNothingButStandardError) {
 TEST(EngineProcessTest, CtrlCOfTheTerminalIsNoSignalToIt) {
     auto engine = shell("kill -INT $$; echo survived");
     EXPECT_EQ(readLine(engine.stream()), "survived");
+}
+
+TEST(EngineProcessTest, ACommandHasAProcessGroupOfItsOwn) {
+    auto engine = EngineProcess::startCommand("echo $$; exec ps -o pgid= -p $$");
+    const std::string pid = readLine(engine.stream());
+    EXPECT_EQ(std::stoi(readLine(engine.stream())), std::stoi(pid));
+}
+
+TEST(EngineProcessTest, ACommandIsKilledWithWhatItStarted) {
+    pid_t pid = 0;
+    {
+        auto engine = EngineProcess::startCommand("sleep 600 & echo $!; wait");
+        pid = std::stoi(readLine(engine.stream()));
+    }
+    EXPECT_TRUE(programs_test::waitUntilGone(pid));
 }
 
 TEST(EngineProcessTest, AProgramThatIsNotThereIsSaidToBe) {
