@@ -26,7 +26,7 @@ constexpr const char* exitCodes = R"(Exit codes:
      argument is larger than the engine accepts
   3  no engine could be started or reached, or its stream was lost
   4  the engine broke the protocol
-  5  the ends do not fit: protocol version or features
+  5  the engine refused: the ends do not fit (protocol version or features), or it is full
   6  cancelled)";
 
 void addConnectionOptions(CLI::App& app, ConnectionOptions& options) {

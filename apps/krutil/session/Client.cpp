@@ -141,6 +141,14 @@ std::unique_ptr<Conversation> Client::openConversation(const ConnectionOptions& 
     } catch (const session::HandshakeRefused& error) {
         interrupt_.dispatch();
         throw Failure(ExitCode::Refused, error.what());
+    } catch (const session::StrayText& error) {
+        interrupt_.dispatch();
+        throw Failure(ExitCode::Violation,
+                      throughShell_ ? "the command of --engine printed " + error.text() +
+                                          " before the session began. Perhaps a start-up script of the shell there, "
+                                          "such as .bashrc, prints on standard output: let it do so in interactive "
+                                          "shells only, or on standard error"
+                                    : error.what());
     } catch (const session::ProtocolViolation& error) {
         interrupt_.dispatch();
         throw Failure(ExitCode::Violation, error.what());
@@ -375,6 +383,12 @@ void Client::fail(const Conversation::SessionEnd& end, const std::string& when) 
 
 void Client::failLost(const std::string& text, const std::string& when) {
     if (const auto end = engine_.waitForEnd(patienceForEnd)) {
+        if (throughShell_ && !end->signalled && end->number == 0) {
+            // Relays end like this when the stream behind them does. An engine ends like this after its last event
+            // only.
+            throw Failure(ExitCode::Stream, "the stream to the engine was cut " + when + ": " + text +
+                                                "; the command of --engine exited with code 0, as relays do");
+        }
         constexpr int notFound = 127;
         const bool missing = throughShell_ && !end->signalled && end->number == notFound;
         throw Failure(ExitCode::Stream,

@@ -67,10 +67,36 @@ TEST(LostEngineTest, IsNoCommand) {
 
 TEST(LostEngineTest, ShowsSomethingElseThanASession) {
     const Ran ran = runClient({"eval", "--engine", "echo hello", "1"});
-    EXPECT_EQ(ran.err,
-              "krutil: the peer does not speak this protocol: expected a first message that begins with "
-              "\"\\x89KRUTIL\\n\", got \"hello\\n\"\n");
+    EXPECT_EQ(
+        ran.err,
+        "krutil: the command of --engine printed \"hello\\n\" before the session began. Perhaps a start-up script of "
+        "the shell there, such as .bashrc, prints on standard output: let it do so in interactive shells only, or "
+        "on standard error\n");
     EXPECT_EQ(ran.exitCode, 4);
+}
+
+TEST(LostEngineTest, IsPrecededByTextOfAScript) {
+    const Ran ran =
+        runClient({"eval", "--engine",
+                   "printf 'Welcome,\\033[31m friend\\n'; exec " + quotedForShell(enginePath()) + " --stdio", "1"});
+    EXPECT_EQ(
+        ran.err,
+        "krutil: the command of --engine printed \"Welcome,\\x1b[31m friend\\n\" before the session began. Perhaps "
+        "a start-up script of the shell there, such as .bashrc, prints on standard output: let it do so in "
+        "interactive shells only, or on standard error\n");
+    EXPECT_EQ(ran.exitCode, 4);
+}
+
+TEST(LostEngineTest, IsBehindARelayThatCuts) {
+    // The shell is the relay: it ends well, though the session did not.
+    const Ran ran = runClient({"eval", "--engine", quotedForShell(enginePath()) + " --stdio; exit 0",
+                               "print('so far', flush=True)\nimport os\nos._exit(9)"});
+    EXPECT_EQ(ran.out, "so far\n");
+    EXPECT_EQ(
+        ran.err,
+        "krutil: the stream to the engine was cut before it answered: the stream ended between two messages, before "
+        "the engine's shutdown event; the command of --engine exited with code 0, as relays do\n");
+    EXPECT_EQ(ran.exitCode, 3);
 }
 
 TEST(LostEngineTest, IsAClientItself) {

@@ -380,6 +380,51 @@ TEST_F(HandshakeTest, OtherFirstBytesAreAViolationThatShowsThem) {
               "got \"bash: krutil-qvm: command not found\\n\"");
 }
 
+TEST_F(HandshakeTest, TextBeforeASessionIsToldApart) {
+    try {
+        const Ends ends = socketPair();
+        wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+        peer.write("Last login: \x1b[1mtoday\n" + wire::helloBytes(wire::hello(SessionHello::ENGINE)));
+        Session::open(ends.in, ends.out, configOf(Role::Client));
+        ADD_FAILURE();
+    } catch (const session::StrayText& error) {
+        EXPECT_EQ(error.text(), "\"Last login: \\x1b[1mtoday\\n\"");
+        EXPECT_STREQ(error.what(),
+                     "the peer does not speak this protocol: expected a first message that begins with "
+                     "\"\\x89KRUTIL\\n\", got \"Last login: \\x1b[1mtoday\\n\"");
+    }
+}
+
+TEST_F(HandshakeTest, APeerThatSaysNothingIsToldApart) {
+    const auto openAtEnd = [this](const std::string& said) {
+        const Ends ends = socketPair();
+        {
+            wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+            peer.write(said);
+        }
+        Session::open(ends.in, ends.out, configOf(Role::Engine));
+    };
+    EXPECT_EQ(textOf<session::PeerSilent>([&] { openAtEnd(""); }),
+              "the peer closed the stream during the handshake: 0 of 16 bytes of the peer's first message had arrived");
+    try {
+        openAtEnd("\x89");
+        ADD_FAILURE();
+    } catch (const session::PeerSilent& error) {
+        ADD_FAILURE() << error.what();
+    } catch (const StreamLost& error) {
+        EXPECT_STREQ(error.what(),
+                     "the peer closed the stream during the handshake: 1 of 16 bytes of the peer's first message had "
+                     "arrived");
+    }
+}
+
+TEST_F(HandshakeTest, APeerThatIsRefusedUnheardIsToldWhy) {
+    const Ends ends = socketPair();
+    Session::refuse(ends.otherIn, configOf(Role::Engine), "come back\x1b later");
+    EXPECT_EQ(textOf<HandshakeRefused>([&] { Session::open(ends.in, ends.out, configOf(Role::Client)); }),
+              "the session is refused by the engine: come back\xEF\xBF\xBD later");
+}
+
 TEST_F(HandshakeTest, FirstWrongByteIsEnough) {
     // Nothing else ever comes, and the stream stays open.
     EXPECT_EQ(openAgainst<ProtocolViolation>("\x89KRAUT", false),

@@ -77,6 +77,11 @@ class Session {
     /// out), std::out_of_range (unknown protocol name here).
     static std::unique_ptr<Session> open(int in, int out, SessionConfig config);
 
+    /// Tells the peer at the other end of a new socket that there is no session for it, with this sentence. The peer's
+    /// open() throws HandshakeRefused with that. Takes ownership of the descriptor and closes it; neither reads nor
+    /// waits. Throws std::out_of_range (unknown protocol name here).
+    static void refuse(int socket, const SessionConfig& config, const std::string& refusal);
+
     /// Closes at once what is still open, and joins the I/O thread. Must not run on the I/O thread.
     ~Session();
     Session(const Session&) = delete;

@@ -1,5 +1,7 @@
 #include "foundation/msg_svc/transport/layers/session/Handshake.hpp"
 
+#include <sys/socket.h>
+
 #include <algorithm>
 #include <array>
 #include <map>
@@ -127,9 +129,11 @@ std::uint32_t receiveHello(HandshakeStream& stream, SessionHello& hello) {
     stream.receive(head.data(), head.size(), "the peer's first message", [&](std::size_t have) {
         const std::string_view got(head.data(), std::min(have, magic.size()));
         if (got != magic.substr(0, got.size())) {
-            throw ProtocolViolation(
-                "the peer does not speak this protocol: expected a first message that begins with " + quoted(magic) +
-                ", got " + quoted(std::string(head.data(), have) + stream.takeAvailable(256), 200));
+            const std::string all = std::string(head.data(), have) + stream.takeAvailable(256);
+            const std::string text = quoted(all.substr(0, all.find(magic)), 200);
+            throw StrayText("the peer does not speak this protocol: expected a first message that begins with " +
+                                quoted(magic) + ", got " + text,
+                            text);
         }
     });
     receiveBody(stream, loadLittleEndian<std::uint32_t>(head.data() + magic.size() + 4), "the peer's hello", hello);
@@ -343,6 +347,16 @@ SessionVerdict receiveVerdict(HandshakeStream& stream) {
 }
 
 }  // namespace
+
+void refuseUnheard(int out, const SessionConfig& config, const std::string& refusal) {
+    const ProtocolRegistry::Protocol protocol = ProtocolRegistry::getRegistry()->find(config.protocol);
+    SessionVerdict verdict;
+    verdict.set_accepted(false);
+    verdict.set_refusal(sentence(refusal, longestRefusal));
+    const std::string bytes = packHello(ownHello(config, protocol.configuration())) + packVerdict(verdict);
+    // The stream is new and takes so little at once; a peer that has gone needs no answer.
+    static_cast<void>(::send(out, bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT));
+}
 
 Settlement shakeHands(int in, int out, const SessionConfig& config) {
     const ProtocolRegistry::Protocol protocol = ProtocolRegistry::getRegistry()->find(config.protocol);

@@ -23,4 +23,8 @@ struct Settlement {
 /// Returns when both ends accepted; throws as Session::open does.
 Settlement shakeHands(int in, int out, const SessionConfig& config);
 
+/// Sends a peer, over a new socket that stays the caller's, a hello and a verdict that refuses the session with this
+/// sentence. Neither reads nor waits.
+void refuseUnheard(int out, const SessionConfig& config, const std::string& refusal);
+
 }  // namespace foundation::msg_svc::transport::layers::session

@@ -71,12 +71,17 @@ void HandshakeStream::receive(char* target, std::size_t size, const std::string&
                                   : lending::receiveWithDescriptors(in_, std::span(&piece, 1), *descriptors);
         if (count > 0) {
             keep(rest, static_cast<std::size_t>(count));
+            heard_ = true;
             have += static_cast<std::size_t>(count);
             if (check) {
                 check(have);
             }
         } else if (count == 0 || errno == ECONNRESET) {
-            throw StreamLost("the peer closed the stream during the handshake: " + progress);
+            const std::string text = "the peer closed the stream during the handshake: " + progress;
+            if (!heard_) {
+                throw PeerSilent(text);
+            }
+            throw StreamLost(text);
         } else if (errno != EINTR && errno != EAGAIN && errno != EWOULDBLOCK) {
             throw StreamLost("cannot read from the stream during the handshake: " + errorText(errno) + "; " + progress);
         }

@@ -417,6 +417,11 @@ std::unique_ptr<Session> Session::open(int in, int out, SessionConfig config) {
         new Session(std::make_unique<Impl>(stream, std::move(config), std::move(settlement))));
 }
 
+void Session::refuse(int socket, const SessionConfig& config, const std::string& refusal) {
+    const core::posix::OwnedDescriptor owned(socket);
+    refuseUnheard(owned.get(), config, refusal);
+}
+
 Session::~Session() {
     if (impl_->abandoned) {
         // The thread exists only in the parent, and the descriptors' numbers may belong to others by now: nothing in
