@@ -80,9 +80,10 @@ std::unique_ptr<IIPResult> resultOf(const Request& request, Interpreter::Ending 
 
 }  // namespace
 
-Engine::Engine(const Options& options, Log& log)
+Engine::Engine(const Options& options, Log& log, SilentClients silent)
     : options_(options),
       log_(log),
+      silent_(silent),
       recording_(startRecording(options, log)),
       diary_(options.diary),
       queue_(options.queue),
@@ -167,6 +168,10 @@ bool Engine::open(int in, int out) {
     } catch (const session_layer::ProtocolViolation& error) {
         return fail(error, ExitCode::Violation);
     } catch (const session_layer::StreamLost& error) {
+        if (silent_ == SilentClients::Counted && dynamic_cast<const session_layer::PeerSilent*>(&error) != nullptr) {
+            exitCode_ = ExitCode::Silent;
+            return false;
+        }
         return fail(error, ExitCode::Lost);
     }
     log_.note("session with " + session_->peer().build);

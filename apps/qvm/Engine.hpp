@@ -42,6 +42,7 @@ enum class ExitCode : int {
     Lost = 3,       ///< cannot serve, or the client went away
     Violation = 4,  ///< the client broke the protocol
     Refused = 5,    ///< protocol, version or features do not match
+    Silent = 6,     ///< a client of a listening engine left before it said anything; for the listener only
 };
 
 /// See the head of this file.
@@ -49,9 +50,12 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
                private EngineServices,
                private PromptHost {
   public:
+    /// How a client is told of that leaves before it says anything.
+    enum class SilentClients { Said, Counted };
+
     /// `options` and `log` must outlive the object. Throws std::system_error when a file of the options cannot be
-    /// opened.
-    Engine(const Options& options, Log& log);
+    /// opened. For silent clients that somebody counts, run() returns ExitCode::Silent.
+    Engine(const Options& options, Log& log, SilentClients silent = SilentClients::Said);
     ~Engine() override;
 
     /// Serves one session over the two descriptors, which it takes over, from the handshake to its end. Call once; the
@@ -102,6 +106,7 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
 
     const Options& options_;
     Log& log_;
+    const SilentClients silent_;
     const std::thread::id mainThread_ = std::this_thread::get_id();
     ExitCode exitCode_ = ExitCode::Ok;                  // of the I/O thread, until close() has joined it
     const std::unique_ptr<apps::Recording> recording_;  // null without one

@@ -19,7 +19,10 @@
 #include <stdexcept>
 #include <system_error>
 
+#include "common/Build.hpp"
+#include "common/KrutilSession.hpp"
 #include "foundation/core/posix/OwnedDescriptor.hpp"
+#include "foundation/msg_svc/transport/layers/session/Session.hpp"
 #include "qvm/process/StandardDescriptors.hpp"
 #include "qvm/python/PythonStart.hpp"
 
@@ -27,6 +30,7 @@ namespace qvm {
 namespace {
 
 namespace posix = foundation::core::posix;
+namespace session_layer = foundation::msg_svc::transport::layers::session;
 
 // How long sessions have to end after they were told to.
 constexpr std::chrono::seconds sessionPatience{2};
@@ -48,9 +52,10 @@ std::string octal(mode_t mode) {
     return text.data();
 }
 
-// Opens the directory for its lock, after making sure that nobody else can put anything into it.
-int openPrivateDirectory(const std::string& path) {
-    if (::mkdir(path.c_str(), 0700) != 0 && errno != EEXIST) {
+// Opens the directory for its lock, after making sure that nobody else can put anything into it. Other users may pass
+// through it if some of them are admitted.
+int openOwnDirectory(const std::string& path, bool othersPass) {
+    if (::mkdir(path.c_str(), othersPass ? 0711 : 0700) != 0 && errno != EEXIST) {
         failWithErrno("Cannot create the directory \"" + path + "\"");
     }
     const int directory = ::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
@@ -63,8 +68,9 @@ int openPrivateDirectory(const std::string& path) {
         problem = "cannot be examined";
     } else if (status.st_uid != ::geteuid()) {
         problem = "belongs to user " + std::to_string(status.st_uid) + ", not to " + std::to_string(::geteuid());
-    } else if ((status.st_mode & 077U) != 0) {
-        problem = "is open to other users (mode " + octal(status.st_mode) + ", expected 0700)";
+    } else if ((status.st_mode & (othersPass ? 022U : 077U)) != 0) {
+        problem = "is open to other users (mode " + octal(status.st_mode) + ", expected " +
+                  (othersPass ? "0711" : "0700") + ")";
     }
     if (!problem.empty()) {
         ::close(directory);
@@ -119,13 +125,20 @@ sigset_t watchedSignals() {
 
 }  // namespace
 
-Listener::Listener(const Options& options, Log& log) : options_(options), log_(log), socket_(newSocket()) {
+Listener::Listener(const Options& options, Log& log) : Listener(options, log, -1) {}
+
+Listener::Listener(const Options& options, Log& log, int socket)
+    : options_(options), log_(log), users_(options.allowUsers), socket_(socket >= 0 ? socket : newSocket()) {
     // Before Python takes SIGINT: one that comes now is for this process, not for the code of a session.
     const sigset_t watched = watchedSignals();
     ::sigprocmask(SIG_BLOCK, &watched, nullptr);
     try {
         preparePython(options_.python);
-        bindSocket();
+        if (socket < 0) {
+            bindSocket();
+        } else if (::fcntl(socket, F_SETFL, O_NONBLOCK) != 0) {
+            failWithErrno("Cannot use the socket");
+        }
     } catch (...) {
         ::close(socket_);
         throw;
@@ -150,7 +163,8 @@ void Listener::bindSocket() {
     const std::string& path = options_.listen;
     const sockaddr_un address = addressOf(path);
     const std::filesystem::path parent = std::filesystem::path(path).parent_path();
-    const posix::OwnedDescriptor directory(openPrivateDirectory(parent.empty() ? "." : parent.string()));
+    const posix::OwnedDescriptor directory(
+        openOwnDirectory(parent.empty() ? "." : parent.string(), users_.areSeveral()));
     // Two engines that start at the same time must not both find a dead socket and remove each other's.
     if (::flock(directory.get(), LOCK_EX) != 0) {
         failWithErrno("Cannot lock the directory of \"" + path + "\"");
@@ -165,7 +179,8 @@ void Listener::bindSocket() {
         }
         ::unlink(path.c_str());
     }
-    const mode_t before = ::umask(0177);
+    // Whoever reaches it is asked who they are.
+    const mode_t before = ::umask(users_.areSeveral() ? 0111 : 0177);
     const int bound = ::bind(socket_, reinterpret_cast<const sockaddr*>(&address), sizeof(address));
     ::umask(before);
     if (bound != 0 || ::listen(socket_, SOMAXCONN) != 0) {
@@ -176,7 +191,7 @@ void Listener::bindSocket() {
 }
 
 ExitCode Listener::run() {
-    log_.say("serving " + options_.listen);
+    log_.say("serving " + (options_.listenFds ? std::string("the socket of the service manager") : options_.listen));
     for (;;) {
         // The socket stays readable while clients wait, so it is not watched while none can be accepted.
         const bool paused = failedAccepts_ > 0;
@@ -197,7 +212,7 @@ ExitCode Listener::run() {
             accept();
         }
         if (connection_ >= 0) {
-            Engine engine(options_, log_);
+            Engine engine(options_, log_, Engine::SilentClients::Counted);
             return engine.run(connection_, connection_);
         }
     }
@@ -220,17 +235,20 @@ void Listener::accept() {
         // The client has gone again.
         return;
     }
-    ucred peer{};
-    socklen_t length = sizeof(peer);
-    if (::getsockopt(connection, SOL_SOCKET, SO_PEERCRED, &peer, &length) != 0 || peer.uid != ::geteuid()) {
-        log_.say("refused a client of user " + std::to_string(peer.uid) + ", since this engine serves user " +
-                 std::to_string(::geteuid()) + " only");
+    if (const std::string refusal = users_.refusal(connection); !refusal.empty()) {
+        sayRefused(refusal);
         ::close(connection);
         return;
     }
     if (sessions_.size() >= options_.maxSessions) {
-        log_.say("refused a client: " + std::to_string(sessions_.size()) + " sessions are open (--max-sessions)");
-        ::close(connection);
+        const std::string count = std::to_string(sessions_.size());
+        sayRefused(": " + count + " sessions are open (--max-sessions)");
+        auto config = apps::krutilSession(session_layer::Role::Engine);
+        config.build = apps::buildString("krutil-qvm");
+        config.limits = options_.limits;
+        session_layer::Session::refuse(connection, config,
+                                       "it has " + count + (sessions_.size() == 1 ? " session" : " sessions") +
+                                           " and may have no more (--max-sessions); try again when one has ended");
         return;
     }
     const pid_t child = forkPrepared();
@@ -249,6 +267,20 @@ void Listener::accept() {
     ::close(connection);
 }
 
+void Listener::sayRefused(const std::string& why) {
+    if (const auto leftOut = refusals_.ask(apps::RateLimit::Clock::now())) {
+        log_.say("refused a client" + why +
+                 (*leftOut > 0 ? "; " + std::to_string(*leftOut) + " earlier refusals were left out" : ""));
+    }
+}
+
+void Listener::countSilent() {
+    if (const auto leftOut = silent_.ask(apps::RateLimit::Clock::now())) {
+        log_.say("a client connected and left without a word, as health checks do" +
+                 (*leftOut > 0 ? "; " + std::to_string(*leftOut) + " did so before" : ""));
+    }
+}
+
 void Listener::reap() {
     int status = 0;
     for (;;) {
@@ -257,6 +289,9 @@ void Listener::reap() {
             return;
         }
         sessions_.erase(child);
+        if (WIFEXITED(status) && WEXITSTATUS(status) == static_cast<int>(ExitCode::Silent)) {
+            countSilent();
+        }
         if (WIFSIGNALED(status)) {
             log_.say("the session of process " + std::to_string(child) + " was ended by signal " +
                      std::to_string(WTERMSIG(status)) + " (" + ::strsignal(WTERMSIG(status)) + ")");

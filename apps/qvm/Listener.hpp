@@ -3,11 +3,14 @@
 
 #include <sys/types.h>
 
+#include <chrono>
 #include <set>
 #include <string>
 
+#include "common/RateLimit.hpp"
 #include "qvm/Engine.hpp"
 #include "qvm/Options.hpp"
+#include "qvm/process/AdmittedUsers.hpp"
 #include "qvm/process/Log.hpp"
 
 namespace qvm {
@@ -22,28 +25,38 @@ class Listener {
     /// way.
     Listener(const Options& options, Log& log);
 
+    /// Serves `socket` instead, which listens already and is taken over; its file stays whose it is. Throws as above.
+    Listener(const Options& options, Log& log, int socket);
+
     /// Closes the socket and removes its file, in the process that made them.
     ~Listener();
     Listener(const Listener&) = delete;
     Listener& operator=(const Listener&) = delete;
 
-    /// Accepts clients of the same user until SIGTERM, SIGINT or SIGHUP, as far as they are not ignored, then ends the
-    /// sessions that are left. While the system has no descriptor for a client, clients wait. Returns how the process
-    /// is to end: this one, or one that was forked for a session.
+    /// Accepts clients of the same user, and of options.allowUsers, until SIGTERM, SIGINT or SIGHUP, as far as they are
+    /// not ignored, then ends the sessions that are left. Clients beyond options.maxSessions are told so. While the
+    /// system has no descriptor for a client, clients wait. Returns how the process is to end: this one, or one that
+    /// was forked for a session.
     ExitCode run();
 
   private:
     void bindSocket();
     void accept();
+    void sayRefused(const std::string& why);
+    void countSilent();
     void reap();
     void endSessions();
 
     const Options& options_;
     Log& log_;
+    const AdmittedUsers users_;
     int socket_ = -1;
     int signals_ = -1;
     ino_t inode_ = 0;
     std::set<pid_t> sessions_;
+    // Anybody who may connect could fill the log with these.
+    apps::RateLimit refusals_{10, std::chrono::minutes(1)};
+    apps::RateLimit silent_{1, std::chrono::hours(1)};
     // Attempts since there was last a descriptor for a client.
     unsigned failedAccepts_ = 0;
     // Set in a process that was forked for a session.

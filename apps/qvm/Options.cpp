@@ -24,7 +24,7 @@ struct OptionTable {
         "\n"
         "An engine runs whatever its clients send, with the rights of the user who started it. It serves\n"
         "one client on its standard input and output (--stdio), or any number of clients of the same user\n"
-        "on a Unix socket (--listen), each in a process of its own.",
+        "on a Unix socket (--listen, --listen-fds), each in a process of its own.",
         "krutil-qvm"};
 };
 
@@ -38,12 +38,22 @@ OptionTable::OptionTable() {
                    "Unix socket to serve; its directory is created, or must be private to this user (0700)")
         ->type_name("PATH")
         ->group(where);
+    app.add_flag("--listen-fds", options.listenFds,
+                 "The Unix socket that a service manager such as systemd hands over: one that listens, or a connection")
+        ->group(where);
 
     const std::string sessions = "Sessions";
     app.add_option("--max-sessions", options.maxSessions, "Sessions at a time of a listening engine")
         ->check(CLI::Range(1, 10'000))
         ->type_name("COUNT")
         ->capture_default_str()
+        ->group(sessions);
+    app.add_option(
+           "--allow-user", options.allowUsers,
+           "Accept connections of this user as well, such as a proxy's; with --listen or --listen-fds, once for "
+           "each. Whoever it lets through has code run as the engine's user")
+        ->type_name("NAME")
+        ->allow_extra_args(false)
         ->group(sessions);
     app.add_option("--handshake-timeout", timeoutSeconds, "Seconds that a client has to say what it speaks")
         ->check(CLI::Range(0.001, 3600.0))
@@ -99,7 +109,7 @@ OptionTable::OptionTable() {
         "  2  wrong usage\n"
         "  3  cannot serve, the client was lost, or a recording is not complete\n"
         "  4  the client broke the protocol\n"
-        "  5  version or feature refused");
+        "  5  version or feature refused, or the client is of a user that is not admitted");
 }
 
 }  // namespace
@@ -113,8 +123,11 @@ Options parseOptions(int argc, const char* const* argv) {
     Options& options = table.options;
     try {
         table.app.parse(argc, argv);
-        if (options.stdio != options.listen.empty()) {
-            throw CLI::ValidationError("Exactly one of --stdio and --listen is required");
+        if (int{options.stdio} + int{!options.listen.empty()} + int{options.listenFds} != 1) {
+            throw CLI::ValidationError("Exactly one of --stdio, --listen and --listen-fds is required");
+        }
+        if (options.stdio && !options.allowUsers.empty()) {
+            throw CLI::ValidationError("--allow-user goes with --listen or --listen-fds");
         }
     } catch (const CLI::ParseError& error) {
         const int status = table.app.exit(error);

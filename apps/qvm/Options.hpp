@@ -5,6 +5,7 @@
 #include <cstddef>
 #include <functional>
 #include <string>
+#include <vector>
 
 #include "common/Recording.hpp"
 #include "foundation/msg_svc/transport/layers/session/Limits.hpp"
@@ -18,8 +19,10 @@ class App;
 namespace qvm {
 
 struct Options {
-    bool stdio = false;  ///< one session on descriptors 0 and 1
-    std::string listen;  ///< path of the Unix socket to serve; empty with stdio
+    bool stdio = false;                   ///< one session on descriptors 0 and 1
+    std::string listen;                   ///< path of the Unix socket to serve; empty for none
+    bool listenFds = false;               ///< the socket that a service manager hands over
+    std::vector<std::string> allowUsers;  ///< whose connections are accepted besides those of the engine's own user
     foundation::msg_svc::transport::layers::session::Limits limits;
     RequestQueue::Bounds queue;
     bool noZeroCopy = false;       ///< arrays travel inside their messages; the peers must do the same

@@ -5,12 +5,15 @@
 #include <cstdio>
 #include <cstdlib>
 #include <exception>
+#include <string>
 
 #include "KrutilProtocol.hpp"
 #include "common/ProtobufLog.hpp"
 #include "qvm/Engine.hpp"
 #include "qvm/Listener.hpp"
 #include "qvm/Options.hpp"
+#include "qvm/process/AdmittedUsers.hpp"
+#include "qvm/process/InheritedSocket.hpp"
 #include "qvm/process/Log.hpp"
 #include "qvm/process/StandardDescriptors.hpp"
 #include "qvm/python/PythonChoice.hpp"
@@ -19,11 +22,31 @@ namespace {
 
 using qvm::ExitCode;
 
+// Whoever has accepted it has not asked who is there.
+ExitCode serveConnection(int connection, const qvm::Options& options, qvm::Log& log) {
+    if (const std::string refusal = qvm::AdmittedUsers(options.allowUsers).refusal(connection); !refusal.empty()) {
+        log.say("refused a client" + refusal);
+        ::close(connection);
+        return ExitCode::Refused;
+    }
+    qvm::Engine engine(options, log);
+    return engine.run(connection, connection);
+}
+
 ExitCode serve(const qvm::Options& options, qvm::Log& log) {
     if (options.stdio) {
         const qvm::ProtocolDescriptors protocol = qvm::moveProtocolAside();
         qvm::Engine engine(options, log);
         return engine.run(protocol.in, protocol.out);
+    }
+    if (options.listenFds) {
+        const qvm::InheritedSocket socket = qvm::takeInheritedSocket();
+        qvm::giveToRunningCode();
+        if (!socket.listens) {
+            return serveConnection(socket.descriptor, options, log);
+        }
+        qvm::Listener listener(options, log, socket.descriptor);
+        return listener.run();
     }
     qvm::giveToRunningCode();
     qvm::Listener listener(options, log);

@@ -176,6 +176,72 @@ TEST_F(ListenerTest, ClientOfAnotherUserIsRefused) {
     engine_->awaitStderr("refused a client of user 65534, since this engine serves user 0 only\n");
 }
 
+// Whether a process of the user `user` that connects is answered.
+bool answers(const std::string& path, uid_t user) {
+    const pid_t child = ::fork();
+    if (child == 0) {
+        sockaddr_un address{};
+        address.sun_family = AF_UNIX;
+        path.copy(address.sun_path, sizeof(address.sun_path) - 1);
+        const int connection = ::socket(AF_UNIX, SOCK_STREAM, 0);
+        if (::setresuid(user, user, user) != 0 ||
+            ::connect(connection, reinterpret_cast<const sockaddr*>(&address), sizeof(address)) != 0) {
+            ::_exit(2);
+        }
+        char byte = 0;
+        ::_exit(::read(connection, &byte, 1) == 1 ? 0 : 1);
+    }
+    int status = 0;
+    EXPECT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_NE(WEXITSTATUS(status), 2);
+    return WEXITSTATUS(status) == 0;
+}
+
+TEST_F(ListenerTest, ClientOfAUserWhoIsAllowedIsServed) {
+    serve({"--allow-user", "nobody"});
+    EXPECT_EQ(modeOf(directory_.file("private")), 0711U);
+    EXPECT_EQ(modeOf(path_), 0666U);
+    EngineClient client(connectTo(path_));
+    EXPECT_EQ(client.eval("1").shown(), "1\n");
+    if (::geteuid() == 0) {
+        ::chmod(directory_.path().c_str(), 0711);
+        EXPECT_TRUE(answers(path_, 65534));
+        EXPECT_FALSE(answers(path_, 65533));
+        engine_->awaitStderr("refused a client of user 65533, since this engine serves users 0, 65534 only\n");
+    }
+}
+
+TEST_F(ListenerTest, DirectoryThatOthersWriteToIsRefusedToAllowedUsersToo) {
+    const std::string open = directory_.file("open");
+    ::mkdir(open.c_str(), 0700);
+    ::chmod(open.c_str(), 0731);
+    EngineProcess engine({"--listen", open + "/socket", "--allow-user", "nobody"});
+    EXPECT_EQ(engine.wait(), 3);
+    EXPECT_EQ(engine.stderrText(), "krutil-qvm: The directory \"" + open +
+                                       "\" is open to other users (mode 0731, expected 0711): put the socket into a "
+                                       "directory of your own.\n");
+}
+
+TEST_F(ListenerTest, UserWhoIsNotThereIsNotAllowed) {
+    EngineProcess engine({"--listen", path_, "--allow-user", "no-such-user"});
+    EXPECT_EQ(engine.wait(), 3);
+    EXPECT_EQ(engine.stderrText(), "krutil-qvm: --allow-user: there is no user \"no-such-user\" on this machine.\n");
+}
+
+TEST_F(ListenerTest, ClientsThatSayNothingAreCounted) {
+    serve();
+    const std::string line = "a client connected and left without a word, as health checks do";
+    for (int i = 0; i < 3; ++i) {
+        ::close(connectTo(path_));
+    }
+    engine_->awaitStderr(line + "\n");
+    EngineClient client(connectTo(path_));
+    client.enqueue("import os\nos.abort()");
+    const std::string text = engine_->awaitStderr("was ended by signal 6 (Aborted)\n");
+    EXPECT_EQ(text.find(line, text.find(line) + 1), std::string::npos) << text;
+    EXPECT_EQ(text.find("closed the stream"), std::string::npos) << text;
+}
+
 TEST_F(ListenerTest, TooLongPathIsRefused) {
     EXPECT_THAT(refusal("/tmp/" + std::string(200, 'x')), HasSubstr("has 205 bytes; the system allows 107.\n"));
 }
@@ -184,7 +250,15 @@ TEST_F(ListenerTest, SessionBeyondTheirNumberIsRefused) {
     serve({"--max-sessions", "1"});
     EngineClient first(connectTo(path_));
     first.eval("1");
-    EXPECT_THROW(EngineClient second(connectTo(path_)), session::StreamLost);
+    try {
+        EngineClient second(connectTo(path_));
+        ADD_FAILURE() << "a second session has begun";
+    } catch (const session::HandshakeRefused& refused) {
+        EXPECT_STREQ(
+            refused.what(),
+            "the session is refused by the engine: it has 1 session and may have no more (--max-sessions); try "
+            "again when one has ended");
+    }
     engine_->awaitStderr("refused a client: 1 sessions are open (--max-sessions)\n");
     EXPECT_EQ(first.eval("1").shown(), "1\n");
 }
