@@ -100,6 +100,8 @@ if(KRUTIL_BUILD_APPS)
     set(programs krutil_client)
     if(TARGET krutil-qvm)
         list(APPEND programs krutil-qvm)
+        install(DIRECTORY "${PROJECT_SOURCE_DIR}/examples/systemd"
+                DESTINATION "${CMAKE_INSTALL_DATADIR}/doc/krutil/examples" COMPONENT tools)
     endif()
     set_target_properties(${programs} PROPERTIES INSTALL_RPATH "$ORIGIN/${programs_to_libraries}")
     set_target_properties(krutil_client PROPERTIES EXPORT_NAME krutil)

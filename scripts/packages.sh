@@ -6,6 +6,7 @@ runtime_packages=(
     libicu72                # text
     libpython3.11           # the engine
     libedit2                # lines that are typed into the client
+    libssl3                 # connections of the client through TLS
     python3 python3-numpy libopenblas0-pthread
 )
 build_packages=(
@@ -13,7 +14,7 @@ build_packages=(
     protobuf-compiler libprotobuf-dev
     libboost-dev libicu-dev
     python3-dev pybind11-dev
-    libcli11-dev nlohmann-json3-dev libedit-dev
+    libcli11-dev nlohmann-json3-dev libedit-dev libssl-dev
 )
 test_packages=(
     libgtest-dev libgmock-dev libbenchmark-dev valgrind
@@ -43,6 +44,8 @@ ecosystem_packages=(
     python3-distributed                                                         # clusters
     python3-matplotlib
     tshark                                                                      # recordings of sessions
+    slurmctld slurmd slurm-client munge                                         # a cluster with a queue
+    openssh-client openssh-server socat systemd haproxy openssl                 # engines elsewhere
 )
 # The conformance vectors' reader in JavaScript; not asked for where a Node.js from elsewhere has both programs.
 javascript_packages=(nodejs npm)

@@ -79,7 +79,8 @@ class Layout(unittest.TestCase):
                      "share/bash-completion/completions/krutil", "share/bash-completion/completions/krutil-qvm",
                      "share/zsh/site-functions/_krutil", "share/fish/vendor_completions.d/krutil.fish",
                      "share/krutil/krutil-events.schema.json", "share/wireshark/protobuf/krutil.protobuf.EvalIIP.proto",
-                     "share/wireshark/protobuf/msg_svc.protobuf.IDType.proto"):
+                     "share/wireshark/protobuf/msg_svc.protobuf.IDType.proto",
+                     "share/doc/krutil/examples/systemd/krutil-qvm@.socket"):
             self.installed(path)
         self.assertTrue(os.path.exists(os.path.join(library_directory(), "wireshark/plugins/krutil.lua")))
 
