@@ -17,7 +17,10 @@ namespace krutil_client {
 /// Which engine, and what is agreed with it.
 struct ConnectionOptions {
     std::optional<std::string> engine;  ///< a shell command; empty for the engine that comes with this program
-    std::optional<std::string> socket;  ///< a Unix socket to connect to instead of starting an engine
+    std::optional<std::string> socket;  ///< where to connect instead of starting one: a Unix socket, tls://HOST:PORT
+    std::string certificate;            ///< for TLS, a PEM file each; empty for those not given
+    std::string key;
+    std::string authorities;
     std::chrono::milliseconds handshakeTimeout{10'000};
     bool noPrecheck = false;      ///< a number that the protocol does not know ends this program, not just the session
     bool noZeroCopy = false;      ///< elements of arrays travel inside their messages

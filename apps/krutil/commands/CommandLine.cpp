@@ -36,9 +36,27 @@ void addConnectionOptions(CLI::App& app, ConnectionOptions& options) {
                        "otherwise krutil-qvm beside this program, or on PATH")
             ->type_name("COMMAND")
             ->group("Engine");
-    app.add_option("--connect", options.socket, "Connect to the engine that listens at this Unix socket")
+    app.add_option("--connect", options.socket,
+                   "Connect to the engine that listens at this Unix socket, or to a TLS proxy before engines as "
+                   "tls://HOST:PORT")
         ->type_name("PATH")
         ->excludes(engine)
+        ->group("Engine");
+    auto* key =
+        app.add_option(
+               "--key", options.key,
+               "For TLS, the key of the certificate: a PEM file, without a passphrase and closed to other users")
+            ->type_name("FILE")
+            ->group("Engine");
+    auto* certificate =
+        app.add_option("--cert", options.certificate, "For TLS, the certificate that this program shows: a PEM file")
+            ->type_name("FILE")
+            ->needs(key)
+            ->group("Engine");
+    key->needs(certificate);
+    app.add_option("--ca", options.authorities,
+                   "For TLS, the authorities that the proxy's certificate is checked with: a PEM file")
+        ->type_name("FILE")
         ->group("Engine");
     app.add_option_function<double>(
            "--handshake-timeout",

@@ -33,7 +33,21 @@ constexpr auto patienceForGoodbye = 5s;
 // How long a stream may stay open after the child that was to serve it has ended, because another process holds it.
 constexpr auto patienceForStream = 1s;
 
+bool isTls(const ConnectionOptions& options) {
+    return options.socket && options.socket->starts_with("tls://");
+}
+
 EngineProcess findEngine(const ConnectionOptions& options) {
+    if (isTls(options)) {
+        TlsAddress address = parseTlsAddress(*options.socket);
+        address.certificate = options.certificate;
+        address.key = options.key;
+        address.authorities = options.authorities;
+        return EngineProcess::connect(address);
+    }
+    if (!options.certificate.empty() || !options.key.empty() || !options.authorities.empty()) {
+        throw Failure(ExitCode::Usage, "--cert, --key and --ca go with --connect tls://HOST:PORT");
+    }
     if (options.socket) {
         return EngineProcess::connect(*options.socket);
     }
@@ -54,7 +68,7 @@ capabilities::CapabilityList capabilitiesHere(const ConnectionOptions& options, 
         list |= capabilities::Capability::Debugging;
     }
     // A shell command may lead to another machine.
-    if (!options.engine) {
+    if (!options.engine && !isTls(options)) {
         list |= capabilities::Capability::LocalClient;
     }
     return list;
@@ -125,7 +139,7 @@ std::unique_ptr<Conversation> Client::openConversation(const ConnectionOptions& 
     capabilities_ = capabilitiesHere(connection, interactive);
     config.capabilities = capabilities_;
     config.handshakeTimeout = connection.handshakeTimeout;
-    config.sharedMemory = !connection.noSharedMemory;
+    config.sharedMemory = !connection.noSharedMemory && !isTls(connection);
     if (!connection.noPrecheck) {
         config.check = apps::precheck;
     }
@@ -382,6 +396,9 @@ void Client::fail(const Conversation::SessionEnd& end, const std::string& when) 
 }
 
 void Client::failLost(const std::string& text, const std::string& when) {
+    if (const std::string why = engine_.connectionFailure(); !why.empty()) {
+        throw Failure(ExitCode::Stream, "the TLS connection to the engine failed " + when + ": " + why);
+    }
     if (const auto end = engine_.waitForEnd(patienceForEnd)) {
         if (throughShell_ && !end->signalled && end->number == 0) {
             // Relays end like this when the stream behind them does. An engine ends like this after its last event

@@ -73,6 +73,7 @@ EngineProcess::EngineProcess(pid_t pid, posix::OwnedDescriptor pidfd, posix::Own
 EngineProcess::EngineProcess(EngineProcess&& other) noexcept
     : pid_(std::exchange(other.pid_, -1)),
       pidfd_(std::move(other.pidfd_)),
+      relay_(std::move(other.relay_)),
       stream_(std::move(other.stream_)),
       end_(other.end_),
       loan_(std::move(other.loan_)) {}
@@ -172,6 +173,13 @@ EngineProcess EngineProcess::connect(const std::string& path) {
                                             ", not as user " + std::to_string(::geteuid()) + " as this program does");
     }
     return EngineProcess(-1, posix::OwnedDescriptor(), std::move(stream));
+}
+
+EngineProcess EngineProcess::connect(const TlsAddress& address) {
+    auto relay = std::make_unique<TlsRelay>(address);
+    EngineProcess engine(-1, posix::OwnedDescriptor(), posix::OwnedDescriptor(relay->takeStream()));
+    engine.relay_ = std::move(relay);
+    return engine;
 }
 
 std::optional<EngineEnd> EngineProcess::waitForEnd(std::chrono::milliseconds patience) {

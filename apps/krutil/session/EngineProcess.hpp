@@ -4,12 +4,14 @@
 #include <sys/types.h>
 
 #include <chrono>
+#include <memory>
 #include <optional>
 #include <string>
 #include <vector>
 
 #include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "krutil/session/TerminalLoan.hpp"
+#include "krutil/session/TlsRelay.hpp"
 
 namespace krutil_client {
 
@@ -45,6 +47,10 @@ class EngineProcess {
     /// Connects to the Unix socket `path`. The process behind it must be this user's. Throws Failure.
     static EngineProcess connect(const std::string& path);
 
+    /// Connects to the engine behind a TLS proxy. Returns at once: what is wrong shows as the end of the stream, and in
+    /// connectionFailure(). Throws Failure for files that cannot be used.
+    static EngineProcess connect(const TlsAddress& address);
+
     EngineProcess(EngineProcess&& other) noexcept;
     EngineProcess& operator=(EngineProcess&&) = delete;
     ~EngineProcess();
@@ -63,6 +69,9 @@ class EngineProcess {
     /// From now on the terminal is this program's again. Happens by itself when the object goes.
     void takeTerminalBack() noexcept;
 
+    /// Why a TLS connection was not made or has failed; empty otherwise.
+    std::string connectionFailure() const { return relay_ ? relay_->failure() : std::string(); }
+
     /// Readable when the child has ended; -1 for a connection.
     int watch() const noexcept { return pidfd_.get(); }
 
@@ -78,6 +87,7 @@ class EngineProcess {
 
     pid_t pid_;
     posix::OwnedDescriptor pidfd_;
+    std::unique_ptr<TlsRelay> relay_;  ///< outlives the stream that it passes on
     posix::OwnedDescriptor stream_;
     std::optional<EngineEnd> end_;
     std::optional<TerminalLoan> loan_;  ///< of a child with a process group of its own

@@ -101,6 +101,12 @@ TEST(CommandLineTest, TheEngine) {
     EXPECT_EQ(connection({"eval", "x", "--engine", "ssh host krutil-qvm --stdio"}).engine,
               "ssh host krutil-qvm --stdio");
     EXPECT_EQ(connection({"eval", "--connect", "/run/x", "x"}).socket, "/run/x");
+    const std::vector<const char*> tls{"eval",  "--connect", "tls://host:1", "--cert",      "certificate",
+                                       "--key", "key",       "--ca",         "authorities", "x"};
+    EXPECT_EQ(connection(tls).socket, "tls://host:1");
+    EXPECT_EQ(connection(tls).certificate, "certificate");
+    EXPECT_EQ(connection(tls).key, "key");
+    EXPECT_EQ(connection(tls).authorities, "authorities");
     EXPECT_EQ(connection({"eval", "--handshake-timeout", "2.5", "x"}).handshakeTimeout.count(), 2500);
     EXPECT_EQ(connection({"eval", "--limit-frames", "17", "x"}).limits.frames, 17U);
 }
@@ -114,6 +120,8 @@ TEST(CommandLineTest, ErrorsSayWhatIsWrongAndWhereHelpIs) {
         {{"eval", "-x"}, "krutil: "},
         {{"eval", "--type", "poem", "x"}, "krutil: --type: poem not in {block,conventional,script}\n"},
         {{"eval", "--engine", "a", "--connect", "b", "x"}, "krutil: "},
+        {{"eval", "--connect", "tls://a:1", "--key", "b", "x"}, "krutil: --key requires --cert\n"},
+        {{"eval", "--connect", "tls://a:1", "--cert", "b", "x"}, "krutil: --cert requires --key\n"},
         {{"eval", "--engine"}, "krutil: --engine: 1 required COMMAND missing\n"},
         {{"eval", "--handshake-timeout", "0", "x"}, "krutil: --handshake-timeout: "},
         {{"eval", "--handshake-timeout", "soon", "x"}, "krutil: "},

@@ -67,7 +67,7 @@ class HandshakeStream {
     int writeError_ = 0;
     SessionRecorder* const recorder_;
     std::string received_;  ///< of the unit that is arriving, for the recorder
-    bool heard_ = false;  ///< whether the peer has sent anything
+    bool heard_ = false;    ///< whether the peer has sent anything
 };
 
 }  // namespace foundation::msg_svc::transport::layers::session
