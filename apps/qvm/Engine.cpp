@@ -51,8 +51,6 @@ using session_layer::SessionConfig;
 // How long a session that has lost its client waits for its own threads before it ends the process.
 constexpr std::chrono::milliseconds grace{200};
 
-constexpr char sessionEnded[] = "The session ended before this request was started.";
-
 // The error of a request that was cancelled.
 RuntimeException interruption(const std::string& text) {
     return {inEXECUTION_CTRLC, msg_svc::protobuf::utf8_to_ustring(text), "KeyboardInterrupt", "", {}, {}, false};
@@ -184,7 +182,7 @@ void Engine::serve() {
     loop();
     queue_.close();
     for (const Request& request : queue_.takeAll()) {
-        announcer_->turn().refuse(request, sessionEnded);
+        announcer_->turn().refuse(request, queue_.refusal(RequestQueue::Put::Closed));
     }
     python_->finish();
     capture_->finish();
@@ -422,26 +420,8 @@ void Engine::onMessage(framing::StreamID stream, const boost::shared_ptr<const M
 }
 
 void Engine::enqueue(Announcer::Turn& turn, const Request& request) {
-    const RequestQueue::Bounds& bounds = queue_.bounds();
-    switch (queue_.put(request)) {
-        case RequestQueue::Put::Taken:
-            break;
-        case RequestQueue::Put::TooMany:
-            turn.refuse(request,
-                        "The engine's queue is full: " + std::to_string(bounds.count) +
-                            " requests wait already, which is the engine's bound. Send this one again when some are "
-                            "done.");
-            break;
-        case RequestQueue::Put::TooLarge:
-            turn.refuse(request,
-                        "The engine's queue is full: with this request, those that wait would hold more than " +
-                            std::to_string(bounds.bytes) +
-                            " bytes, which is the engine's bound. Send it again when some are done, or send less at a "
-                            "time.");
-            break;
-        case RequestQueue::Put::Closed:
-            turn.refuse(request, sessionEnded);
-            break;
+    if (const RequestQueue::Put put = queue_.put(request); put != RequestQueue::Put::Taken) {
+        turn.refuse(request, queue_.refusal(put));
     }
 }
 

@@ -87,6 +87,22 @@ RequestQueue::Put RequestQueue::put(Request request) {
     return Put::Taken;
 }
 
+std::string RequestQueue::refusal(Put put) const {
+    switch (put) {
+        case Put::TooMany:
+            return "The engine's queue is full: " + std::to_string(bounds_.count) +
+                   " requests wait already, which is the engine's bound. Send this one again when some are done.";
+        case Put::TooLarge:
+            return "The engine's queue is full: with this request, those that wait would hold more than " +
+                   std::to_string(bounds_.bytes) +
+                   " bytes, which is the engine's bound. Send it again when some are done, or send less at a time.";
+        case Put::Taken:
+        case Put::Closed:
+            break;
+    }
+    return "The session ended before this request was started.";
+}
+
 bool RequestQueue::anyIsDue(DequeuePoint point) const {
     return intake_ != Intake::Closed && std::any_of(entries_.begin(), entries_.end(),
                                                     [point](const Entry& entry) { return isFreeAndDue(entry, point); });

@@ -15,6 +15,7 @@
 #include <deque>
 #include <mutex>
 #include <optional>
+#include <string>
 #include <vector>
 
 #include "foundation/core/posix/EventDescriptor.hpp"
@@ -65,11 +66,13 @@ class RequestQueue {
     RequestQueue(const RequestQueue&) = delete;
     RequestQueue& operator=(const RequestQueue&) = delete;
 
-    const Bounds& bounds() const noexcept { return bounds_; }
-
     /// Adds a request behind the others, or one for the bootstrap before all of another mode. Never waits. wake() is to
     /// follow: whoever waits is not to wake up and stand before a lock that the caller holds.
     Put put(Request request);
+
+    /// Why a request was not taken, in a sentence for whoever sent it; not for Put::Taken. Put::Closed is also what
+    /// becomes of those that still wait when the session ends.
+    std::string refusal(Put put) const;
 
     /// Has wait() look again. Without a system call when nobody waits.
     void wake();
