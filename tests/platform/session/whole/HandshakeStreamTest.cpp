@@ -40,7 +40,7 @@ TEST_F(HandshakeTest, TextBeforeASessionIsToldApart) {
 }
 
 TEST_F(HandshakeTest, APeerThatSaysNothingIsToldApart) {
-    const auto openAtEnd = [this](const std::string& said) {
+    const auto openAtEnd = [](const std::string& said) {
         const Ends ends = socketPair();
         {
             wire::ByteEnd peer(ends.otherIn, ends.otherOut);
