@@ -226,17 +226,20 @@ void PcapngReader::beginSection() {
     }
     section_.clear();
     program_.clear();
+    comment_.clear();
     forEachOption(block().substr(sectionFixed, consumed_ - sectionFixed - 4),
                   [this](std::uint16_t code, std::string_view value) {
                       if (code == pcapng::userApplication) {
                           program_ = value;
+                      } else if (code == pcapng::comment) {
+                          comment_ = value;
                       }
                   });
 }
 
 void PcapngReader::addInterface() {
     checkLength(interfaceFixed, "the description of an interface");
-    Interface described{{}, program_};
+    Interface described{{}, program_, comment_};
     unsigned resolution = 6;
     forEachOption(block().substr(interfaceFixed, consumed_ - interfaceFixed - 4),
                   [&](std::uint16_t code, std::string_view value) {

@@ -31,6 +31,7 @@ class PcapngReader {
     struct Interface {
         std::string name;     ///< empty for none
         std::string program;  ///< what made the section; empty if it does not say
+        std::string comment;  ///< of the section; empty for none
     };
 
     struct Packet {
@@ -101,6 +102,7 @@ class PcapngReader {
     std::optional<Skipping> skipping_;
     bool swapped_ = false;  ///< numbers of this section are big-endian
     std::string program_;   ///< of this section
+    std::string comment_;   ///< of this section
     std::vector<Description> section_;
     std::vector<Interface> interfaces_;
 };

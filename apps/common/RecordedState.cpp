@@ -83,14 +83,14 @@ void RecordedState::note(Direction direction, Part part, std::uint64_t nanosecon
         case 5:  // shared data
             break;
         case 3:
-            keep(std::move(kept), unit, header, goodbye_);
+            keep(kept, unit, header, goodbye_);
             return;
         default:
             return;
     }
     Begun& message = begun_[client ? 0 : 1];
     if (!last || client) {
-        message.leftOut = message.leftOut || !keep(std::move(kept), unit, header, message.frames);
+        message.leftOut = message.leftOut || !keep(kept, unit, header, message.frames);
         if (message.leftOut) {
             drop(message.frames);
         }

@@ -25,53 +25,6 @@ constexpr std::uint64_t frameHeader = 24;
 
 constexpr std::uint64_t largestPart = pcapng::longestPacket - pcapng::tags.size();
 
-template <class Number>
-void append(std::string& block, Number number) {
-    for (std::size_t i = 0; i < sizeof(Number); ++i) {
-        block += static_cast<char>(static_cast<unsigned char>(number >> (8 * i)));
-    }
-}
-
-void pad(std::string& block) {
-    block.append((4 - block.size() % 4) % 4, '\0');
-}
-
-void appendOption(std::string& block, std::uint16_t code, std::string_view value) {
-    append(block, code);
-    append(block, static_cast<std::uint16_t>(value.size()));
-    block += value;
-    pad(block);
-}
-
-void beginBlock(std::string& block, std::uint32_t type) {
-    append(block, type);
-    // The length, which endBlock() knows.
-    append(block, std::uint32_t{0});
-}
-
-// The block begins at `begin`, and is the last one.
-void endBlock(std::string& block, std::size_t begin = 0) {
-    append(block, pcapng::endOfOptions);
-    append(block, std::uint16_t{0});
-    const auto length = static_cast<std::uint32_t>(block.size() - begin + 4);
-    append(block, length);
-    block.replace(begin + 4, 4, block, block.size() - 4, 4);
-}
-
-// `count` bytes of the unit from `first` on.
-void appendBytes(std::string& block, std::span<const iovec> unit, std::uint64_t first, std::uint64_t count) {
-    for (const iovec& piece : unit) {
-        if (first >= piece.iov_len) {
-            first -= piece.iov_len;
-            continue;
-        }
-        const std::uint64_t taken = std::min<std::uint64_t>(count, piece.iov_len - first);
-        block.append(static_cast<const char*>(piece.iov_base) + first, taken);
-        count -= taken;
-        first = 0;
-    }
-}
-
 // Errors have the name that the user gave.
 posix::OwnedDescriptor openRecording(const std::string& path, const std::string& name, bool& regular) {
     const std::string cannot = "cannot record to '" + name + "'";
@@ -151,28 +104,10 @@ void Recording::beginSession(Role role, const std::string& build) {
 
 // With the mutex held. The first `repeated` units of the section were in an earlier file; without, a session begins.
 void Recording::writeSection(std::optional<std::size_t> repeated) {
-    block_.clear();
-    beginBlock(block_, pcapng::sectionHeader);
-    append(block_, pcapng::byteOrderMagic);
-    append(block_, std::uint16_t{1});
-    append(block_, std::uint16_t{0});
-    append(block_, std::int64_t{-1});
-    if (repeated) {
-        appendOption(block_, pcapng::comment,
-                     "continued: repeats " + std::to_string(*repeated) + " packets of an earlier file");
-    }
-    appendOption(block_, pcapng::userApplication, build_);
-    endBlock(block_);
-
-    const std::size_t begin = block_.size();
-    beginBlock(block_, pcapng::interfaceDescription);
-    append(block_, pcapng::upperPdu);
-    append(block_, std::uint16_t{0});
-    append(block_, static_cast<std::uint32_t>(pcapng::longestPacket));
-    appendOption(block_, pcapng::interfaceName,
-                 (role_ == Role::Client ? "client " : "engine ") + std::to_string(::getpid()));
-    appendOption(block_, pcapng::timeResolution, "\x09");
-    endBlock(block_, begin);
+    pcapng::makeSection(
+        block_,
+        repeated ? "continued: repeats " + std::to_string(*repeated) + " packets of an earlier file" : std::string(),
+        build_, (role_ == Role::Client ? "client " : "engine ") + std::to_string(::getpid()));
     write();
 }
 
@@ -207,7 +142,7 @@ void Recording::recordUnit(Direction direction, Part part, std::span<const iovec
             kept = room - overheadOf(room);
         }
     }
-    writeUnit(direction, nanoseconds, unit, kept, size);
+    writeUnit({direction == Direction::Sent, nanoseconds, unit, kept, size});
     fresh_ = false;
     if (state_) {
         state_->note(direction, part, nanoseconds, unit, size);
@@ -235,39 +170,17 @@ void Recording::repeatState() {
     writeSection(units.size());
     for (const RecordedState::Unit* unit : units) {
         std::string bytes = unit->bytes;
+        const std::uint64_t kept =
+            unit->part == Part::Frame ? std::min<std::uint64_t>(bytes.size(), snap_) : bytes.size();
         const iovec piece{bytes.data(), bytes.size()};
-        writeUnit(unit->direction, unit->nanoseconds, {&piece, 1}, bytes.size(), unit->size);
+        writeUnit({unit->direction == Direction::Sent, unit->nanoseconds, {&piece, 1}, kept, unit->size});
     }
 }
 
-// With the mutex held. The first `kept` bytes of a unit of `size` bytes.
-void Recording::writeUnit(Direction direction, std::uint64_t nanoseconds, std::span<const iovec> unit,
-                          std::uint64_t kept, std::uint64_t size) {
-    for (std::uint64_t first = 0; first < kept && complete_; first += largestPart) {
-        const std::uint64_t count = std::min(kept - first, largestPart);
-        // Only the last packet tells of what is missing.
-        const std::uint64_t missing = first + count == kept ? size - kept : 0;
-        const std::uint64_t original =
-            std::min<std::uint64_t>(pcapng::tags.size() + count + missing, std::numeric_limits<std::uint32_t>::max());
-        block_.clear();
-        beginBlock(block_, pcapng::enhancedPacket);
-        append(block_, std::uint32_t{0});
-        append(block_, static_cast<std::uint32_t>(nanoseconds >> 32U));
-        append(block_, static_cast<std::uint32_t>(nanoseconds));
-        append(block_, static_cast<std::uint32_t>(pcapng::tags.size() + count));
-        append(block_, static_cast<std::uint32_t>(original));
-        block_ += pcapng::tags;
-        appendBytes(block_, unit, first, count);
-        pad(block_);
-        append(block_, pcapng::packetFlags);
-        append(block_, std::uint16_t{4});
-        append(block_, direction == Direction::Sent ? pcapng::outbound : pcapng::inbound);
-        if (count != size) {
-            appendOption(block_, pcapng::comment,
-                         "bytes " + std::to_string(first) + "-" + std::to_string(first + count - 1) + " of " +
-                             std::to_string(size));
-        }
-        endBlock(block_);
+// With the mutex held.
+void Recording::writeUnit(const pcapng::Unit& unit) {
+    for (std::uint64_t first = 0; first < unit.kept && complete_;) {
+        first += pcapng::makePacket(block_, unit, first);
         write();
     }
 }

@@ -9,6 +9,7 @@
 #include <optional>
 #include <string>
 
+#include "common/PcapngBlocks.hpp"
 #include "common/RecordedState.hpp"
 #include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "foundation/msg_svc/transport/layers/session/SessionConfig.hpp"
@@ -60,8 +61,7 @@ class Recording final : public foundation::msg_svc::transport::layers::session::
     bool makeRoom(std::uint64_t bytes);
     void repeatState();
     void writeSection(std::optional<std::size_t> repeated);
-    void writeUnit(Direction direction, std::uint64_t nanoseconds, std::span<const iovec> unit, std::uint64_t kept,
-                   std::uint64_t size);
+    void writeUnit(const pcapng::Unit& unit);
     void write();
     void end(const std::string& reason);
 

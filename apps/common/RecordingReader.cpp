@@ -22,6 +22,12 @@ bool takeNumber(std::string_view& text, std::string_view prefix, std::uint64_t& 
     return error == std::errc();
 }
 
+// Of a session that an earlier file began.
+std::optional<std::uint64_t> repeatedPackets(std::string_view comment) {
+    std::uint64_t count = 0;
+    return takeNumber(comment, "continued: repeats ", count) ? std::optional(count) : std::nullopt;
+}
+
 UnitKind kindOf(unsigned place, std::uint64_t size) {
     switch (place) {
         case 1:
@@ -74,7 +80,7 @@ void RecordingReader::addSessions() {
         const PcapngReader::Interface& interface = packets_.interfaces()[i];
         sessions_.push_back(
             {interface.name.starts_with("engine ") ? RecordedUnit::Role::Engine : RecordedUnit::Role::Client,
-             interface.name, interface.program});
+             interface.name, interface.program, repeatedPackets(interface.comment)});
     }
     streams_.resize(sessions_.size());
 }

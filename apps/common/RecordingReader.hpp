@@ -45,6 +45,7 @@ struct RecordedSession {
     RecordedUnit::Role recorder = RecordedUnit::Role::Client;  ///< the end that has recorded
     std::string process;                                       ///< "client PID" or "engine PID"
     std::string program;                                       ///< with its version; empty if the file does not say
+    std::optional<std::uint64_t> repeated{};  ///< of a session that an earlier file began: packets that it has as well
 };
 
 /// Reads units in the order in which they are complete in the file. Text in what it returns is as the file has it.

@@ -7,6 +7,7 @@
 #include <filesystem>
 #include <fstream>
 #include <iterator>
+#include <limits>
 #include <stdexcept>
 #include <string>
 #include <vector>
@@ -29,8 +30,9 @@ constexpr std::uint64_t bound = RecordOptions::smallestSize;
 
 class RecordingSizeTest : public ::testing::Test {
   protected:
-    Recording recording(const std::string& file) {
+    Recording recording(const std::string& file, std::uint64_t snap = std::numeric_limits<std::uint64_t>::max()) {
         RecordOptions options;
+        options.snap = snap;
         options.file = file;
         options.size = bound;
         return Recording(options, [this](const std::string& sentence) { complaints_.push_back(sentence); });
@@ -126,6 +128,17 @@ TEST_F(RecordingSizeTest, FrameThatIsTooLargeForAFileIsCut) {
     record(made, Direction::Received, Part::Frame, next);
     ASSERT_EQ(recorded(file_).size(), 1U);
     EXPECT_EQ(recorded(file_)[0].data, next);
+}
+
+TEST_F(RecordingSizeTest, SnapHoldsForWhatIsRepeated) {
+    Recording made = recording(file_, 30);
+    made.beginSession(Recording::Role::Client, "krutil");
+    record(made, Direction::Sent, Part::Frame, message(1, "krutil:IIPEnqueueMessage", 10));
+    while (!std::filesystem::exists(file_ + ".1")) {
+        record(made, Direction::Sent, Part::Frame, message(0, "krutil:TextBaseEvent", 10));
+    }
+    EXPECT_EQ(recorded(file_).at(0).data.size(), 30U);
+    EXPECT_EQ(recorded(file_).at(0).comment, "bytes 0-29 of 58");
 }
 
 TEST_F(RecordingSizeTest, FilesNeverExceedTheirBound) {
