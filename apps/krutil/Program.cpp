@@ -25,6 +25,7 @@
 #include "krutil/commands/CommandLine.hpp"
 #include "krutil/commands/EvalCommand.hpp"
 #include "krutil/commands/Repl.hpp"
+#include "krutil/commands/ReplayCommand.hpp"
 #include "krutil/display/JsonPrinter.hpp"
 #include "krutil/display/PersonPrinter.hpp"
 #include "krutil/session/Client.hpp"
@@ -252,6 +253,10 @@ ExitCode runCommand(const Options& options, const CallOptions& call, Printer& pr
     AskingClient asking(options, printer, terminal, standardInputIsTerminal());
     return inSession(asking,
                      [&] { return callFunction(asking.client(), call, std::move(prepared), printer, terminal.err); });
+}
+
+ExitCode runCommand(const Options& options, const ReplayOptions& replay, Printer&, Terminal& terminal) {
+    return replayRecording(options.connection, replay, terminal.out, terminal.interrupt);
 }
 
 void startRecording(const apps::RecordOptions& options, Terminal& terminal) {

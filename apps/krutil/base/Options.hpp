@@ -79,10 +79,16 @@ struct ReplOptions {
     SinkOptions sink;
 };
 
+/// `krutil replay`.
+struct ReplayOptions {
+    std::string file;
+    std::chrono::milliseconds patience{10'000};  ///< an answer may take that much longer than in the recording
+};
+
 struct Options {
     ConnectionOptions connection;
     DisplayOptions display;
-    std::variant<EvalOptions, CallOptions, ReplOptions> command;
+    std::variant<EvalOptions, CallOptions, ReplOptions, ReplayOptions> command;
 };
 
 }  // namespace krutil_client

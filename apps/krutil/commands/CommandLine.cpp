@@ -29,7 +29,8 @@ constexpr const char* exitCodes = R"(Exit codes:
   5  the engine refused: the ends do not fit (protocol version or features), or it is full
   6  cancelled)";
 
-void addConnectionOptions(CLI::App& app, ConnectionOptions& options) {
+// Which engine.
+void addEngineOptions(CLI::App& app, ConnectionOptions& options) {
     auto* engine =
         app.add_option("--engine", options.engine,
                        "Start the engine with this shell command, for example 'ssh HOST krutil-qvm --stdio'; "
@@ -69,6 +70,11 @@ void addConnectionOptions(CLI::App& app, ConnectionOptions& options) {
         ->type_name("SECONDS")
         ->default_str("10")
         ->group("Engine");
+}
+
+// What is agreed with it, too.
+void addConnectionOptions(CLI::App& app, ConnectionOptions& options) {
+    addEngineOptions(app, options);
     app.add_flag(
            "--no-zero-copy", options.noZeroCopy,
            "Copy arrays into their messages, as QX_DISABLE_ZEROCOPY=1 does; both ends must. An engine that is started "
@@ -213,6 +219,37 @@ void addRepl(CLI::App& app, Options& options, ReplOptions& repl) {
     command->callback([&options, &repl] { options.command = repl; });
 }
 
+constexpr const char* replayCodes = R"(Exit codes of replay:
+  0  the engine answered as in the recording
+  1  it answered otherwise
+  2  the command line or the recording cannot be used
+  3  no engine could be started or reached, or its stream was lost
+  4  the engine broke the protocol
+  5  the engine refuses the session
+  6  cancelled)";
+
+void addReplay(CLI::App& app, Options& options, ReplayOptions& replay) {
+    auto* command = app.add_subcommand(
+        "replay",
+        "Say to an engine what the client of a recording has said, and show where the engine answers otherwise");
+    command->add_option("FILE", replay.file, "The recording; - for standard input")->required()->type_name("");
+    command
+        ->add_option_function<double>(
+            "--patience",
+            [&replay](const double& seconds) {
+                replay.patience =
+                    std::chrono::milliseconds(static_cast<std::chrono::milliseconds::rep>(seconds * 1'000.0));
+            },
+            "How much longer than in the recording an answer may take")
+        ->check(CLI::Range(0.001, 86'400.0).description(""))
+        ->type_name("SECONDS")
+        ->default_str("10")
+        ->group("Request");
+    addEngineOptions(*command, options.connection);
+    command->footer(replayCodes);
+    command->callback([&options, &replay] { options.command = replay; });
+}
+
 // Options without a command are those of the one that needs no name.
 bool beginsOptionsOfRepl(const std::string& argument) {
     constexpr std::array<std::string_view, 3> ofTheProgram{"-h", "--help", "--version"};
@@ -297,6 +334,7 @@ struct OptionTable {
     CallOptions call;
     EvalOptions run;
     ReplOptions repl;
+    ReplayOptions replay;
     CLI::App app{
         "Evaluates code on an engine in another process. Without a command, code is read line by line; the options are "
         "those of repl.",
@@ -314,6 +352,7 @@ OptionTable::OptionTable(const std::vector<std::string>& words) {
     addCall(app, options, call);
     addRun(app, options, run);
     addRepl(app, options, repl);
+    addReplay(app, options, replay);
 }
 
 }  // namespace

@@ -37,6 +37,21 @@ bool isTls(const ConnectionOptions& options) {
     return options.socket && options.socket->starts_with("tls://");
 }
 
+capabilities::CapabilityList capabilitiesHere(const ConnectionOptions& options, bool interactive) {
+    capabilities::CapabilityList list{capabilities::Capability::WebWindow};
+    if (interactive) {
+        list |= capabilities::Capability::InteractiveCommandLine;
+        list |= capabilities::Capability::Debugging;
+    }
+    // A shell command may lead to another machine.
+    if (!options.engine && !isTls(options)) {
+        list |= capabilities::Capability::LocalClient;
+    }
+    return list;
+}
+
+}  // namespace
+
 EngineProcess findEngine(const ConnectionOptions& options) {
     if (isTls(options)) {
         TlsAddress address = parseTlsAddress(*options.socket);
@@ -60,21 +75,6 @@ EngineProcess findEngine(const ConnectionOptions& options) {
         throw Failure(failure.code(), std::string(failure.what()) + "; name another one with --engine");
     }
 }
-
-capabilities::CapabilityList capabilitiesHere(const ConnectionOptions& options, bool interactive) {
-    capabilities::CapabilityList list{capabilities::Capability::WebWindow};
-    if (interactive) {
-        list |= capabilities::Capability::InteractiveCommandLine;
-        list |= capabilities::Capability::Debugging;
-    }
-    // A shell command may lead to another machine.
-    if (!options.engine && !isTls(options)) {
-        list |= capabilities::Capability::LocalClient;
-    }
-    return list;
-}
-
-}  // namespace
 
 Client::Client(const ConnectionOptions& connection, const DisplayOptions& display, Printer& printer, const Output& out,
                Output& err, Interrupt& interrupt, bool interactive, apps::Recording* recording)

@@ -39,6 +39,9 @@ enum class Leave {
     AtOnce,        ///< they are cancelled
 };
 
+/// The engine that the options name, started or connected to. Throws Failure.
+EngineProcess findEngine(const ConnectionOptions& options);
+
 /// Starts or reaches the engine, sends requests, and ends in good order. Failures of the engine or the session come out
 /// as Failure, with a sentence that says which. Main thread only.
 class Client {

@@ -1,0 +1,83 @@
+// What the ends of a session have said to each other, as a recording has it.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace krutil_client {
+
+/// A frame of a message. A content that was in shared memory is data like any other.
+struct SaidFrame {
+    bool tagged = false;
+    unsigned type = 0;
+    std::string tag{};
+    std::string content{};
+};
+
+/// What an end said at once.
+struct Said {
+    enum class Kind { Message, Goodbye, Abort };
+
+    Kind kind = Kind::Message;
+    std::uint32_t stream = 0;
+    std::vector<SaidFrame> frames{};  ///< the root is the last one; of an abort, one whose content is the reason
+    std::uint64_t offset = 0;         ///< of its last frame in the recording
+    std::uint64_t nanoseconds = 0;    ///< when it was recorded
+
+    /// The tag of the root; empty for what is no message.
+    std::string_view tag() const { return frames.empty() ? std::string_view() : frames.back().tag; }
+    bool endsExchange() const { return tag() == "krutil:IIPReply" || tag() == "krutil:IIPCancelReply"; }
+    bool isText() const { return tag() == "krutil:TextBaseEvent" || tag() == "krutil:SinkTextEvent"; }
+};
+
+/// Puts the frames of one direction together.
+class Listener {
+  public:
+    /// Takes a whole frame. Returns what is complete with it; frames that only manage shared memory say nothing. Throws
+    /// Failure with ExitCode::Violation for what is no frame.
+    std::optional<Said> take(std::string_view frame);
+
+  private:
+    std::vector<SaidFrame> frames_;
+};
+
+/// The first 24 bytes of a frame, as far as replaying needs them.
+struct SaidHeader {
+    static constexpr std::size_t size = 24;
+
+    unsigned kind = 0;
+    bool last = false;
+    unsigned type = 0;
+    std::uint32_t stream = 0;
+    std::size_t tagSize = 0;
+    std::uint64_t contentSize = 0;
+
+    /// Of 24 bytes or more.
+    static SaidHeader of(std::string_view frame);
+};
+
+/// The frames of `said` as bytes, numbered from 1. Data is data, wherever it was.
+std::string framesOf(const Said& said);
+
+/// One session.
+struct Talk {
+    struct Sent {
+        Said said;
+        std::size_t after = 0;  ///< so many of the engine's had been recorded before it
+    };
+
+    std::string process;  ///< that has recorded
+    std::string hello;    ///< the client's first message
+    std::vector<Sent> client{};
+    std::vector<Said> engine{};
+};
+
+/// The sessions of a recording that can be replayed. Throws Failure with a sentence for one that cannot be read, and
+/// for one that cannot be replayed: it begins without the handshake, or has frames of which only the beginnings are
+/// there.
+std::vector<Talk> readTalks(const std::string& file);
+
+}  // namespace krutil_client
