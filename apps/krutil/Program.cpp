@@ -28,6 +28,7 @@
 #include "krutil/commands/ReplayCommand.hpp"
 #include "krutil/display/JsonPrinter.hpp"
 #include "krutil/display/PersonPrinter.hpp"
+#include "krutil/inspect/RedactedCopy.hpp"
 #include "krutil/session/Client.hpp"
 #include "krutil/terminal/EngineHelp.hpp"
 #include "krutil/terminal/LineEditor.hpp"
@@ -257,6 +258,13 @@ ExitCode runCommand(const Options& options, const CallOptions& call, Printer& pr
 
 ExitCode runCommand(const Options& options, const ReplayOptions& replay, Printer&, Terminal& terminal) {
     return replayRecording(options.connection, replay, terminal.out, terminal.interrupt);
+}
+
+ExitCode runCommand(const Options&, const RedactOptions& redact, Printer&, Terminal& terminal) {
+    if (const auto note = redactRecording(redact.file, redact.out)) {
+        terminal.err.write("krutil: " + *note + "\n");
+    }
+    return ExitCode::Ok;
 }
 
 void startRecording(const apps::RecordOptions& options, Terminal& terminal) {

@@ -39,7 +39,7 @@ ALLOWED = {
 # beside the rooms may include all of them. Neither program includes from the other, nor does what both share.
 PROGRAM_ROOMS = {
     "apps/common": [],
-    "apps/krutil": ["base", "arrays", "display", "session", "terminal", "replay", "commands"],
+    "apps/krutil": ["base", "arrays", "display", "session", "terminal", "inspect", "replay", "commands"],
     "apps/qvm": ["process", "requests", "python"],
 }
 

@@ -85,10 +85,16 @@ struct ReplayOptions {
     std::chrono::milliseconds patience{10'000};  ///< an answer may take that much longer than in the recording
 };
 
+/// `krutil redact`.
+struct RedactOptions {
+    std::string file;  ///< "-" for standard input
+    std::string out;   ///< is created
+};
+
 struct Options {
     ConnectionOptions connection;
     DisplayOptions display;
-    std::variant<EvalOptions, CallOptions, ReplOptions, ReplayOptions> command;
+    std::variant<EvalOptions, CallOptions, ReplOptions, ReplayOptions, RedactOptions> command;
 };
 
 }  // namespace krutil_client

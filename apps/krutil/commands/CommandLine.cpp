@@ -250,6 +250,15 @@ void addReplay(CLI::App& app, Options& options, ReplayOptions& replay) {
     command->callback([&options, &replay] { options.command = replay; });
 }
 
+void addRedact(CLI::App& app, Options& options, RedactOptions& redact) {
+    auto* command = app.add_subcommand(
+        "redact", "Copy a recording without its text and numbers, so that it can go into a report of a fault");
+    command->add_option("FILE", redact.file, "The recording; - for standard input")->required()->type_name("");
+    command->add_option("OUT", redact.out, "The copy, a new file")->required()->type_name("");
+    command->footer(exitCodes);
+    command->callback([&options, &redact] { options.command = redact; });
+}
+
 // Options without a command are those of the one that needs no name.
 bool beginsOptionsOfRepl(const std::string& argument) {
     constexpr std::array<std::string_view, 3> ofTheProgram{"-h", "--help", "--version"};
@@ -335,6 +344,7 @@ struct OptionTable {
     EvalOptions run;
     ReplOptions repl;
     ReplayOptions replay;
+    RedactOptions redact;
     CLI::App app{
         "Evaluates code on an engine in another process. Without a command, code is read line by line; the options are "
         "those of repl.",
@@ -353,6 +363,7 @@ OptionTable::OptionTable(const std::vector<std::string>& words) {
     addRun(app, options, run);
     addRepl(app, options, repl);
     addReplay(app, options, replay);
+    addRedact(app, options, redact);
 }
 
 }  // namespace

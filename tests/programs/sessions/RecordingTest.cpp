@@ -131,6 +131,26 @@ TEST_F(ProgramRecordingTest, FileOfBoundedSizeGoesOnInAnother) {
     }
 }
 
+TEST_F(ProgramRecordingTest, RedactedCopyHasNoText) {
+    const Ran ran =
+        runClient({"eval", "secret = 'word' * 3\nprint(secret)\nraise ValueError(secret)", "--record", file_});
+    EXPECT_EQ(ran.exitCode, 1) << ran.err;
+    const std::string copy = directory_.file("copy.pcapng");
+    const Ran redacted = run(clientCommand({"redact", file_, copy}));
+    EXPECT_EQ(redacted.exitCode, 0);
+    EXPECT_EQ(redacted.out + redacted.err, "");
+    const auto before = recorded(file_);
+    const auto now = recorded(copy);
+    EXPECT_THAT(recordedStream(before, inbound), HasSubstr("wordword"));
+    EXPECT_THAT(recordedStream(now, inbound) + recordedStream(now, outbound), ::testing::Not(HasSubstr("word")));
+    EXPECT_THAT(recordedStream(now, outbound), HasSubstr("krutil:EvalIIP"));
+    EXPECT_EQ(recordedStream(now, inbound).size(), recordedStream(before, inbound).size());
+    EXPECT_EQ(now.size(), before.size());
+    const Ran again = run(clientCommand({"redact", file_, copy}));
+    EXPECT_EQ(again.err, "krutil: cannot create '" + copy + "': File exists\n");
+    EXPECT_EQ(again.exitCode, 2);
+}
+
 TEST_F(ProgramRecordingTest, FullDiskIsSaidOnceAndInTheExitCode) {
     const std::string sentence = "cannot write to '/dev/full': No space left on device; the recording ends here\n";
     const Ran client = runClient({"eval", "1 + 1", "--record", "/dev/full"});
