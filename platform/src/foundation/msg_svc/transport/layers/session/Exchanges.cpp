@@ -62,8 +62,8 @@ bool Exchanges::isDone(Role role) const noexcept {
     });
 }
 
-std::optional<Refusal> Exchanges::receiveAnything() const noexcept {
-    return isDone(peer()) ? std::optional(afterLastWordOf(peer())) : std::nullopt;
+std::optional<Refusal> Exchanges::sayAnything(Role speaker) const noexcept {
+    return isDone(speaker) ? std::optional(afterLastWordOf(speaker)) : std::nullopt;
 }
 
 framing::StreamID Exchanges::newStreamID() noexcept {

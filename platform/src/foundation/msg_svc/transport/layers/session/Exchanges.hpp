@@ -53,8 +53,14 @@ class Exchanges {
     /// Whether the peer may have said something; if so, it counts as said.
     std::optional<Refusal> receive(Saying saying, framing::StreamID stream) { return say(peer(), saying, stream); }
 
-    /// AfterGoodbye or AfterShutdown when the peer has said its last word.
-    std::optional<Refusal> receiveAnything() const noexcept;
+    /// Whether the end of this role may say something now, as this end sees it; if so, it counts as said.
+    std::optional<Refusal> say(Role speaker, Saying saying, framing::StreamID stream);
+
+    /// AfterGoodbye or AfterShutdown when the end of this role has said its last word.
+    std::optional<Refusal> sayAnything(Role speaker) const noexcept;
+
+    /// The same for the peer.
+    std::optional<Refusal> receiveAnything() const noexcept { return sayAnything(peer()); }
 
     Phase phase() const noexcept { return phase_; }
 
@@ -66,7 +72,6 @@ class Exchanges {
 
   private:
     Role peer() const noexcept { return own_ == Role::Client ? Role::Engine : Role::Client; }
-    std::optional<Refusal> say(Role speaker, Saying saying, framing::StreamID stream);
 
     Role own_;
     Phase phase_ = Phase::Talking;

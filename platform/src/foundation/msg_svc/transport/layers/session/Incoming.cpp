@@ -8,10 +8,6 @@
 #include <utility>
 #include <variant>
 
-#include "foundation/msg_svc/transport/layers/message/Message.hpp"
-#include "foundation/msg_svc/transport/layers/session/FrameKinds.hpp"
-#include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
-#include "foundation/msg_svc/transport/layers/session/RefusalTexts.hpp"
 #include "foundation/msg_svc/transport/layers/session/StreamDescriptors.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
@@ -26,15 +22,13 @@ Incoming::Incoming(asio::io_context& io, core::posix::OwnedDescriptor& descripto
                    std::shared_ptr<const serialization::Registry> registry, const std::string& arrayTag,
                    SharedExchanges& exchanges, const Outgoing& outgoing, lending::SharedMemory* shared, Owner& owner)
     : config_(config),
-      registry_(std::move(registry)),
-      exchanges_(exchanges),
       outgoing_(outgoing),
       shared_(shared),
       owner_(owner),
       stream_(io),
       reader_(config.limits, arrayTag, shared == nullptr ? nullptr : &shared->borrower, config.recorder),
+      intake_(config, std::move(registry), arrayTag, exchanges),
       keptMemory_(io, config.keepMemory),
-      arrayTag_(arrayTag),
       descriptor_(descriptor.get()) {
     stream_.assign(descriptor.get());
     descriptor.release();
@@ -177,99 +171,11 @@ void Incoming::take(MessageReader::Item item) {
         }
         return;
     }
-    std::optional<Refusal> refusal;
-    const bool goodbye = std::holds_alternative<MessageReader::Goodbye>(item);
-    {
-        const std::lock_guard lock(exchanges_.mutex);
-        refusal = goodbye ? exchanges_.exchanges.receive(Saying::Goodbye, 0) : exchanges_.exchanges.receiveAnything();
-    }
-    if (refusal) {
-        throw ProtocolViolation(refusalToReceive(*refusal, Saying::Goodbye, config_.role, 0, {}));
-    }
-    if (goodbye) {
-        handler_->onGoodbye();
+    if (std::holds_alternative<MessageReader::Goodbye>(item)) {
+        intake_.takeGoodbye(*handler_);
     } else {
-        takeMessage(std::move(std::get<MessageReader::Frames>(item).frames));
+        intake_.takeMessage(std::move(std::get<MessageReader::Frames>(item).frames), *handler_);
     }
-}
-
-void Incoming::takeMessage(Frames frames) {
-    if (config_.trace) {
-        for (const auto& frame : frames) {
-            config_.trace({false, frame == frames.back(), *frame});
-        }
-    }
-    const framing::StreamID stream = frames.back()->streamID();
-    const auto* const root = asTagged(*frames.back());
-    const auto refuse = [stream](const std::string& why) {
-        throw ProtocolViolation("message on stream " + std::to_string(stream) + ": " + why);
-    };
-    if (root == nullptr) {
-        refuse("expected a tagged frame as its last one, got a data frame");
-    }
-    const serialization::SerializerBase* serializer = nullptr;
-    try {
-        serializer = registry_->find(root->tag()).get();
-    } catch (const std::out_of_range&) {
-        refuse("no serializer is registered for its tag " + quoted(root->tag()));
-    }
-    const auto* const messages = serialization::asFamily<RootSerializer<exchange::Message>>(*serializer);
-    const auto* const replies = serialization::asFamily<RootSerializer<exchange::Reply>>(*serializer);
-    const auto* const events = serialization::asFamily<RootSerializer<eventmgr::BaseEvent>>(*serializer);
-    if (messages == nullptr && replies == nullptr && events == nullptr) {
-        refuse(quoted(root->tag()) + " is only ever referred to and cannot be the last frame");
-    }
-    const Saying saying = messages != nullptr  ? Saying::Message
-                          : replies != nullptr ? Saying::Reply
-                                               : sayingOfEvent(serializer->type(), config_);
-    std::optional<Refusal> refusal;
-    {
-        const std::lock_guard lock(exchanges_.mutex);
-        refusal = exchanges_.exchanges.receive(saying, stream);
-    }
-    if (refusal) {
-        throw ProtocolViolation(refusalToReceive(*refusal, saying, config_.role, stream, root->tag()));
-    }
-    if (config_.check) {
-        for (const auto& frame : frames) {
-            if (const auto* const tagged = asTagged(*frame)) {
-                config_.check(*tagged);
-            }
-        }
-    }
-    if (messages != nullptr) {
-        handler_->onMessage(stream, rebuild(*messages, std::move(frames)));
-    } else if (replies != nullptr) {
-        handler_->onReply(stream, rebuild(*replies, std::move(frames)));
-    } else {
-        handler_->onEvent(stream, rebuild(*events, std::move(frames)));
-    }
-}
-
-// Objects.
-
-template <class T>
-boost::shared_ptr<const T> Incoming::rebuild(const RootSerializer<T>& serializer, Frames frames) {
-    const framing::FrameIndex root = frames.size();
-    notes_.take(frames);
-    // Indexes of a message start at 1.
-    frames.insert(frames.begin(), nullptr);
-    const auto message = std::make_unique<message::Message>(std::move(frames));
-    const auto refuse = [&](const std::string& why) {
-        throw ProtocolViolation("cannot read " + quoted(serializer.name()) + ": " + why);
-    };
-    boost::shared_ptr<const T> object;
-    try {
-        object = serializer.deserialize(root, message, registry_, serialization::SerializationContext());
-    } catch (const std::exception& error) {
-        refuse(notes_.explain(error, *registry_, arrayTag_));
-    } catch (...) {
-        refuse("exception of an unknown type");
-    }
-    if (!object) {
-        refuse("its serializer returned no object");
-    }
-    return object;
 }
 
 }  // namespace foundation::msg_svc::transport::layers::session

@@ -6,20 +6,17 @@
 #pragma once
 
 #include <atomic>
-#include <boost/shared_ptr.hpp>
 #include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <string>
-#include <vector>
 
 #include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "foundation/msg_svc/transport/layers/session/Asio.hpp"
 #include "foundation/msg_svc/transport/layers/session/Exchanges.hpp"
-#include "foundation/msg_svc/transport/layers/session/FrameNotes.hpp"
+#include "foundation/msg_svc/transport/layers/session/Intake.hpp"
 #include "foundation/msg_svc/transport/layers/session/KeptMemory.hpp"
 #include "foundation/msg_svc/transport/layers/session/MessageReader.hpp"
-#include "foundation/msg_svc/transport/layers/session/ObjectWriter.hpp"
 #include "foundation/msg_svc/transport/layers/session/Outgoing.hpp"
 #include "foundation/msg_svc/transport/layers/session/Session.hpp"
 #include "foundation/msg_svc/transport/layers/session/lending/SharedMemory.hpp"
@@ -82,7 +79,6 @@ class Incoming {
   private:
     // Waiting (for start) -> Reading <-> HeldBack; Stopped is the end of all.
     enum class State { Waiting, Reading, HeldBack, Stopped };
-    using Frames = std::vector<std::unique_ptr<framing::Frame>>;
 
     bool isReading() const noexcept { return state_ == State::Reading && !silenced_; }
     bool owesTooMuch() const noexcept { return outgoing_.answersOwed() >= config_.maxPendingAnswers; }
@@ -91,21 +87,15 @@ class Incoming {
     bool read();
     void takeItems();
     void take(MessageReader::Item item);
-    void takeMessage(Frames frames);
-    template <class T>
-    boost::shared_ptr<const T> rebuild(const RootSerializer<T>& serializer, Frames frames);
 
     const SessionConfig& config_;
-    const std::shared_ptr<const serialization::Registry> registry_;
-    SharedExchanges& exchanges_;
     const Outgoing& outgoing_;
     lending::SharedMemory* const shared_;
     Owner& owner_;
     asio::posix::stream_descriptor stream_;
     MessageReader reader_;
-    FrameNotes notes_;
+    Intake intake_;
     KeptMemory keptMemory_;
-    const std::string arrayTag_;
     SessionHandler* handler_ = nullptr;
     State state_ = State::Waiting;
 

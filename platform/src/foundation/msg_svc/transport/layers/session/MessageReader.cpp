@@ -31,7 +31,7 @@ namespace {
 
 }  // namespace
 
-MessageReader::MessageReader(const Limits& limits, std::string arrayTag, lending::Borrower* borrower,
+MessageReader::MessageReader(const Limits& limits, std::string arrayTag, lending::LentContents* borrower,
                              SessionRecorder* recorder)
     : limits_(limits),
       arrayTag_(std::move(arrayTag)),

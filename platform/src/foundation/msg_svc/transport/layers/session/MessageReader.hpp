@@ -16,7 +16,7 @@
 #include "foundation/msg_svc/transport/layers/session/FrameHeader.hpp"
 #include "foundation/msg_svc/transport/layers/session/Limits.hpp"
 #include "foundation/msg_svc/transport/layers/session/SessionRecorder.hpp"
-#include "foundation/msg_svc/transport/layers/session/lending/Borrower.hpp"
+#include "foundation/msg_svc/transport/layers/session/lending/LentContents.hpp"
 #include "foundation/vantor/carrier/framing/Frame.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
@@ -61,7 +61,7 @@ class MessageReader {
     /// `arrayTag` is the tag to which Limits::arrayMessage applies instead of Limits::taggedFrame. `borrower` has the
     /// contents that stay in the peer's memory; null when there are none. `recorder` is given each frame that is
     /// complete; null for none.
-    MessageReader(const Limits& limits, std::string arrayTag, lending::Borrower* borrower = nullptr,
+    MessageReader(const Limits& limits, std::string arrayTag, lending::LentContents* borrower = nullptr,
                   SessionRecorder* recorder = nullptr);
 
     /// Where the next bytes of the stream belong, in order; never empty. Valid until the next call of next(). To be
@@ -108,7 +108,7 @@ class MessageReader {
 
     Limits limits_;
     std::string arrayTag_;
-    lending::Borrower* borrower_;
+    lending::LentContents* borrower_;
     SessionRecorder* recorder_;
 
     // Bytes that have arrived and are not taken yet.

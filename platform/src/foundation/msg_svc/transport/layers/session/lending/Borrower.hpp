@@ -10,7 +10,7 @@
 #include <span>
 
 #include "foundation/core/posix/OwnedDescriptor.hpp"
-#include "foundation/msg_svc/transport/layers/session/lending/SharedContent.hpp"
+#include "foundation/msg_svc/transport/layers/session/lending/LentContents.hpp"
 #include "foundation/vantor/carrier/framing/Frame.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
@@ -19,14 +19,12 @@ class Outgoing;
 
 namespace foundation::msg_svc::transport::layers::session::lending {
 
-namespace framing = ::foundation::vantor::carrier::framing;
-
 /// Makes buffers of memory that the peer has lent, and tells the peer when they are not used any more. The buffers may
 /// outlive this object and the session. One thread, but for members that say otherwise.
 ///
 /// A child that this process forks reads on in what was mapped at that moment, so such memory is given back as kept:
 /// the peer does not write to it again.
-class Borrower {
+class Borrower final : public LentContents {
   public:
     /// Contents are given back through `outgoing`, until close().
     explicit Borrower(Outgoing& outgoing);
@@ -41,7 +39,7 @@ class Borrower {
     /// The content as a buffer of the BufferAllocator. It lies in the memory of the next descriptor, which is closed.
     /// Code may write to the bytes: what is written stays in this process. Throws MemoryRefused for what is not as it
     /// has to be, and std::bad_alloc.
-    framing::FrameBuffer borrow(const SharedContent& content);
+    framing::FrameBuffer borrow(const SharedContent& content) override;
 
     // Any thread.
 
