@@ -110,6 +110,7 @@ if(KRUTIL_BUILD_APPS)
             COMPONENT tools)
 
     install(FILES "${PROJECT_SOURCE_DIR}/apps/krutil/display/krutil-events.schema.json"
+            "${PROJECT_SOURCE_DIR}/apps/krutil/inspect/krutil-inspect.schema.json"
             DESTINATION "${CMAKE_INSTALL_DATADIR}/krutil" COMPONENT tools)
     if(TARGET krutil_manuals)
         set(made "${PROJECT_BINARY_DIR}/apps/manuals/made")

@@ -70,8 +70,8 @@ std::optional<std::string_view> withoutTags(std::string_view data) {
 
 }  // namespace
 
-PcapngReader::PcapngReader(const std::string& file)
-    : name_(file == "-" ? "standard input" : "'" + file + "'"), descriptor_(STDIN_FILENO) {
+PcapngReader::PcapngReader(const std::string& file, std::function<void(int)> wait)
+    : name_(file == "-" ? "standard input" : "'" + file + "'"), descriptor_(STDIN_FILENO), wait_(std::move(wait)) {
     if (file != "-") {
         owned_.reset(::open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY));
         if (!owned_) {
@@ -94,6 +94,9 @@ bool PcapngReader::fill(std::size_t count) {
     while (buffer_.size() - begin_ < count) {
         buffer_.erase(0, std::exchange(begin_, 0));
         const std::size_t have = buffer_.size();
+        if (wait_) {
+            wait_(descriptor_);
+        }
         buffer_.resize(have + readSize);
         const ssize_t got = ::read(descriptor_, buffer_.data() + have, readSize);
         const int error = errno;

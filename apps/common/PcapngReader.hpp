@@ -44,8 +44,9 @@ class PcapngReader {
         std::string_view data;              ///< without the tags; valid until the next call of next()
     };
 
-    /// "-" reads standard input. Throws std::system_error with a sentence.
-    explicit PcapngReader(const std::string& file);
+    /// "-" reads standard input. `wait` is called with the descriptor before each read, which may block otherwise;
+    /// empty for nothing. Throws std::system_error with a sentence.
+    explicit PcapngReader(const std::string& file, std::function<void(int)> wait = nullptr);
 
     /// The next packet; empty at the end of what is there. A later call goes on when there is more. Throws
     /// RecordingError, and std::system_error when the file cannot be read.
@@ -94,6 +95,7 @@ class PcapngReader {
     std::string name_;
     foundation::core::posix::OwnedDescriptor owned_;
     int descriptor_;
+    std::function<void(int)> wait_;
 
     std::string buffer_;
     std::size_t begin_ = 0;       ///< in the buffer, of the block that is next or was the last

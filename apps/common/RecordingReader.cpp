@@ -53,7 +53,8 @@ std::string rangeText(std::uint64_t first, std::uint64_t size) {
 
 }  // namespace
 
-RecordingReader::RecordingReader(const std::string& file, std::uint64_t keep) : packets_(file), keep_(keep) {}
+RecordingReader::RecordingReader(const std::string& file, std::uint64_t keep, std::function<void(int)> wait)
+    : packets_(file, std::move(wait)), keep_(keep) {}
 
 // Which bytes of its unit a packet has: its comment says so, one without such a comment is a unit.
 RecordingReader::Part RecordingReader::partOf(const PcapngReader::Packet& packet) const {

@@ -28,6 +28,7 @@
 #include "krutil/commands/ReplayCommand.hpp"
 #include "krutil/display/JsonPrinter.hpp"
 #include "krutil/display/PersonPrinter.hpp"
+#include "krutil/inspect/InspectCommand.hpp"
 #include "krutil/inspect/RedactedCopy.hpp"
 #include "krutil/session/Client.hpp"
 #include "krutil/terminal/EngineHelp.hpp"
@@ -267,6 +268,10 @@ ExitCode runCommand(const Options&, const RedactOptions& redact, Printer&, Termi
     return ExitCode::Ok;
 }
 
+ExitCode runCommand(const Options&, const InspectOptions& inspect, Printer&, Terminal& terminal) {
+    return inspectRecording(inspect, terminal.out, terminal.err, terminal.interrupt);
+}
+
 void startRecording(const apps::RecordOptions& options, Terminal& terminal) {
     if (options.file.empty()) {
         return;
@@ -323,6 +328,10 @@ int runProgram(int argc, const char* const* argv) {
     if (std::get<Options>(parsed).connection.noZeroCopy) {
         // Before the first serializer asks; an engine that is started here inherits it.
         ::setenv("QX_DISABLE_ZEROCOPY", "1", 1);
+    }
+    if (std::holds_alternative<InspectOptions>(std::get<Options>(parsed).command)) {
+        // Recorded arrays are read in both forms, whatever sessions of this process were to do.
+        ::unsetenv("QX_DISABLE_ZEROCOPY");
     }
     try {
         krutil::protobuf::KrutilProtocol::init();

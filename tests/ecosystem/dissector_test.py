@@ -213,6 +213,9 @@ class DissectorTest(unittest.TestCase):
             self.assertIn(name, names)
         self.assertRegex(self.run_tool("capinfos", "-c", "-E", self.file)[0],
                          rf"Wireshark Upper PDU[^\n]*\n(?:.*\n)*Number of packets: +{len(packets)}\n")
+        inspected = subprocess.run(["krutil", "inspect", "--lint", self.file], stdout=subprocess.PIPE, text=True,
+                                   check=True).stdout
+        self.assertRegex(inspected, r"^no rule is broken in \d+ units of 1 sessions\n$")
 
     def test_real_sessions(self):
         array = os.path.join(self.environment["HOME"], "array.npy")

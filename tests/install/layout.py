@@ -78,7 +78,8 @@ class Layout(unittest.TestCase):
                      "share/man/man5/krutil-recording.5", "share/man/man7/krutil-protocol.7",
                      "share/bash-completion/completions/krutil", "share/bash-completion/completions/krutil-qvm",
                      "share/zsh/site-functions/_krutil", "share/fish/vendor_completions.d/krutil.fish",
-                     "share/krutil/krutil-events.schema.json", "share/wireshark/protobuf/krutil.protobuf.EvalIIP.proto",
+                     "share/krutil/krutil-events.schema.json", "share/krutil/krutil-inspect.schema.json",
+                     "share/wireshark/protobuf/krutil.protobuf.EvalIIP.proto",
                      "share/wireshark/protobuf/msg_svc.protobuf.IDType.proto",
                      "share/doc/krutil/examples/systemd/krutil-qvm@.socket"):
             self.installed(path)

@@ -12,7 +12,7 @@ enum class ExitCode : int {
     CodeError = 1,  ///< the code raised an error
     Usage = 2,      ///< the command line or the code text cannot be used
     Stream = 3,     ///< no engine could be started or reached, or a stream was lost
-    Violation = 4,  ///< the engine broke the protocol
+    Violation = 4,  ///< the engine broke the protocol, or a recording that is checked does
     Refused = 5,    ///< the ends do not fit: version or features
     Cancelled = 6,  ///< cancelled, by Ctrl-C here or by the engine
 };

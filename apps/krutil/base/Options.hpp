@@ -3,6 +3,7 @@
 
 #include <chrono>
 #include <cstddef>
+#include <limits>
 #include <optional>
 #include <string>
 #include <variant>
@@ -91,10 +92,28 @@ struct RedactOptions {
     std::string out;   ///< is created
 };
 
+/// `krutil inspect`.
+struct InspectOptions {
+    using Role = foundation::msg_svc::transport::layers::session::Role;
+
+    std::string file;       ///< "-" for standard input
+    bool frames = false;    ///< a line for each frame
+    bool fields = false;    ///< with its fields
+    bool hex = false;       ///< with its bytes
+    bool timeline = false;  ///< requests instead of messages
+    bool lint = false;      ///< broken rules instead of messages
+    bool json = false;
+    std::string request;             ///< the identifier of the only one, or its first digits
+    std::vector<std::string> types;  ///< the only ones; empty for all
+    std::optional<Role> from;        ///< the only sender
+    double since = 0;                ///< seconds after the first packet
+    double until = std::numeric_limits<double>::infinity();
+};
+
 struct Options {
     ConnectionOptions connection;
     DisplayOptions display;
-    std::variant<EvalOptions, CallOptions, ReplOptions, ReplayOptions, RedactOptions> command;
+    std::variant<EvalOptions, CallOptions, ReplOptions, ReplayOptions, RedactOptions, InspectOptions> command;
 };
 
 }  // namespace krutil_client

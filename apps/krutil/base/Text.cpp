@@ -35,6 +35,36 @@ std::string nameOfCode(const std::string& code) {
     return name;
 }
 
+std::string quotedText(std::string_view text, std::size_t longest) {
+    // A character has at most four bytes of UTF-8 for one or two units.
+    const std::u16string units =
+        msg_svc::protobuf::utf8_to_ustring(std::string(text.substr(0, 4 * std::min(longest, text.size()) + 4)));
+    std::u16string shown;
+    std::size_t taken = 0;
+    for (; taken < std::min(longest, units.size()); ++taken) {
+        const char16_t unit = units[taken];
+        const bool mark = unit == 0x200E || unit == 0x200F || (unit >= 0x2028 && unit <= 0x202E) ||
+                          (unit >= 0x2066 && unit <= 0x2069);
+        if (unit == u'\n') {
+            shown += u"\\n";
+        } else if (unit == u'"' || unit == u'\\') {
+            shown += {u'\\', unit};
+        } else if (unit < 0x20 || (unit >= 0x7F && unit < 0xA0) || mark) {
+            std::array<char, 8> escape{};
+            std::snprintf(escape.data(), escape.size(), unit > 0xFF ? "\\u%04x" : "\\x%02x", unsigned{unit});
+            const std::string_view digits = escape.data();
+            shown.append(digits.begin(), digits.end());
+        } else {
+            shown += unit;
+        }
+    }
+    // Half of a pair would become something else.
+    if (taken < units.size() && taken > 0 && (units[taken - 1] & 0xFC00U) == 0xD800U) {
+        shown.pop_back();
+    }
+    return "\"" + msg_svc::protobuf::ustring_to_utf8(shown) + (taken < units.size() ? "\"..." : "\"");
+}
+
 std::string toUtf8(std::wstring_view text) {
     std::mbstate_t state{};
     std::string result;

@@ -27,6 +27,11 @@ std::string_view streamName(krutil::io::StreamTypeEnum stream);
 /// "success", "compile error", "runtime error", "debugger quit", "cancelled" or "communication error".
 std::string_view statusName(krutil::cmddistributor::inExecutionStatus status);
 
+/// Text of a peer between double quotes, at most `longest` UTF-16 units of it and then "...". What could steer a
+/// terminal or change how a line reads (control characters, marks of direction, quotes, backslashes) is written as an
+/// escape; what is not UTF-8 is U+FFFD.
+std::string quotedText(std::string_view text, std::size_t longest);
+
 /// A line number, which peers state as a floating-point number: without a fraction where it has none.
 std::string lineText(double line);
 

@@ -25,7 +25,7 @@ constexpr const char* exitCodes = R"(Exit codes:
   2  the command line, the code text or a file cannot be used, a recording is not complete, or an
      argument is larger than the engine accepts
   3  no engine could be started or reached, or its stream was lost
-  4  the engine broke the protocol
+  4  the engine broke the protocol, or a recording that is checked does
   5  the engine refused: the ends do not fit (protocol version or features), or it is full
   6  cancelled)";
 
@@ -333,6 +333,58 @@ void addCall(CLI::App& app, Options& options, CallOptions& call) {
     });
 }
 
+void addInspect(CLI::App& app, Options& options, InspectOptions& inspect) {
+    auto* command = app.add_subcommand("inspect", "Show what is in a recording of sessions");
+    command->add_option("FILE", inspect.file, "A file that --record has written, or - for standard input")
+        ->required()
+        ->type_name("");
+    command->add_flag("--frames", inspect.frames, "Show the frames of each message")->group("Display");
+    command->add_flag("--fields", inspect.fields, "Show the frames and the fields in them")->group("Display");
+    command->add_flag("--hex", inspect.hex, "Show the frames and their bytes")->group("Display");
+    auto* json =
+        command->add_flag("--json", inspect.json, "Print one JSON object a line for each message")->group("Display");
+    auto* timeline =
+        command->add_flag("--timeline", inspect.timeline, "Show for each request what happened to it, and when")
+            ->excludes(json)
+            ->group("Display");
+    command
+        ->add_flag("--lint", inspect.lint,
+                   "Show no messages, but where a session breaks a rule: the file, the byte, and what was expected")
+        ->excludes(timeline)
+        ->group("Display");
+    command
+        ->add_option("--request", inspect.request,
+                     "Only messages of the request whose identifier begins with these hexadecimal digits")
+        ->type_name("ID")
+        ->group("Filter");
+    command->add_option("--type", inspect.types, "Only messages of this type, IIPReply for example; may be repeated")
+        ->allow_extra_args(false)
+        ->type_name("NAME")
+        ->group("Filter");
+    static const std::map<std::string, InspectOptions::Role> roles{{"client", InspectOptions::Role::Client},
+                                                                   {"engine", InspectOptions::Role::Engine}};
+    command
+        ->add_option_function<std::string>(
+            "--from", [&inspect](const std::string& name) { inspect.from = roles.at(name); },
+            "Only messages that this end has sent: client or engine")
+        ->check(CLI::IsMember(&roles))
+        ->type_name("END")
+        ->group("Filter");
+    command->add_option("--since", inspect.since, "Only messages from this time on, counted from the first packet")
+        ->type_name("SECONDS")
+        ->default_str("")
+        ->group("Filter");
+    command->add_option("--until", inspect.until, "Only messages up to this time")
+        ->type_name("SECONDS")
+        ->default_str("")
+        ->group("Filter");
+    command->footer(exitCodes);
+    command->callback([&options, &inspect] {
+        options.display.json = inspect.json;
+        options.command = inspect;
+    });
+}
+
 // All commands and options, and what parsing fills in.
 struct OptionTable {
     // Words tell whether two dashes come.
@@ -345,6 +397,7 @@ struct OptionTable {
     ReplOptions repl;
     ReplayOptions replay;
     RedactOptions redact;
+    InspectOptions inspect;
     CLI::App app{
         "Evaluates code on an engine in another process. Without a command, code is read line by line; the options are "
         "those of repl.",
@@ -364,6 +417,7 @@ OptionTable::OptionTable(const std::vector<std::string>& words) {
     addRepl(app, options, repl);
     addReplay(app, options, replay);
     addRedact(app, options, redact);
+    addInspect(app, options, inspect);
 }
 
 }  // namespace

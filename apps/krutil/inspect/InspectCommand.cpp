@@ -1,0 +1,170 @@
+#include "krutil/inspect/InspectCommand.hpp"
+
+#include <poll.h>
+
+#include <algorithm>
+#include <array>
+#include <limits>
+#include <nlohmann/json.hpp>
+#include <optional>
+#include <string>
+#include <system_error>
+#include <utility>
+
+#include "common/RecordingReader.hpp"
+#include "krutil/base/Interrupt.hpp"
+#include "krutil/base/Output.hpp"
+#include "krutil/base/Text.hpp"
+#include "krutil/inspect/InspectedMessage.hpp"
+#include "krutil/inspect/Lint.hpp"
+#include "krutil/inspect/MessageText.hpp"
+#include "krutil/inspect/Summary.hpp"
+#include "krutil/inspect/Timelines.hpp"
+
+namespace krutil_client {
+namespace {
+
+using nlohmann::ordered_json;
+
+// Of a unit, unless all its bytes are asked for. Decoding a message takes several times its size.
+constexpr std::uint64_t keptBytes = 1U << 20U;
+
+std::string jsonLine(const ordered_json& object) {
+    return object.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace) + "\n";
+}
+
+class Inspection {
+  public:
+    Inspection(const InspectOptions& options, Output& out, Output& err, Interrupt& interrupt)
+        : options_(options),
+          out_(out),
+          err_(err),
+          reader_(options.file, options.hex || options.lint ? std::numeric_limits<std::uint64_t>::max() : keptBytes,
+                  [&interrupt](int fd) { waitFor(fd, interrupt); }),
+          messages_(options.hex) {}
+
+    ExitCode run() {
+        while (auto unit = reader_.next()) {
+            show(std::move(*unit));
+        }
+        for (const InspectedMessage& message : messages_.rest()) {
+            show(message);
+        }
+        out_.write(timelines_.rest());
+        if (const auto sentence = reader_.unfinished()) {
+            say("unfinished", *sentence);
+        }
+        if (options_.lint && !options_.json && findings_ == 0) {
+            out_.write("no rule is broken in " + std::to_string(units_) + " units of " +
+                       std::to_string(reader_.sessions().size()) + " sessions\n");
+        }
+        return findings_ == 0 ? ExitCode::Ok : ExitCode::Violation;
+    }
+
+  private:
+    // A pipe may be silent for long.
+    static void waitFor(int fd, Interrupt& interrupt) {
+        std::array<pollfd, 2> watched{pollfd{fd, POLLIN, 0}, pollfd{interrupt.fd(), POLLIN, 0}};
+        while (watched[0].revents == 0) {
+            ::poll(watched.data(), watched.size(), -1);
+            if (watched[1].revents != 0) {
+                interrupt.dispatch();
+            }
+        }
+    }
+
+    void say(const char* event, const std::string& sentence) {
+        if (options_.json) {
+            out_.write(jsonLine({{"event", event}, {"text", sentence}}));
+        } else {
+            err_.write("krutil: " + sentence + "\n");
+        }
+    }
+
+    void showSessions() {
+        for (; shownSessions_ < reader_.sessions().size(); ++shownSessions_) {
+            const apps::RecordedSession& session = reader_.sessions()[shownSessions_];
+            if (options_.json) {
+                out_.write(jsonLine({{"event", "session"},
+                                     {"session", shownSessions_},
+                                     {"process", session.process},
+                                     {"program", session.program},
+                                     {"begin", *begin_}}));
+            } else if (!options_.lint && !options_.timeline) {
+                out_.write("session " + std::to_string(shownSessions_) + ", recorded by " +
+                           quotedText(session.process, 40) + ", " + quotedText(session.program, 80) + "\n");
+            }
+        }
+    }
+
+    void show(apps::RecordedUnit unit) {
+        begin_ = begin_.value_or(unit.nanoseconds);
+        ++units_;
+        showSessions();
+        if (!options_.lint) {
+            if (const auto message = messages_.take(std::move(unit))) {
+                show(*message);
+            }
+            return;
+        }
+        const auto fault = lint_.take(unit, reader_.sessions()[unit.session]);
+        if (!fault) {
+            return;
+        }
+        ++findings_;
+        if (options_.json) {
+            out_.write(
+                jsonLine({{"event", "finding"}, {"session", unit.session}, {"offset", unit.offset}, {"text", *fault}}));
+        } else {
+            out_.write(reader_.name() + ", byte " + std::to_string(unit.offset) + ": " + *fault + "\n");
+        }
+    }
+
+    void show(const InspectedMessage& message) {
+        if (!isWanted(message)) {
+            return;
+        }
+        if (options_.timeline) {
+            out_.write(timelines_.take(message));
+        } else {
+            out_.write(options_.json ? messageJson(message, *begin_, options_) + "\n"
+                                     : messageText(message, *begin_, options_));
+        }
+    }
+
+    bool isWanted(const InspectedMessage& message) const {
+        const std::uint64_t time = std::max(message.first().nanoseconds, *begin_);
+        const double seconds = static_cast<double>(time - *begin_) / 1e9;
+        const auto wants = [&message](const std::string& type) { return type == message.type(); };
+        return message.request.starts_with(options_.request) &&
+               (options_.types.empty() || std::any_of(options_.types.begin(), options_.types.end(), wants)) &&
+               (!options_.from || *options_.from == message.first().sender) && seconds >= options_.since &&
+               seconds <= options_.until;
+    }
+
+    const InspectOptions& options_;
+    Output& out_;
+    Output& err_;
+    apps::RecordingReader reader_;
+    MessageAssembler messages_;
+    Timelines timelines_;
+    Lint lint_;
+    std::optional<std::uint64_t> begin_;  ///< time of the first packet
+    std::size_t shownSessions_ = 0;
+    std::uint64_t units_ = 0;
+    std::uint64_t findings_ = 0;
+};
+
+}  // namespace
+
+ExitCode inspectRecording(const InspectOptions& options, Output& out, Output& err, Interrupt& interrupt) {
+    try {
+        return Inspection(options, out, err, interrupt).run();
+    } catch (const apps::RecordingError& error) {
+        throw Failure(ExitCode::Usage, error.what());
+    } catch (const std::system_error& error) {
+        throw Failure(ExitCode::Usage, error.what());
+    }
+}
+
+}  // namespace krutil_client
