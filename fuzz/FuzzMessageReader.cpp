@@ -18,6 +18,7 @@
 #include "foundation/msg_svc/transport/layers/session/MessageReader.hpp"
 #include "foundation/msg_svc/transport/layers/session/Outgoing.hpp"
 #include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
+#include "foundation/msg_svc/transport/layers/session/lending/Borrower.hpp"
 #include "foundation/msg_svc/transport/layers/session/lending/DescriptorPassing.hpp"
 
 namespace {
