@@ -237,7 +237,7 @@ TEST(EngineUsageTest, ExactlyOnePlaceToServe) {
          {std::vector<std::string>{}, {"--stdio", "--listen", "x"}, {"--listen", ""}}) {
         EngineProcess engine(arguments);
         EXPECT_EQ(engine.wait(), 2);
-        EXPECT_THAT(engine.stderrText(), HasSubstr("Exactly one of --stdio and --listen is required"));
+        EXPECT_THAT(engine.stderrText(), HasSubstr("Exactly one of --stdio, --listen and --listen-fds is required"));
     }
     EngineProcess unknown({"--nonsense"});
     EXPECT_EQ(unknown.wait(), 2);
