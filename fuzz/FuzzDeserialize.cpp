@@ -27,7 +27,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         // Numbers that end the process by the protocol's own rule are left out, as sessions do.
         for (unsigned long index = 1; index <= root; ++index) {
             if (const auto* tagged = dynamic_cast<const TaggedFrame*>(message->frame(index).get())) {
-                apps::precheck(*tagged);
+                apps::precheck(true)->check(*tagged);
             }
         }
         samples::read(*serializer, root, message, registry, transport::SerializationContext());

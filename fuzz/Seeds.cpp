@@ -1,9 +1,11 @@
-// Writes the fuzzers' seeds, made of the samples, into DIRECTORY/deserialize and DIRECTORY/message_reader.
+// Writes the fuzzers' seeds, made of the samples, into a folder of DIRECTORY for each.
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <iostream>
 
+#include "common/MessageNames.hpp"
 #include "input/FuzzInput.hpp"
 #include "krutil_protobuf/support/TestTransport.hpp"
 #include "samples/Samples.hpp"
@@ -57,6 +59,14 @@ std::vector<std::string> sharedMemoryBytes() {
             '\x87' + header(6, 0, 7, 0) + header(6, 1, 8, 0), '\x98' + header(6, 2, 7, 0)};
 }
 
+// A content behind the place of its type among the names.
+std::string walkInput(const transport::FrameContent& frame) {
+    const auto names = apps::messageNames();
+    const auto found =
+        std::find_if(names.begin(), names.end(), [&](const apps::MessageName& name) { return name.tag == frame.tag; });
+    return static_cast<char>(found - names.begin()) + frame.bytes;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -66,8 +76,10 @@ int main(int argc, char** argv) {
     }
     const std::filesystem::path deserialize = std::filesystem::path(argv[1]) / "deserialize";
     const std::filesystem::path reader = std::filesystem::path(argv[1]) / "message_reader";
+    const std::filesystem::path walk = std::filesystem::path(argv[1]) / "wire_walk";
     std::filesystem::create_directories(deserialize);
     std::filesystem::create_directories(reader);
+    std::filesystem::create_directories(walk);
     const auto registry = transport::sessionRegistry();
     const auto& serializers = registry->serializers();
     std::size_t count = 0;
@@ -92,6 +104,9 @@ int main(int argc, char** argv) {
             // Cut in the middle as well: what is lost on the way looks like this.
             write(deserialize / (name + "-cut"), input.substr(0, input.size() / 2));
             write(reader / (name + "-cut"), wire.substr(0, wire.size() / 2));
+            const std::string content = walkInput(frames.back());
+            write(walk / name, content);
+            write(walk / (name + "-cut"), content.substr(0, content.size() / 2));
         }
     }
     for (const std::string& wire : sharedMemoryBytes()) {

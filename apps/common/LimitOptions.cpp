@@ -77,6 +77,9 @@ void addLimitOptions(CLI::App& app, foundation::msg_svc::transport::layers::sess
     addNumber(app, "--limit-frames", limits.frames, unlimited, "Most frames of a message that are accepted")
         ->type_name("COUNT")
         ->default_str(std::to_string(limits.frames));
+    addNumber(app, "--limit-parts", limits.parts, unlimited, "Most fields of a tagged frame that are accepted")
+        ->type_name("COUNT")
+        ->default_str(std::to_string(limits.parts));
 }
 
 }  // namespace apps

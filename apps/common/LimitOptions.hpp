@@ -12,10 +12,10 @@
 
 namespace apps {
 
-/// Adds --limit-tag, --limit-tagged-frame, --limit-array-message, --limit-message and --limit-frames to `app`, each of
-/// which stores into `limits` when `app` parses; --help shows the values that `limits` holds now as the defaults. Sizes
-/// are bytes, with an optional unit (KiB, MiB, GiB, TiB or the letter alone, in powers of 1024, whatever the case).
-/// `limits` must outlive `app`.
+/// Adds --limit-tag, --limit-tagged-frame, --limit-array-message, --limit-message, --limit-frames and --limit-parts to
+/// `app`, each of which stores into `limits` when `app` parses; --help shows the values that `limits` holds now as the
+/// defaults. Sizes are bytes, with an optional unit (KiB, MiB, GiB, TiB or the letter alone, in powers of 1024,
+/// whatever the case). `limits` must outlive `app`.
 void addLimitOptions(CLI::App& app, foundation::msg_svc::transport::layers::session::Limits& limits);
 
 /// Adds one option in the group "Limits" that takes a size from `smallest` to `largest` and stores it into `bytes`,

@@ -6,43 +6,44 @@
 namespace apps {
 namespace {
 
-struct Row {
-    std::string_view tag;
-    std::string_view message;
-};
-
-constexpr std::string_view protocolPrefix = "krutil:";
-constexpr std::string_view messagePrefix = "krutil.protobuf.";
-
-// Where the message is not simply what follows the protocol's prefix.
-constexpr std::array exceptions{
-    Row{"krutil:IIPStartedEvent", "krutil.protobuf.IIPStateEvent"},
-    Row{"krutil:IIPSuspendedEvent", "krutil.protobuf.IIPStateEvent"},
-    Row{"krutil:IIPResumedEvent", "krutil.protobuf.IIPStateEvent"},
-    Row{"krutil:IIPDiscardedEvent", "krutil.protobuf.IIPStateEvent"},
-    Row{"krutil:IIPRequeuedEvent", "krutil.protobuf.IIPStateEvent"},
-    Row{"krutil:IIPReactivatedEvent", "krutil.protobuf.IIPStateEvent"},
-    Row{"krutil:IIPCompletedEvent", "krutil.protobuf.IIPStateEvent"},
-    Row{"krutil:detail::LastIIPEvent", "krutil.protobuf.IIPStateEvent"},
-    Row{"krutil:QDA", "foundation.korveldata.protobuf.KORVEL_Array"},
-    Row{"krutil:capabilities_api:CapabilitiesChanged", "krutil.protobuf.CapabilitiesChanged"},
-    Row{"korvel:lang:diagnostic:IssuedWarningEvent", "krutil.protobuf.IssuedWarningEvent"},
-    Row{"korvel:lang:diagnostic:IssuedEnabledWarningEvent", "krutil.protobuf.IssuedEnabledWarningEvent"},
+constexpr std::array names{
+    MessageName{"korvel:lang:diagnostic:IssuedEnabledWarningEvent", "krutil.protobuf.IssuedEnabledWarningEvent"},
+    MessageName{"korvel:lang:diagnostic:IssuedWarningEvent", "krutil.protobuf.IssuedWarningEvent"},
+    MessageName{"krutil:DebugLoopEvent", "krutil.protobuf.DebugLoopEvent"},
+    MessageName{"krutil:EvalIIP", "krutil.protobuf.EvalIIP"},
+    MessageName{"krutil:FEvalIIP", "krutil.protobuf.FEvalIIP"},
+    MessageName{"krutil:FEvalResult", "krutil.protobuf.FEvalResult"},
+    MessageName{"krutil:IIPCancelMessage", "krutil.protobuf.IIPCancelMessage"},
+    MessageName{"krutil:IIPCancelReply", "krutil.protobuf.IIPCancelReply"},
+    MessageName{"krutil:IIPCompletedEvent", "krutil.protobuf.IIPStateEvent"},
+    MessageName{"krutil:IIPDiscardedEvent", "krutil.protobuf.IIPStateEvent"},
+    MessageName{"krutil:IIPEnqueueMessage", "krutil.protobuf.IIPEnqueueMessage"},
+    MessageName{"krutil:IIPReactivatedEvent", "krutil.protobuf.IIPStateEvent"},
+    MessageName{"krutil:IIPReply", "krutil.protobuf.IIPReply"},
+    MessageName{"krutil:IIPRequeuedEvent", "krutil.protobuf.IIPStateEvent"},
+    MessageName{"krutil:IIPResult", "krutil.protobuf.IIPResult"},
+    MessageName{"krutil:IIPResumedEvent", "krutil.protobuf.IIPStateEvent"},
+    MessageName{"krutil:IIPStartedEvent", "krutil.protobuf.IIPStateEvent"},
+    MessageName{"krutil:IIPSuspendedEvent", "krutil.protobuf.IIPStateEvent"},
+    MessageName{"krutil:PrintableErrorEvent", "krutil.protobuf.PrintableErrorEvent"},
+    MessageName{"krutil:QDA", "foundation.korveldata.protobuf.KORVEL_Array"},
+    MessageName{"krutil:QVMShutdownEvent", "krutil.protobuf.QVMShutdownEvent"},
+    MessageName{"krutil:SinkTextEvent", "krutil.protobuf.SinkTextEvent"},
+    MessageName{"krutil:TextBaseEvent", "krutil.protobuf.TextBaseEvent"},
+    MessageName{"krutil:capabilities_api:CapabilitiesChanged", "krutil.protobuf.CapabilitiesChanged"},
+    MessageName{"krutil:detail::LastIIPEvent", "krutil.protobuf.IIPStateEvent"},
 };
 
 }  // namespace
 
+std::span<const MessageName> messageNames() noexcept {
+    return names;
+}
+
 std::string messageNameOfTag(std::string_view tag) {
-    const auto row = std::find_if(exceptions.begin(), exceptions.end(),
-                                  [tag](const Row& candidate) { return candidate.tag == tag; });
-    if (row != exceptions.end()) {
-        return std::string(row->message);
-    }
-    if (tag.substr(0, protocolPrefix.size()) != protocolPrefix || tag.size() == protocolPrefix.size() ||
-        tag.find(':', protocolPrefix.size()) != std::string_view::npos) {
-        return {};
-    }
-    return std::string(messagePrefix) + std::string(tag.substr(protocolPrefix.size()));
+    const auto row =
+        std::find_if(names.begin(), names.end(), [tag](const MessageName& name) { return name.tag == tag; });
+    return row == names.end() ? std::string() : std::string(row->message);
 }
 
 }  // namespace apps

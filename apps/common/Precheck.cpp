@@ -1,93 +1,55 @@
 #include "common/Precheck.hpp"
 
-#include <google/protobuf/io/coded_stream.h>
-#include <google/protobuf/io/zero_copy_stream_impl_lite.h>
+#include <google/protobuf/descriptor.h>
 
-#include <limits>
-#include <map>
+#include <stdexcept>
 #include <string>
-#include <string_view>
+#include <vector>
 
-#include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
-#include "krutil.protobuf.FEvalResult.pb.h"
-#include "krutil.protobuf.IIPResult.pb.h"
-#include "krutil.protobuf.PrintableErrorEvent.pb.h"
-#include "krutil.protobuf.SinkTextEvent.pb.h"
-#include "krutil.protobuf.TextBaseEvent.pb.h"
+#include "common/MessageNames.hpp"
 
 namespace apps {
 namespace {
 
-using foundation::msg_svc::transport::layers::session::ProtocolViolation;
-using foundation::vantor::carrier::framing::TaggedFrame;
-namespace proto = krutil::protobuf;
+using foundation::msg_svc::transport::layers::session::WireWalk;
+using google::protobuf::Descriptor;
+using google::protobuf::DescriptorPool;
 
-[[noreturn]] void refuse(const TaggedFrame& frame, const char* field, int value, const char* expected) {
-    throw ProtocolViolation("frame \"" + std::string(frame.tag()) + "\": expected " + field + " from " + expected +
-                            ", got " + std::to_string(value));
-}
-
-// The same steps as the serializers', so that both see the same fields of content that does not parse.
-template <class ProtoMessage>
-ProtoMessage parse(const TaggedFrame& frame) {
-    ProtoMessage message;
-    const auto most = static_cast<unsigned long>(std::numeric_limits<int>::max());
-    if (frame.size() <= most) {
-        google::protobuf::io::ArrayInputStream array(frame.data(), static_cast<int>(frame.size()), -1);
-        google::protobuf::io::CodedInputStream coded(&array);
-        coded.SetTotalBytesLimit(std::numeric_limits<int>::max());
-        static_cast<void>(message.ParseFromCodedStream(&coded));
+const Descriptor& messageNamed(const std::string& name) {
+    const Descriptor* const message = DescriptorPool::generated_pool()->FindMessageTypeByName(name);
+    if (message == nullptr) {
+        throw std::logic_error("precheck: expected a message " + name + " in the schema, got none");
     }
-    return message;
+    return *message;
 }
 
-template <class ProtoMessage>
-void checkText(const TaggedFrame& frame) {
-    const auto stream = parse<ProtoMessage>(frame).stream();
-    if (!proto::StreamType_IsValid(stream)) {
-        refuse(frame, "a stream", stream, "0 to 2");
+WireWalk::NumberRule rule(const char* message, const char* field, const char* name, int last) {
+    return {messageNamed(message).FindFieldByName(field), name, 0, last};
+}
+
+std::shared_ptr<const WireWalk> walk(bool numbers) {
+    WireWalk::Messages messages;
+    for (const MessageName& row : messageNames()) {
+        messages.emplace(row.tag, &messageNamed(std::string(row.message)));
     }
-}
-
-// As deep as the parser went, which has a limit.
-void checkStatus(const TaggedFrame& frame, const proto::RuntimeException& exception) {
-    if (!proto::ExecutionStatus_IsValid(exception.status())) {
-        refuse(frame, "a status", exception.status(), "0 to 5");
+    std::vector<WireWalk::NumberRule> rules;
+    if (numbers) {
+        rules = {rule("krutil.protobuf.TextBaseEvent", "stream", "a stream", 2),
+                 rule("krutil.protobuf.SinkTextEvent", "stream", "a stream", 2),
+                 rule("krutil.protobuf.RuntimeException", "status", "a status", 5)};
     }
-    for (const auto& cause : exception.causes()) {
-        checkStatus(frame, cause);
-    }
-}
-
-void checkResult(const TaggedFrame& frame) {
-    checkStatus(frame, parse<proto::IIPResult>(frame).exception());
-}
-
-void checkCallResult(const TaggedFrame& frame) {
-    checkStatus(frame, parse<proto::FEvalResult>(frame).iipresult().exception());
-}
-
-void checkPrintableError(const TaggedFrame& frame) {
-    checkStatus(frame, parse<proto::PrintableErrorEvent>(frame).except());
-}
-
-const std::map<std::string_view, void (*)(const TaggedFrame&)>& checks() {
-    static const std::map<std::string_view, void (*)(const TaggedFrame&)> byTag{
-        {"krutil:TextBaseEvent", checkText<proto::TextBaseEvent>},
-        {"krutil:SinkTextEvent", checkText<proto::SinkTextEvent>},
-        {"krutil:IIPResult", checkResult},
-        {"krutil:FEvalResult", checkCallResult},
-        {"krutil:PrintableErrorEvent", checkPrintableError},
-    };
-    return byTag;
+    return std::make_shared<const WireWalk>(messages, rules);
 }
 
 }  // namespace
 
-void precheck(const TaggedFrame& frame) {
-    if (const auto found = checks().find(frame.tag()); found != checks().end()) {
-        found->second(frame);
+std::shared_ptr<const WireWalk> precheck(bool numbers) {
+    static const std::shared_ptr<const WireWalk> all = walk(true);
+    if (numbers) {
+        return all;
     }
+    static const std::shared_ptr<const WireWalk> structure = walk(false);
+    return structure;
 }
 
 }  // namespace apps

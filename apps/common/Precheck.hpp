@@ -1,14 +1,15 @@
-// Looks at received numbers that would end the process before the serializers convert them.
+// Looks at received contents before the serializers convert them.
 #pragma once
 
-#include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
+#include <memory>
+
+#include "foundation/msg_svc/transport/layers/session/WireWalk.hpp"
 
 namespace apps {
 
-/// For SessionConfig::check. Throws ProtocolViolation, which closes the session, for a stream number of a text event or
-/// a status of an error, at any depth, that the protocol's conversions end the process for. Parses the content with the
-/// serializers' own parser and limits, so that truncated or malformed content is judged as they will read it; frames of
-/// other types cost one look-up of their tag. May be called from any thread.
-void precheck(const foundation::vantor::carrier::framing::TaggedFrame& frame);
+/// For SessionConfig::check: knows the messages of all tags of the protocol. With `numbers` it refuses the stream
+/// numbers of texts and the statuses of errors, at any depth, that the protocol's conversions end the process for. Made
+/// by the first call with that argument, once for the process; any thread.
+std::shared_ptr<const foundation::msg_svc::transport::layers::session::WireWalk> precheck(bool numbers);
 
 }  // namespace apps

@@ -146,9 +146,7 @@ bool Engine::open(int in, int out) {
     config.limits = options_.limits;
     config.capabilities = capabilities_.lists().engine;
     config.sharedMemory = !options_.noSharedMemory;
-    if (!options_.noPrecheck) {
-        config.check = apps::precheck;
-    }
+    config.check = apps::precheck(!options_.noPrecheck);
     config.handshakeTimeout = options_.handshakeTimeout;
     if (recording_) {
         recording_->beginSession(config.role, config.build);

@@ -21,6 +21,7 @@
 
 #include "common/Build.hpp"
 #include "common/KrutilSession.hpp"
+#include "common/Precheck.hpp"
 #include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "foundation/msg_svc/transport/layers/session/Session.hpp"
 #include "qvm/process/StandardDescriptors.hpp"
@@ -134,6 +135,8 @@ Listener::Listener(const Options& options, Log& log, int socket)
     ::sigprocmask(SIG_BLOCK, &watched, nullptr);
     try {
         preparePython(options_.python);
+        // Made once, before sessions are forked.
+        apps::precheck(!options_.noPrecheck);
         if (socket < 0) {
             bindSocket();
         } else if (::fcntl(socket, F_SETFL, O_NONBLOCK) != 0) {

@@ -259,7 +259,7 @@ class InspectTest(unittest.TestCase):
                          'cannot read "krutil:IIPEnqueueMessage": frame 1: expected a frame, got none: it was read '
                          "already")
         self.assertEqual(self.finding(("<", frame(1, 29, 0, 1, "krutil:TextBaseEvent", field(2, 9)))),
-                         'frame "krutil:TextBaseEvent": expected a stream from 0 to 2, got 9')
+                         'frame "krutil:TextBaseEvent", byte 0, field stream: expected a stream from 0 to 2, got 9')
         self.assertEqual(self.finding(("<", frame(1, 29, 0, 1, "krutil:TextBaseEvent", b"", size=5 << 20))),
                          'content of frame 1 with tag "krutil:TextBaseEvent" exceeds the limit "taggedFrame": expected '
                          "at most 4194304 bytes, got 5242880")

@@ -15,11 +15,10 @@ import checkout
 # Document -> header of the tables whose first column lists texts of violations. In it, a word in capitals is a place
 # for something else.
 VIOLATIONS = {"docs/session-wire.md": "| text | the cause |", "docs/protocol.md": "| the session says | the cause |"}
-PLACES = {r"\b[NMSTXY]\b": r"\d+", r"\b(?:TAG|READER|LIMIT|TEXT)\b|\\\.\\\.\\\.": ".*"}
+PLACES = {r"\b[NMSTXY]\b": r"\d+", r"\b(?:TAG|READER|LIMIT|TEXT|PATH)\b|\\\.\\\.\\\.": ".*"}
 # Where the code says them: in the arguments of these calls, and in these functions. What a sender is told before it
 # sends is no violation.
 SESSION = "platform/src/foundation/msg_svc/transport/layers/session/"
-PRECHECK = "apps/common/Precheck.cpp"
 TO_SENDERS = SESSION + "PeerLimits.cpp"
 SAYS = re.compile(r"\b(?:ProtocolViolation|refuse|refuseSize|onViolation)\(")
 SAYING = re.compile(r"^std::string (?:refusalToReceive|FrameNotes::\w+)\(.*?^}", re.MULTILINE | re.DOTALL)
@@ -96,7 +95,7 @@ def check(root):
             if not pattern(row[0]).search(tested):
                 findings.append(f'{path}: no test expects "{row[0]}"')
     for path in checkout.files(root, ".cpp"):
-        if path.startswith((SESSION, PRECHECK)) and path != TO_SENDERS:
+        if path.startswith(SESSION) and path != TO_SENDERS:
             code = checkout.read(root, path)
             parts = [arguments(code, match.end()) for match in SAYS.finditer(code)] + SAYING.findall(code)
             for text in sorted({text for part in parts for text in strings(part)}):

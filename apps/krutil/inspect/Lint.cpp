@@ -67,6 +67,7 @@ rules::Limits limitsOf(const msg_svc::protobuf::SessionHello& hello) {
     limits.arrayMessage = hello.limits().arraymessage();
     limits.message = hello.limits().message();
     limits.frames = hello.limits().frames();
+    limits.parts = hello.limits().parts() != 0 ? hello.limits().parts() : rules::WireWalk::anyParts;
     return limits;
 }
 
@@ -140,7 +141,7 @@ void Lint::settle(const apps::RecordedSession& recorded, Session& session) {
     }
     rules::SessionConfig config = apps::krutilSession(recorded.recorder);
     // Numbers that would end this program are a fault that it finds.
-    config.check = apps::precheck;
+    config.check = apps::precheck(true);
     const auto features = featuresOf(*client.verdict);
     session.checker = std::make_unique<rules::SessionChecker>(
         config, rules::SessionChecker::Settled{limitsOf(*client.hello),

@@ -140,9 +140,7 @@ std::unique_ptr<Conversation> Client::openConversation(const ConnectionOptions& 
     config.capabilities = capabilities_;
     config.handshakeTimeout = connection.handshakeTimeout;
     config.sharedMemory = !connection.noSharedMemory && !isTls(connection);
-    if (!connection.noPrecheck) {
-        config.check = apps::precheck;
-    }
+    config.check = apps::precheck(!connection.noPrecheck);
     if (tracer_) {
         config.trace = std::ref(*tracer_);
     }

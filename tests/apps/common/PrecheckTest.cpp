@@ -1,5 +1,6 @@
 #include "common/Precheck.hpp"
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <boost/shared_ptr.hpp>
@@ -10,6 +11,7 @@
 
 #include "KrutilProtocol.hpp"
 #include "apps/common/UnknownNumbers.hpp"
+#include "common/MessageNames.hpp"
 #include "foundation/msg_svc/eventmgr/BaseEvent.hpp"
 #include "foundation/msg_svc/transport/layers/message/Message.hpp"
 #include "foundation/msg_svc/transport/layers/serialization/SerializerAPI.hpp"
@@ -38,7 +40,7 @@ std::unique_ptr<TaggedFrame> frameOf(const std::string& tag, const std::string& 
 // What the check says; empty when it lets the frame pass.
 std::string verdict(const std::string& tag, const std::string& content) {
     try {
-        precheck(*frameOf(tag, content));
+        precheck(true)->check(*frameOf(tag, content));
         return {};
     } catch (const session::ProtocolViolation& violation) {
         return violation.what();
@@ -47,11 +49,13 @@ std::string verdict(const std::string& tag, const std::string& content) {
 
 struct ErrorMessage {
     const char* tag;
+    const char* path;
     std::string (*make)(int depth, int status);
 };
 
-const std::vector<ErrorMessage> errorMessages{
-    {"krutil:IIPResult", result}, {"krutil:FEvalResult", callResult}, {"krutil:PrintableErrorEvent", printableError}};
+const std::vector<ErrorMessage> errorMessages{{"krutil:IIPResult", "exception", result},
+                                              {"krutil:FEvalResult", "iipResult.exception", callResult},
+                                              {"krutil:PrintableErrorEvent", "except", printableError}};
 
 TEST(PrecheckTest, StreamsOfTextsOutsideTheirRangeAreRefused) {
     for (const int stream : {0, 1, 2}) {
@@ -59,50 +63,67 @@ TEST(PrecheckTest, StreamsOfTextsOutsideTheirRangeAreRefused) {
         EXPECT_EQ(verdict("krutil:SinkTextEvent", textEvent<proto::SinkTextEvent>(stream)), "");
     }
     for (const int stream : {-1, 3, 2'147'483'647, -2'147'483'647 - 1}) {
-        const std::string expected = R"(": expected a stream from 0 to 2, got )" + std::to_string(stream);
         EXPECT_EQ(verdict("krutil:TextBaseEvent", textEvent<proto::TextBaseEvent>(stream)),
-                  R"(frame "krutil:TextBaseEvent)" + expected);
+                  refusalOfStream("krutil:TextBaseEvent", stream));
         EXPECT_EQ(verdict("krutil:SinkTextEvent", textEvent<proto::SinkTextEvent>(stream)),
-                  R"(frame "krutil:SinkTextEvent)" + expected);
+                  refusalOfStream("krutil:SinkTextEvent", stream));
     }
 }
 
 TEST(PrecheckTest, StatusesOutsideTheirRangeAreRefusedAtAnyDepth) {
-    for (const auto& [tag, make] : errorMessages) {
+    for (const auto& [tag, path, make] : errorMessages) {
         for (const int depth : {0, 1, 2, 30}) {
             for (const int status : {0, 1, 2, 3, 4, 5}) {
                 EXPECT_EQ(verdict(tag, make(depth, status)), "") << depth;
             }
             for (const int status : {-1, 6, 2'147'483'647}) {
-                EXPECT_EQ(
-                    verdict(tag, make(depth, status)),
-                    "frame \"" + std::string(tag) + "\": expected a status from 0 to 5, got " + std::to_string(status))
-                    << depth;
+                const std::string message = make(depth, status);
+                EXPECT_EQ(verdict(tag, message), refusalOfStatus(tag, path, message, depth, status)) << depth;
             }
         }
     }
 }
 
-TEST(PrecheckTest, SentenceNamesTheFrameAndTheNumber) {
-    EXPECT_EQ(verdict("krutil:IIPResult", result(0, 6)),
-              "frame \"krutil:IIPResult\": expected a status from 0 to 5, got 6");
+TEST(PrecheckTest, SentenceNamesTheFrameThePlaceAndTheNumber) {
+    EXPECT_EQ(
+        verdict("krutil:IIPResult", result(2, 6)),
+        "frame \"krutil:IIPResult\", byte 32, field exception.causes (2 times).status: expected a status from 0 to "
+        "5, got 6");
 }
 
-TEST(PrecheckTest, WhatLiesBelowTheParsersDepthIsNotSeenByTheSerializersEither) {
-    for (const auto& [tag, make] : errorMessages) {
-        EXPECT_EQ(verdict(tag, make(150, 99)), "") << tag;
+TEST(PrecheckTest, SentenceNamesWhatIsKnownOfThePlace) {
+    EXPECT_EQ(verdict("krutil:TextBaseEvent", textEvent<proto::TextBaseEvent>(7)),
+              R"(frame "krutil:TextBaseEvent", byte 2, field stream: expected a stream from 0 to 2, got 7)");
+    EXPECT_EQ(verdict("krutil:TextBaseEvent", std::string(1, '\0')),
+              R"(frame "krutil:TextBaseEvent", byte 0: expected a field number from 1 on, got 0)");
+}
+
+TEST(PrecheckTest, WithoutNumbersOnlyTheirRangesAreFree) {
+    const auto structure = precheck(false);
+    for (const auto& [tag, path, make] : errorMessages) {
+        EXPECT_NO_THROW(structure->check(*frameOf(tag, make(3, 6))));
+        EXPECT_THROW(structure->check(*frameOf(tag, make(3, 6) + "\x08")), session::ProtocolViolation);
+    }
+    EXPECT_EQ(precheck(false), structure) << "made once";
+}
+
+TEST(PrecheckTest, WhatIsDeeperThanTheParserReadsIsRefused) {
+    for (const auto& [tag, path, make] : errorMessages) {
+        EXPECT_THAT(verdict(tag, make(150, 5)),
+                    testing::EndsWith(": expected at most 100 messages inside one another, got more"))
+            << tag;
     }
 }
 
-TEST(PrecheckTest, FramesOfOtherTypesAndEmptyOnesPass) {
+TEST(PrecheckTest, ContentsOfEveryTypeAreLookedAt) {
+    for (const MessageName& name : messageNames()) {
+        const std::string tag(name.tag);
+        EXPECT_EQ(verdict(tag, ""), "");
+        EXPECT_EQ(verdict(tag, "\xff\xff\xff"), "frame \"" + tag + "\", byte 0: expected 1 more byte, got none");
+    }
+    EXPECT_EQ(verdict("unknown", "\xff\xff\xff"), "");
     // The number that would be a bad stream of a text.
     EXPECT_EQ(verdict("krutil:IIPReply", textEvent<proto::TextBaseEvent>(7)), "");
-    EXPECT_EQ(verdict("unknown", textEvent<proto::TextBaseEvent>(7)), "");
-    for (const char* tag : {"krutil:TextBaseEvent", "krutil:SinkTextEvent", "krutil:IIPResult", "krutil:FEvalResult",
-                            "krutil:PrintableErrorEvent"}) {
-        EXPECT_EQ(verdict(tag, ""), "");
-        EXPECT_EQ(verdict(tag, "\xff\xff\xff"), "");
-    }
 }
 
 // The serializers themselves, which end the process for what the check is to refuse.
@@ -124,34 +145,34 @@ class PrecheckAgainstSerializersTest : public ::testing::Test {
         dynamic_cast<const EventSerializer&>(*registry->find(tag)).deserialize(1, message, registry, {});
     }
 
-    // The check refuses what the serializer dies of, at whichever byte the content is cut, and lets the rest pass.
-    void checkEachCut(const std::string& tag, const std::string& content, const std::string& lastWords) {
-        std::vector<std::size_t> refused;
-        for (std::size_t length = 0; length <= content.size(); ++length) {
-            if (verdict(tag, content.substr(0, length)).empty()) {
-                read(tag, content.substr(0, length));
-            } else {
-                refused.push_back(length);
-            }
-        }
-        ASSERT_GE(refused.size(), 2U);
-        ASSERT_LT(refused.size(), content.size());
-        EXPECT_DEATH(read(tag, content.substr(0, refused.front())), lastWords);
-        EXPECT_DEATH(read(tag, content.substr(0, refused.back())), lastWords);
+    // What the serializer dies of is refused.
+    void checkFatal(const std::string& tag, const std::string& content, const std::string& lastWords) {
+        EXPECT_NE(verdict(tag, content), "");
+        EXPECT_DEATH(read(tag, content), lastWords);
     }
 
     std::shared_ptr<serialization::Registry> registry = std::make_shared<serialization::Registry>();
 };
 
-TEST_F(PrecheckAgainstSerializersTest, CutTextEventsAreJudgedAsTheyAreRead) {
-    checkEachCut("krutil:TextBaseEvent", textEvent<proto::TextBaseEvent>(7),
-                 "Unsupported krutil::protobuf::StreamType");
-    checkEachCut("krutil:SinkTextEvent", textEvent<proto::SinkTextEvent>(-7),
-                 "Unsupported krutil::protobuf::StreamType");
+TEST_F(PrecheckAgainstSerializersTest, NumbersThatTheyDieOf) {
+    checkFatal("krutil:TextBaseEvent", textEvent<proto::TextBaseEvent>(7), "Unsupported krutil::protobuf::StreamType");
+    checkFatal("krutil:SinkTextEvent", textEvent<proto::SinkTextEvent>(-7), "Unsupported krutil::protobuf::StreamType");
+    checkFatal("krutil:PrintableErrorEvent", printableError(3, 9), "Unsupported protobuf::ExecutionStatus value");
+    // The parser has read the number when the content ends.
+    const std::string whole = textEvent<proto::TextBaseEvent>(7);
+    checkFatal("krutil:TextBaseEvent", whole.substr(0, 4), "Unsupported krutil::protobuf::StreamType");
 }
 
-TEST_F(PrecheckAgainstSerializersTest, CutErrorsAreJudgedAsTheyAreRead) {
-    checkEachCut("krutil:PrintableErrorEvent", printableError(3, 9), "Unsupported protobuf::ExecutionStatus value");
+// They take what they have read for the whole, so it is refused before they see it.
+TEST_F(PrecheckAgainstSerializersTest, EachCutIsReadByThemAndRefusedBefore) {
+    const std::string whole = textEvent<proto::TextBaseEvent>(1);
+    for (std::size_t length = 0; length <= whole.size(); ++length) {
+        const std::string cut = whole.substr(0, length);
+        EXPECT_NO_THROW(read("krutil:TextBaseEvent", cut));
+        // A field ends there.
+        const bool isWhole = length == 0 || length == 2 || length == 4 || length == whole.size();
+        EXPECT_EQ(verdict("krutil:TextBaseEvent", cut).empty(), isWhole) << length;
+    }
 }
 
 TEST_F(PrecheckAgainstSerializersTest, ErrorsBelowTheParsersDepthAreRead) {

@@ -63,4 +63,19 @@ inline std::string printableError(int depth, int status) {
     return message.SerializeAsString();
 }
 
+/// What is said to a text event for a stream that is none.
+inline std::string refusalOfStream(const std::string& tag, int stream) {
+    return "frame \"" + tag + "\", byte 2, field stream: expected a stream from 0 to 2, got " + std::to_string(stream);
+}
+
+/// What is said to a message with such an error, which stands in the field `path` of it.
+inline std::string refusalOfStatus(const std::string& tag, const std::string& path, const std::string& message,
+                                   int depth, int status) {
+    const std::string causes = depth == 0   ? ""
+                               : depth == 1 ? ".causes"
+                                            : ".causes (" + std::to_string(depth) + " times)";
+    return "frame \"" + tag + "\", byte " + std::to_string(message.rfind(error(0, status).SerializeAsString())) +
+           ", field " + path + causes + ".status: expected a status from 0 to 5, got " + std::to_string(status);
+}
+
 }  // namespace apps_test

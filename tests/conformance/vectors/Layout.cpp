@@ -49,7 +49,7 @@ struct StreamOfMessages::Parts {
         try {
             for (const auto& frame : frames) {
                 if (const auto* const tagged = dynamic_cast<const transport::TaggedFrame*>(frame.get())) {
-                    apps::precheck(*tagged);
+                    apps::precheck(true)->check(*tagged);
                 }
             }
             // Indexes of a message start at 1.

@@ -27,7 +27,7 @@ void addTextEvents(std::vector<Vector>& vectors, const std::string& type) {
             type, name,
             edited<Proto>(message,
                           [value = number](auto& proto) { proto.set_stream(static_cast<wire::StreamType>(value)); }),
-            "frame \"" + type + "\": expected a stream from 0 to 2, got " + std::to_string(number)));
+            refusedAt(type, 23, "field stream: expected a stream from 0 to 2, got " + std::to_string(number))));
     }
     auto textless = edited<Proto>(message, [](auto& proto) { proto.clear_text(); });
     textless.back().bytes += "\x1A\x02\xC3\x28";
@@ -112,7 +112,7 @@ void addErrors(std::vector<Vector>& vectors) {
         type, "status_6",
         edited<wire::PrintableErrorEvent>(
             message, [](auto& proto) { proto.mutable_except()->set_status(static_cast<wire::ExecutionStatus>(6)); }),
-        "frame \"krutil:PrintableErrorEvent\": expected a status from 0 to 5, got 6"));
+        refusedAt(type, 25, "field except.status: expected a status from 0 to 5, got 6")));
     vectors.push_back(accepted(type, "error_absent",
                                edited<wire::PrintableErrorEvent>(message,
                                                                  [](auto& proto) {

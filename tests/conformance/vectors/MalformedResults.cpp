@@ -62,23 +62,27 @@ void addResults(std::vector<Vector>& vectors) {
            "Required field is missing: protobuf::IIPResult.id");
     for (const auto& [name, number] : {std::pair{"status_6", 6}, {"status_minus_1", -1}}) {
         const auto status = static_cast<wire::ExecutionStatus>(number);
-        const std::string why =
-            "frame \"krutil:IIPResult\": expected a status from 0 to 5, got " + std::to_string(number);
-        refuse(name, with([&](auto& proto) { proto.mutable_exception()->set_status(status); }), why);
+        const std::string why = "status: expected a status from 0 to 5, got " + std::to_string(number);
+        refuse(name, with([&](auto& proto) { proto.mutable_exception()->set_status(status); }),
+               refusedAt(result, 25, "field exception." + why));
         refuse(std::string(name) + "_of_a_cause",
-               with([&](auto& proto) { proto.mutable_exception()->add_causes()->set_status(status); }), why);
+               with([&](auto& proto) { proto.mutable_exception()->add_causes()->set_status(status); }),
+               refusedAt(result, 133, "field exception.causes." + why));
     }
 
-    // The error stands in front of the identifier, which is lost when the parser gives up inside the error.
     auto deep = message;
-    wire::IIPResult id;
-    id.mutable_id()->set_lo(9);
     wire::IIPResult error;
+    error.mutable_id()->set_lo(9);
     *error.mutable_exception() = nested(101);
-    deep.back().bytes = error.SerializeAsString() + id.SerializeAsString();
+    deep.back().bytes = error.SerializeAsString();
+    // The innermost cause is empty: its field is the last two bytes.
+    const std::size_t innermost = deep.back().bytes.size() - 2;
     vectors.push_back(unparsable(
-        refused(result, "error_of_101_levels", deep, "Required field is missing: protobuf::IIPResult.id"), {},
-        "Parsers take 100 messages inside one another, or as many as they are told to. Engines write 64 levels."));
+        refused(result, "error_of_101_levels", std::move(deep),
+                refusedAt(result, innermost,
+                          "field exception.causes (100 times): expected at most 100 messages inside one another, got "
+                          "more")),
+        {}, "Parsers take 100 messages inside one another, or as many as they are told to. Engines write 64 levels."));
 
     auto unnamed = with([](auto& proto) {
         proto.mutable_exception()->Clear();
@@ -110,7 +114,7 @@ void addCallResults(std::vector<Vector>& vectors) {
     refuse("status_6", with([](auto& proto) {
                proto.mutable_iipresult()->mutable_exception()->set_status(static_cast<wire::ExecutionStatus>(6));
            }),
-           "frame \"krutil:FEvalResult\": expected a status from 0 to 5, got 6");
+           refusedAt(callResult, 27, "field iipResult.exception.status: expected a status from 0 to 5, got 6"));
     vectors.push_back(accepted(callResult, "error", with([](auto& proto) {
                                    proto.mutable_iipresult()->mutable_exception()->set_status(wire::inRUNTIME_ERROR);
                                }),

@@ -22,8 +22,6 @@ std::vector<FrameContent> framesOf(const std::string& type, const samples::Objec
     return transport::writtenFrames(*registry->find(type), object, registry);
 }
 
-const char* const keepsWhatCameBefore = "The library keeps the fields in front of the fault; most parsers refuse all.";
-
 std::vector<FrameContent> withMoreContent(std::vector<FrameContent> frames, const std::string& bytes) {
     frames.back().bytes += bytes;
     return frames;
@@ -33,25 +31,31 @@ std::vector<FrameContent> withMoreContent(std::vector<FrameContent> frames, cons
 void addStrayContent(std::vector<Vector>& vectors, const samples::SampleSet& set) {
     const std::string& type = set.serializer;
     const std::string sample = set.samples.front().name;
-    const auto add = [&](const std::string& name, const std::string& bytes) -> Vector& {
-        return vectors.emplace_back(
-            accepted(type, name, withMoreContent(sampleFrames(type, sample), bytes), sampleReading(type, sample)));
-    };
-    const auto addUnparsable = [&](const std::string& name, const std::string& bytes,
+    const auto frames = sampleFrames(type, sample);
+    const std::size_t size = frames.back().bytes.size();
+    vectors.push_back(
+        accepted(type, "unknown_field", withMoreContent(frames, "\xC0\x3E\x2A"), sampleReading(type, sample)));
+    vectors.back().note = "Unknown fields are skipped.";
+    const auto addUnparsable = [&](const std::string& name, const std::string& bytes, const std::string& why,
                                    std::vector<std::string> differing = {}, const std::string& note = "") {
-        Vector& vector = add(name, bytes);
-        vector = unparsable(std::move(vector), std::move(differing), note.empty() ? keepsWhatCameBefore : note);
+        vectors.push_back(unparsable(refused(type, name, withMoreContent(frames, bytes), refusedAt(type, size, why)),
+                                     std::move(differing), note));
     };
-    add("unknown_field", "\xC0\x3E\x2A").note = "Unknown fields are skipped.";
-    addUnparsable("ends_behind_a_key", "\xC0\x3E");
-    addUnparsable("ends_before_its_claimed_length", "\xC2\x3E\x7F");
-    addUnparsable("claims_two_gibibytes", "\xC2\x3E\xFF\xFF\xFF\xFF\x07", {},
+    addUnparsable("ends_behind_a_key", "\xC0\x3E", "field 1000: expected 1 more byte, got none");
+    addUnparsable("ends_before_its_claimed_length", "\xC2\x3E\x7F", "field 1000: expected 127 more bytes, got none");
+    addUnparsable("claims_two_gibibytes", "\xC2\x3E\xFF\xFF\xFF\xFF\x07",
+                  "field 1000: expected 2147483647 more bytes, got none", {},
                   "No reader may take memory for a length that is merely claimed.");
-    addUnparsable("wire_type_of_no_meaning", "\xC7\x3E");
-    addUnparsable("field_number_zero", std::string("\x00\x01", 2));
-    addUnparsable("group_without_end", "\xC3\x3E");
-    addUnparsable("varint_of_eleven_bytes", "\xC0\x3E\xFF\xFF\xFF\xFF\xFF\xFF\xFF\xFF\xFF\xFF\x01", {javascript},
+    addUnparsable("wire_type_of_no_meaning", "\xC7\x3E", "field 1000: expected a wire type from 0 to 5, got 7");
+    addUnparsable("field_number_zero", std::string("\x00\x01", 2), "expected a field number from 1 on, got 0");
+    addUnparsable("varint_of_eleven_bytes", "\xC0\x3E\xFF\xFF\xFF\xFF\xFF\xFF\xFF\xFF\xFF\xFF\x01",
+                  "field 1000: expected a number of at most 10 bytes, got more", {javascript},
                   "A number has ten bytes at most; a parser may skip a longer one of a field that it does not know.");
+    // It is missed where the content ends.
+    vectors.push_back(unparsable(
+        refused(type, "group_without_end", withMoreContent(frames, "\xC3\x3E"),
+                refusedAt(type, size + 2, "field 1000: expected the end of group 1000, got the end of what it is in")),
+        {}, ""));
 }
 
 void addWrongFrameType(std::vector<Vector>& vectors, const samples::SampleSet& set) {
@@ -135,6 +139,10 @@ std::string replaced(const std::string& text, const std::string& from, const std
         throw std::logic_error("\"" + from + "\" is not once in: " + text);
     }
     return text.substr(0, place) + to + text.substr(place + from.size());
+}
+
+std::string refusedAt(const std::string& type, std::size_t place, const std::string& why) {
+    return "frame \"" + type + "\", byte " + std::to_string(place) + (why.starts_with("field") ? ", " : ": ") + why;
 }
 
 Vector refused(const std::string& type, const std::string& name, std::vector<FrameContent> frames,

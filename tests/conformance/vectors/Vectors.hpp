@@ -57,6 +57,10 @@ std::string sampleReading(const std::string& type, const std::string& sample);
 /// `text` with one occurrence of `from` as `to`. Throws std::logic_error when there is not exactly one.
 std::string replaced(const std::string& text, const std::string& from, const std::string& to);
 
+/// The words for a frame with this tag whose content is not one whole message: the byte at which the field in question
+/// begins, and `why`, which begins with "field PATH: " or is about none.
+std::string refusedAt(const std::string& type, std::size_t place, const std::string& why);
+
 Vector refused(const std::string& type, const std::string& name, std::vector<FrameContent> frames,
                const std::string& refusal);
 Vector accepted(const std::string& type, const std::string& name, std::vector<FrameContent> frames,

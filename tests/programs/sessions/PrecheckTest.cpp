@@ -6,6 +6,7 @@
 
 #include <csignal>
 #include <cstdint>
+#include <regex>
 
 #include "programs/support/Program.hpp"
 
@@ -92,13 +93,25 @@ Ran withoutCheck(const Sent& sent) {
                       "exec " + fakeEngine(std::string(sent.kind) + " " + sent.tag + " " + hex(sent.content)), "1"});
 }
 
+// The place of a field depends on the identifier in front of it, which the client makes up.
+std::string withoutPlaces(const std::string& text) {
+    return std::regex_replace(text, std::regex(", byte [0-9]+"), ", byte N");
+}
+
+std::string refusal(const Sent& sent, const std::string& what) {
+    return "krutil: frame \"" + std::string(sent.tag) + "\", byte N, field " + what + "\n";
+}
+
+void expectRefusal(const Ran& ran, const Sent& sent, const std::string& what) {
+    EXPECT_EQ(withoutPlaces(ran.err), refusal(sent, what));
+    EXPECT_EQ(ran.out, "");
+    EXPECT_EQ(ran.exitCode, 4);
+}
+
 // The check refuses the message with a sentence of its own; without it the process ends with that of the conversion.
 void expectRefused(const Sent& sent, const std::string& what, const char* fatal) {
     SCOPED_TRACE(::testing::PrintToString(sent));
-    const Ran checked = withCheck(sent);
-    EXPECT_EQ(checked.err, "krutil: frame \"" + std::string(sent.tag) + "\": " + what + "\n");
-    EXPECT_EQ(checked.out, "");
-    EXPECT_EQ(checked.exitCode, 4);
+    expectRefusal(withCheck(sent), sent, what);
     const Ran unchecked = withoutCheck(sent);
     EXPECT_EQ(unchecked.err, fatal);
     EXPECT_EQ(unchecked.out, "");
@@ -111,7 +124,7 @@ Ran expectSame(const Sent& sent) {
     const Ran checked = withCheck(sent);
     const Ran unchecked = withoutCheck(sent);
     EXPECT_EQ(checked.out, unchecked.out);
-    EXPECT_EQ(checked.err, unchecked.err);
+    EXPECT_EQ(withoutPlaces(checked.err), withoutPlaces(unchecked.err));
     EXPECT_EQ(checked.exitCode, unchecked.exitCode);
     return checked;
 }
@@ -120,7 +133,7 @@ TEST(ClientPrecheckTest, StreamsOfTextsOutsideTheirRange) {
     for (const char* tag : {"krutil:TextBaseEvent", "krutil:SinkTextEvent"}) {
         for (const std::int64_t stream : {3, -1}) {
             expectRefused({"event", tag, textEvent(stream)},
-                          "expected a stream from 0 to 2, got " + std::to_string(stream), fatalStream);
+                          "stream: expected a stream from 0 to 2, got " + std::to_string(stream), fatalStream);
         }
     }
 }
@@ -128,11 +141,18 @@ TEST(ClientPrecheckTest, StreamsOfTextsOutsideTheirRange) {
 // The parser stops at 100 levels.
 constexpr int depths[]{0, 1, 90};
 
+// The field of an error in which its innermost status stands.
+std::string statusIn(const char* path, int depth) {
+    return path + std::string(depth == 0 ? "" : depth == 1 ? ".causes" : ".causes (90 times)") + ".status";
+}
+
 TEST(ClientPrecheckTest, StatusesOfResultsOutsideTheirRange) {
     for (const int depth : depths) {
         for (const std::int64_t status : {6, -1}) {
-            expectRefused({"result", "krutil:IIPResult", result(error(depth, status))},
-                          "expected a status from 0 to 5, got " + std::to_string(status), fatalStatus);
+            expectRefused(
+                {"result", "krutil:IIPResult", result(error(depth, status))},
+                statusIn("exception", depth) + ": expected a status from 0 to 5, got " + std::to_string(status),
+                fatalStatus);
         }
     }
 }
@@ -140,14 +160,14 @@ TEST(ClientPrecheckTest, StatusesOfResultsOutsideTheirRange) {
 TEST(ClientPrecheckTest, StatusesOfErrorsThatAreDroppedLater) {
     for (const int depth : depths) {
         expectRefused({"result", "krutil:FEvalResult", callResult(error(depth, 6))},
-                      "expected a status from 0 to 5, got 6", fatalStatus);
+                      statusIn("iipResult.exception", depth) + ": expected a status from 0 to 5, got 6", fatalStatus);
     }
 }
 
 TEST(ClientPrecheckTest, StatusesOfErrorsToPrintOutsideTheirRange) {
     for (const int depth : depths) {
         expectRefused({"event", "krutil:PrintableErrorEvent", printableError(error(depth, 6))},
-                      "expected a status from 0 to 5, got 6", fatalStatus);
+                      statusIn("except", depth) + ": expected a status from 0 to 5, got 6", fatalStatus);
     }
 }
 
@@ -163,37 +183,23 @@ TEST(ClientPrecheckTest, LegalMessagesAreShownAsTheyAreWithoutIt) {
     }
 }
 
-TEST(ClientPrecheckTest, WhatLiesBelowTheParsersDepthIsNotReadEither) {
-    EXPECT_EQ(expectSame({"result", "krutil:IIPResult", result(error(150, 6))}).exitCode, 1);
-    EXPECT_EQ(expectSame({"event", "krutil:PrintableErrorEvent", printableError(error(150, 6))}).exitCode, 0);
+TEST(ClientPrecheckTest, WhatLiesBelowTheParsersDepthIsRefusedEitherWay) {
+    const Sent sent{"event", "krutil:PrintableErrorEvent", printableError(error(150, 5))};
+    expectRefusal(expectSame(sent), sent,
+                  "except.causes (100 times): expected at most 100 messages inside one another, got more");
 }
 
-// The parser reads the first byte of a number that is cut after it.
-TEST(ClientPrecheckTest, CutTextsAreJudgedByWhatIsReadOfThem) {
+// Without the check of numbers only these pass: what is cut is refused all the same.
+TEST(ClientPrecheckTest, CutTextsAreRefusedEitherWay) {
     const std::string whole = textEvent(300);
-    for (std::size_t length = 0; length < whole.size(); ++length) {
-        const Sent sent{"event", "krutil:TextBaseEvent", whole.substr(0, length)};
-        if (length < 2) {
-            EXPECT_EQ(expectSame(sent).exitCode, 0);
-        } else {
-            expectRefused(sent, std::string("expected a stream from 0 to 2, got ") + (length == 2 ? "44" : "300"),
-                          fatalStream);
-        }
-    }
-}
-
-TEST(ClientPrecheckTest, CutErrorsAreJudgedByWhatIsReadOfThem) {
-    const std::string whole = result(error(1, 6));
-    // The innermost status is followed by a text of eleven bytes.
-    const std::size_t status = whole.size() - 11;
-    for (std::size_t length = 0; length < whole.size(); ++length) {
-        const Sent sent{"result", "krutil:IIPResult", whole.substr(0, length)};
-        if (length < status) {
-            expectSame(sent);
-        } else {
-            expectRefused(sent, "expected a status from 0 to 5, got 6", fatalStatus);
-        }
-    }
+    const auto cut = [&](std::size_t length) { return Sent{"event", "krutil:TextBaseEvent", whole.substr(0, length)}; };
+    EXPECT_EQ(expectSame(cut(0)).exitCode, 0);
+    expectRefusal(expectSame(cut(1)), cut(1), "stream: expected 1 more byte, got none");
+    expectRefusal(expectSame(cut(2)), cut(2), "stream: expected 1 more byte, got none");
+    expectRefused(cut(3), "stream: expected a stream from 0 to 2, got 300", fatalStream);
+    expectRefusal(withCheck(cut(4)), cut(4), "stream: expected a stream from 0 to 2, got 300");
+    expectRefusal(withoutCheck(cut(4)), cut(4), "text: expected 1 more byte, got none");
+    expectRefusal(withoutCheck(cut(9)), cut(9), "text: expected 5 more bytes, got 4");
 }
 
 TEST(ClientPrecheckTest, WhatASerializerRefusesIsRefusedInItsWordsEitherWay) {

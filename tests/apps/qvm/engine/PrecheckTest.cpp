@@ -152,19 +152,22 @@ struct Stowaway {
 
 std::vector<Stowaway> stowaways() {
     std::vector<Stowaway> all;
-    const auto add = [&](const std::string& tag, const std::string& bad, const std::string& what,
+    const auto add = [&](const std::string& tag, const std::string& bad, const std::string& refusal,
                          const std::string& good) {
-        all.push_back({{tag, bad}, "frame \"" + tag + "\": expected " + what, {tag, good}});
+        all.push_back({{tag, bad}, refusal, {tag, good}});
     };
-    add("krutil:TextBaseEvent", textEvent<proto::TextBaseEvent>(3), "a stream from 0 to 2, got 3",
+    add("krutil:TextBaseEvent", textEvent<proto::TextBaseEvent>(3), refusalOfStream("krutil:TextBaseEvent", 3),
         textEvent<proto::TextBaseEvent>(2));
-    add("krutil:SinkTextEvent", textEvent<proto::SinkTextEvent>(-1), "a stream from 0 to 2, got -1",
+    add("krutil:SinkTextEvent", textEvent<proto::SinkTextEvent>(-1), refusalOfStream("krutil:SinkTextEvent", -1),
         textEvent<proto::SinkTextEvent>(2));
+    const auto addStatus = [&](const std::string& tag, const std::string& path, int depth, int status, auto make) {
+        const std::string bad = make(depth, status);
+        add(tag, bad, refusalOfStatus(tag, path, bad, depth, status), make(depth, 5));
+    };
     for (const int depth : {0, 30}) {
-        add("krutil:IIPResult", result(depth, 6), "a status from 0 to 5, got 6", result(depth, 5));
-        add("krutil:FEvalResult", callResult(depth, -1), "a status from 0 to 5, got -1", callResult(depth, 5));
-        add("krutil:PrintableErrorEvent", printableError(depth, 6), "a status from 0 to 5, got 6",
-            printableError(depth, 5));
+        addStatus("krutil:IIPResult", "exception", depth, 6, result);
+        addStatus("krutil:FEvalResult", "iipResult.exception", depth, -1, callResult);
+        addStatus("krutil:PrintableErrorEvent", "except", depth, 6, printableError);
     }
     return all;
 }
@@ -275,19 +278,33 @@ TEST(EnginePrecheckTest, RequestForAStreamThatIsNoneIsServedEitherWay) {
     }
 }
 
-// The parser reads the first byte of a number that is cut after it.
-TEST(EnginePrecheckTest, CutContentIsJudgedByWhatIsReadOfIt) {
-    proto::TextBaseEvent message;
-    message.set_stream(number<proto::StreamType>(300));
-    const std::string whole = message.SerializeAsString();
-    ASSERT_EQ(whole.size(), 3U);
-    for (std::size_t length = 0; length < whole.size(); ++length) {
-        const Parts parts{{"krutil:TextBaseEvent", whole.substr(0, length)}, evaluation(), enqueue(2)};
-        const std::string why = "frame \"krutil:TextBaseEvent\": expected a stream from 0 to 2, got 44";
-        EXPECT_EQ(outcomeOf(parts, checked),
-                  length < 2 ? (Outcome{evaluated, {}, 0, {}}) : (Outcome{{}, why, 4, "krutil-qvm: " + why + "\n"}));
-        EXPECT_EQ(outcomeOf(parts, unchecked), (Outcome{evaluated, {}, 0, {}})) << length;
+// That is no matter of numbers: without the check of these it is refused all the same.
+TEST(EnginePrecheckTest, ContentThatIsCutIsRefusedEitherWay) {
+    proto::EvalIIP message;
+    ASSERT_TRUE(message.ParseFromString(evaluation().content));
+    const std::string whole = evaluation().content;
+    for (const auto& options : {checked, unchecked}) {
+        const Parts parts{{"krutil:EvalIIP", whole.substr(0, whole.size() - 1)}, enqueue(1)};
+        const std::string why = "frame \"krutil:EvalIIP\", byte " +
+                                std::to_string(whole.size() - 2 - message.cmd().size()) +
+                                ", field cmd: expected 5 more bytes, got 4";
+        EXPECT_EQ(outcomeOf(parts, options), (Outcome{{}, why, 4, "krutil-qvm: " + why + "\n"}));
     }
+}
+
+// Two bytes make an empty error, which is a large object of the process that reads it.
+TEST(EnginePrecheckTest, MorePartsThanTheLimitAreRefused) {
+    std::string content = evaluation().content;
+    for (int i = 0; i < 996; ++i) {
+        content += std::string("\x18\x00", 2);
+    }
+    const auto engineWith = [&](const std::string& most) {
+        return outcomeOf({{"krutil:EvalIIP", content}, enqueue(1)}, {"--limit-parts", most});
+    };
+    const std::string why =
+        "frame \"krutil:EvalIIP\" exceeds the limit \"parts\": expected at most 1000 fields, got more";
+    EXPECT_EQ(engineWith("1001"), (Outcome{evaluated, {}, 0, {}}));
+    EXPECT_EQ(engineWith("1000"), (Outcome{{}, why, 4, "krutil-qvm: " + why + "\n"}));
 }
 
 class ListenerPrecheckTest : public testing::TestWithParam<bool> {};
@@ -305,7 +322,7 @@ TEST_P(ListenerPrecheckTest, SessionThatIsClosedLeavesTheOthers) {
     other.eval("x = 41");
 
     const Outcome outcome = ByteClient(connectTo(path)).exchange({stowaways().front().bad, enqueue(1)});
-    const std::string why = GetParam() ? "frame \"krutil:TextBaseEvent\": expected a stream from 0 to 2, got 3"
+    const std::string why = GetParam() ? refusalOfStream("krutil:TextBaseEvent", 3)
                                        : "cannot read \"krutil:IIPEnqueueMessage\": frame 1: expected an object that "
                                          "\"krutil:IIPEnqueueMessage\" can refer to, got one with tag "
                                          "\"krutil:TextBaseEvent\"";

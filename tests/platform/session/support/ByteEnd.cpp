@@ -196,6 +196,7 @@ SessionHello hello(SessionHello::Role role) {
     hello.mutable_limits()->set_arraymessage(64U << 20);
     hello.mutable_limits()->set_message(4ULL << 30);
     hello.mutable_limits()->set_frames(65'536);
+    hello.mutable_limits()->set_parts(262'144);
     return hello;
 }
 

@@ -95,6 +95,16 @@ TEST_F(HandshakeTest, HelloWithoutLimitsIsAViolation) {
               "the peer's hello: expected the limits of the peer, got none");
 }
 
+TEST_F(HandshakeTest, PeerThatDoesNotKnowOfPartsHasNoLimitOfThem) {
+    const Ends ends = socketPair();
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    SessionHello hello = wire::hello(SessionHello::ENGINE);
+    hello.mutable_limits()->clear_parts();
+    peer.write(wire::helloBytes(hello) + wire::verdictBytes(wire::acceptance()));
+    const auto session = Session::open(ends.in, ends.out, configOf(Role::Client));
+    EXPECT_EQ(session->peer().limits.parts, session::WireWalk::anyParts);
+}
+
 TEST_F(HandshakeTest, UnknownFieldsAndCapabilitiesOfALaterPeerAreIgnored) {
     const Ends ends = socketPair();
     wire::ByteEnd peer(ends.otherIn, ends.otherOut);

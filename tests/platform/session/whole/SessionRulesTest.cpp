@@ -3,6 +3,7 @@
 #include <boost/make_shared.hpp>
 
 #include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
+#include "msg_svc.protobuf.IDType.pb.h"
 #include "platform/session/support/TestSessions.hpp"
 #include "platform/session/support/WireBytes.hpp"
 
@@ -298,6 +299,41 @@ TEST_F(PeerLimitsTest, Frames) {
     EXPECT_EQ(refusal(limits, question("q", {bulkOf(1), bulkOf(1)})),
               "\"test:question\" is larger than the engine accepts: its limit \"frames\" is 2 frames, the message has "
               "3");
+}
+
+TEST_F(PeerLimitsTest, Parts) {
+    SessionConfig clientConfig = configOf(Role::Client);
+    clientConfig.check = std::make_shared<const session::WireWalk>(
+        session::WireWalk::Messages{{"test:question", msg_svc::protobuf::IDType::descriptor()}});
+    SessionConfig engineConfig = clientConfig;
+    engineConfig.role = Role::Engine;
+    engineConfig.limits.parts = 1000;
+    const auto fields = [](int count) {
+        std::string content;
+        for (int i = 0; i < count; ++i) {
+            content += "\x08\x01";
+        }
+        return content;
+    };
+    SessionPair pair(clientConfig, engineConfig);
+    EXPECT_EQ(textOf<LimitExceeded>([&] { pair.client->send(1, question(fields(1001))); }),
+              "\"test:question\" is larger than the engine accepts: its limit \"parts\" is 1000 fields, the content of "
+              "frame 1 has 1001");
+    const std::string long_ = "\x0A\x90\x4E" + std::string(10'000, 'x');
+    pair.client->send(1, question(fields(1000)));
+    pair.client->send(2, question(long_));
+    EXPECT_THAT(pair.engineSaw.waitForLines(2), ElementsAre("question 1 " + fields(1000), "question 2 " + long_));
+}
+
+TEST_F(PeerLimitsTest, PartsThatASenderWithoutMannersSends) {
+    SessionConfig config = configOf(Role::Engine);
+    config.check = std::make_shared<const session::WireWalk>(
+        session::WireWalk::Messages{{"test:question", msg_svc::protobuf::IDType::descriptor()}});
+    config.limits.parts = 2;
+    SessionWithBytes end(config);
+    end.peer->write(root(1, questionTag, "\x08\x01\x08\x01\x08\x01"));
+    EXPECT_EQ(end.saw.waitForEnd().text,
+              "frame \"test:question\" exceeds the limit \"parts\": expected at most 2 fields, got more");
 }
 
 TEST_F(PeerLimitsTest, Tag) {

@@ -9,6 +9,7 @@
 
 #include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
 #include "foundation/vantor/carrier/framing/DataFrame.hpp"
+#include "msg_svc.protobuf.IDType.pb.h"
 #include "platform/session/support/TestSessions.hpp"
 #include "platform/session/support/WireBytes.hpp"
 
@@ -218,18 +219,16 @@ TEST_F(SessionTest, TraceSeesEveryFrameInBothDirections) {
     EXPECT_THAT(traced, ElementsAre("> 1 data bytes", "> 2 test:question last q", "< 1 test:answer last a"));
 }
 
-TEST_F(SessionTest, CheckMayCloseTheSessionBeforeTheSerializerRuns) {
+TEST_F(SessionTest, ContentThatIsNotOneWholeMessageClosesTheSessionBeforeTheSerializerRuns) {
     SessionConfig config = configOf(Role::Engine);
-    config.check = [](const framing::TaggedFrame& frame) {
-        if (std::string(frame.data(), frame.size()) == "fail to read") {
-            throw session::ProtocolViolation("checked: " + std::string(frame.tag()));
-        }
-    };
+    config.check = std::make_shared<const session::WireWalk>(
+        session::WireWalk::Messages{{"test:question", msg_svc::protobuf::IDType::descriptor()}});
     SessionPair pair(configOf(Role::Client), config);
-    pair.client->send(1, question("fine"));
-    pair.client->send(2, question("fail to read"));
-    EXPECT_EQ(pair.engineSaw.waitForEnd().text, "checked: test:question");
-    EXPECT_EQ(pair.clientSaw.waitForEnd().text, "the peer closed the session: checked: test:question");
+    pair.client->send(1, question("\x08\x01"));
+    pair.client->send(2, question("\x08"));
+    const std::string refusal = R"(frame "test:question", byte 0, field hi: expected 1 more byte, got none)";
+    EXPECT_EQ(pair.engineSaw.waitForEnd().text, refusal);
+    EXPECT_EQ(pair.clientSaw.waitForEnd().text, "the peer closed the session: " + refusal);
 }
 
 // A forked child.

@@ -1,4 +1,4 @@
-// What a session accepts, in bytes and frames.
+// What a session accepts, in bytes, frames and fields.
 #pragma once
 
 #include <cstdint>
@@ -15,6 +15,7 @@ struct Limits {
     std::uint64_t arrayMessage = 64ULL << 20;  ///< the same for the tagged frame of an array
     std::uint64_t message = 4ULL << 30;        ///< bytes of all frames of one message, data frames included
     std::uint64_t frames = 65'536;             ///< frames of one message
+    std::uint64_t parts = 262'144;             ///< fields of a tagged frame's content, as WireWalk counts them
 
     bool operator==(const Limits&) const = default;  ///< the same in every part
 };

@@ -4,6 +4,7 @@
 #include <chrono>
 #include <cstddef>
 #include <functional>
+#include <memory>
 #include <optional>
 #include <string>
 #include <typeindex>
@@ -13,7 +14,8 @@
 #include "foundation/msg_svc/transport/layers/session/Limits.hpp"
 #include "foundation/msg_svc/transport/layers/session/ProtocolRegistry.hpp"
 #include "foundation/msg_svc/transport/layers/session/SessionRecorder.hpp"
-#include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
+#include "foundation/msg_svc/transport/layers/session/WireWalk.hpp"
+#include "foundation/vantor/carrier/framing/Frame.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 
@@ -89,9 +91,9 @@ struct SessionConfig {
     /// Is given the bytes of the session, from the handshake to the end. Must outlive the session; null for none.
     SessionRecorder* recorder = nullptr;
 
-    /// Called with each received tagged frame before its serializer; may throw ProtocolViolation to close the session.
-    /// Empty for no check.
-    std::function<void(const framing::TaggedFrame&)> check;
+    /// Looks at the content of each received tagged frame before its serializer does; what it refuses closes the
+    /// session. It counts the parts of what is sent, too, where the peer has a limit of them. Null for neither.
+    std::shared_ptr<const WireWalk> check;
 };
 
 /// What the handshake told about the other end.

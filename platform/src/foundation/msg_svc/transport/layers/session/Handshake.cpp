@@ -85,6 +85,7 @@ SessionHello ownHello(const SessionConfig& config, const std::vector<FeatureRequ
     hello.mutable_limits()->set_arraymessage(config.limits.arrayMessage);
     hello.mutable_limits()->set_message(config.limits.message);
     hello.mutable_limits()->set_frames(config.limits.frames);
+    hello.mutable_limits()->set_parts(config.limits.parts);
     for (const auto capability : config.capabilities.getEnabledCapabilitySequence()) {
         hello.add_capabilities(static_cast<std::uint64_t>(capability));
     }
@@ -271,6 +272,8 @@ Peer peerOf(const SessionHello& hello) {
     peer.limits.arrayMessage = hello.limits().arraymessage();
     peer.limits.message = hello.limits().message();
     peer.limits.frames = hello.limits().frames();
+    // An end that does not know this limit has none.
+    peer.limits.parts = hello.limits().parts() != 0 ? hello.limits().parts() : WireWalk::anyParts;
     for (const std::uint64_t number : hello.capabilities()) {
         // Capabilities that this end has no bit for are none that it could use.
         if (number <= 63) {

@@ -78,7 +78,7 @@ void Intake::takeMessage(Frames frames, SessionHandler& handler) {
     if (config_.check) {
         for (const auto& frame : frames) {
             if (const auto* const tagged = asTagged(*frame)) {
-                config_.check(*tagged);
+                config_.check->check(*tagged, config_.limits.parts);
             }
         }
     }

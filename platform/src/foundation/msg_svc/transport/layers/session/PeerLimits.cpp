@@ -9,8 +9,9 @@
 
 namespace foundation::msg_svc::transport::layers::session {
 
-PeerLimits::PeerLimits(const Limits& limits, std::string peerName, std::string arrayTag)
-    : limits_(limits), peerName_(std::move(peerName)), arrayTag_(std::move(arrayTag)) {}
+PeerLimits::PeerLimits(const Limits& limits, std::string peerName, std::string arrayTag,
+                       std::shared_ptr<const WireWalk> walk)
+    : limits_(limits), peerName_(std::move(peerName)), arrayTag_(std::move(arrayTag)), walk_(std::move(walk)) {}
 
 void PeerLimits::check(const std::vector<std::unique_ptr<framing::Frame>>& frames) const {
     const auto refuse = [&](const char* limit, std::uint64_t accepted, std::uint64_t size, const std::string& what,
@@ -36,6 +37,13 @@ void PeerLimits::check(const std::vector<std::unique_ptr<framing::Frame>>& frame
             if (frame->size() > accepted) {
                 refuse(array ? "arrayMessage" : "taggedFrame", accepted, frame->size(),
                        "the content of frame " + std::to_string(frame->index()), "bytes");
+            }
+            // A part takes two bytes or more, so nearly no content has to be counted.
+            if (walk_ && frame->size() / 2 > limits_.parts) {
+                if (const std::uint64_t parts = walk_->parts(*tagged); parts > limits_.parts) {
+                    refuse("parts", limits_.parts, parts, "the content of frame " + std::to_string(frame->index()),
+                           "fields");
+                }
             }
             total += tagged->tag().size();
         }

@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "foundation/msg_svc/transport/layers/session/Limits.hpp"
+#include "foundation/msg_svc/transport/layers/session/WireWalk.hpp"
 #include "foundation/vantor/carrier/framing/Frame.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
@@ -16,8 +17,8 @@ namespace framing = ::foundation::vantor::carrier::framing;
 class PeerLimits {
   public:
     /// `peerName` is the peer's in a sentence ("the engine"); `arrayTag` the tag to which Limits::arrayMessage applies,
-    /// empty for none.
-    PeerLimits(const Limits& limits, std::string peerName, std::string arrayTag);
+    /// empty for none. `walk` counts parts; null when they are not to be counted.
+    PeerLimits(const Limits& limits, std::string peerName, std::string arrayTag, std::shared_ptr<const WireWalk> walk);
 
     /// Throws LimitExceeded, which names the limit. The last frame must be a tagged one.
     void check(const std::vector<std::unique_ptr<framing::Frame>>& frames) const;
@@ -26,6 +27,7 @@ class PeerLimits {
     Limits limits_;
     std::string peerName_;
     std::string arrayTag_;
+    std::shared_ptr<const WireWalk> walk_;
 };
 
 }  // namespace foundation::msg_svc::transport::layers::session

@@ -119,7 +119,7 @@ Session::Impl::Impl(StreamDescriptors& stream, SessionConfig sessionConfig, Sett
       settlement(std::move(settled)),
       writer_(settlement.registry,
               PeerLimits(settlement.peer.limits, config.role == Role::Client ? "the engine" : "the client",
-                         settlement.arrayTag)),
+                         settlement.arrayTag, config.check)),
       exchanges_(config.role),
       outgoing_(io_, stream.out, config.roomBytes, config.recorder, *this),
       shared_(settlement.sharedMemory ? std::make_unique<lending::SharedMemory>(config.role, outgoing_) : nullptr),
