@@ -71,7 +71,7 @@ std::optional<std::string_view> withoutTags(std::string_view data) {
 }  // namespace
 
 PcapngReader::PcapngReader(const std::string& file, std::function<void(int)> wait)
-    : name_(file == "-" ? "standard input" : "'" + file + "'"), descriptor_(STDIN_FILENO), wait_(std::move(wait)) {
+    : name_(file == "-" ? "standard input" : "'" + file + "'"), wait_(std::move(wait)) {
     if (file != "-") {
         owned_.reset(::open(file.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY));
         if (!owned_) {

@@ -1,6 +1,8 @@
 // Reads files of the format pcapng as far as recordings of sessions need it.
 #pragma once
 
+#include <unistd.h>
+
 #include <cstddef>
 #include <cstdint>
 #include <functional>
@@ -94,7 +96,7 @@ class PcapngReader {
 
     std::string name_;
     foundation::core::posix::OwnedDescriptor owned_;
-    int descriptor_;
+    int descriptor_ = STDIN_FILENO;
     std::function<void(int)> wait_;
 
     std::string buffer_;
