@@ -50,7 +50,7 @@ std::string hexDump(std::string_view bytes) {
             hex += ' ' + plainHex({&c, 1});
             shown += c >= ' ' && c <= '~' ? c : '.';
         }
-        text += offset.data() + hex + std::string(3 * (width - row.size()) + 2, ' ') + shown + '\n';
+        text.append(offset.data()).append(hex).append(3 * (width - row.size()) + 2, ' ').append(shown).append(1, '\n');
     }
     return text;
 }

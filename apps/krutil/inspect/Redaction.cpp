@@ -119,19 +119,14 @@ void redactPacked(Bytes bytes, const FieldDescriptor* field) {
 void redactMessage(Bytes bytes, const Descriptor* type, int depth);
 
 void redactDelimited(Bytes bytes, const FieldDescriptor* field, int depth) {
-    if (field == nullptr) {
-        hide(bytes);
-    } else if (field->cpp_type() == FieldDescriptor::CPPTYPE_MESSAGE) {
+    const bool isText = field != nullptr && field->type() == FieldDescriptor::TYPE_STRING;
+    if (field != nullptr && field->cpp_type() == FieldDescriptor::CPPTYPE_MESSAGE) {
         redactMessage(bytes, field->message_type(), depth + 1);
-    } else if (field->type() == FieldDescriptor::TYPE_BYTES) {
+    } else if (field != nullptr && field->type() == FieldDescriptor::TYPE_BYTES) {
         hide(bytes, '\0');
-    } else if (field->type() == FieldDescriptor::TYPE_STRING) {
-        if (!isTextKept(field, {bytes.data(), bytes.size()})) {
-            hide(bytes);
-        }
-    } else if (field->is_repeated()) {
+    } else if (field != nullptr && field->is_repeated() && !isText) {
         redactPacked(bytes, field);
-    } else {
+    } else if (!isText || !isTextKept(field, {bytes.data(), bytes.size()})) {
         hide(bytes);
     }
 }

@@ -203,7 +203,8 @@ std::vector<std::string> differences(const std::vector<Said>& before, const std:
         }
         for (std::size_t frame = 0; frame < before[i].frames.size(); ++frame) {
             if (const auto text = difference(before[i].frames[frame], now[i].frames[frame]); !text.empty()) {
-                found.push_back(where + ", frame " + std::to_string(frame + 1) + ": " + text);
+                found.push_back(where);
+                found.back().append(", frame ").append(std::to_string(frame + 1)).append(": ").append(text);
             }
         }
     }

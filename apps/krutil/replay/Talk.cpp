@@ -198,6 +198,7 @@ std::vector<Talk> readTalks(const std::string& file) {
         throw Failure(ExitCode::Usage, error.what());
     }
     std::vector<Talk> talks;
+    talks.reserve(readers.size());
     for (TalkReader& reader : readers) {
         talks.push_back(reader.finish(last));
     }
