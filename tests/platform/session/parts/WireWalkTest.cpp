@@ -214,7 +214,7 @@ TEST_F(WireWalkTest, GeneratedMessages) {
     EXPECT_EQ(walk.parts(walkedFrame("hello", hello.SerializeAsString())), 6U);
 }
 
-// All contents of up to four bytes out of those that mean something, and all cuts of longer ones.
+// All contents of up to three bytes out of those that mean something, and all cuts of longer ones.
 TEST_F(WireWalkTest, AgreesWithTheParserOnEveryShortContent) {
     const std::string alphabet =
         "\x00\x01\x02\x04\x06\x07\x08\x0A\x0B\x0C\x0D\x18\x1A\x22\x2B\x2C\x32\x3A\x42\x7F\x80\x81\xFF"s;
