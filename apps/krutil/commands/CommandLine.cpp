@@ -29,6 +29,21 @@ constexpr const char* exitCodes = R"(Exit codes:
   5  the engine refused: the ends do not fit (protocol version or features), or it is full
   6  cancelled)";
 
+// A time of a millisecond to a day, in seconds, with ten as its default.
+void addSecondsOption(CLI::App& app, const std::string& name, std::chrono::milliseconds& time,
+                      const std::string& description, const std::string& group) {
+    app.add_option_function<double>(
+           name,
+           [&time](const double& seconds) {
+               time = std::chrono::milliseconds(static_cast<std::chrono::milliseconds::rep>(seconds * 1'000.0));
+           },
+           description)
+        ->check(CLI::Range(0.001, 86'400.0).description(""))
+        ->type_name("SECONDS")
+        ->default_str("10")
+        ->group(group);
+}
+
 // Which engine.
 void addEngineOptions(CLI::App& app, ConnectionOptions& options) {
     auto* engine =
@@ -59,17 +74,8 @@ void addEngineOptions(CLI::App& app, ConnectionOptions& options) {
                    "For TLS, the authorities that the proxy's certificate is checked with: a PEM file")
         ->type_name("FILE")
         ->group("Engine");
-    app.add_option_function<double>(
-           "--handshake-timeout",
-           [&options](const double& seconds) {
-               options.handshakeTimeout =
-                   std::chrono::milliseconds(static_cast<std::chrono::milliseconds::rep>(seconds * 1'000.0));
-           },
-           "How long the engine may take to start and answer")
-        ->check(CLI::Range(0.001, 86'400.0).description(""))
-        ->type_name("SECONDS")
-        ->default_str("10")
-        ->group("Engine");
+    addSecondsOption(app, "--handshake-timeout", options.handshakeTimeout,
+                     "How long the engine may take to start and answer", "Engine");
 }
 
 // What is agreed with it, too.
@@ -233,18 +239,8 @@ void addReplay(CLI::App& app, Options& options, ReplayOptions& replay) {
         "replay",
         "Say to an engine what the client of a recording has said, and show where the engine answers otherwise");
     command->add_option("FILE", replay.file, "The recording; - for standard input")->required()->type_name("");
-    command
-        ->add_option_function<double>(
-            "--patience",
-            [&replay](const double& seconds) {
-                replay.patience =
-                    std::chrono::milliseconds(static_cast<std::chrono::milliseconds::rep>(seconds * 1'000.0));
-            },
-            "How much longer than in the recording an answer may take")
-        ->check(CLI::Range(0.001, 86'400.0).description(""))
-        ->type_name("SECONDS")
-        ->default_str("10")
-        ->group("Request");
+    addSecondsOption(*command, "--patience", replay.patience,
+                     "How much longer than in the recording an answer may take", "Request");
     addEngineOptions(*command, options.connection);
     command->footer(replayCodes);
     command->callback([&options, &replay] { options.command = replay; });
