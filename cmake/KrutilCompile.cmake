@@ -1,4 +1,4 @@
-# How everything in this repository is compiled: language level, warnings, sanitizers.
+# How everything in this repository is compiled: language level, warnings, sanitizers, hardening.
 #
 # krutil_compile_options is linked privately by every target of our own; generated code takes only the language level and
 # the sanitizers (krutil_generated_options), because its warnings are not ours to mend.
@@ -36,6 +36,11 @@ if(KRUTIL_SANITIZE)
         -fsanitize=${KRUTIL_SANITIZE} -fno-omit-frame-pointer -fno-sanitize-recover=all)
     target_link_options(krutil_generated_options INTERFACE -fsanitize=${KRUTIL_SANITIZE})
     target_compile_definitions(krutil_generated_options INTERFACE KRUTIL_SANITIZED=1)
+elseif(NOT CMAKE_BUILD_TYPE STREQUAL "Debug")
+    # What makes a fault harder to exploit. Functions of C that check sizes need optimised code.
+    target_compile_options(krutil_generated_options INTERFACE
+        -fstack-protector-strong -fstack-clash-protection -fcf-protection -U_FORTIFY_SOURCE -D_FORTIFY_SOURCE=2)
+    target_link_options(krutil_generated_options INTERFACE LINKER:-z,relro LINKER:-z,now)
 endif()
 
 add_library(krutil_compile_options INTERFACE)

@@ -9,6 +9,6 @@ namespace foundation::core::diag {
 ///     fatal: MESSAGE (FILE:LINE, FUNCTION)
 ///
 /// A null text prints as "(null)". Allocates nothing and takes no lock, so it works on any thread and in any state.
-[[noreturn]] void terminate(const char* message, const char* file, int line, const char* function) noexcept;
+[[noreturn]] void terminate(const char* message, const char* file, int line, const char* function);
 
 }  // namespace foundation::core::diag

@@ -71,7 +71,7 @@ const char* decimal(int number, std::array<char, 16>& digits) noexcept {
 
 }  // namespace
 
-void terminate(const char* message, const char* file, int line, const char* function) noexcept {
+void terminate(const char* message, const char* file, int line, const char* function) {
     const auto shown = [](const char* text) { return text != nullptr ? text : "(null)"; };
     std::array<char, 16> digits{};
     std::array<iovec, 9> pieces{piece("fatal: "), piece(shown(message)),        piece(" ("), piece(shown(file)),
