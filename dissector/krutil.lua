@@ -7,7 +7,7 @@
 local krutil = Proto("krutil", "krutil session")
 
 local KINDS = {
-    [1] = "tagged", [2] = "data", [3] = "goodbye", [4] = "abort", [5] = "shared data", [6] = "return",
+    [1] = "tagged", [2] = "data", [3] = "goodbye", [4] = "abort", [5] = "shared data", [6] = "return", [7] = "keep-alive",
 }
 local TAGGED, DATA, GOODBYE, ABORT, SHARED, RETURN = 1, 2, 3, 4, 5, 6
 local LAST = 0x80

@@ -86,6 +86,7 @@ class DissectorTest(unittest.TestCase):
         recording.add(INBOUND, frame(2, 4, 1, 1, "", b"data", last=False))
         recording.add(INBOUND, frame(5, 4, 1, 2, "", struct.pack("<QQQ", 7, 4096, 5), last=False) + b"hello")
         recording.add(INBOUND, frame(6, 1, 0, 9, "", b""))
+        recording.add(OUTBOUND, frame(7, 0, 0, 0, "", b""))
         recording.add(OUTBOUND, frame(3, 0, 0, 0, "", b""))
         recording.add(INBOUND, frame(4, 0, 0, 0, "", b"why"))
         self.write(recording.bytes())
@@ -93,8 +94,8 @@ class DissectorTest(unittest.TestCase):
             "client: hello", "engine: hello", "client: verdict", "engine: verdict", "client: token", "engine: token",
             "client: answer 1", "engine: answer 0", "client: stream 1 1 krutil:EvalIIP",
             "client: stream 1 2. krutil:IIPEnqueueMessage", "engine: stream 1 1 data, 4 bytes",
-            "engine: stream 1 2 shared data, 5 bytes", "engine: stream 0. return", "client: stream 0. goodbye",
-            "engine: stream 0. abort: why"])
+            "engine: stream 1 2 shared data, 5 bytes", "engine: stream 0. return", "client: stream 0. keep-alive",
+            "client: stream 0. goodbye", "engine: stream 0. abort: why"])
         self.assertEqual(self.fields("krutil.sender", "krutil.kind", "krutil.last", "krutil.type", "krutil.stream",
                                      "krutil.index", "krutil.size", "krutil.tag")[8:], [
             ("client", "1", "0", "29", "1", "1", "9", "krutil:EvalIIP"),
@@ -102,6 +103,7 @@ class DissectorTest(unittest.TestCase):
             ("engine", "2", "0", "4", "1", "1", "4", ""),
             ("engine", "5", "0", "4", "1", "2", "24", ""),
             ("engine", "6", "1", "1", "0", "9", "0", ""),
+            ("client", "7", "1", "0", "0", "0", "0", ""),
             ("client", "3", "1", "0", "0", "0", "0", ""),
             ("engine", "4", "1", "0", "0", "0", "3", "")])
         self.assertEqual(self.fields("krutil.shared.number", "krutil.shared.offset", "krutil.shared.size",

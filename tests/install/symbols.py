@@ -13,7 +13,7 @@ from tree import CHECKOUT, COMPARE_WITH_RECORDED, LIBRARIES, LINK_FLAGS, find, m
 
 # What C has for the product: its memory, its environment variable, and what each C++ program needs.
 OF_C = re.compile(r"__cxa_\w+|_ITM_\w+|__gmon_start__|_Unwind_Resume|__dynamic_cast|__gxx_personality_v0|__tls_get_addr"
-                  r"|__libc_single_threaded|__once_proxy|pthread_once|__stack_chk_fail|getenv"
+                  r"|__libc_single_threaded|__once_proxy|pthread_once|__stack_chk_fail|__\w+_chk|getenv"
                   r"|mem(cpy|move|set|cmp)|bcmp|str(len|cmp)|descriptor_table_msg_5fsvc_\w+")
 # C++ functions that are about threads or files; std::once_flag and std::call_once are not among them.
 OF_THREADS_OR_FILES = re.compile(r"\bstd::(jthread|thread|this_thread|async|mutex|condition_variable|filesystem)\b"

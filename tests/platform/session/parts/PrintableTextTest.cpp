@@ -23,6 +23,14 @@ TEST(PrintableTextTest, SentenceKeepsTextAndReplacesControlCharacters) {
     EXPECT_EQ(sentence("\xC2\x9B"), "\xEF\xBF\xBD");
 }
 
+TEST(PrintableTextTest, SentenceReadsInTheOrderInWhichItWasWritten) {
+    for (const char* const control : {"\u061c", "\u200e", "\u200f", "\u202a", "\u202b", "\u202c", "\u202d", "\u202e",
+                                      "\u2066", "\u2067", "\u2068", "\u2069"}) {
+        EXPECT_EQ(sentence(std::string("a") + control + "b"), "a\uFFFDb") << control;
+    }
+    EXPECT_EQ(sentence("\u05d0\u200d\u0627"), "\u05d0\u200d\u0627");
+}
+
 TEST(PrintableTextTest, SentenceIsCut) {
     EXPECT_EQ(sentence("abcdef", 4), "abcd...");
     EXPECT_EQ(sentence("ab\xC3\xA9", 3), "ab\xEF\xBF\xBD...");

@@ -160,12 +160,13 @@ SessionVerdict ByteEnd::readVerdict() {
 
 void ByteEnd::shakeHands(bool sharedMemory) {
     SessionHello mine = readHello();
-    if (!sharedMemory) {
-        auto& features = *mine.mutable_features();
-        features.erase(std::remove_if(features.begin(), features.end(),
-                                      [](const auto& feature) { return feature.name() == "SHM"; }),
-                       features.end());
-    }
+    auto& features = *mine.mutable_features();
+    features.erase(std::remove_if(features.begin(), features.end(),
+                                  [sharedMemory](const auto& feature) {
+                                      return feature.name() == "KEEPALIVE" ||
+                                             (feature.name() == "SHM" && !sharedMemory);
+                                  }),
+                   features.end());
     mine.set_role(mine.role() == SessionHello::CLIENT ? SessionHello::ENGINE : SessionHello::CLIENT);
     write(helloBytes(mine));
     const SessionVerdict verdict = readVerdict();

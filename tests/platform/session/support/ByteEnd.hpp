@@ -37,8 +37,8 @@ class ByteEnd {
     msg_svc::protobuf::SessionHello readHello();
     msg_svc::protobuf::SessionVerdict readVerdict();
 
-    /// Performs the handshake as the counterpart of the other end, whatever that is, accepting everything but shared
-    /// memory. With `sharedMemory` it accepts that, too, and the probe follows.
+    /// Performs the handshake as the counterpart of the other end, whatever that is, accepting everything but signs of
+    /// life and shared memory. With `sharedMemory` it accepts that, too, and the probe follows.
     void shakeHands(bool sharedMemory = false);
 
   private:

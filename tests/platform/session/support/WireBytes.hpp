@@ -3,6 +3,7 @@
 
 #include <cstdint>
 #include <string>
+#include <vector>
 
 namespace wire {
 
@@ -53,8 +54,30 @@ inline std::string goodbye() {
     return header({3, false, 0, 0, 0, 0, 0});
 }
 
+inline std::string keepAlive() {
+    return header({7, false, 0, 0, 0, 0, 0});
+}
+
 inline std::string abort(const std::string& reason) {
     return header({4, false, 0, 0, 0, 0, reason.size()}) + reason;
+}
+
+/// Bytes of a stream, divided into frames; the last one has what is left.
+inline std::vector<std::string> framesOf(std::string bytes) {
+    const auto number = [&bytes](std::size_t at, std::size_t count) {
+        std::size_t value = 0;
+        for (std::size_t i = count; i > 0; --i) {
+            value = value << 8U | static_cast<unsigned char>(bytes.at(at + i - 1));
+        }
+        return value;
+    };
+    std::vector<std::string> frames;
+    while (!bytes.empty()) {
+        const std::size_t size = bytes.size() < 24 ? bytes.size() : 24 + number(2, 2) + number(16, 8);
+        frames.push_back(bytes.substr(0, size));
+        bytes.erase(0, size);
+    }
+    return frames;
 }
 
 }  // namespace wire

@@ -2,8 +2,11 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <csignal>
+#include <utility>
 
+#include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "platform/session/support/HandshakeFixture.hpp"
 
 namespace testing_sessions {
@@ -11,6 +14,7 @@ namespace {
 
 using capabilities::Capability;
 using msg_svc::protobuf::SessionHello;
+using msg_svc::protobuf::SessionVerdict;
 using session::FeatureRequest;
 using session::HandshakeRefused;
 using session::ProtocolViolation;
@@ -161,6 +165,107 @@ TEST_F(HandshakeTest, SilentPeerTimesOut) {
     config.handshakeTimeout = std::chrono::milliseconds(50);
     EXPECT_EQ(textOf<StreamLost>([&] { Session::open(ends.in, ends.out, config); }),
               "the handshake timed out after 50 milliseconds: 4 of 16 bytes of the peer's first message had arrived");
+}
+
+TEST_F(HandshakeTest, AStreamThatTakesNothingIsNotWaitedForToTheEnd) {
+    const Ends ends = pipes();
+    const foundation::core::posix::OwnedDescriptor silent(ends.otherOut);
+    ::close(ends.otherIn);
+    SessionConfig config = configOf(Role::Client);
+    config.handshakeTimeout = std::chrono::hours(1);
+    EXPECT_EQ(textOf<StreamLost>([&] { Session::open(ends.in, ends.out, config); }),
+              "cannot write to the stream during the handshake: Broken pipe");
+}
+
+TEST_F(HandshakeTest, APeerThatIsTooLateIsToldSo) {
+    const Ends ends = socketPair();
+    SessionConfig config = configOf(Role::Engine);
+    config.handshakeTimeout = std::chrono::milliseconds(50);
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    const std::string text = textOf<StreamLost>([&] { Session::open(ends.in, ends.out, config); });
+    peer.readHello();
+    const SessionVerdict verdict = peer.readVerdict();
+    EXPECT_FALSE(verdict.accepted());
+    EXPECT_EQ(verdict.refusal(),
+              "the handshake timed out after 50 milliseconds: 0 of 16 bytes of the peer's first message had arrived");
+    EXPECT_EQ(verdict.refusal(), text);
+    EXPECT_EQ(peer.readAll(), "");
+}
+
+// An admission that is withdrawn after the peer has sent `bytes`; what this end sends behind its hello.
+class WithdrawnTest : public HandshakeTest {
+  protected:
+    std::string sentAfterHello(const std::string& bytes, const std::string& refusal) {
+        const Ends ends = socketPair();
+        const Ends word = socketPair();
+        wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+        wire::ByteEnd decider(word.otherIn, word.otherOut);
+        const foundation::core::posix::OwnedDescriptor own(word.in);
+        SessionConfig config = configOf(Role::Engine);
+        config.admission.word = word.in;
+        config.admission.refusal = [&, asked = false]() mutable {
+            ++asked_;
+            // Asked for the acceptance first where the peer has come that far.
+            const bool accepting = !bytes.empty() && !std::exchange(asked, true);
+            return accepting ? std::string() : refusal;
+        };
+        auto opening = std::async(std::launch::async, [&] {
+            return textOf<HandshakeRefused>([&] { Session::open(ends.in, ends.out, config); });
+        });
+        peer.readHello();
+        peer.write(bytes);
+        std::string sent = bytes.empty() ? std::string() : peer.read(wire::verdictBytes(wire::acceptance()).size());
+        decider.write("!");
+        text_ = opening.get();
+        return sent + peer.readAll();
+    }
+
+    int asked_ = 0;
+    std::string text_;
+};
+
+TEST_F(WithdrawnTest, APeerThatHasSaidNothingIsToldWhy) {
+    SessionVerdict refusing;
+    refusing.set_refusal("others came");
+    EXPECT_EQ(sentAfterHello("", "others came"), wire::verdictBytes(refusing));
+    EXPECT_EQ(text_, "the session is refused: others came");
+    EXPECT_EQ(asked_, 1);
+}
+
+TEST_F(WithdrawnTest, NothingFollowsAVerdictThatAccepts) {
+    EXPECT_EQ(sentAfterHello(wire::helloBytes(wire::hello(SessionHello::CLIENT)), "others came"),
+              wire::verdictBytes(wire::acceptance()));
+    EXPECT_EQ(text_, "the session is refused: others came");
+    EXPECT_EQ(asked_, 2);
+}
+
+TEST_F(HandshakeTest, AWordThatRefusesNothingIsAskedForOnce) {
+    const Ends word = socketPair();
+    wire::ByteEnd decider(word.otherIn, word.otherOut);
+    const foundation::core::posix::OwnedDescriptor own(word.in);
+    decider.close();
+    SessionConfig config = configOf(Role::Engine);
+    std::atomic<int> asked = 0;
+    config.admission = {[&] {
+                            ++asked;
+                            return std::string();
+                        },
+                        word.in};
+    const Ends ends = socketPair();
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    auto opening = std::async(std::launch::async, [&] { return Session::open(ends.in, ends.out, config); });
+    peer.shakeHands();
+    EXPECT_TRUE(opening.get());
+    // And once before the peer was accepted.
+    EXPECT_EQ(asked, 2);
+}
+
+TEST_F(HandshakeTest, APeerThatIsNotAdmittedIsToldWhy) {
+    SessionConfig engineConfig = configOf(Role::Engine);
+    engineConfig.admission.refusal = [] { return std::string("no room\x1b here"); };
+    const Outcome outcome = openBoth(configOf(Role::Client), engineConfig);
+    EXPECT_EQ(outcome.engineText, "the session is refused: no room\xEF\xBF\xBD here");
+    EXPECT_EQ(outcome.clientText, "the session is refused by the engine: no room\xEF\xBF\xBD here");
 }
 
 TEST_F(HandshakeTest, UnknownProtocolNameIsOutOfRangeAndTheDescriptorsAreClosed) {

@@ -2,6 +2,7 @@
 
 #include <boost/make_shared.hpp>
 
+#include "foundation/msg_svc/transport/layers/session/SessionChecker.hpp"
 #include "foundation/vantor/carrier/framing/BufferAllocator.hpp"
 #include "msg_svc.protobuf.IDType.pb.h"
 #include "platform/session/support/TestSessions.hpp"
@@ -62,6 +63,21 @@ std::string root(std::uint64_t stream, const std::string& tag, const std::string
 }
 
 const std::string question1 = root(1, questionTag);
+
+// A recording of the same session is judged in the same words.
+TEST_P(SessionViolationTest, IsFoundInARecording) {
+    const Role sender = GetParam().role == Role::Client ? Role::Engine : Role::Client;
+    session::SessionChecker checker(configOf(GetParam().role), {});
+    if (GetParam().asked) {
+        checker.take(Role::Client, question1);
+    }
+    EXPECT_EQ(textOf<session::ProtocolViolation>([&] {
+                  for (const std::string& each : wire::framesOf(GetParam().bytes)) {
+                      checker.take(sender, each);
+                  }
+              }),
+              GetParam().text);
+}
 
 INSTANTIATE_TEST_SUITE_P(
     OfAClient, SessionViolationTest,

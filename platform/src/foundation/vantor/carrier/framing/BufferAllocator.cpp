@@ -17,6 +17,7 @@
 #include <vector>
 
 #include "foundation/core/diag/terminate.hpp"
+#include "foundation/vantor/carrier/framing/forbiddenMemory.hpp"
 #include "foundation/vantor/carrier/framing/largeBuffers.hpp"
 #include "foundation/vantor/carrier/shared_memory/SegmentPool.hpp"
 
@@ -33,12 +34,9 @@ constexpr std::size_t pageSize = 4096;
 // is.
 constexpr std::size_t largePagesFrom = 4U << 20;
 
-// Bytes kept for recycling, in whole buffers. In sanitized builds nothing is kept, so that a use after release is seen.
-#ifdef KRUTIL_SANITIZED
-constexpr std::size_t recycleBound = 0;
-#else
+// Bytes kept for recycling, in whole buffers. Sanitizers see that a buffer is used after its release: the one for
+// addresses is told what nobody may use, and a race with its next owner is one.
 constexpr std::size_t recycleBound = 256U << 20;
-#endif
 
 // One holder of an address: an allocation of our own, or memory of another owner.
 struct Record {
@@ -114,6 +112,8 @@ void unmap(char* memory, std::size_t capacity) {
 
 void unmap(const std::list<Kept>& all) {
     for (const Kept& each : all) {
+        // What is mapped there next is somebody else's.
+        allow(each.buffer, each.capacity);
         unmap(each.buffer, each.capacity);
     }
 }
@@ -143,18 +143,20 @@ std::list<Kept> evict(Recycled& all, Condition condition) {
     return evicted;
 }
 
-// Keeps a buffer in place of those that have waited longest; returns what must be unmapped for it, perhaps itself.
+// Keeps a buffer in place of those that have waited longest; returns these, which must be unmapped.
 std::list<Kept> keep(char* buffer, std::size_t capacity) {
     std::list<Kept> node;
+    if (capacity > recycleBound) {
+        unmap(buffer, capacity);
+        return node;
+    }
     try {
         node.push_back({buffer, capacity, Clock::now()});
     } catch (const std::bad_alloc&) {
         unmap(buffer, capacity);
         return node;
     }
-    if (capacity > recycleBound) {
-        return node;
-    }
+    forbid(buffer, capacity);
     Recycled& all = recycled();
     const std::lock_guard lock(all.mutex);
     all.kept.splice(all.kept.begin(), node);
@@ -167,7 +169,7 @@ char* obtain(std::size_t size, std::size_t& capacity) {
     if (size > static_cast<std::size_t>(std::numeric_limits<std::ptrdiff_t>::max()) / 2) {
         throw std::bad_alloc();
     }
-    if (size < largeSize || recycleBound == 0) {
+    if (size < largeSize) {
         const std::size_t rounded = size == 0 ? alignment : (size + alignment - 1) / alignment * alignment;
         void* const memory = std::aligned_alloc(alignment, rounded);
         if (memory == nullptr) {
@@ -176,17 +178,22 @@ char* obtain(std::size_t size, std::size_t& capacity) {
         return static_cast<char*>(memory);
     }
     capacity = capacityFor(size);
-    if (char* const buffer = takeRecycled(capacity)) {
-        return buffer;
+    char* buffer = takeRecycled(capacity);
+    if (buffer != nullptr) {
+        allow(buffer, size);
+    } else {
+        buffer = map(capacity);
     }
-    return map(capacity);
+    forbid(buffer + size, capacity - size);
+    return buffer;
 }
 
-void giveBack(char* buffer, std::size_t capacity) {
+void giveBack(char* buffer, std::size_t size, std::size_t capacity) {
     if (capacity == 0) {
         std::free(buffer);
         return;
     }
+    allow(buffer + size, capacity - size);
     unmap(keep(buffer, capacity));
 }
 
@@ -221,7 +228,7 @@ char* BufferAllocator::allocate(std::size_t size) {
     try {
         enter(buffer, record);
     } catch (...) {
-        giveBack(buffer, record.capacity);
+        giveBack(buffer, size, record.capacity);
         throw;
     }
     return buffer;
@@ -269,7 +276,7 @@ void BufferAllocator::release(char* buffer) {
     if (record.drop != nullptr) {
         record.drop(record.owner);
     } else {
-        giveBack(buffer, record.capacity);
+        giveBack(buffer, record.size, record.capacity);
     }
 }
 

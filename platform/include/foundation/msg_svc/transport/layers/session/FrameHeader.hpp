@@ -19,6 +19,7 @@ enum class FrameKind : std::uint8_t {
     Abort = 4,       ///< the sender closes the session; the content says why
     SharedData = 5,  ///< a data frame whose content is in memory that both ends see; its content says where
     Return = 6,      ///< the sender is done with a content of that kind; its number is in the place of the frame index
+    KeepAlive = 7,   ///< nothing but a sign that the sender is there
 };
 
 /// Header of one frame; a plain value. On the wire: kind (highest bit: last frame of its message), frame type, tag size

@@ -22,6 +22,7 @@ class SessionChecker {
         Limits engineLimits;                                    ///< what the engine accepts
         std::unordered_map<std::string, std::string> features;  ///< of the protocol, name to value
         bool sharedMemory = false;                              ///< contents may be in memory that both ends see
+        bool keepAlive = false;                                 ///< there may be frames that are signs of life
     };
 
     /// `config` is that of the end that has recorded: its role, and what it says of the protocol, counts. Throws

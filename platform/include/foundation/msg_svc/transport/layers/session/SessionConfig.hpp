@@ -46,6 +46,17 @@ struct UnusableFeature {
     bool operator==(const UnusableFeature&) const = default;  ///< the same in every part
 };
 
+/// Somebody else than the two ends who has a say in whether there is a session: whoever counts those of several
+/// processes, for example.
+struct Admission {
+    /// Why there is to be no session, as a sentence for the peer; empty when there may be one. Called before this end
+    /// accepts a peer that fits, and may wait then. Called once before that, too, when `word` becomes readable.
+    std::function<std::string()> refusal;
+
+    /// Watched while Session::open() waits for the peer; -1 for nothing to watch. Stays the caller's.
+    int word = -1;
+};
+
 /// How this end presents itself, what it accepts, and what a session needs to know about its protocol. Both ends of a
 /// session are given the same `shutdownEvent` and `clientEvents`.
 struct SessionConfig {
@@ -69,10 +80,16 @@ struct SessionConfig {
     ::capabilities::CapabilityList capabilities;
     /// How long Session::open() waits for the peer at most.
     std::chrono::milliseconds handshakeTimeout{10'000};
+    /// Who is asked besides; without a function nobody is.
+    Admission admission;
 
     /// Lets contents of data frames of 1 MiB and more stay in memory that both ends see, where the peer wants that too,
     /// the stream is a Unix socket and descriptors reach the peer. Code may write to such a content as to any other.
     bool sharedMemory = false;
+
+    /// How often a client sends a sign of life, where the engine knows such frames and nothing else waits to be
+    /// written; the engine answers each. So no proxy in between takes the stream for idle. 0 for never.
+    std::chrono::milliseconds keepAlive{0};
 
     /// Bytes of unwritten output above which waitForRoom() waits.
     std::size_t roomBytes = 1U << 20;

@@ -32,9 +32,12 @@ constexpr std::string_view magic("\x89KRUTIL\n", 8);
 constexpr std::uint32_t layoutVersion = 1;
 constexpr std::size_t longestBody = 65'536;
 
-// The session's own feature, beside those of the protocol. Settled only where descriptors can be passed at all.
+// The session's own features, beside those of the protocol. The first is settled only where descriptors can be passed
+// at all, the second where the client asks for it.
 constexpr const char* sharedMemory = "SHM";
 constexpr const char* asDescriptors = "descriptors";
+constexpr const char* keepAlive = "KEEPALIVE";
+constexpr const char* asFrames = "frames";
 
 // Texts for a person, so that none of them makes a hello or a verdict too long.
 constexpr std::size_t longestBuild = 1024;
@@ -125,7 +128,7 @@ void receiveBody(HandshakeStream& stream, std::uint32_t size, const std::string&
     }
 }
 
-std::uint32_t receiveHello(HandshakeStream& stream, SessionHello& hello) {
+std::uint32_t readHello(HandshakeStream& stream, SessionHello& hello) {
     std::array<char, magic.size() + 8> head{};
     stream.receive(head.data(), head.size(), "the peer's first message", [&](std::size_t have) {
         const std::string_view got(head.data(), std::min(have, magic.size()));
@@ -261,7 +264,7 @@ std::string join(const std::vector<std::string>& mismatches) {
     for (const std::string& mismatch : mismatches) {
         text += (text.empty() ? "" : "; ") + mismatch;
     }
-    return sentence(text, longestRefusal);
+    return text;
 }
 
 Peer peerOf(const SessionHello& hello) {
@@ -310,13 +313,19 @@ std::string tagOfArrays(const serialization::Registry& registry) {
     }
 }
 
-SessionVerdict makeVerdict(const Agreement& agreement) {
+SessionVerdict refusingVerdict(const std::string& refusal) {
     SessionVerdict verdict;
-    verdict.set_accepted(agreement.mismatches.empty());
+    verdict.set_accepted(false);
+    verdict.set_refusal(sentence(refusal, longestRefusal));
+    return verdict;
+}
+
+SessionVerdict makeVerdict(const Agreement& agreement) {
     if (!agreement.mismatches.empty()) {
-        verdict.set_refusal(join(agreement.mismatches));
-        return verdict;
+        return refusingVerdict(join(agreement.mismatches));
     }
+    SessionVerdict verdict;
+    verdict.set_accepted(true);
     for (const auto& [name, value] : agreement.features) {
         SessionFeature& feature = *verdict.add_features();
         feature.set_name(name);
@@ -331,6 +340,16 @@ SessionVerdict receiveVerdict(HandshakeStream& stream) {
     SessionVerdict verdict;
     receiveBody(stream, loadLittleEndian<std::uint32_t>(length.data()), "the peer's verdict", verdict);
     return verdict;
+}
+
+// A peer that is too late is told so.
+std::uint32_t receiveHello(HandshakeStream& stream, SessionHello& hello) {
+    try {
+        return readHello(stream, hello);
+    } catch (const TimedOut& error) {
+        stream.sendNow(packVerdict(refusingVerdict(error.what())));
+        throw;
+    }
 }
 
 // Ends the handshake of an end that refuses: the peer is told, and its own list is added where it knows more.
@@ -351,14 +370,12 @@ SessionVerdict receiveVerdict(HandshakeStream& stream) {
 
 }  // namespace
 
-void refuseUnheard(int out, const SessionConfig& config, const std::string& refusal) {
+void refuseUnheard(core::posix::OwnedDescriptor socket, const SessionConfig& config, const std::string& refusal) {
     const ProtocolRegistry::Protocol protocol = ProtocolRegistry::getRegistry()->find(config.protocol);
-    SessionVerdict verdict;
-    verdict.set_accepted(false);
-    verdict.set_refusal(sentence(refusal, longestRefusal));
-    const std::string bytes = packHello(ownHello(config, protocol.configuration())) + packVerdict(verdict);
+    const std::string bytes =
+        packHello(ownHello(config, protocol.configuration())) + packVerdict(refusingVerdict(refusal));
     // The stream is new and takes so little at once; a peer that has gone needs no answer.
-    static_cast<void>(::send(out, bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT));
+    static_cast<void>(::send(socket.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL | MSG_DONTWAIT));
 }
 
 Settlement shakeHands(int in, int out, const SessionConfig& config) {
@@ -367,11 +384,24 @@ Settlement shakeHands(int in, int out, const SessionConfig& config) {
     if (config.sharedMemory && lending::passesDescriptors(in) && lending::passesDescriptors(out)) {
         features.emplace_back(sharedMemory, asDescriptors, FeatureHandling::Optional);
     }
+    // An engine does what its client wants.
+    if (config.role == Role::Engine || config.keepAlive.count() > 0) {
+        features.emplace_back(keepAlive, asFrames, FeatureHandling::Optional);
+    }
     const SessionHello own = ownHello(config, features);
 
     HandshakeStream stream(in, out, config.handshakeTimeout, config.recorder);
     stream.send(packHello(own));
     SessionHello peer;
+    bool judged = false;
+    stream.watch(config.admission.word, [&] {
+        if (const std::string refusal = config.admission.refusal(); !refusal.empty()) {
+            if (!judged) {
+                stream.sendNow(packVerdict(refusingVerdict(refusal)));
+            }
+            throw HandshakeRefused("the session is refused: " + sentence(refusal, longestRefusal));
+        }
+    });
     const std::uint32_t peerLayout = receiveHello(stream, peer);
 
     Agreement agreement;
@@ -388,15 +418,22 @@ Settlement shakeHands(int in, int out, const SessionConfig& config) {
     const bool ownIsClient = config.role == Role::Client;
     settle(ownIsClient ? ownEnd : peerEnd, ownIsClient ? peerEnd : ownEnd, agreement);
     checkUsable(config, features, ownEnd.name, agreement);
-    Settlement settlement{peerOf(peer), {agreement.features.begin(), agreement.features.end()}, nullptr, {}, false};
+    Settlement settlement{peerOf(peer), {agreement.features.begin(), agreement.features.end()}, nullptr, {}};
     // Of the session, not of the protocol, and not settled before it has been tried.
     settlement.features.erase(sharedMemory);
+    settlement.features.erase(keepAlive);
     if (agreement.mismatches.empty()) {
         settlement.registry = setUp(protocol, config, ownEnd.name, settlement.features, agreement.mismatches);
         settlement.arrayTag = tagOfArrays(*settlement.registry);
     }
+    if (agreement.mismatches.empty() && config.admission.refusal) {
+        if (std::string refusal = config.admission.refusal(); !refusal.empty()) {
+            agreement.mismatches.push_back(std::move(refusal));
+        }
+    }
 
     const SessionVerdict verdict = makeVerdict(agreement);
+    judged = true;
     stream.send(packVerdict(verdict));
     if (!verdict.accepted()) {
         refuse(stream, verdict.refusal(), peerEnd.name);
@@ -418,6 +455,10 @@ Settlement shakeHands(int in, int out, const SessionConfig& config) {
     if (agreement.features.contains(sharedMemory) && lending::probeSharedMemory(stream)) {
         settlement.sharedMemory = true;
         settlement.features.emplace(sharedMemory, asDescriptors);
+    }
+    if (agreement.features.contains(keepAlive)) {
+        settlement.keepAlive = true;
+        settlement.features.emplace(keepAlive, asFrames);
     }
     return settlement;
 }

@@ -9,12 +9,15 @@
 #include <cerrno>
 #include <span>
 #include <system_error>
+#include <utility>
 
-#include "foundation/msg_svc/transport/layers/session/SessionError.hpp"
 #include "foundation/msg_svc/transport/layers/session/lending/DescriptorPassing.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 namespace {
+
+// How long a peer to which nothing can be written may take to say why.
+constexpr std::chrono::milliseconds timeToSayWhy{1'000};
 
 std::string errorText(int error) {
     return std::generic_category().message(error);
@@ -51,6 +54,18 @@ void HandshakeStream::sendWith(const std::string& bytes, int descriptor) {
     flush();
     send(bytes);
     unsentDescriptor_ = descriptor;
+}
+
+void HandshakeStream::watch(int descriptor, std::function<void()> onReadable) {
+    watched_ = descriptor;
+    onReadable_ = std::move(onReadable);
+}
+
+void HandshakeStream::sendNow(const std::string& bytes) {
+    send(bytes);
+    if (writeError_ == 0) {
+        writeSome();
+    }
 }
 
 void HandshakeStream::limitTo(std::chrono::milliseconds patience) {
@@ -100,6 +115,10 @@ void HandshakeStream::flush() {
     while (!unsent_.empty() && writeError_ == 0) {
         wait(false, std::to_string(unsent_.size()) + " bytes are unwritten");
     }
+    throwIfUnwritable();
+}
+
+void HandshakeStream::throwIfUnwritable() const {
     if (writeError_ != 0) {
         throw StreamLost("cannot write to the stream during the handshake: " + errorText(writeError_));
     }
@@ -109,7 +128,8 @@ void HandshakeStream::flush() {
 void HandshakeStream::wait(bool reading, const std::string& progress) {
     for (;;) {
         const bool writing = !unsent_.empty() && writeError_ == 0;
-        std::array<pollfd, 2> polled{pollfd{reading ? in_ : -1, POLLIN, 0}, pollfd{writing ? out_ : -1, POLLOUT, 0}};
+        std::array<pollfd, 3> polled{pollfd{reading ? in_ : -1, POLLIN, 0}, pollfd{writing ? out_ : -1, POLLOUT, 0},
+                                     pollfd{watched_, POLLIN, 0}};
         const auto left =
             std::max<Clock::rep>(0, std::chrono::ceil<std::chrono::milliseconds>(deadline_ - Clock::now()).count());
         const int ready = ::poll(polled.data(), polled.size(), static_cast<int>(std::min<Clock::rep>(left, 60'000)));
@@ -117,8 +137,13 @@ void HandshakeStream::wait(bool reading, const std::string& progress) {
             throw StreamLost("cannot wait for the stream during the handshake: " + errorText(errno));
         }
         if (ready == 0 && Clock::now() >= deadline_) {
-            throw StreamLost("the handshake timed out after " + std::to_string(timeout_.count()) +
-                             " milliseconds: " + progress);
+            throwIfUnwritable();
+            throw TimedOut("the handshake timed out after " + std::to_string(timeout_.count()) +
+                           " milliseconds: " + progress);
+        }
+        if (ready > 0 && polled[2].revents != 0) {
+            watched_ = -1;
+            onReadable_();
         }
         if (ready > 0 && polled[1].revents != 0) {
             writeSome();
@@ -140,6 +165,7 @@ void HandshakeStream::writeSome() {
     } else if (errno != EINTR && errno != EAGAIN && errno != EWOULDBLOCK) {
         // The peer may have said why before it closed its end, so reading goes on.
         writeError_ = errno;
+        limitTo(timeToSayWhy);
     }
 }
 

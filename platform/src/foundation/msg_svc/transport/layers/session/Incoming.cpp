@@ -20,13 +20,16 @@ constexpr int readsInATurn = 16;
 
 Incoming::Incoming(asio::io_context& io, core::posix::OwnedDescriptor& descriptor, const SessionConfig& config,
                    std::shared_ptr<const serialization::Registry> registry, const std::string& arrayTag,
-                   SharedExchanges& exchanges, const Outgoing& outgoing, lending::SharedMemory* shared, Owner& owner)
+                   SharedExchanges& exchanges, const Outgoing& outgoing, lending::SharedMemory* shared,
+                   KeepAlive& keepAlive, Owner& owner)
     : config_(config),
       outgoing_(outgoing),
       shared_(shared),
+      keepAlive_(keepAlive),
       owner_(owner),
       stream_(io),
-      reader_(config.limits, arrayTag, shared == nullptr ? nullptr : &shared->borrower, config.recorder),
+      reader_(config.limits, arrayTag, shared == nullptr ? nullptr : &shared->borrower, config.recorder,
+              keepAlive.isSettled()),
       intake_(config, std::move(registry), arrayTag, exchanges),
       keptMemory_(io, config.keepMemory),
       descriptor_(descriptor.get()) {
@@ -171,7 +174,10 @@ void Incoming::take(MessageReader::Item item) {
         }
         return;
     }
-    if (std::holds_alternative<MessageReader::Goodbye>(item)) {
+    if (std::holds_alternative<MessageReader::KeepAlive>(item)) {
+        intake_.takeKeepAlive();
+        keepAlive_.answer();
+    } else if (std::holds_alternative<MessageReader::Goodbye>(item)) {
         intake_.takeGoodbye(*handler_);
     } else {
         intake_.takeMessage(std::move(std::get<MessageReader::Frames>(item).frames), *handler_);

@@ -15,6 +15,7 @@
 #include "foundation/msg_svc/transport/layers/session/Asio.hpp"
 #include "foundation/msg_svc/transport/layers/session/Exchanges.hpp"
 #include "foundation/msg_svc/transport/layers/session/Intake.hpp"
+#include "foundation/msg_svc/transport/layers/session/KeepAlive.hpp"
 #include "foundation/msg_svc/transport/layers/session/KeptMemory.hpp"
 #include "foundation/msg_svc/transport/layers/session/MessageReader.hpp"
 #include "foundation/msg_svc/transport/layers/session/Outgoing.hpp"
@@ -44,7 +45,8 @@ class Incoming {
     /// when the peer sees no memory of this process, nor this process any of the peer's.
     Incoming(asio::io_context& io, core::posix::OwnedDescriptor& descriptor, const SessionConfig& config,
              std::shared_ptr<const serialization::Registry> registry, const std::string& arrayTag,
-             SharedExchanges& exchanges, const Outgoing& outgoing, lending::SharedMemory* shared, Owner& owner);
+             SharedExchanges& exchanges, const Outgoing& outgoing, lending::SharedMemory* shared, KeepAlive& keepAlive,
+             Owner& owner);
 
     /// Begins to read, unless stop() was called before.
     void start(SessionHandler& handler);
@@ -91,6 +93,7 @@ class Incoming {
     const SessionConfig& config_;
     const Outgoing& outgoing_;
     lending::SharedMemory* const shared_;
+    KeepAlive& keepAlive_;
     Owner& owner_;
     asio::posix::stream_descriptor stream_;
     MessageReader reader_;

@@ -25,6 +25,13 @@ void Intake::expectMore() {
     }
 }
 
+void Intake::takeKeepAlive() {
+    // A client goes on with them after its goodbye, while it waits for the rest.
+    if (speaker() == Role::Engine) {
+        expectMore();
+    }
+}
+
 void Intake::takeGoodbye(SessionHandler& handler) {
     std::optional<Refusal> refusal;
     {

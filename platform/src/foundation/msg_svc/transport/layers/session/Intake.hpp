@@ -26,6 +26,9 @@ class Intake {
     /// A goodbye of the peer. Throws ProtocolViolation when there must be none now.
     void takeGoodbye(SessionHandler& handler);
 
+    /// A sign of life of the peer. Throws ProtocolViolation when there must be none now.
+    void takeKeepAlive();
+
     /// The frames of one message of the peer, of which its object is made. Throws ProtocolViolation for a message that
     /// may not be sent now or cannot be read; nothing of it has reached the handler then.
     void takeMessage(Frames frames, SessionHandler& handler);

@@ -32,11 +32,12 @@ namespace {
 }  // namespace
 
 MessageReader::MessageReader(const Limits& limits, std::string arrayTag, lending::LentContents* borrower,
-                             SessionRecorder* recorder)
+                             SessionRecorder* recorder, bool keepAlive)
     : limits_(limits),
       arrayTag_(std::move(arrayTag)),
       borrower_(borrower),
       recorder_(recorder),
+      keepAlive_(keepAlive),
       ahead_(new char[mostAhead]) {}
 
 std::span<const iovec> MessageReader::buffers() noexcept {
@@ -117,27 +118,40 @@ void MessageReader::acceptHeader() {
     }
 }
 
-void MessageReader::checkControlHeader() const {
-    const bool goodbye = header_->is(FrameKind::Goodbye);
-    if (!goodbye && !header_->is(FrameKind::Abort)) {
-        refuse("frame kind",
-               borrower_ == nullptr ? "1 (tagged), 2 (data), 3 (goodbye) or 4 (abort)"
-                                    : "1 (tagged), 2 (data), 3 (goodbye), 4 (abort), 5 (shared data) or 6 (return)",
-               std::to_string(header_->kind));
+std::string MessageReader::expectedKinds() const {
+    std::vector<std::string> kinds{"1 (tagged)", "2 (data)", "3 (goodbye)", "4 (abort)"};
+    if (borrower_ != nullptr) {
+        kinds.insert(kinds.end(), {"5 (shared data)", "6 (return)"});
     }
+    if (keepAlive_) {
+        kinds.emplace_back("7 (keep-alive)");
+    }
+    std::string text = kinds.front();
+    for (std::size_t i = 1; i < kinds.size(); ++i) {
+        text += (i + 1 < kinds.size() ? ", " : " or ") + kinds[i];
+    }
+    return text;
+}
+
+void MessageReader::checkControlHeader() const {
+    const bool abort = header_->is(FrameKind::Abort);
+    const bool keepAlive = keepAlive_ && header_->is(FrameKind::KeepAlive);
+    if (!abort && !keepAlive && !header_->is(FrameKind::Goodbye)) {
+        refuse("frame kind", expectedKinds(), std::to_string(header_->kind));
+    }
+    const std::string name = abort ? "abort frame" : keepAlive ? "keep-alive frame" : "goodbye frame";
     if (header_->last || header_->type != framing::FrameType::Unspecified || header_->tagSize != 0 ||
         header_->stream != 0 || header_->index != 0) {
-        throw ProtocolViolation(std::string(goodbye ? "goodbye" : "abort") +
-                                " frame: expected last bit, frame type, tag size, stream ID and index 0");
+        throw ProtocolViolation(name + ": expected last bit, frame type, tag size, stream ID and index 0");
     }
-    if (goodbye && header_->contentSize != 0) {
-        refuse("goodbye frame", "no content", std::to_string(header_->contentSize) + " bytes");
+    if (!abort && header_->contentSize != 0) {
+        refuse(name, "no content", std::to_string(header_->contentSize) + " bytes");
     }
-    if (goodbye && !frames_.empty()) {
-        throw ProtocolViolation("goodbye frame in the middle of a message: expected " + frameName(frames_.size() + 1));
+    if (!abort && !frames_.empty()) {
+        throw ProtocolViolation(name + " in the middle of a message: expected " + frameName(frames_.size() + 1));
     }
     if (header_->contentSize > longestReason) {
-        refuse("abort frame", "a reason of at most " + std::to_string(longestReason) + " bytes",
+        refuse(name, "a reason of at most " + std::to_string(longestReason) + " bytes",
                std::to_string(header_->contentSize));
     }
 }
@@ -282,6 +296,8 @@ std::optional<MessageReader::Item> MessageReader::completeFrame() {
     std::optional<Item> item;
     if (header_->is(FrameKind::Goodbye)) {
         item = Goodbye{};
+    } else if (header_->is(FrameKind::KeepAlive)) {
+        item = KeepAlive{};
     } else if (header_->is(FrameKind::Abort)) {
         item = Abort{std::string(content_.first.get(), content_.second)};
     } else if (header_->is(FrameKind::Return)) {

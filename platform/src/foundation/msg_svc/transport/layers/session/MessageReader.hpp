@@ -41,6 +41,7 @@ class MessageReader {
         std::vector<std::unique_ptr<framing::Frame>> frames;
     };
     struct Goodbye {};
+    struct KeepAlive {};
     struct Abort {
         std::string reason;
     };
@@ -49,7 +50,7 @@ class MessageReader {
         std::uint64_t number;
         bool kept;
     };
-    using Item = std::variant<Frames, Goodbye, Abort, Returned>;
+    using Item = std::variant<Frames, Goodbye, KeepAlive, Abort, Returned>;
 
     /// Longest reason of an abort, in bytes.
     static constexpr std::uint64_t longestReason = 4096;
@@ -60,9 +61,9 @@ class MessageReader {
 
     /// `arrayTag` is the tag to which Limits::arrayMessage applies instead of Limits::taggedFrame. `borrower` has the
     /// contents that stay in the peer's memory; null when there are none. `recorder` is given each frame that is
-    /// complete; null for none.
+    /// complete; null for none. `keepAlive`: whether both ends have settled on frames of that kind.
     MessageReader(const Limits& limits, std::string arrayTag, lending::LentContents* borrower = nullptr,
-                  SessionRecorder* recorder = nullptr);
+                  SessionRecorder* recorder = nullptr, bool keepAlive = false);
 
     /// Where the next bytes of the stream belong, in order; never empty. Valid until the next call of next(). To be
     /// called when next() has returned nothing.
@@ -96,6 +97,7 @@ class MessageReader {
         return content_.first && contentHave_ < content_.second && tagHave_ == tag_.size();
     }
     void acceptHeader();
+    std::string expectedKinds() const;
     void checkControlHeader() const;
     void checkReturnHeader() const;
     void checkMessageHeader() const;
@@ -110,6 +112,7 @@ class MessageReader {
     std::string arrayTag_;
     lending::LentContents* borrower_;
     SessionRecorder* recorder_;
+    bool keepAlive_;
 
     // Bytes that have arrived and are not taken yet.
     std::unique_ptr<char[]> ahead_;

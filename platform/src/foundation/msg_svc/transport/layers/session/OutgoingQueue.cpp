@@ -57,7 +57,7 @@ void OutgoingPieces::addFrame(const framing::Frame& frame, bool last, std::optio
     }
 }
 
-OutgoingPieces::OutgoingPieces(FrameKind kind, const std::string& content) {
+OutgoingPieces::OutgoingPieces(FrameKind kind, const std::string& content, bool answer) : answer_(answer) {
     FrameHeader header;
     header.kind = static_cast<std::uint8_t>(kind);
     header.contentSize = content.size();

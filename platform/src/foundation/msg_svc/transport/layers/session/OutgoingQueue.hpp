@@ -38,8 +38,8 @@ class OutgoingPieces {
     /// it is; null when the peer sees no memory of this process.
     OutgoingPieces(std::vector<std::unique_ptr<framing::Frame>> frames, bool answer, lending::Lender* lender = nullptr);
 
-    /// A goodbye, or an abort with its reason.
-    OutgoingPieces(FrameKind kind, const std::string& content);
+    /// A goodbye, a sign of life, or an abort with its reason.
+    OutgoingPieces(FrameKind kind, const std::string& content, bool answer = false);
 
     /// Gives back what the peer has lent under this number. `kept`: its memory stays mapped here.
     static OutgoingPieces giveBack(std::uint64_t number, bool kept);

@@ -1,5 +1,7 @@
 #include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
 
+#include <unicode/uchar.h>
+
 #include "msg_svc/protobuf/ustring.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
@@ -27,8 +29,8 @@ std::string sentence(const std::string& text, std::size_t longest) {
     const bool cut = text.size() > longest;
     std::u16string units = ::msg_svc::protobuf::utf8_to_ustring(cut ? text.substr(0, longest) : text);
     for (char16_t& unit : units) {
-        const bool control = (unit < 0x20 && unit != u'\t' && unit != u'\n') || (unit >= 0x7F && unit < 0xA0);
-        unit = control ? u'\uFFFD' : unit;
+        const bool control = u_charType(unit) == U_CONTROL_CHAR && unit != u'\t' && unit != u'\n';
+        unit = control || u_hasBinaryProperty(unit, UCHAR_BIDI_CONTROL) != 0 ? u'\uFFFD' : unit;
     }
     return ::msg_svc::protobuf::ustring_to_utf8(units) + (cut ? "..." : "");
 }

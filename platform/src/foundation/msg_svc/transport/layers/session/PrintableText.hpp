@@ -12,8 +12,9 @@ namespace foundation::msg_svc::transport::layers::session {
 /// backslash is written as an escape, so that a peer cannot steer a terminal or a log.
 std::string quoted(std::string_view bytes, std::size_t longest = 80);
 
-/// Well-formed UTF-8 without control characters but tab and line feed, at most `longest` bytes (and then "..."): what
-/// is shown of a sentence that the peer wrote. Bytes that are not are replaced.
+/// Well-formed UTF-8 without control characters but tab and line feed, and without controls of direction, which change
+/// how a line reads; at most `longest` bytes (and then "..."): what is shown of a sentence that the peer wrote.
+/// Whatever is not so is replaced.
 std::string sentence(const std::string& text, std::size_t longest = 8192);
 
 /// What messages call the frame with this index.

@@ -1,6 +1,7 @@
 #include "foundation/msg_svc/transport/layers/session/RefusalTexts.hpp"
 
 #include <boost/core/demangle.hpp>
+#include <system_error>
 
 #include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
 
@@ -57,6 +58,10 @@ std::string refusalToReceive(Refusal refusal, Saying saying, Role own, framing::
             break;
     }
     return message + " is an event: expected the stream ID 0 or that of an open exchange";
+}
+
+std::string cannotWrite(int error) {
+    return "cannot write to the stream: " + std::generic_category().message(error);
 }
 
 }  // namespace foundation::msg_svc::transport::layers::session

@@ -31,10 +31,6 @@ using Shared = boost::shared_ptr<const T>;
 constexpr std::chrono::milliseconds lingerTime{1'000};
 constexpr std::chrono::milliseconds writeFailureGrace{1'000};
 
-std::string cannotWrite(int error) {
-    return "cannot write to the stream: " + std::generic_category().message(error);
-}
-
 template <class T>
 Saying sayingOf(const T& object, const SessionConfig& config) {
     if constexpr (std::is_same_v<T, eventmgr::BaseEvent>) {
@@ -105,6 +101,7 @@ class Session::Impl final : private Incoming::Owner, private Outgoing::Owner {
     asio::steady_timer timer_{io_};
     Outgoing outgoing_;
     const std::unique_ptr<lending::SharedMemory> shared_;  // null without shared memory
+    KeepAlive keepAlive_;
     Incoming incoming_;
 
     // Of the I/O thread.
@@ -123,8 +120,9 @@ Session::Impl::Impl(StreamDescriptors& stream, SessionConfig sessionConfig, Sett
       exchanges_(config.role),
       outgoing_(io_, stream.out, config.roomBytes, config.recorder, *this),
       shared_(settlement.sharedMemory ? std::make_unique<lending::SharedMemory>(config.role, outgoing_) : nullptr),
+      keepAlive_(io_, config, settlement.keepAlive, exchanges_, outgoing_),
       incoming_(io_, stream.in, config, settlement.registry, settlement.arrayTag, exchanges_, outgoing_, shared_.get(),
-                *this) {}
+                keepAlive_, *this) {}
 
 void Session::Impl::start(SessionHandler& handler) {
     asio::post(io_, [this, &handler] {
@@ -133,6 +131,7 @@ void Session::Impl::start(SessionHandler& handler) {
             handler_->onEnd(end_);
         } else {
             incoming_.start(handler);
+            keepAlive_.start();
         }
     });
     thread_.start();
@@ -391,6 +390,7 @@ void Session::Impl::closeDown() {
         shared_->close();
     }
     timer_.cancel();
+    keepAlive_.stop();
     if (handler_ != nullptr) {
         handler_->onEnd(end_);
     }
@@ -418,8 +418,7 @@ std::unique_ptr<Session> Session::open(int in, int out, SessionConfig config) {
 }
 
 void Session::refuse(int socket, const SessionConfig& config, const std::string& refusal) {
-    const core::posix::OwnedDescriptor owned(socket);
-    refuseUnheard(owned.get(), config, refusal);
+    refuseUnheard(core::posix::OwnedDescriptor(socket), config, refusal);
 }
 
 Session::~Session() {

@@ -80,8 +80,8 @@ class SessionChecker::Impl {
     Impl(const SessionConfig& config, const Settled& settled)
         : exchanges_(config.role),
           registry_(registryOf(config, settled)),
-          fromClient_(receiving(config, Role::Engine, settled.engineLimits), *this, settled.sharedMemory),
-          fromEngine_(receiving(config, Role::Client, settled.clientLimits), *this, settled.sharedMemory) {}
+          fromClient_(receiving(config, Role::Engine, settled.engineLimits), *this, settled),
+          fromEngine_(receiving(config, Role::Client, settled.clientLimits), *this, settled) {}
 
     void take(Role sender, std::string_view frame);
     bool atBoundary(Role sender) const noexcept {
@@ -90,9 +90,10 @@ class SessionChecker::Impl {
 
   private:
     struct Direction {
-        Direction(SessionConfig receiver, Impl& impl, bool sharedMemory)
+        Direction(SessionConfig receiver, Impl& impl, const Settled& settled)
             : config(std::move(receiver)),
-              reader(config.limits, arrayTagOf(*impl.registry_), sharedMemory ? &contents : nullptr),
+              reader(config.limits, arrayTagOf(*impl.registry_), settled.sharedMemory ? &contents : nullptr, nullptr,
+                     settled.keepAlive),
               intake(config, impl.registry_, arrayTagOf(*impl.registry_), impl.exchanges_) {}
 
         const SessionConfig config;
@@ -167,6 +168,8 @@ void SessionChecker::Impl::takeItem(Direction& direction, MessageReader::Item it
         }
     } else if (std::holds_alternative<MessageReader::Abort>(item)) {
         direction.aborted = true;
+    } else if (std::holds_alternative<MessageReader::KeepAlive>(item)) {
+        direction.intake.takeKeepAlive();
     } else if (std::holds_alternative<MessageReader::Goodbye>(item)) {
         direction.intake.takeGoodbye(nobody_);
     } else {
