@@ -71,13 +71,15 @@ struct Terminal {
     bool edits = false;                          ///< a session has begun whose lines are edited
     std::optional<LineEditor> editor{};          ///< outlives a session, and with it what it remembers
     std::optional<apps::Recording> recording{};  ///< of all sessions
+    bool engineFilesComplete = true;             ///< those that the engines of all sessions have written
 };
 
 std::unique_ptr<Printer> makePrinter(const DisplayOptions& options, Output& out, Output& err) {
     if (options.json) {
         return std::make_unique<JsonPrinter>(out);
     }
-    return std::make_unique<PersonPrinter>(out, err, PersonStyle{options.warningStack, wantsColor(options.color, err)});
+    return std::make_unique<PersonPrinter>(
+        out, err, PersonStyle{options.warningStack, wantsColor(options.color, err), options.safeText});
 }
 
 // A client that asks the person at standard input, if there is one, what the engine wants to know.
@@ -123,6 +125,7 @@ class AskingClient {
         if (const std::string note = client_.finish(leave); !note.empty()) {
             std::cerr << "krutil: " << note << std::endl;
         }
+        terminal_.engineFilesComplete = terminal_.engineFilesComplete && client_.engineFilesComplete();
     }
 
   private:
@@ -258,17 +261,19 @@ ExitCode runCommand(const Options& options, const CallOptions& call, Printer& pr
 }
 
 ExitCode runCommand(const Options& options, const ReplayOptions& replay, Printer&, Terminal& terminal) {
+    if (replay.serve) {
+        return serveRecording(options.connection, replay, terminal.err, terminal.interrupt);
+    }
     return replayRecording(options.connection, replay, terminal.out, terminal.interrupt);
 }
 
-ExitCode runCommand(const Options&, const RedactOptions& redact, Printer&, Terminal& terminal) {
-    if (const auto note = redactRecording(redact.file, redact.out)) {
-        terminal.err.write("krutil: " + *note + "\n");
-    }
-    return ExitCode::Ok;
-}
-
 ExitCode runCommand(const Options&, const InspectOptions& inspect, Printer&, Terminal& terminal) {
+    if (!inspect.redacted.empty()) {
+        if (const auto note = redactRecording(inspect.file, inspect.redacted)) {
+            terminal.err.write("krutil: " + *note + "\n");
+        }
+        return ExitCode::Ok;
+    }
     return inspectRecording(inspect, terminal.out, terminal.err, terminal.interrupt);
 }
 
@@ -301,8 +306,11 @@ ExitCode runReporting(const Options& options) {
         startRecording(options.display.record, terminal);
         const ExitCode code = std::visit(
             [&](const auto& command) { return runCommand(options, command, *printer, terminal); }, options.command);
+        if (code != ExitCode::Ok) {
+            return code;
+        }
         const bool recorded = !terminal.recording || terminal.recording->isComplete();
-        return code == ExitCode::Ok && !recorded ? ExitCode::Usage : code;
+        return !recorded ? ExitCode::Usage : !terminal.engineFilesComplete ? ExitCode::Stream : ExitCode::Ok;
     } catch (const Failure& failure) {
         return report(failure.code(), failure.what());
     } catch (const Cancelled& cancelled) {

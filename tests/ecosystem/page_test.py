@@ -4,18 +4,16 @@ import glob
 import io
 import json
 import os
-import shutil
 import socket
 import subprocess
 import unittest
 
 import matplotlib.image
 import nbformat
-from selenium import webdriver
-from selenium.webdriver.chrome.service import Service
 from selenium.webdriver.common.by import By
 from selenium.webdriver.support.ui import WebDriverWait
 
+import browser
 import jupyter
 from eventually import PATIENCE, eventually
 
@@ -36,12 +34,7 @@ class PageTest(unittest.TestCase):
                  f"--notebook-dir={cls.notebooks}"], stderr=log)
         cls.addClassCleanup(cls.stop_server)
         cls.address, cls.token = cls.find_server()
-        options = webdriver.ChromeOptions()
-        for option in ("--headless=new", "--no-sandbox", "--disable-gpu", "--disable-dev-shm-usage",
-                       "--window-size=1000,1200", f"--user-data-dir={cls.directory}/browser"):
-            options.add_argument(option)
-        cls.browser = webdriver.Chrome(options=options, service=Service(shutil.which("chromedriver")))
-        cls.addClassCleanup(cls.browser.quit)
+        cls.browser = browser.start(cls, cls.directory)
 
     @classmethod
     def stop_server(cls):

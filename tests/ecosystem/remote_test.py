@@ -116,6 +116,11 @@ class SocatTest(RemoteTest):
                          "with code 0, as relays do\n")
         self.assertEqual(client.wait(PATIENCE), 3)
 
+    def test_signs_of_life_keep_an_idle_session(self):
+        # One that is on its way when the engine has ended makes socat complain.
+        self.assert_runs(f"krutil eval --keep-alive 0.1 --engine 'socat -T 1 - UNIX-CONNECT:{self.serve()} 2>/dev/null' "
+                         "'import time; time.sleep(3); 42'", "42\n")
+
 
 class ServiceTest(RemoteTest):
     def test_units_are_well_formed(self):

@@ -13,90 +13,12 @@ import unittest
 
 import jsonschema
 
+from recorded_session import (GOODBYE, IIP, SHUTDOWN, field, frame, hello, recorded, reply, request, text, varint,
+                              verdict)
 from recordings import INBOUND, OUTBOUND, Recording
 
 SCHEMA, KRUTIL = sys.argv[1:3]
 PATIENCE = 100
-MAGIC = b"\x89KRUTIL\n"
-
-
-def varint(value):
-    out = b""
-    while value > 0x7F:
-        out += bytes([value & 0x7F | 0x80])
-        value >>= 7
-    return out + bytes([value])
-
-
-def field(number, content):
-    """A field of Protocol Buffers: a number, or bytes."""
-    if isinstance(content, int):
-        return varint(number << 3) + varint(content)
-    return varint(number << 3 | 2) + varint(len(content)) + content
-
-
-LIMITS = b"".join(field(i + 1, n) for i, n in enumerate((128, 4 << 20, 64 << 20, 4 << 30, 65_536)))
-
-
-def hello(role, limits=LIMITS, layout=1):
-    body = field(1, role) + field(2, b"krutil") + field(3, 1) + field(6, limits) + field(8, b"test\x1b[31m")
-    return MAGIC + struct.pack("<II", layout, len(body)) + body
-
-
-def verdict(accepted=1, shared=False):
-    def feature(name, value):
-        return field(2, field(1, name) + field(2, value))
-    body = field(1, accepted) + (feature(b"SHM", b"descriptors") if shared else b"") + feature(b"ZEROCOPY", b"enable")
-    return struct.pack("<I", len(body)) + body
-
-
-def frame(kind, frame_type, stream, index, tag, content, last=True, size=None):
-    return struct.pack("<BBHIQQ", kind | (0x80 if last else 0), frame_type, len(tag), stream, index,
-                       len(content) if size is None else size) + tag.encode() + content
-
-
-ID = field(1, field(2, 1))
-TRAITS = field(3, b"") + field(4, b"")
-IIP = field(1, field(2, b"python") + TRAITS)
-
-
-def request(stream=1, code=b"print(1)", lo=0xABCDEF):
-    return [frame(1, 29, stream, 1, "krutil:EvalIIP", IIP + field(2, code), last=False),
-            frame(1, 27, stream, 2, "krutil:IIPEnqueueMessage", field(1, 1) + field(2, field(2, lo)) + field(5, 6))]
-
-
-def reply(stream=1):
-    return [frame(1, 29, stream, 1, "krutil:IIPResult", ID + field(2, b""), last=False),
-            frame(1, 29, stream, 2, "krutil:IIPReply", ID + field(2, 1))]
-
-
-def text(stream, content):
-    return frame(1, 29, stream, 1, "krutil:TextBaseEvent", field(3, content))
-
-
-GOODBYE = frame(3, 0, 0, 0, "", b"", last=False)
-SHUTDOWN = frame(1, 29, 0, 1, "krutil:QVMShutdownEvent", b"")
-
-
-def handshake(recording, shared=False):
-    recording.add(OUTBOUND, hello(0))
-    recording.add(INBOUND, hello(1))
-    recording.add(OUTBOUND, verdict(shared=shared))
-    recording.add(INBOUND, verdict(shared=shared))
-    if shared:
-        for unit in b"12345678", b"\1":
-            recording.add(OUTBOUND, unit)
-            recording.add(INBOUND, unit)
-
-
-def recorded(*units, shared=False):
-    """A recording: the handshake, then units with their direction in front: > to the engine, < from it."""
-    recording = Recording("client 4711")
-    handshake(recording, shared)
-    for direction, unit in units:
-        for each in unit if isinstance(unit, list) else [unit]:
-            recording.add(OUTBOUND if direction == ">" else INBOUND, each)
-    return recording
 
 
 class InspectTest(unittest.TestCase):
@@ -226,9 +148,9 @@ class InspectTest(unittest.TestCase):
         self.assertEqual(self.inspect(file=missing, exit_code=2)[1],
                          f"krutil: cannot read '{missing}': No such file or directory\n")
 
-    def finding(self, *units, exit_code=4, shared=False):
+    def finding(self, *units, exit_code=4, **features):
         """What --lint says of the last unit of a recording, and that it names its place."""
-        recording = recorded(*units, shared=shared)
+        recording = recorded(*units, **features)
         self.write(recording)
         offset = sum(len(block) for block in recording.blocks[:-1])
         prefix = f"'{self.file}', byte {offset}: "
@@ -294,6 +216,17 @@ class InspectTest(unittest.TestCase):
         small = frame(5, 11, 1, 1, "", struct.pack("<QQQ", 7, 0, 9), last=False) + bytes(9)
         self.assertEqual(self.finding((">", small), shared=True),
                          "shared content of frame 1 on stream 1: expected 1048576 bytes or more, got 9")
+
+    def test_signs_of_life(self):
+        life = frame(7, 0, 0, 0, "", b"", last=False)
+        self.write(recorded((">", [life, *request(), life]), ("<", [*reply(), life]), (">", [GOODBYE, life]),
+                            ("<", SHUTDOWN), living=True))
+        self.assertEqual(self.inspect("--lint")[0], "no rule is broken in 14 units of 1 sessions\n")
+        self.assertEqual(self.inspect("--type", "keep-alive")[0].count(" keep-alive, 24 bytes\n"), 4)
+        self.assertEqual(self.finding(("<", SHUTDOWN), ("<", life), living=True),
+                         "expected nothing after the engine's shutdown event, got another frame")
+        self.assertEqual(self.finding((">", life)),
+                         "frame kind: expected 1 (tagged), 2 (data), 3 (goodbye) or 4 (abort), got 7")
 
     def test_lint_checks_the_handshake(self):
         def of(*units):

@@ -11,7 +11,7 @@ enum class ExitCode : int {
     Ok = 0,
     CodeError = 1,  ///< the code raised an error
     Usage = 2,      ///< the command line or the code text cannot be used
-    Stream = 3,     ///< no engine could be started or reached, or a stream was lost
+    Stream = 3,     ///< no engine could be started or reached, a stream was lost, or a file of the engine lacks text
     Violation = 4,  ///< the engine broke the protocol, or a recording that is checked does
     Refused = 5,    ///< the ends do not fit: version or features
     Cancelled = 6,  ///< cancelled, by Ctrl-C here or by the engine

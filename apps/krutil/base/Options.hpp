@@ -23,6 +23,7 @@ struct ConnectionOptions {
     std::string key;
     std::string authorities;
     std::chrono::milliseconds handshakeTimeout{10'000};
+    std::chrono::milliseconds keepAlive{0};  ///< how often an engine elsewhere gets a sign of life; 0 for never
     bool noPrecheck = false;      ///< a number that the protocol does not know ends this program, not just the session
     bool noZeroCopy = false;      ///< elements of arrays travel inside their messages
     bool noSharedMemory = false;  ///< those of large arrays as bytes, also to an engine on this machine
@@ -41,6 +42,7 @@ struct DisplayOptions {
     apps::RecordOptions record;
     bool timing = false;
     bool warningStack = false;  ///< warnings tell where they were issued
+    bool safeText = false;      ///< characters of programs that steer a terminal are shown as escapes
     Color color = Color::Auto;
 };
 
@@ -83,13 +85,8 @@ struct ReplOptions {
 /// `krutil replay`.
 struct ReplayOptions {
     std::string file;
+    bool serve = false;                          ///< the engine's side, to a client, instead of the client's
     std::chrono::milliseconds patience{10'000};  ///< an answer may take that much longer than in the recording
-};
-
-/// `krutil redact`.
-struct RedactOptions {
-    std::string file;  ///< "-" for standard input
-    std::string out;   ///< is created
 };
 
 /// `krutil inspect`.
@@ -103,17 +100,19 @@ struct InspectOptions {
     bool timeline = false;  ///< requests instead of messages
     bool lint = false;      ///< broken rules instead of messages
     bool json = false;
-    std::string request;             ///< the identifier of the only one, or its first digits
-    std::vector<std::string> types;  ///< the only ones; empty for all
-    std::optional<Role> from;        ///< the only sender
-    double since = 0;                ///< seconds after the first packet
+    std::optional<std::string> html;  ///< the page that is written instead; "-" for standard output
+    std::string redacted;             ///< the copy without text and numbers that is written instead; empty for none
+    std::string request;              ///< the identifier of the only one, or its first digits
+    std::vector<std::string> types;   ///< the only ones; empty for all
+    std::optional<Role> from;         ///< the only sender
+    double since = 0;                 ///< seconds after the first packet
     double until = std::numeric_limits<double>::infinity();
 };
 
 struct Options {
     ConnectionOptions connection;
     DisplayOptions display;
-    std::variant<EvalOptions, CallOptions, ReplOptions, ReplayOptions, RedactOptions, InspectOptions> command;
+    std::variant<EvalOptions, CallOptions, ReplOptions, ReplayOptions, InspectOptions> command;
 };
 
 }  // namespace krutil_client

@@ -1,5 +1,7 @@
 #include "krutil/base/Text.hpp"
 
+#include <unicode/uchar.h>
+
 #include <algorithm>
 #include <array>
 #include <climits>
@@ -10,6 +12,16 @@
 #include "msg_svc/protobuf/ustring.hpp"
 
 namespace krutil_client {
+namespace {
+
+std::string escapeOf(char32_t character, Escapes escapes) {
+    std::array<char, 12> text{};
+    const bool isShort = escapes == Escapes::Short && character <= 0xFF;
+    std::snprintf(text.data(), text.size(), isShort ? "\\x%02x" : "\\u%04x", static_cast<unsigned>(character));
+    return text.data();
+}
+
+}  // namespace
 
 std::optional<std::size_t> firstInvalidUtf8(const std::string& text) {
     // Whatever is ill-formed comes back as a replacement character, which differs from it in its first byte or, where
@@ -35,6 +47,37 @@ std::string nameOfCode(const std::string& code) {
     return name;
 }
 
+bool steersTerminal(char32_t character) {
+    const auto code = static_cast<UChar32>(character);
+    switch (u_charType(code)) {
+        case U_CONTROL_CHAR:
+        case U_LINE_SEPARATOR:
+        case U_PARAGRAPH_SEPARATOR:
+            return true;
+        default:
+            return u_hasBinaryProperty(code, UCHAR_BIDI_CONTROL) != 0;
+    }
+}
+
+std::string safeText(const std::string& text, Escapes escapes) {
+    // Most text is printable ASCII, which is left where it is.
+    const auto plain = [](char c) { return (c >= ' ' && c <= '~') || c == '\n' || c == '\t'; };
+    if (std::all_of(text.begin(), text.end(), plain)) {
+        return text;
+    }
+    std::u16string safe;
+    // All these characters are one unit.
+    for (const char16_t unit : msg_svc::protobuf::utf8_to_ustring(text)) {
+        if (steersTerminal(unit) && unit != u'\n' && unit != u'\t') {
+            const std::string escape = escapeOf(unit, escapes);
+            safe.append(escape.begin(), escape.end());
+        } else {
+            safe += unit;
+        }
+    }
+    return msg_svc::protobuf::ustring_to_utf8(safe);
+}
+
 std::string quotedText(std::string_view text, std::size_t longest) {
     // A character has at most four bytes of UTF-8 for one or two units.
     const std::u16string units =
@@ -43,17 +86,13 @@ std::string quotedText(std::string_view text, std::size_t longest) {
     std::size_t taken = 0;
     for (; taken < std::min(longest, units.size()); ++taken) {
         const char16_t unit = units[taken];
-        const bool mark = unit == 0x200E || unit == 0x200F || (unit >= 0x2028 && unit <= 0x202E) ||
-                          (unit >= 0x2066 && unit <= 0x2069);
         if (unit == u'\n') {
             shown += u"\\n";
         } else if (unit == u'"' || unit == u'\\') {
             shown += {u'\\', unit};
-        } else if (unit < 0x20 || (unit >= 0x7F && unit < 0xA0) || mark) {
-            std::array<char, 8> escape{};
-            std::snprintf(escape.data(), escape.size(), unit > 0xFF ? "\\u%04x" : "\\x%02x", unsigned{unit});
-            const std::string_view digits = escape.data();
-            shown.append(digits.begin(), digits.end());
+        } else if (steersTerminal(unit)) {
+            const std::string escape = escapeOf(unit, Escapes::Short);
+            shown.append(escape.begin(), escape.end());
         } else {
             shown += unit;
         }

@@ -4,33 +4,56 @@
 
 #include <algorithm>
 #include <array>
+#include <cmath>
 #include <limits>
 #include <nlohmann/json.hpp>
 #include <optional>
 #include <string>
 #include <system_error>
 #include <utility>
+#include <vector>
 
 #include "common/RecordingReader.hpp"
 #include "krutil/base/Interrupt.hpp"
+#include "krutil/base/JsonLine.hpp"
 #include "krutil/base/Output.hpp"
 #include "krutil/base/Text.hpp"
 #include "krutil/inspect/InspectedMessage.hpp"
 #include "krutil/inspect/Lint.hpp"
+#include "krutil/inspect/MessagePage.hpp"
 #include "krutil/inspect/MessageText.hpp"
+#include "krutil/inspect/NewFile.hpp"
 #include "krutil/inspect/Summary.hpp"
 #include "krutil/inspect/Timelines.hpp"
 
 namespace krutil_client {
 namespace {
 
-using nlohmann::ordered_json;
-
 // Of a unit, unless all its bytes are asked for. Decoding a message takes several times its size.
 constexpr std::uint64_t keptBytes = 1U << 20U;
 
-std::string jsonLine(const ordered_json& object) {
-    return object.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace) + "\n";
+// The filters as they are typed; empty for none.
+std::string filtersOf(const InspectOptions& options) {
+    std::string text;
+    const auto add = [&text](const char* option, const std::string& value) {
+        text += (text.empty() ? "" : " ") + std::string(option) + " " + value;
+    };
+    if (!options.request.empty()) {
+        add("--request", options.request);
+    }
+    for (const std::string& type : options.types) {
+        add("--type", type);
+    }
+    if (options.from) {
+        add("--from", *options.from == InspectOptions::Role::Client ? "client" : "engine");
+    }
+    if (options.since > 0) {
+        add("--since", lineText(options.since));
+    }
+    if (std::isfinite(options.until)) {
+        add("--until", lineText(options.until));
+    }
+    return text;
 }
 
 class Inspection {
@@ -44,16 +67,23 @@ class Inspection {
           messages_(options.hex) {}
 
     ExitCode run() {
-        while (auto unit = reader_.next()) {
-            show(std::move(*unit));
+        try {
+            while (auto unit = reader_.next()) {
+                show(std::move(*unit));
+            }
+        } catch (const apps::RecordingError& error) {
+            writePage("This page has what the recording says before it is damaged: " + std::string(error.what()));
+            throw;
         }
         for (const InspectedMessage& message : messages_.rest()) {
             show(message);
         }
         out_.write(timelines_.rest());
-        if (const auto sentence = reader_.unfinished()) {
+        const auto sentence = reader_.unfinished();
+        if (sentence) {
             say("unfinished", *sentence);
         }
+        writePage(sentence ? "This page has what is there: " + *sentence + "." : "");
         if (options_.lint && !options_.json && findings_ == 0) {
             out_.write("no rule is broken in " + std::to_string(units_) + " units of " +
                        std::to_string(reader_.sessions().size()) + " sessions\n");
@@ -90,7 +120,7 @@ class Inspection {
                                      {"process", session.process},
                                      {"program", session.program},
                                      {"begin", *begin_}}));
-            } else if (!options_.lint && !options_.timeline) {
+            } else if (!options_.lint && !options_.timeline && !options_.html) {
                 out_.write("session " + std::to_string(shownSessions_) + ", recorded by " +
                            quotedText(session.process, 40) + ", " + quotedText(session.program, 80) + "\n");
             }
@@ -120,14 +150,41 @@ class Inspection {
         }
     }
 
+    // If there is to be one. Errors of the file itself are `note`; empty for none.
+    void writePage(const std::string& note) {
+        if (!options_.html) {
+            return;
+        }
+        std::vector<std::string> notes;
+        if (!note.empty()) {
+            notes.push_back(note);
+        }
+        if (const std::string filters = filtersOf(options_); !filters.empty()) {
+            notes.push_back(std::to_string(unwanted_) + (unwanted_ == 1 ? " message is" : " messages are") +
+                            " left out by " + filters + ".");
+        }
+        const std::string page = page_.html(reader_.sessions(), options_.file, std::move(notes));
+        if (*options_.html == "-") {
+            out_.write(page);
+        } else {
+            NewFile(*options_.html).write(page);
+        }
+    }
+
     void show(const InspectedMessage& message) {
-        if (!isWanted(message)) {
+        const bool wanted = isWanted(message);
+        unwanted_ += wanted ? 0U : 1U;
+        if (options_.html) {
+            page_.take(message, *begin_, wanted);
+            return;
+        }
+        if (!wanted) {
             return;
         }
         if (options_.timeline) {
             out_.write(timelines_.take(message));
         } else {
-            out_.write(options_.json ? messageJson(message, *begin_, options_) + "\n"
+            out_.write(options_.json ? messageJson(message, *begin_, options_)
                                      : messageText(message, *begin_, options_));
         }
     }
@@ -148,11 +205,13 @@ class Inspection {
     apps::RecordingReader reader_;
     MessageAssembler messages_;
     Timelines timelines_;
+    MessagePage page_;
     Lint lint_;
     std::optional<std::uint64_t> begin_;  ///< time of the first packet
     std::size_t shownSessions_ = 0;
     std::uint64_t units_ = 0;
     std::uint64_t findings_ = 0;
+    std::uint64_t unwanted_ = 0;
 };
 
 }  // namespace

@@ -101,6 +101,8 @@ std::string InspectedFrame::type() const {
             return "shared data";
         case FrameKind::Return:
             return "return";
+        case FrameKind::KeepAlive:
+            return "keep-alive";
     }
     return "kind " + std::to_string(header.kind);
 }

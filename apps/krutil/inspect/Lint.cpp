@@ -147,7 +147,8 @@ void Lint::settle(const apps::RecordedSession& recorded, Session& session) {
         config, rules::SessionChecker::Settled{limitsOf(*client.hello),
                                                limitsOf(*engine.hello),
                                                {features.begin(), features.end()},
-                                               probed && client.descriptors && engine.descriptors});
+                                               probed && client.descriptors && engine.descriptors,
+                                               features.contains("KEEPALIVE")});
 }
 
 void Lint::check(const apps::RecordedUnit& unit, const apps::RecordedSession& recorded, Session& session) {

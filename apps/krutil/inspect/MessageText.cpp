@@ -10,6 +10,7 @@
 #include <nlohmann/json.hpp>
 #include <sstream>
 
+#include "krutil/base/JsonLine.hpp"
 #include "krutil/inspect/Summary.hpp"
 
 namespace krutil_client {
@@ -167,7 +168,7 @@ std::string messageJson(const InspectedMessage& message, std::uint64_t begin, co
             object["frames"].push_back(std::move(part));
         }
     }
-    return object.dump(-1, ' ', false, nlohmann::json::error_handler_t::replace);
+    return jsonLine(object);
 }
 
 }  // namespace krutil_client

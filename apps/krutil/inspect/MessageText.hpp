@@ -18,7 +18,7 @@ namespace krutil_client {
 /// and its bytes. All lines end with a newline.
 std::string messageText(const InspectedMessage& message, std::uint64_t begin, const InspectOptions& options);
 
-/// The same as one JSON object, without a newline. docs/json-output.md describes it.
+/// The same as one JSON object, on a line. docs/json-output.md describes it.
 std::string messageJson(const InspectedMessage& message, std::uint64_t begin, const InspectOptions& options);
 
 /// Seconds since `begin`, with microseconds.

@@ -1,35 +1,24 @@
 #include "krutil/inspect/RedactedCopy.hpp"
 
-#include <fcntl.h>
-#include <sys/stat.h>
 #include <sys/uio.h>
 
-#include <cerrno>
 #include <cstdint>
 #include <system_error>
 
 #include "common/PcapngBlocks.hpp"
 #include "common/RecordingReader.hpp"
-#include "foundation/core/posix/OwnedDescriptor.hpp"
-#include "foundation/core/posix/writeFully.hpp"
 #include "krutil/base/ExitCode.hpp"
+#include "krutil/inspect/NewFile.hpp"
 #include "krutil/inspect/Redaction.hpp"
 
 namespace krutil_client {
 namespace {
 
 namespace pcapng = apps::pcapng;
-namespace posix = foundation::core::posix;
 
 class Copy {
   public:
-    explicit Copy(const std::string& name)
-        : name_(name),
-          file_(::open(name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOCTTY | O_CLOEXEC, S_IRUSR | S_IWUSR)) {
-        if (!file_) {
-            fail("create");
-        }
-    }
+    explicit Copy(const std::string& name) : file_(name) {}
 
     void add(const apps::RecordedSession& session) {
         const std::string comment =
@@ -37,7 +26,7 @@ class Copy {
                              : std::string();
         pcapng::makeSection(block_, comment, isBuild(session.program) ? session.program : "redacted",
                             redactedProcess(session.process));
-        write();
+        file_.write(block_);
     }
 
     void add(apps::RecordedUnit& unit) {
@@ -49,7 +38,7 @@ class Copy {
                                    unit.size};
         for (std::uint64_t first = 0; first < packets.kept;) {
             first += pcapng::makePacket(block_, packets, first);
-            write();
+            file_.write(block_);
         }
     }
 
@@ -59,19 +48,7 @@ class Copy {
         return process.substr(0, process.find_first_not_of("0123456789", std::string("client ").size()));
     }
 
-    void write() {
-        if (!posix::writeFully(file_.get(), block_)) {
-            fail("write to");
-        }
-    }
-
-    [[noreturn]] void fail(const char* what) const {
-        throw Failure(ExitCode::Usage,
-                      std::string("cannot ") + what + " '" + name_ + "': " + std::generic_category().message(errno));
-    }
-
-    const std::string name_;
-    const posix::OwnedDescriptor file_;
+    NewFile file_;
     std::string block_;
 };
 

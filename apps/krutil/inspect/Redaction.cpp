@@ -189,10 +189,10 @@ void redactMessage(Bytes bytes, const Descriptor* type, int depth) {
 }
 
 void redactFrame(Bytes frame) {
-    enum Kind : unsigned { Tagged = 1, Data, Goodbye, Abort, Shared, Return };
+    enum Kind : unsigned { Tagged = 1, Data, Goodbye, Abort, Shared, Return, KeepAlive };
     const unsigned kind = frame.empty() ? 0U : static_cast<unsigned char>(frame[0]) & 0x7FU;
     // What is no frame may be what a program has printed.
-    if (frame.size() < headerSize || kind < Tagged || kind > Return) {
+    if (frame.size() < headerSize || kind < Tagged || kind > KeepAlive) {
         hide(frame);
         return;
     }

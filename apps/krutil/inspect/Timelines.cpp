@@ -1,6 +1,8 @@
 #include "krutil/inspect/Timelines.hpp"
 
+#include <algorithm>
 #include <utility>
+#include <vector>
 
 #include "krutil/inspect/MessageText.hpp"
 #include "krutil/inspect/Summary.hpp"
@@ -52,12 +54,18 @@ std::string Timelines::take(const InspectedMessage& message) {
 }
 
 std::string Timelines::rest() {
-    std::string text;
+    std::vector<Timeline> inOrder;
     for (auto& [request, timeline] : open_) {
+        inOrder.push_back(std::move(timeline));
+    }
+    open_.clear();
+    std::sort(inOrder.begin(), inOrder.end(),
+              [](const Timeline& left, const Timeline& right) { return left.begin < right.begin; });
+    std::string text;
+    for (Timeline& timeline : inOrder) {
         endLine(timeline);
         text += timeline.text + "   no reply\n";
     }
-    open_.clear();
     return text;
 }
 

@@ -20,7 +20,7 @@ class Timelines {
     ///        +0.000310 <-- IIPStartedEvent, 63 bytes
     std::string take(const InspectedMessage& message);
 
-    /// The timelines of requests without a reply.
+    /// The timelines of requests without a reply, in the order of their beginning.
     std::string rest();
 
   private:

@@ -136,7 +136,7 @@ TEST_F(ProgramRecordingTest, RedactedCopyHasNoText) {
         runClient({"eval", "secret = 'word' * 3\nprint(secret)\nraise ValueError(secret)", "--record", file_});
     EXPECT_EQ(ran.exitCode, 1) << ran.err;
     const std::string copy = directory_.file("copy.pcapng");
-    const Ran redacted = run(clientCommand({"redact", file_, copy}));
+    const Ran redacted = run(clientCommand({"inspect", file_, "--redact", copy}));
     EXPECT_EQ(redacted.exitCode, 0);
     EXPECT_EQ(redacted.out + redacted.err, "");
     const auto before = recorded(file_);
@@ -146,7 +146,7 @@ TEST_F(ProgramRecordingTest, RedactedCopyHasNoText) {
     EXPECT_THAT(recordedStream(now, outbound), HasSubstr("krutil:EvalIIP"));
     EXPECT_EQ(recordedStream(now, inbound).size(), recordedStream(before, inbound).size());
     EXPECT_EQ(now.size(), before.size());
-    const Ran again = run(clientCommand({"redact", file_, copy}));
+    const Ran again = run(clientCommand({"inspect", file_, "--redact", copy}));
     EXPECT_EQ(again.err, "krutil: cannot create '" + copy + "': File exists\n");
     EXPECT_EQ(again.exitCode, 2);
 }
