@@ -24,24 +24,28 @@ constexpr const char* exitCodes = R"(Exit codes:
   1  the code or the function raised an error
   2  the command line, the code text or a file cannot be used, a recording is not complete, or an
      argument is larger than the engine accepts
-  3  no engine could be started or reached, or its stream was lost
+  3  no engine could be started or reached, its stream was lost, or its diary, log or recording is
+     not complete
   4  the engine broke the protocol, or a recording that is checked does
   5  the engine refused: the ends do not fit (protocol version or features), or it is full
   6  cancelled)";
 
-// A time of a millisecond to a day, in seconds, with ten as its default.
+// A time of a millisecond to a day, in seconds. Its default is what `time` holds, 0 for none.
 void addSecondsOption(CLI::App& app, const std::string& name, std::chrono::milliseconds& time,
                       const std::string& description, const std::string& group) {
-    app.add_option_function<double>(
-           name,
-           [&time](const double& seconds) {
-               time = std::chrono::milliseconds(static_cast<std::chrono::milliseconds::rep>(seconds * 1'000.0));
-           },
-           description)
-        ->check(CLI::Range(0.001, 86'400.0).description(""))
-        ->type_name("SECONDS")
-        ->default_str("10")
-        ->group(group);
+    auto* const option =
+        app.add_option_function<double>(
+               name,
+               [&time](const double& seconds) {
+                   time = std::chrono::milliseconds(static_cast<std::chrono::milliseconds::rep>(seconds * 1'000.0));
+               },
+               description)
+            ->check(CLI::Range(0.001, 86'400.0).description(""))
+            ->type_name("SECONDS")
+            ->group(group);
+    if (time.count() > 0) {
+        option->default_str(std::to_string(time.count() / 1'000));
+    }
 }
 
 // Which engine.
@@ -76,6 +80,11 @@ void addEngineOptions(CLI::App& app, ConnectionOptions& options) {
         ->group("Engine");
     addSecondsOption(app, "--handshake-timeout", options.handshakeTimeout,
                      "How long the engine may take to start and answer", "Engine");
+    addSecondsOption(
+        app, "--keep-alive", options.keepAlive,
+        "How often a sign of life is exchanged with an engine behind --engine or TLS, for proxies that end "
+        "idle connections; otherwise never",
+        "Engine");
 }
 
 // What is agreed with it, too.
@@ -120,6 +129,10 @@ void addDisplayOptions(CLI::App& app, DisplayOptions& options) {
         ->default_str("auto")
         ->group("Display");
     app.add_flag("--warning-stack", options.warningStack, "Show where each warning was issued")->group("Display");
+    app.add_flag("--safe-text", options.safeText,
+                 "Show control characters of what programs print, and controls of direction, as escapes; "
+                 "newline and tab stay. --json always does that")
+        ->group("Display");
 }
 
 void addSinkOptions(CLI::App& app, SinkOptions& options) {
@@ -226,33 +239,31 @@ void addRepl(CLI::App& app, Options& options, ReplOptions& repl) {
 }
 
 constexpr const char* replayCodes = R"(Exit codes of replay:
-  0  the engine answered as in the recording
-  1  it answered otherwise
+  0  the other end spoke as in the recording
+  1  it said something else
   2  the command line or the recording cannot be used
-  3  no engine could be started or reached, or its stream was lost
-  4  the engine broke the protocol
-  5  the engine refuses the session
+  3  no engine could be started or reached, or the stream of the other end was lost
+  4  the other end broke the protocol
+  5  the other end refuses the session
   6  cancelled)";
 
 void addReplay(CLI::App& app, Options& options, ReplayOptions& replay) {
     auto* command = app.add_subcommand(
         "replay",
-        "Say to an engine what the client of a recording has said, and show where the engine answers otherwise");
+        "Say to an engine what the client of a recording has said, and show where the engine answers otherwise; or the "
+        "engine's part to a client");
     command->add_option("FILE", replay.file, "The recording; - for standard input")->required()->type_name("");
+    auto* serve = command
+                      ->add_flag("--serve", replay.serve,
+                                 "Say to a client at standard input and output what the engine has said, and show on "
+                                 "standard error where the client says something else; for --engine of a client")
+                      ->group("Request");
     addSecondsOption(*command, "--patience", replay.patience,
                      "How much longer than in the recording an answer may take", "Request");
     addEngineOptions(*command, options.connection);
+    serve->excludes("--engine")->excludes("--connect");
     command->footer(replayCodes);
     command->callback([&options, &replay] { options.command = replay; });
-}
-
-void addRedact(CLI::App& app, Options& options, RedactOptions& redact) {
-    auto* command = app.add_subcommand(
-        "redact", "Copy a recording without its text and numbers, so that it can go into a report of a fault");
-    command->add_option("FILE", redact.file, "The recording; - for standard input")->required()->type_name("");
-    command->add_option("OUT", redact.out, "The copy, a new file")->required()->type_name("");
-    command->footer(exitCodes);
-    command->callback([&options, &redact] { options.command = redact; });
 }
 
 // Options without a command are those of the one that needs no name.
@@ -329,6 +340,34 @@ void addCall(CLI::App& app, Options& options, CallOptions& call) {
     });
 }
 
+// Instead of all that inspect prints.
+void addPage(CLI::App& inspection, InspectOptions& inspect) {
+    auto* html = inspection
+                     .add_option("--html", inspect.html,
+                                 "Write a page for a browser to this new file, or - for standard output: requests as "
+                                 "lanes on an axis of time, and their messages as marks")
+                     ->type_name("OUT")
+                     ->group("Display");
+    for (const char* const other : {"--frames", "--fields", "--hex", "--json", "--timeline", "--lint"}) {
+        html->excludes(inspection.get_option(other));
+    }
+}
+
+// Of the whole recording.
+void addCopy(CLI::App& inspection, InspectOptions& inspect) {
+    auto* copy = inspection
+                     .add_option("--redact", inspect.redacted,
+                                 "Write a copy without text and numbers to this new file, so that it can go into a "
+                                 "report of a fault")
+                     ->type_name("OUT")
+                     ->group("Display");
+    for (CLI::Option* const other : inspection.get_options()) {
+        if (other != copy && other->get_single_name() != "FILE" && other != inspection.get_help_ptr()) {
+            copy->excludes(other);
+        }
+    }
+}
+
 void addInspect(CLI::App& app, Options& options, InspectOptions& inspect) {
     auto* command = app.add_subcommand("inspect", "Show what is in a recording of sessions");
     command->add_option("FILE", inspect.file, "A file that --record has written, or - for standard input")
@@ -348,6 +387,7 @@ void addInspect(CLI::App& app, Options& options, InspectOptions& inspect) {
                    "Show no messages, but where a session breaks a rule: the file, the byte, and what was expected")
         ->excludes(timeline)
         ->group("Display");
+    addPage(*command, inspect);
     command
         ->add_option("--request", inspect.request,
                      "Only messages of the request whose identifier begins with these hexadecimal digits")
@@ -374,6 +414,7 @@ void addInspect(CLI::App& app, Options& options, InspectOptions& inspect) {
         ->type_name("SECONDS")
         ->default_str("")
         ->group("Filter");
+    addCopy(*command, inspect);
     command->footer(exitCodes);
     command->callback([&options, &inspect] {
         options.display.json = inspect.json;
@@ -392,7 +433,6 @@ struct OptionTable {
     EvalOptions run;
     ReplOptions repl;
     ReplayOptions replay;
-    RedactOptions redact;
     InspectOptions inspect;
     CLI::App app{
         "Evaluates code on an engine in another process. Without a command, code is read line by line; the options are "
@@ -412,7 +452,6 @@ OptionTable::OptionTable(const std::vector<std::string>& words) {
     addRun(app, options, run);
     addRepl(app, options, repl);
     addReplay(app, options, replay);
-    addRedact(app, options, redact);
     addInspect(app, options, inspect);
 }
 

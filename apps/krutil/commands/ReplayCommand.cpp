@@ -1,5 +1,7 @@
 #include "krutil/commands/ReplayCommand.hpp"
 
+#include <unistd.h>
+
 #include <algorithm>
 #include <chrono>
 #include <string>
@@ -7,6 +9,7 @@
 
 #include "krutil/replay/Comparison.hpp"
 #include "krutil/replay/Player.hpp"
+#include "krutil/replay/Server.hpp"
 #include "krutil/replay/Talk.hpp"
 #include "krutil/session/Client.hpp"
 
@@ -35,7 +38,39 @@ bool show(const std::vector<Compared>& all, Output& out) {
     return same == all.size();
 }
 
+// The session that can be said to a client.
+Talk onlyTalk(const std::string& file) {
+    std::vector<Talk> talks = readTalks(file);
+    const auto refuse = [&file](const std::string& reason) {
+        throw Failure(ExitCode::Usage, "cannot replay '" + file + "' to a client: " + reason);
+    };
+    if (talks.size() != 1) {
+        refuse("expected one session, got " + std::to_string(talks.size()));
+    }
+    if (!talks.front().wholeFromBeginning) {
+        refuse("expected a session from its beginning, got the later part of one; record with a larger --record-size");
+    }
+    if (!talks.front().verdict.accepted()) {
+        refuse("expected a session that both ends have accepted, got one without");
+    }
+    return std::move(talks.front());
+}
+
 }  // namespace
+
+ExitCode serveRecording(const ConnectionOptions& connection, const ReplayOptions& options, Output& err,
+                        Interrupt& interrupt) {
+    if (options.file == "-" || ::isatty(STDIN_FILENO) == 1 || ::isatty(STDOUT_FILENO) == 1) {
+        throw Failure(ExitCode::Usage,
+                      "with --serve, standard input and output carry the session with a client: expected a file with a "
+                      "name, in a command that a client starts as its engine");
+    }
+    const Talk talk = onlyTalk(options.file);
+    const Served served = serve(posix::OwnedDescriptor(STDIN_FILENO), posix::OwnedDescriptor(STDOUT_FILENO), talk,
+                                connection.handshakeTimeout, options.patience, interrupt,
+                                [&err](const std::string& sentence) { err.write(sentence + "\n"); });
+    return served.gone ? ExitCode::Stream : served.differs ? ExitCode::CodeError : ExitCode::Ok;
+}
 
 ExitCode replayRecording(const ConnectionOptions& connection, const ReplayOptions& options, Output& out,
                          Interrupt& interrupt) {

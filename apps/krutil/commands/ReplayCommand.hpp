@@ -13,4 +13,10 @@ namespace krutil_client {
 ExitCode replayRecording(const ConnectionOptions& connection, const ReplayOptions& options, Output& out,
                          Interrupt& interrupt);
 
+/// Says what the engine of a recording has said, to a client at standard input and output, and shows on `err` where the
+/// client says something else. Returns ExitCode::CodeError when it does, and ExitCode::Stream when it has gone before
+/// the end. Throws Failure, and Cancelled on Ctrl-C.
+ExitCode serveRecording(const ConnectionOptions& connection, const ReplayOptions& options, Output& err,
+                        Interrupt& interrupt);
+
 }  // namespace krutil_client

@@ -6,24 +6,25 @@
 #include <google/protobuf/util/message_differencer.h>
 
 #include <algorithm>
-#include <limits>
+#include <array>
 #include <map>
-#include <memory>
 #include <string_view>
 #include <utility>
 
-#include "common/MessageNames.hpp"
+#include "common/MessageWalk.hpp"
 #include "krutil.protobuf.TextBaseEvent.pb.h"
 
 namespace krutil_client {
 namespace {
 
-using google::protobuf::FieldDescriptor;
 using google::protobuf::Message;
 
 constexpr std::size_t longestSentence = 600;
 constexpr std::size_t shownDifferences = 10;
 constexpr std::size_t shortestAddress = 6;
+
+// When a warning was issued; the number by which a client calls itself.
+constexpr std::array ignoredFields{"krutil.protobuf.Warning.datenum", "krutil.protobuf.FEvalIIP.clientQvmID"};
 
 // Both events of texts have the same fields.
 using Text = krutil::protobuf::TextBaseEvent;
@@ -86,39 +87,6 @@ std::string withoutAddresses(const std::string& text) {
     return scrubbed.append(text, at, std::string::npos);
 }
 
-void removeAddresses(Message& message) {
-    const auto& reflection = *message.GetReflection();
-    std::vector<const FieldDescriptor*> fields;
-    reflection.ListFields(message, &fields);
-    for (const FieldDescriptor* field : fields) {
-        const int count = field->is_repeated() ? reflection.FieldSize(message, field) : 1;
-        for (int i = 0; i < count; ++i) {
-            if (field->cpp_type() == FieldDescriptor::CPPTYPE_MESSAGE) {
-                removeAddresses(field->is_repeated() ? *reflection.MutableRepeatedMessage(&message, field, i)
-                                                     : *reflection.MutableMessage(&message, field));
-            } else if (field->type() == FieldDescriptor::TYPE_STRING && field->is_repeated()) {
-                reflection.SetRepeatedString(&message, field, i,
-                                             withoutAddresses(reflection.GetRepeatedString(message, field, i)));
-            } else if (field->type() == FieldDescriptor::TYPE_STRING) {
-                reflection.SetString(&message, field, withoutAddresses(reflection.GetString(message, field)));
-            }
-        }
-    }
-}
-
-std::unique_ptr<Message> parsedFrame(const SaidFrame& frame) {
-    const auto* const type =
-        google::protobuf::DescriptorPool::generated_pool()->FindMessageTypeByName(apps::messageNameOfTag(frame.tag));
-    if (type == nullptr) {
-        return nullptr;
-    }
-    std::unique_ptr<Message> message(google::protobuf::MessageFactory::generated_factory()->GetPrototype(type)->New());
-    if (!message->ParsePartialFromString(frame.content)) {
-        return nullptr;
-    }
-    return message;
-}
-
 std::string differenceOfBytes(const std::string& before, const std::string& now) {
     if (before == now) {
         return {};
@@ -130,13 +98,15 @@ std::string differenceOfBytes(const std::string& before, const std::string& now)
     return "its " + std::to_string(before.size()) + " bytes differ from byte " + std::to_string(at) + " on";
 }
 
-std::string differenceOfMessages(Message& before, Message& now) {
-    removeAddresses(before);
-    removeAddresses(now);
+std::string differenceOfMessages(Message& before, Message& now, Addresses addresses) {
+    if (addresses == Addresses::MayDiffer) {
+        const auto remove = [](std::string& text) { text = withoutAddresses(text); };
+        apps::forEachText(before, remove);
+        apps::forEachText(now, remove);
+    }
     google::protobuf::util::MessageDifferencer differencer;
-    if (const auto* time =
-            google::protobuf::DescriptorPool::generated_pool()->FindFieldByName("krutil.protobuf.Warning.datenum")) {
-        differencer.IgnoreField(time);
+    for (const char* name : ignoredFields) {
+        differencer.IgnoreField(google::protobuf::DescriptorPool::generated_pool()->FindFieldByName(name));
     }
     differencer.set_report_ignores(false);
     std::string report;
@@ -153,7 +123,7 @@ std::string differenceOfMessages(Message& before, Message& now) {
     return report.substr(0, longestSentence) + (report.size() > longestSentence ? "..." : "");
 }
 
-std::string difference(const SaidFrame& before, const SaidFrame& now) {
+std::string difference(const SaidFrame& before, const SaidFrame& now, Addresses addresses) {
     const auto name = [](const SaidFrame& frame) {
         return frame.tagged ? google::protobuf::CEscape(frame.tag) : std::string("data");
     };
@@ -164,13 +134,10 @@ std::string difference(const SaidFrame& before, const SaidFrame& now) {
     if (before.content == now.content) {
         return {};
     }
-    const auto left = before.tagged ? parsedFrame(before) : nullptr;
-    const auto right = now.tagged ? parsedFrame(now) : nullptr;
-    return left && right ? differenceOfMessages(*left, *right) : differenceOfBytes(before.content, now.content);
-}
-
-std::string nameOf(const Said& said) {
-    return google::protobuf::CEscape(std::string(said.tag()));
+    const auto left = before.tagged ? apps::parsedMessage(before.tag, before.content) : nullptr;
+    const auto right = now.tagged ? apps::parsedMessage(now.tag, now.content) : nullptr;
+    return left && right ? differenceOfMessages(*left, *right, addresses)
+                         : differenceOfBytes(before.content, now.content);
 }
 
 // An engine may go on where the recording ends early.
@@ -196,16 +163,8 @@ std::vector<std::string> differences(const std::vector<Said>& before, const std:
             found.push_back(where + ": got " + nameOf(now[i]));
             break;
         }
-        if (before[i].frames.size() != now[i].frames.size()) {
-            found.push_back(where + ": expected " + std::to_string(before[i].frames.size()) + " frames, got " +
-                            std::to_string(now[i].frames.size()));
-            continue;
-        }
-        for (std::size_t frame = 0; frame < before[i].frames.size(); ++frame) {
-            if (const auto text = difference(before[i].frames[frame], now[i].frames[frame]); !text.empty()) {
-                found.push_back(where);
-                found.back().append(", frame ").append(std::to_string(frame + 1)).append(": ").append(text);
-            }
+        for (const std::string& text : compareFrames(before[i], now[i], Addresses::MayDiffer)) {
+            found.push_back(where + text);
         }
     }
     return found;
@@ -235,6 +194,32 @@ Sequences byRequest(const Talk& talk, const std::vector<Said>& said) {
 }
 
 }  // namespace
+
+std::string nameOf(const Said& said) {
+    switch (said.kind) {
+        case Said::Kind::Goodbye:
+            return "goodbye";
+        case Said::Kind::Abort:
+            return "abort";
+        case Said::Kind::Message:
+            break;
+    }
+    return google::protobuf::CEscape(std::string(said.tag()));
+}
+
+std::vector<std::string> compareFrames(const Said& before, const Said& now, Addresses addresses) {
+    if (before.frames.size() != now.frames.size()) {
+        return {": expected " + std::to_string(before.frames.size()) + " frames, got " +
+                std::to_string(now.frames.size())};
+    }
+    std::vector<std::string> found;
+    for (std::size_t i = 0; i < before.frames.size(); ++i) {
+        if (const auto text = difference(before.frames[i], now.frames[i], addresses); !text.empty()) {
+            found.push_back(", frame " + std::to_string(i + 1) + ": " + text);
+        }
+    }
+    return found;
+}
 
 bool endsInGoodOrder(const Talk& talk) {
     return std::any_of(talk.engine.begin(), talk.engine.end(),

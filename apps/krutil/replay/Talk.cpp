@@ -5,30 +5,20 @@
 #include <system_error>
 #include <utility>
 
+#include "common/FrameBytes.hpp"
 #include "common/RecordingReader.hpp"
 #include "krutil/base/ExitCode.hpp"
 
 namespace krutil_client {
 namespace {
 
-enum FrameKind : unsigned { tagged = 1, data, goodbye, abort, sharedData, giveBack };
+using apps::FrameHeader;
+using apps::FrameKind;
+using foundation::vantor::carrier::framing::FrameType;
 
-constexpr unsigned lastFrame = 0x80;
-constexpr std::size_t sizeOfShared = 24;
-
-std::uint64_t littleEndianNumber(std::string_view bytes) {
-    std::uint64_t number = 0;
-    for (std::size_t i = bytes.size(); i > 0; --i) {
-        number = number << 8U | static_cast<unsigned char>(bytes[i - 1]);
-    }
-    return number;
-}
-
-void appendLittleEndian(std::string& bytes, std::uint64_t number, std::size_t size) {
-    for (std::size_t i = 0; i < size; ++i) {
-        bytes += static_cast<char>(static_cast<unsigned char>(number >> (8 * i)));
-    }
-}
+// In front of a content that was in shared memory.
+constexpr std::size_t sizeOfSharedPlace = 24;
+constexpr std::size_t sizeOfVerdictHead = 4;
 
 [[noreturn]] void cannotReplay(const std::string& file, std::uint64_t offset, const std::string& reason) {
     throw Failure(ExitCode::Usage, "cannot replay '" + file + "': byte " + std::to_string(offset) + ": " + reason);
@@ -36,11 +26,11 @@ void appendLittleEndian(std::string& bytes, std::uint64_t number, std::size_t si
 
 // Whether all of a frame had come when its stream ended.
 bool isWholeFrame(std::string_view bytes) {
-    if (bytes.size() < SaidHeader::size) {
+    if (bytes.size() < FrameHeader::size) {
         return false;
     }
-    const SaidHeader header = SaidHeader::of(bytes);
-    const std::size_t behind = bytes.size() - SaidHeader::size;
+    const FrameHeader header = apps::headerOf(bytes);
+    const std::size_t behind = bytes.size() - FrameHeader::size;
     return behind >= header.tagSize && behind - header.tagSize >= header.contentSize;
 }
 
@@ -49,6 +39,7 @@ class TalkReader {
   public:
     TalkReader(const std::string& file, const apps::RecordedSession& session) : file_(file) {
         talk_.process = session.process;
+        talk_.wholeFromBeginning = !session.repeated;
     }
 
     void take(const apps::RecordedUnit& unit) {
@@ -56,12 +47,13 @@ class TalkReader {
         switch (unit.kind) {
             case apps::RecordedUnit::Kind::FirstMessage:
                 checkWhole(unit);
-                if (client) {
-                    talk_.hello = unit.bytes;
-                }
-                hello_[client ? 0 : 1] = true;
+                (client ? talk_.clientHello : talk_.engineHello) = unit.bytes;
                 break;
             case apps::RecordedUnit::Kind::Verdict:
+                // One that cannot be read accepts nothing.
+                static_cast<void>(
+                    talk_.verdict.ParseFromString(unit.bytes.substr(std::min(sizeOfVerdictHead, unit.bytes.size()))));
+                break;
             case apps::RecordedUnit::Kind::Token:
             case apps::RecordedUnit::Kind::Answer:
                 break;
@@ -71,7 +63,7 @@ class TalkReader {
     }
 
     Talk finish(std::uint64_t offset) {
-        if (!hello_[0] || !hello_[1]) {
+        if (!shookHands()) {
             cannotReplay(file_, offset,
                          "expected the first messages of both ends in the session of " + talk_.process +
                              ", got none; the session was over before, or the recording begins later");
@@ -80,6 +72,8 @@ class TalkReader {
     }
 
   private:
+    bool shookHands() const { return !talk_.clientHello.empty() && !talk_.engineHello.empty(); }
+
     void checkWhole(const apps::RecordedUnit& unit) const {
         if (!unit.whole()) {
             cannotReplay(file_, unit.offset,
@@ -90,7 +84,7 @@ class TalkReader {
     }
 
     void takeFrame(const apps::RecordedUnit& unit, bool client) {
-        if (!hello_[0] || !hello_[1]) {
+        if (!shookHands()) {
             cannotReplay(file_, unit.offset,
                          "expected the first messages of both ends, got a frame; the recording begins later");
         }
@@ -113,44 +107,37 @@ class TalkReader {
 
     const std::string& file_;
     Talk talk_;
-    std::array<bool, 2> hello_{};
     std::array<Listener, 2> listeners_;
 };
 
 }  // namespace
 
-SaidHeader SaidHeader::of(std::string_view frame) {
-    const auto first = static_cast<unsigned char>(frame[0]);
-    return {first & (lastFrame - 1),
-            (first & lastFrame) != 0,
-            static_cast<unsigned char>(frame[1]),
-            static_cast<std::uint32_t>(littleEndianNumber(frame.substr(4, 4))),
-            static_cast<std::size_t>(littleEndianNumber(frame.substr(2, 2))),
-            littleEndianNumber(frame.substr(16, 8))};
-}
-
 std::optional<Said> Listener::take(std::string_view frame) {
-    const SaidHeader header = SaidHeader::of(frame);
-    const std::string_view behind = frame.substr(SaidHeader::size);
+    const FrameHeader header = apps::headerOf(frame);
+    const std::string_view behind = frame.substr(FrameHeader::size);
     const std::string_view tag = behind.substr(0, header.tagSize);
     const std::string_view content = behind.substr(tag.size());
-    switch (header.kind) {
-        case tagged:
-        case data:
-            frames_.push_back({header.kind == tagged, header.type, std::string(tag), std::string(content)});
+    const auto type = static_cast<unsigned>(header.type);
+    switch (static_cast<FrameKind>(header.kind)) {
+        case FrameKind::Tagged:
+            frames_.push_back({true, type, std::string(tag), std::string(content)});
             break;
-        case sharedData:
+        case FrameKind::Data:
+            frames_.push_back({false, type, {}, std::string(content)});
+            break;
+        case FrameKind::SharedData:
             frames_.push_back(
-                {false, header.type, {}, std::string(content.substr(std::min(sizeOfShared, content.size())))});
+                {false, type, {}, std::string(content.substr(std::min(sizeOfSharedPlace, content.size())))});
             break;
-        case goodbye:
+        case FrameKind::Goodbye:
             return Said{Said::Kind::Goodbye, 0, {}, 0, 0};
-        case abort:
+        case FrameKind::Abort:
             return Said{Said::Kind::Abort, 0, {{false, 0, {}, std::string(content)}}, 0, 0};
-        case giveBack:
+        case FrameKind::Return:
+        case FrameKind::KeepAlive:
             return std::nullopt;
         default:
-            throw Failure(ExitCode::Violation, "frame kind: expected 1 to 6, got " + std::to_string(header.kind));
+            throw Failure(ExitCode::Violation, "frame kind: expected 1 to 7, got " + std::to_string(header.kind));
     }
     if (!header.last) {
         return std::nullopt;
@@ -159,21 +146,21 @@ std::optional<Said> Listener::take(std::string_view frame) {
 }
 
 std::string framesOf(const Said& said) {
-    std::string bytes;
+    const auto bytesOf = [](const FrameHeader& header) {
+        const FrameHeader::Bytes bytes = encode(header);
+        return std::string(bytes.begin(), bytes.end());
+    };
     if (said.kind == Said::Kind::Goodbye) {
-        bytes += static_cast<char>(goodbye);
-        bytes.append(SaidHeader::size - 1, '\0');
-        return bytes;
+        FrameHeader header;
+        header.kind = static_cast<std::uint8_t>(FrameKind::Goodbye);
+        return bytesOf(header);
     }
+    std::string bytes;
     for (std::size_t i = 0; i < said.frames.size(); ++i) {
         const SaidFrame& frame = said.frames[i];
-        const unsigned last = i + 1 == said.frames.size() ? lastFrame : 0U;
-        bytes += static_cast<char>((frame.tagged ? tagged : data) | last);
-        bytes += static_cast<char>(frame.type);
-        appendLittleEndian(bytes, frame.tag.size(), 2);
-        appendLittleEndian(bytes, said.stream, 4);
-        appendLittleEndian(bytes, i + 1, 8);
-        appendLittleEndian(bytes, frame.content.size(), 8);
+        bytes += bytesOf({static_cast<std::uint8_t>(frame.tagged ? FrameKind::Tagged : FrameKind::Data),
+                          i + 1 == said.frames.size(), static_cast<FrameType>(frame.type),
+                          static_cast<std::uint16_t>(frame.tag.size()), said.stream, i + 1, frame.content.size()});
         bytes += frame.tag;
         bytes += frame.content;
     }

@@ -7,6 +7,8 @@
 #include <string_view>
 #include <vector>
 
+#include "msg_svc.protobuf.SessionHandshake.pb.h"
+
 namespace krutil_client {
 
 /// A frame of a message. A content that was in shared memory is data like any other.
@@ -36,27 +38,12 @@ struct Said {
 /// Puts the frames of one direction together.
 class Listener {
   public:
-    /// Takes a whole frame. Returns what is complete with it; frames that only manage shared memory say nothing. Throws
+    /// Takes a whole frame. Returns what is complete with it; returns and signs of life say nothing. Throws
     /// Failure with ExitCode::Violation for what is no frame.
     std::optional<Said> take(std::string_view frame);
 
   private:
     std::vector<SaidFrame> frames_;
-};
-
-/// The first 24 bytes of a frame, as far as replaying needs them.
-struct SaidHeader {
-    static constexpr std::size_t size = 24;
-
-    unsigned kind = 0;
-    bool last = false;
-    unsigned type = 0;
-    std::uint32_t stream = 0;
-    std::size_t tagSize = 0;
-    std::uint64_t contentSize = 0;
-
-    /// Of 24 bytes or more.
-    static SaidHeader of(std::string_view frame);
 };
 
 /// The frames of `said` as bytes, numbered from 1. Data is data, wherever it was.
@@ -69,8 +56,11 @@ struct Talk {
         std::size_t after = 0;  ///< so many of the engine's had been recorded before it
     };
 
-    std::string process;  ///< that has recorded
-    std::string hello;    ///< the client's first message
+    std::string process;                          ///< that has recorded
+    std::string clientHello{};                    ///< the client's first message
+    std::string engineHello{};                    ///< the engine's
+    msg_svc::protobuf::SessionVerdict verdict{};  ///< of either end; both have settled on the same
+    bool wholeFromBeginning = true;               ///< no earlier file has the beginning of the session
     std::vector<Sent> client{};
     std::vector<Said> engine{};
 };

@@ -108,6 +108,8 @@ TEST(CommandLineTest, TheEngine) {
     EXPECT_EQ(connection(tls).key, "key");
     EXPECT_EQ(connection(tls).authorities, "authorities");
     EXPECT_EQ(connection({"eval", "--handshake-timeout", "2.5", "x"}).handshakeTimeout.count(), 2500);
+    EXPECT_EQ(connection({"eval", "x"}).keepAlive.count(), 0);
+    EXPECT_EQ(connection({"eval", "--keep-alive", "30", "x"}).keepAlive.count(), 30'000);
     EXPECT_EQ(connection({"eval", "--limit-frames", "17", "x"}).limits.frames, 17U);
 }
 
@@ -141,12 +143,43 @@ TEST(CommandLineTest, ErrorsSayWhatIsWrongAndWhereHelpIs) {
 TEST(CommandLineTest, WithoutACommandLinesAreRead) {
     EXPECT_FALSE(std::get<ReplOptions>(std::get<Options>(parse({})).command).noHistory);
     EXPECT_FALSE(std::get<ReplOptions>(std::get<Options>(parse({"repl"})).command).noHistory);
-    const Options options = std::get<Options>(parse({"repl", "--no-history", "--color", "never", "--warning-stack"}));
+    const Options options =
+        std::get<Options>(parse({"repl", "--no-history", "--color", "never", "--warning-stack", "--safe-text"}));
     EXPECT_TRUE(std::get<ReplOptions>(options.command).noHistory);
     EXPECT_EQ(options.display.color, Color::Never);
     EXPECT_TRUE(options.display.warningStack);
+    EXPECT_TRUE(options.display.safeText);
     EXPECT_EQ(parseFinished({"repl", "--color", "red"}).err,
               "krutil: --color: red not in {always,auto,never}\nRun krutil --help for help.\n");
+}
+
+TEST(CommandLineTest, InspectTakesAFileAndFilters) {
+    const Options options =
+        std::get<Options>(parse({"inspect", "--type", "IIPReply", "--type", "data", "--from", "engine", "--since",
+                                 "1.5", "--request", "ab", "--hex", "--json", "-"}));
+    const auto& inspect = std::get<InspectOptions>(options.command);
+    EXPECT_EQ(inspect.file, "-");
+    EXPECT_EQ(inspect.types, (std::vector<std::string>{"IIPReply", "data"}));
+    EXPECT_EQ(inspect.from, InspectOptions::Role::Engine);
+    EXPECT_EQ(inspect.since, 1.5);
+    EXPECT_EQ(inspect.request, "ab");
+    EXPECT_TRUE(inspect.hex);
+    EXPECT_FALSE(inspect.lint);
+    EXPECT_TRUE(options.display.json);
+    EXPECT_EQ(parseFinished({"inspect"}).err, "krutil: FILE is required\nRun krutil --help for help.\n");
+    EXPECT_EQ(parseFinished({"inspect", "--lint", "--timeline", "f"}).code, ExitCode::Usage);
+}
+
+TEST(CommandLineTest, ARedactedCopyIsOfTheWholeRecording) {
+    const Options options = std::get<Options>(parse({"inspect", "f", "--redact", "copy"}));
+    EXPECT_EQ(std::get<InspectOptions>(options.command).redacted, "copy");
+    for (const auto& other :
+         std::vector<std::vector<const char*>>{{"--json"}, {"--html", "page"}, {"--type", "data"}}) {
+        std::vector<const char*> words{"inspect", "f", "--redact", "copy"};
+        words.insert(words.end(), other.begin(), other.end());
+        EXPECT_EQ(parseFinished(words).err,
+                  std::string("krutil: ") + other.front() + " excludes --redact\nRun krutil --help for help.\n");
+    }
 }
 
 TEST(CommandLineTest, OptionsWithoutACommandAreThoseOfRepl) {
@@ -181,7 +214,9 @@ TEST(CommandLineTest, HelpGoesToStandardOutput) {
     EXPECT_EQ(finished.err, "");
     EXPECT_THAT(finished.out, HasSubstr("Usage: krutil [OPTIONS] [SUBCOMMAND]\n"));
     EXPECT_THAT(finished.out, HasSubstr("  eval                          Evaluate code and show what it prints\n"));
-    EXPECT_THAT(finished.out, HasSubstr("  3  no engine could be started or reached, or its stream was lost\n"));
+    EXPECT_THAT(finished.out,
+                HasSubstr("  3  no engine could be started or reached, its stream was lost, or its diary, "
+                          "log or recording is\n     not complete\n"));
 }
 
 TEST(CommandLineTest, HelpOfACommandFitsInOneHundredColumns) {
