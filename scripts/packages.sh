@@ -25,6 +25,7 @@ test_packages=(
     clang                                               # users of the installed tree have it or g++
     abigail-tools                                       # whether the libraries' ABI has changed
     python3-jsonschema                                  # what --json prints
+    libsixel-bin                                        # pictures as sixels
 )
 # What draws the pictures of benchmarks.
 bench_packages=(python3-matplotlib)

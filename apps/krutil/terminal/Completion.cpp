@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <cwchar>
 
+#include "krutil/base/Text.hpp"
+
 namespace krutil_client {
 namespace {
 
@@ -11,7 +13,8 @@ constexpr std::size_t gap = 2;
 
 std::wstring shownName(std::wstring name) {
     std::replace_if(
-        name.begin(), name.end(), [](wchar_t c) { return ::wcwidth(c) < 0; }, L'?');
+        name.begin(), name.end(),
+        [](wchar_t c) { return ::wcwidth(c) < 0 || steersTerminal(static_cast<char32_t>(c)); }, L'?');
     return name;
 }
 

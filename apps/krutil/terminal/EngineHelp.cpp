@@ -84,13 +84,14 @@ std::optional<std::string> EngineHelp::inspect(const std::string& name) {
     const auto cursor = static_cast<std::int64_t>(toWide(name).size());
     const auto answer = callQuietly(client_, {"qvm.inspect", 1, {textArray(name), ArrayFactory().createScalar(cursor)}},
                                     patienceForStart);
-    return answer.end == QuietAnswer::End::Returned ? textOf(answer.outputs[0]) : std::nullopt;
+    const auto told = answer.end == QuietAnswer::End::Returned ? textOf(answer.outputs[0]) : std::nullopt;
+    return told ? std::optional(safeText(*told)) : std::nullopt;
 }
 
 std::string EngineHelp::pythonVersion() {
     const auto answer = callQuietly(client_, {"sys.version.__str__", 1, {}}, patienceForStart);
     const auto version = answer.end == QuietAnswer::End::Returned ? textOf(answer.outputs[0]) : std::nullopt;
-    return version ? version->substr(0, version->find(' ')) : std::string();
+    return version ? safeText(version->substr(0, version->find(' '))) : std::string();
 }
 
 void EngineHelp::shorten(int limit) {

@@ -82,11 +82,12 @@ bool PictureViewer::draw(const PictureForm& form) {
             typed_(asked->typed);
         }
     }
-    if (protocol_.value_or(ImageProtocol::None) == ImageProtocol::None) {
-        return false;
+    const auto drawn =
+        drawing(protocol_.value_or(ImageProtocol::None), form.content, sizeOfPng(form.content).width, out_);
+    if (drawn) {
+        out_.write(*drawn);
     }
-    out_.write(drawing(*protocol_, form.content, sizeOfPng(form.content).width, out_));
-    return true;
+    return drawn.has_value();
 }
 
 }  // namespace krutil_client

@@ -10,6 +10,8 @@
 #include <cerrno>
 #include <string_view>
 
+#include "krutil/terminal/SixelPicture.hpp"
+
 namespace krutil_client {
 namespace {
 
@@ -66,6 +68,11 @@ std::optional<std::string> takePart(std::string& text, std::string_view begin, s
     return part;
 }
 
+// Whether the terminal's attributes, "ESC [ ? 62 ; 4 c" for example, say so. The first number is the kind of terminal.
+bool drawsSixels(std::string_view attributes) {
+    return attributes.find(";4;") != std::string_view::npos || attributes.ends_with(";4c");
+}
+
 // Reads until the terminal has given its last answer, or until the deadline.
 AskedTerminal readAnswers(Clock::time_point deadline) {
     constexpr std::size_t longest = 65'536;
@@ -84,11 +91,12 @@ AskedTerminal readAnswers(Clock::time_point deadline) {
             return asked;
         }
         text.append(piece.data(), static_cast<std::size_t>(got));
-        if (takePart(text, "\x1b[?", "c", "c")) {
+        if (const auto device = takePart(text, "\x1b[?", "c", "c")) {
             const auto kitty = takePart(text, "\x1b_Gi=31;", "\x1b\\", "\x1b\\");
             const auto cell = takePart(text, "\x1b]1337;ReportCellSize=", "\x1b\\", "\a");
             asked.protocol = kitty && kitty->find(";OK") != std::string::npos ? ImageProtocol::Kitty
                              : cell                                           ? ImageProtocol::ITerm2
+                             : drawsSixels(*device)                           ? ImageProtocol::Sixel
                                                                               : ImageProtocol::None;
             return asked;
         }
@@ -141,14 +149,24 @@ std::optional<AskedTerminal> askTerminal(Output& out, std::chrono::milliseconds 
     return readAnswers(Clock::now() + patience);
 }
 
-std::string drawing(ImageProtocol protocol, const std::string& png, std::size_t width, const Output& out) {
+std::optional<std::string> drawing(ImageProtocol protocol, const std::string& png, std::size_t width,
+                                   const Output& out) {
     const TerminalSize size = out.terminalSize();
     const bool tooWide = size.pixelWidth != 0 && width > size.pixelWidth;
-    if (protocol == ImageProtocol::Kitty) {
-        return kittyDrawing(base64(png), tooWide ? ",c=" + std::to_string(size.columns) : "");
+    switch (protocol) {
+        case ImageProtocol::Kitty:
+            return kittyDrawing(base64(png), tooWide ? ",c=" + std::to_string(size.columns) : "");
+        case ImageProtocol::ITerm2:
+            return "\x1b]1337;File=inline=1;size=" + std::to_string(png.size()) + (tooWide ? ";width=100%" : "") + ":" +
+                   base64(png) + "\a\n";
+        case ImageProtocol::Sixel: {
+            auto sixels = sixelOf(png, tooWide ? std::optional(size.pixelWidth) : std::nullopt);
+            return sixels ? std::optional(*sixels + "\n") : std::nullopt;
+        }
+        case ImageProtocol::None:
+            break;
     }
-    return "\x1b]1337;File=inline=1;size=" + std::to_string(png.size()) + (tooWide ? ";width=100%" : "") + ":" +
-           base64(png) + "\a\n";
+    return std::nullopt;
 }
 
 }  // namespace krutil_client

@@ -15,6 +15,7 @@ enum class ImageProtocol {
     None,
     Kitty,   ///< kitty's graphics protocol
     ITerm2,  ///< iTerm2's inline images
+    Sixel,   ///< DEC's sixels
 };
 
 /// What came of asking a terminal.
@@ -29,7 +30,9 @@ struct AskedTerminal {
 std::optional<AskedTerminal> askTerminal(Output& out, std::chrono::milliseconds patience);
 
 /// What to write to `out` for a PNG picture to be drawn where the cursor is. It ends at the beginning of a line. One of
-/// more pixels than the terminal has in a row, where that is known, is made to fit. Not for ImageProtocol::None.
-std::string drawing(ImageProtocol protocol, const std::string& png, std::size_t width, const Output& out);
+/// more pixels than the terminal has in a row, where that is known, is made to fit. Empty when the terminal cannot draw
+/// it, or nothing can make the sixels that it needs.
+std::optional<std::string> drawing(ImageProtocol protocol, const std::string& png, std::size_t width,
+                                   const Output& out);
 
 }  // namespace krutil_client

@@ -150,6 +150,10 @@ class Screen {
 
     std::size_t showSequence() {
         // Strings, such as pictures, up to their end.
+        if (pending_.size() > 1 && pending_[1] == 'P') {
+            const std::size_t stringEnd = pending_.find("\x1b\\", 2);
+            return stringEnd == std::string::npos ? 0 : stringEnd + 2;
+        }
         if (pending_.size() > 1 && (pending_[1] == '_' || pending_[1] == ']')) {
             const std::size_t stringEnd = pending_.find('\\');
             const std::size_t bell = pending_[1] == ']' ? pending_.find('\a') : std::string::npos;

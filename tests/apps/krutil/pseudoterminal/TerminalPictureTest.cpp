@@ -7,6 +7,7 @@
 #include <fstream>
 #include <iterator>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "apps/krutil/pseudoterminal/TerminalFixture.hpp"
@@ -46,11 +47,24 @@ def stop():
         evaluate("import sys; sys.path.insert(0, '" + directory.string() + "'); from picture import Picture, stop");
     }
 
-    void begin(const std::vector<std::string>& arguments = {"repl"}) {
+    void begin(const std::vector<std::string>& arguments = {"repl"},
+               const std::vector<std::pair<std::string, std::string>>& more = {}) {
         auto variables = environment();
+        variables.insert(variables.end(), more.begin(), more.end());
         variables.emplace_back("TMPDIR", pictures.string());
         terminal = std::make_unique<Terminal>(command(arguments), variables);
         expectPrompt();
+    }
+
+    // With a program of the test in the place of img2sixel.
+    void beginWithSixels(const std::string& script) {
+        leave();
+        const std::filesystem::path programs = directory / "programs";
+        std::filesystem::create_directory(programs);
+        std::ofstream(programs / "img2sixel") << "#!/bin/sh\n" << script << "\n";
+        std::filesystem::permissions(programs / "img2sixel", std::filesystem::perms::owner_all);
+        begin({"repl"}, {{"PATH", programs.string() + ":" + std::getenv("PATH")}});
+        evaluate("import sys; sys.path.insert(0, '" + directory.string() + "'); from picture import Picture, stop");
     }
 
     // Evaluates it, and waits for the terminal to be asked.
@@ -114,6 +128,31 @@ TEST_F(TerminalPictureTest, ITermsProtocolDrawsWhereTheTerminalKnowsIt) {
     terminal->expect("\x1b]1337;File=inline=1;size=24;width=100%:" + encoded + "\a\r\n");
     expectPrompt();
     leave();
+}
+
+TEST_F(TerminalPictureTest, SixelsAreDrawnWhereTheTerminalKnowsThem) {
+    beginWithSixels("printf '\\033Pq%s\\033\\\\' \"$*\"");
+    showFirst();
+    terminal->type("\x1b[?62;4;22c");
+    terminal->expect("\x1bPq\x1b\\\r\n");
+    expectPrompt();
+    terminal->resize(Terminal::columns, Terminal::rows, 2);
+    enter("Picture()");
+    terminal->expect("\x1bPq-w 2\x1b\\\r\n");
+    expectPrompt();
+    leave();
+    EXPECT_TRUE(std::filesystem::is_empty(pictures));
+}
+
+TEST_F(TerminalPictureTest, SixelsThatCannotBeMadeAreAFileInstead) {
+    beginWithSixels("printf '\\033Pq~\\033[2J\\033\\\\'");
+    showFirst();
+    terminal->type("\x1b[?62;22;4c");
+    terminal->expect("krutil: picture 1 is in ");
+    expectPrompt();
+    leave();
+    expectFile();
+    EXPECT_EQ(terminal->sent().find("\x1bPq"), std::string::npos);
 }
 
 TEST_F(TerminalPictureTest, TerminalThatDrawsNothingHasAFileInstead) {
