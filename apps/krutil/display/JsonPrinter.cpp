@@ -13,6 +13,7 @@
 #include "korvel/lang/diagnostic/IssuedEnabledWarningEvent.hpp"
 #include "korvel/lang/diagnostic/IssuedWarningEvent.hpp"
 #include "krutil/arrays/ArrayText.hpp"
+#include "krutil/base/JsonLine.hpp"
 #include "krutil/base/Text.hpp"
 #include "krutil/capabilities_api/CapabilitiesChanged.hpp"
 #include "krutil/eventmgr/QVMShutdownEvent.hpp"
@@ -221,7 +222,7 @@ ordered_json textObject(const char* name, const EventT& event) {
 }  // namespace
 
 void JsonPrinter::print(const ordered_json& object) {
-    out_.write(object.dump(-1, ' ', false, ordered_json::error_handler_t::replace) + '\n');
+    out_.write(jsonLine(object));
 }
 
 void JsonPrinter::subscribe(foundation::msg_svc::eventmgr::EventMgr& events) {

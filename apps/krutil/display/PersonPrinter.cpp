@@ -5,6 +5,7 @@
 
 #include "korvel/lang/diagnostic/IssuedEnabledWarningEvent.hpp"
 #include "krutil/arrays/ArrayText.hpp"
+#include "krutil/base/Text.hpp"
 #include "krutil/display/ErrorText.hpp"
 #include "krutil/display/WarningText.hpp"
 #include "krutil/io/PrintableErrorEvent.hpp"
@@ -45,17 +46,22 @@ void PersonPrinter::subscribe(foundation::msg_svc::eventmgr::EventMgr& events) {
     });
 }
 
+// Of the engine's text.
+std::string PersonPrinter::shown(const std::string& text) const {
+    return style_.safeText ? safeText(text) : text;
+}
+
 void PersonPrinter::show(const krutil::io::TextBase& text) {
     const std::string utf8 = msg_svc::protobuf::ustring_to_utf8(text.getText());
     if (text.getStreamType() == krutil::io::StreamTypeEnum::ERROR_STREAM) {
         complain(red, utf8);
     } else {
-        out_.write(utf8);
+        out_.write(shown(utf8));
     }
 }
 
 void PersonPrinter::complain(const char* color, const std::string& text) {
-    err_.write(style_.color ? color + text + plain : text);
+    err_.write(style_.color ? color + shown(text) + plain : shown(text));
 }
 
 void PersonPrinter::connected(const foundation::msg_svc::transport::layers::session::Peer&,
@@ -65,7 +71,7 @@ void PersonPrinter::returned(const Returned& output) {
     const std::string name =
         output.count == 1 ? std::string()
                           : "output " + std::to_string(output.number) + " of " + std::to_string(output.count) + ": ";
-    out_.write(name + (output.file.empty() ? arrayText(output.array)
+    out_.write(name + (output.file.empty() ? shown(arrayText(output.array))
                                            : arrayHeading(output.array) + " -> " + output.file + "\n"));
 }
 

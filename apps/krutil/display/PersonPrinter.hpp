@@ -11,12 +11,13 @@ namespace krutil_client {
 struct PersonStyle {
     bool warningStack = false;  ///< where each warning was issued
     bool color = false;         ///< text on standard error is told apart by colour
+    bool safeText = false;      ///< what came from the engine is shown as safeText() has it
 };
 
-/// Text goes to standard output or standard error as it arrives, byte for byte as UTF-8; errors, warnings that are
-/// shown and timing go to standard error. An error is shown as the engine wants it printed, or else as errorText() has
-/// it. Outputs of a function go to standard output, as arrayText() has them or as the file that they are in. Files of
-/// pictures are named on standard error.
+/// Text goes to standard output or standard error as it arrives, byte for byte as UTF-8 unless the style wants safe
+/// text; errors, warnings that are shown and timing go to standard error. An error is shown as the engine wants it
+/// printed, or else as errorText() has it. Outputs of a function go to standard output, as arrayText() has them or as
+/// the file that they are in. Files of pictures are named on standard error.
 class PersonPrinter : public Printer {
   public:
     /// Both must outlive the object.
@@ -32,6 +33,7 @@ class PersonPrinter : public Printer {
     void timed(const Timing& timing) override;
 
   private:
+    std::string shown(const std::string& text) const;
     void show(const krutil::io::TextBase& text);
     void complain(const char* color, const std::string& text);
 

@@ -26,13 +26,21 @@ Canceller::~Canceller() {
 
 void Canceller::run(const std::function<bool()>& done) {
     while (!done()) {
-        if (!impatientAt_) {
-            conversation_.run([&] { return impatientAt_ || done(); });
-        } else if (!conversation_.runUntil(*impatientAt_, done)) {
+        const auto deadline = impatientAt_;
+        const auto changed = [&] { return impatientAt_ != deadline || done(); };
+        if (!deadline) {
+            conversation_.run(changed);
+        } else if (!conversation_.runUntil(*deadline, changed)) {
+            // An answer on a slow stream comes behind what was said before it.
+            if (unanswered_ > 0 && heard_ != conversation_.delivered()) {
+                heard_ = conversation_.delivered();
+                impatientAt_ = Conversation::Clock::now() + patience;
+                continue;
+            }
             impatientAt_.reset();
-            say_(
-                "the engine has not stopped yet; code that is not Python's may hold it up. Press Ctrl-C twice to end "
-                "the engine");
+            say_(unanswered_ > 0 ? "the engine does not answer. Press Ctrl-C twice within two seconds to end the engine"
+                                 : "the engine has not stopped yet; code that is not Python's may hold it up. Press "
+                                   "Ctrl-C twice to end the engine");
         }
     }
 }
@@ -47,6 +55,7 @@ void Canceller::interrupted() {
                                                  : "cancelled; the connection was closed, which ends the session");
     }
     asked_ = now;
+    stopping_ = false;
     // The last one first: those that wait must not begin when the one that runs ends.
     const auto requests = requests_();
     for (auto request = requests.rbegin(); request != requests.rend(); ++request) {
@@ -57,12 +66,20 @@ void Canceller::interrupted() {
                                    answered(cancel->getStatus());
                                }
                            });
+        ++unanswered_;
+        heard_ = conversation_.delivered();
+        impatientAt_ = now + patience;
     }
 }
 
 void Canceller::answered(IIPCancelReply::CancelStatus status) {
+    if (--unanswered_ == 0 && !stopping_) {
+        // There is nothing left to wait for.
+        impatientAt_.reset();
+    }
     switch (status) {
         case IIPCancelReply::PENDING_CANCEL:
+            stopping_ = true;
             impatientAt_ = Conversation::Clock::now() + patience;
             break;
         case IIPCancelReply::UNABLE_TO_CANCEL_ALREADY_RUNNING:

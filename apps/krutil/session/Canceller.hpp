@@ -2,6 +2,8 @@
 #pragma once
 
 #include <chrono>
+#include <cstddef>
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -27,7 +29,8 @@ class Canceller {
     /// How long after the first Ctrl-C another one is the second.
     static constexpr std::chrono::milliseconds again{2'000};
 
-    /// How long an engine that was told to stop may take before the person is told that it has not.
+    /// How long an engine that was told to stop may take, to answer and then to stop, before the person is told that it
+    /// has not.
     static constexpr std::chrono::milliseconds patience{1'500};
 
     /// The requests that a Ctrl-C is about, in the order in which they were sent; asked when it comes.
@@ -40,7 +43,8 @@ class Canceller {
     Canceller& operator=(const Canceller&) = delete;
 
     /// Delivers until `done` returns true, as Conversation::run() does, and tells the person when an engine that was
-    /// told to stop takes its time. Throws what run() throws, and Failure when the second Ctrl-C has ended the engine.
+    /// told to stop takes its time, or says nothing at all: that, and how to end it. Throws what run() throws, and
+    /// Failure when the second Ctrl-C has ended the engine.
     void run(const std::function<bool()>& done);
 
   private:
@@ -55,6 +59,9 @@ class Canceller {
     std::function<void()> actionBefore_;
     std::optional<Conversation::Clock::time_point> asked_;
     std::optional<Conversation::Clock::time_point> impatientAt_;
+    std::size_t unanswered_ = 0;  ///< cancels
+    std::uint64_t heard_ = 0;     ///< of the conversation, when the time began
+    bool stopping_ = false;       ///< the engine has said so since the last Ctrl-C
     // Replies to cancels may come when the object has gone.
     std::shared_ptr<bool> alive_ = std::make_shared<bool>(true);
 };

@@ -33,6 +33,9 @@ constexpr auto patienceForGoodbye = 5s;
 // How long a stream may stay open after the child that was to serve it has ended, because another process holds it.
 constexpr auto patienceForStream = 1s;
 
+// How an engine exits whose session has gone well, but not the writing of its files.
+constexpr int incompleteFiles = 3;
+
 bool isTls(const ConnectionOptions& options) {
     return options.socket && options.socket->starts_with("tls://");
 }
@@ -141,6 +144,9 @@ std::unique_ptr<Conversation> Client::openConversation(const ConnectionOptions& 
     config.handshakeTimeout = connection.handshakeTimeout;
     config.sharedMemory = !connection.noSharedMemory && !isTls(connection);
     config.check = apps::precheck(!connection.noPrecheck);
+    if (connection.engine || isTls(connection)) {
+        config.keepAlive = connection.keepAlive;
+    }
     if (tracer_) {
         config.trace = std::ref(*tracer_);
     }
@@ -372,6 +378,10 @@ std::string Client::finish(Leave leave) {
     if (!end) {
         engine_.kill();
         return "the engine did not end after it answered, and was killed";
+    }
+    if (!lost && !end->signalled && end->number == incompleteFiles) {
+        engineFilesComplete_ = false;
+        return "the engine " + end->text() + " after it answered: a diary, log or recording of it is not complete";
     }
     return lost || end->signalled ? "the engine " + end->text() + " after it answered" : std::string();
 }

@@ -131,6 +131,9 @@ class Client {
     /// throws.
     std::string finish(Leave leave = Leave::WhenAnswered);
 
+    /// Whether the diary, log and recording of a child have all that belongs into them; known after finish().
+    bool engineFilesComplete() const noexcept { return engineFilesComplete_; }
+
   private:
     std::unique_ptr<Conversation> openConversation(const ConnectionOptions& connection, bool interactive,
                                                    apps::Recording* recording);
@@ -151,6 +154,7 @@ class Client {
     std::optional<Conversation::Clock::time_point> firstText_;
     RequestList requests_{events_};
     std::function<void()> showPictures_;
+    bool engineFilesComplete_ = true;
     bool picturesAnnounced_ = false;
     capabilities::CapabilityList capabilities_;
     capabilities::CapabilityList engineCapabilities_;

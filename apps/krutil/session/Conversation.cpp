@@ -147,6 +147,7 @@ bool Conversation::deliverOne() {
     // Taken out first: what is called may itself wait and deliver.
     Arrived next = std::move(taken_.front());
     taken_.pop_front();
+    ++delivered_;
     if (!isQuiet(next)) {
         stopPastime();
     }

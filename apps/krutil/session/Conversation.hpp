@@ -5,6 +5,7 @@
 #include <chrono>
 #include <condition_variable>
 #include <cstddef>
+#include <cstdint>
 #include <deque>
 #include <exception>
 #include <functional>
@@ -84,6 +85,9 @@ class Conversation : private foundation::msg_svc::transport::layers::session::Se
     /// when `done` was.
     bool runUntilReadable(int descriptor, const std::function<bool()>& done);
 
+    /// How much of what the engine has said was delivered: messages, replies and events.
+    std::uint64_t delivered() const noexcept { return delivered_; }
+
     /// Calls `action` once, in a run function, when `descriptor` becomes readable or hangs up. One at a time; -1 for
     /// none.
     void watch(int descriptor, std::function<void()> action);
@@ -142,6 +146,7 @@ class Conversation : private foundation::msg_svc::transport::layers::session::Se
     std::unordered_map<StreamID, ReplyAction> actions_;
     std::unordered_set<StreamID> quiet_;  ///< of those in actions_
     std::deque<Arrived> taken_;           ///< arrived and not yet delivered
+    std::uint64_t delivered_ = 0;
     std::optional<SessionEnd> end_;
     int watched_ = -1;
     std::function<void()> watchAction_;

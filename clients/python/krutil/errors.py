@@ -4,6 +4,7 @@
 """
 
 import ast
+import re
 import sys
 import types
 from typing import Any, NamedTuple, Optional
@@ -11,8 +12,20 @@ from typing import Any, NamedTuple, Optional
 from .schema import ExecutionStatus
 
 
+# Control characters but newline and tab, separators of lines and paragraphs, controls of direction.
+_STEERS_TERMINAL = re.compile("[\x00-\x08\x0b-\x1f\x7f-\x9f\u061c\u200e\u200f\u2028-\u202e\u2066-\u2069]")
+
+
+def safe_text(text: str) -> str:
+    """The text with whatever would steer a terminal, or change how a line reads, as an escape."""
+    return _STEERS_TERMINAL.sub(lambda found: found.group().encode("unicode_escape").decode("ascii"), text)
+
+
 class Error(Exception):
-    """The base of all exceptions of this package."""
+    """The base of all exceptions of this package. What the engine says cannot steer a terminal on which it is printed."""
+
+    def __str__(self) -> str:
+        return safe_text(super().__str__())
 
 
 class Cancelled(Error):
@@ -127,7 +140,8 @@ def _traceback(frames: tuple[RemoteFrame, ...]) -> Optional[types.TracebackType]
     traceback = None
     for file, function, line in reversed(frames):
         names: dict[str, Any] = {"sys": sys}
-        exec(_FRAME_MAKER.replace(co_filename=file, co_name=function, co_firstlineno=line), names)
+        place = _FRAME_MAKER.replace(co_filename=safe_text(file), co_name=safe_text(function), co_firstlineno=line)
+        exec(place, names)
         frame = names.pop("frame")
         traceback = types.TracebackType(traceback, frame, frame.f_lasti, line)
     return traceback

@@ -6,6 +6,7 @@ The directory of krutil-qvm is the first in PATH.
 import contextlib
 import io
 import os
+import pickle
 import queue
 import signal
 import subprocess
@@ -168,6 +169,22 @@ class Behaviour:
             self.assertTrue(printed.endswith(f'  File "{file}", line 6, in <module>\n'
                                              "krutil.RemoteError: ValueError: no\n"), printed)
             self.assertEqual(session.eval("'goes on'", timeout=PATIENCE).value, "'goes on'")
+
+    def test_an_error_cannot_steer_the_terminal_that_it_is_printed_on(self):
+        message = "a\x1b[2J\t\x9b\u061c\u200e\u202e\u2066\u2028\n\u05d0"
+        source = f"raise ValueError({message!r})"
+        code = f"exec(compile({source!r}, 'file\u202e.py', 'exec'))"
+        with self.begin() as session:
+            with self.assertRaises(krutil.RemoteError) as caught:
+                session.eval(code, timeout=PATIENCE)
+            self.assertEqual(caught.exception.message, message)
+            shown = "ValueError: a\\x1b[2J\t\\x9b\\u061c\\u200e\\u202e\\u2066\\u2028\n\u05d0"
+            self.assertEqual(str(caught.exception), shown)
+            # assertRaises takes the traceback away; a copy has it again.
+            copy = pickle.loads(pickle.dumps(caught.exception))
+            printed = "".join(traceback.format_exception(copy))
+            self.assertTrue(printed.endswith('  File "file\\u202e.py", line 1, in <module>\n'
+                                             f"krutil.RemoteError: {shown}\n"), printed)
 
     def test_an_error_in_a_file_that_is_here_too(self):
         with tempfile.NamedTemporaryFile("w", suffix=".py") as file:
@@ -582,6 +599,24 @@ class StartTest(unittest.TestCase):
                 with self.assertRaisesRegex(ValueError, text):
                     refused()
             self.assertEqual(session.eval("1", timeout=PATIENCE).value, "1")
+
+    def test_a_recording_is_an_engine(self):
+        numbers = numpy.arange(1000.0)
+        with tempfile.TemporaryDirectory() as directory:
+            file = os.path.join(directory, "session.pcapng")
+            sums, reports = [], []
+            for command in (f"krutil-qvm --stdio --record {file}", f"krutil replay {file} --serve"):
+                # The engine's standard error is this process's own, so that of a shell around it goes to a file.
+                report = os.path.join(directory, "report")
+                with krutil.start(["sh", "-c", f"{command} 2> {report}"], timeout=PATIENCE) as session:
+                    self.assertEqual(session.eval("6 * 7", timeout=PATIENCE).value, "42")
+                    with self.assertRaises(krutil.RemoteError):
+                        session.eval("1 / 0", timeout=PATIENCE)
+                    sums.append(session.call("numpy.add", numbers, numbers, timeout=PATIENCE))
+                with open(report, encoding="utf-8") as lines:
+                    reports.append(lines.read())
+        numpy.testing.assert_array_equal(sums[1], 2 * numbers)
+        self.assertEqual(reports[1], "4 of 4 messages of the client as in the recording\n")
 
     def test_a_full_queue(self):
         with krutil.start("krutil-qvm --stdio --max-queued 1", timeout=PATIENCE) as session:

@@ -75,20 +75,36 @@ TEST_F(ListenerLifecycleTest, AHangUpThatIsIgnoredStaysSo) {
 }
 
 TEST_F(ListenerLifecycleTest, AListenerWithoutPythonSaysSoAndServesNobody) {
-#if defined(KRUTIL_SANITIZED)
-    GTEST_SKIP() << "sanitizers need descriptors";
-#endif
-    // Four descriptors: the last of them is the socket's.
-    const std::string limit =
-        "import os, resource, sys\n"
-        "os.closerange(3, 1000)\n"
-        "resource.setrlimit(resource.RLIMIT_NOFILE, (4, 4))\n"
-        "os.execv(sys.argv[1], sys.argv[1:])";
-    const Ran ran = run({"/usr/bin/python3", "-c", limit, enginePath(), "--listen", socket()});
-    const std::string said = "krutil-qvm: Python cannot be started: error evaluating path\n";
+    const Ran ran = run({"/usr/bin/env", "PYTHONHOME=/nonexistent", enginePath(), "--listen", socket()});
+    const std::string said =
+        "krutil-qvm: Python cannot be started: failed to get the Python codec of the filesystem encoding\n";
     EXPECT_EQ(ran.err.substr(ran.err.size() - std::min(ran.err.size(), said.size())), said) << ran.err;
     EXPECT_EQ(ran.exitCode, 3);
     EXPECT_FALSE(std::filesystem::exists(socket()));
+}
+
+TEST_F(ListenerLifecycleTest, AnEngineWithTooFewDescriptorsNamesTheLimit) {
+    for (const std::string& limit : {std::string("20"), std::string("127")}) {
+        for (const std::vector<std::string>& how : {std::vector<std::string>{"--listen", socket()}, {"--stdio"}}) {
+            std::vector<std::string> arguments{"/usr/bin/prlimit", "--nofile=" + limit, enginePath()};
+            arguments.insert(arguments.end(), how.begin(), how.end());
+            const Ran ran = run(arguments);
+            EXPECT_EQ(ran.err, "krutil-qvm: This process may have " + limit +
+                                   " descriptors at a time (RLIMIT_NOFILE), and an engine needs 128. Raise the limit, "
+                                   "for example with \"ulimit -n 1024\".\n");
+            EXPECT_EQ(ran.exitCode, 3);
+            EXPECT_FALSE(std::filesystem::exists(socket()));
+        }
+    }
+}
+
+TEST_F(ListenerLifecycleTest, AnEngineHasEnoughWithTheDescriptorsThatItNeeds) {
+#if defined(KRUTIL_SANITIZED)
+    GTEST_SKIP() << "sanitizers need descriptors";
+#endif
+    listen({"/usr/bin/prlimit", "--nofile=128"});
+    const Ran ran = runClient(connecting({"eval", "import numpy; numpy.arange(3).sum()"}));
+    EXPECT_EQ(ran.out + ran.err, "3\n");
 }
 
 TEST_F(ListenerLifecycleTest, SessionsOutliveAListenerThatIsKilled) {
@@ -119,11 +135,12 @@ TEST_F(ListenerLifecycleTest, AListenerThatIsStoppedKeepsNobodyWaitingForEver) {
     stage().answer(*this);
     finish();
     resume(listener().pid());
-    // The client that gave up is found when it is accepted.
-    EXPECT_TRUE(listener().waitForErr("verdict had arrived\n"));
-    expectEngineGone(
-        "krutil-qvm: the peer closed the stream during the handshake: 0 of 4 bytes of the peer's verdict had "
-        "arrived\n");
+    // The client that gave up is found when it is accepted, and has said why.
+    const std::string said =
+        "the session is refused by the client: the handshake timed out after 100 milliseconds: 0 of 16 bytes of the "
+        "peer's first message had arrived\n";
+    EXPECT_TRUE(listener().waitForErr(said));
+    expectEngineGone("krutil-qvm: " + said);
 }
 
 TEST_F(ListenerLifecycleTest, BadEndsLeaveNothing) {

@@ -190,6 +190,16 @@ TEST(EvalTest, WithoutSharedMemoryASessionHasNoSuchFeature) {
     EXPECT_EQ(events.at(0).at("features"), json({{"ZEROCOPY", "enable"}}));
 }
 
+TEST(EvalTest, SignsOfLifeAreForEnginesThatMayBeElsewhere) {
+    const auto elsewhere = objects(runClient({"eval", "--json", "--keep-alive", "0.001", "--no-shared-memory",
+                                              "--engine", quotedForShell(enginePath()) + " --stdio", "1"})
+                                       .out);
+    EXPECT_EQ(elsewhere.at(0).at("features"), json({{"KEEPALIVE", "frames"}, {"ZEROCOPY", "enable"}}));
+    EXPECT_EQ(elsewhere.back(), json({{"event", "shutdown"}}));
+    const auto here = objects(runClient({"eval", "--json", "--keep-alive", "0.001", "--no-shared-memory", "1"}).out);
+    EXPECT_EQ(here.at(0).at("features"), json({{"ZEROCOPY", "enable"}}));
+}
+
 TEST(EvalTest, OutputArrivesBeforeTheCodeHasEnded) {
     const test_support::TemporaryDirectory directory;
     ASSERT_EQ(::mkfifo(directory.file("go").c_str(), 0600), 0);
@@ -271,6 +281,21 @@ TEST(EvalTest, ATraceThatFindsNoRoomEndsAndTheSessionGoesOn) {
     EXPECT_EQ(ran.out, "on\n");
     EXPECT_EQ(ran.err, "krutil: cannot write to '/dev/full': No space left on device; the trace ends here\n");
     EXPECT_EQ(ran.exitCode, 0);
+}
+
+TEST(EvalTest, ADiaryThatFindsNoRoomIsInTheExitCode) {
+    const std::string engine = quotedForShell(enginePath()) + " --stdio --diary /dev/full";
+    const Ran ran = runClient({"eval", "--diary", "--engine", engine, "print('on')"});
+    EXPECT_EQ(ran.out, "on\n");
+    EXPECT_EQ(ran.err,
+              "krutil-qvm: cannot write to '/dev/full': No space left on device; text for it is lost until there is "
+              "room\n"
+              "krutil-qvm: '/dev/full' is not complete: 3 bytes are lost\n"
+              "krutil: the engine exited with code 3 after it answered: a diary, log or recording of it is not "
+              "complete\n");
+    EXPECT_EQ(ran.exitCode, 3);
+    const Ran failed = runClient({"eval", "--diary", "--engine", engine, "print('on')\n1 / 0"});
+    EXPECT_EQ(failed.exitCode, 1);
 }
 
 TEST(EvalTest, ATraceIsCompleteUpToWhatEndedTheEngine) {

@@ -7,6 +7,7 @@
 
 #include "apps/krutil/CaughtOutput.hpp"
 #include "cmddistributor/IIPStateEvent.hpp"
+#include "foundation/korveldata/ArrayFactory.hpp"
 #include "krutil/capabilities_api/CapabilitiesChanged.hpp"
 #include "krutil/display/JsonPrinter.hpp"
 #include "krutil/display/PersonPrinter.hpp"
@@ -81,6 +82,27 @@ TEST_F(PersonPrinterTest, TimingTellsWhatIsKnown) {
     EXPECT_EQ(errPipe.content(), "krutil: engine ready after 12.35 ms, answered after 2.00 ms\n");
 }
 
+class SafePersonPrinterTest : public PrinterFixture {
+  protected:
+    SafePersonPrinterTest() { printer.subscribe(events); }
+    PersonPrinter printer{out, err, {.color = true, .safeText = true}};
+};
+
+TEST_F(SafePersonPrinterTest, ShowsWhatSteersATerminalAsEscapes) {
+    publish<TextBaseEvent>(request, StreamTypeEnum::OUTPUT_STREAM, u"out\x1b[2J\r\t\u202e\n");
+    publish<SinkTextEvent>(request, StreamTypeEnum::OUTPUT_STREAM, u"'value\u2066'\n");
+    publish<TextBaseEvent>(request, StreamTypeEnum::ERROR_STREAM, u"err\x1b]0;title\a\n");
+    const cmddistributor::RuntimeException raised{
+        krutil::cmddistributor::inRUNTIME_ERROR, u"bad \x1b[31m", "Error", "", {{u"a\u202e.py", "f", 1}}, {}, false};
+    printer.replied({request, &raised});
+    const auto array = foundation::korveldata::ArrayFactory().createText(u"text\x1b[2J");
+    printer.returned({request, 1, 1, array, ""});
+    EXPECT_EQ(outPipe.content(), "out\\x1b[2J\\x0d\t\\u202e\n'value\\u2066'\ntext of 8 characters: text\\x1b[2J\n");
+    EXPECT_EQ(errPipe.content(),
+              "\x1b[31merr\\x1b]0;title\\x07\n\x1b[0m"
+              "\x1b[31mIn \"a\\u202e.py\", line 1, in f\nError: bad \\x1b[31m\n\x1b[0m");
+}
+
 class JsonPrinterTest : public PrinterFixture {
   protected:
     JsonPrinterTest() { printer.subscribe(events); }
@@ -139,6 +161,14 @@ TEST_F(JsonPrinterTest, ConnectionTimingAndFailure) {
         "\n"
         R"({"event":"failure","exitCode":3,"text":"the engine was lost"})"
         "\n");
+}
+
+TEST_F(JsonPrinterTest, WhatSteersATerminalIsAnEscape) {
+    publish<TextBaseEvent>(request, StreamTypeEnum::OUTPUT_STREAM, u"a\x1b\u009b\u202e\u2069b");
+    const std::string line = outPipe.content();
+    EXPECT_EQ(line, R"({"event":"text","request":")" + requestText +
+                        R"(","stream":"output","text":"a\u001b\u009b\u202e\u2069b"})" + "\n");
+    EXPECT_EQ(nlohmann::json::parse(line).at("text"), "a\x1b\u009b\u202e\u2069b");
 }
 
 TEST_F(JsonPrinterTest, AReplyCarriesItsError) {

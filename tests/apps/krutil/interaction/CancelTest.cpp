@@ -139,5 +139,37 @@ TEST_F(ClientCancelTest, AnEngineThatDoesNotStopIsTalkedAbout) {
     EXPECT_EQ(client->finish(), "");
 }
 
+TEST_F(ClientCancelTest, AnEngineThatDoesNotAnswerIsTalkedAboutAndThenEnded) {
+    request = IDType(1, 2);
+    ScriptedEngine peer(engine([](ScriptedEngine&) {},
+                               [this](ScriptedEngine&, auto) {
+                                   if (cancels == 2) {
+                                       pressCtrlC();
+                                   }
+                               }));
+    ConnectionOptions connection;
+    connection.socket = peer.path();
+    client.emplace(connection, DisplayOptions{}, printer, out, err, interrupt, false);
+    std::vector<std::string> said;
+    Canceller canceller(
+        client->conversation(), client->engine(), interrupt, [this] { return std::vector{request}; },
+        [&](const std::string& text) { said.push_back(text); });
+    const std::vector<std::string> expected{
+        "the engine does not answer. Press Ctrl-C twice within two seconds to end the engine"};
+    pressCtrlC();
+    canceller.run([&said] { return !said.empty(); });
+    EXPECT_EQ(said, expected);
+    // What the sentence says is what helps.
+    try {
+        pressCtrlC();
+        canceller.run([] { return false; });
+        FAIL();
+    } catch (const Failure& failure) {
+        EXPECT_EQ(failure.code(), ExitCode::Cancelled);
+        EXPECT_STREQ(failure.what(), "cancelled; the connection was closed, which ends the session");
+    }
+    EXPECT_EQ(said, expected);
+}
+
 }  // namespace
 }  // namespace krutil_client
