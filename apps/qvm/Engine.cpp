@@ -1,3 +1,5 @@
+// The engine itself: what ties its rooms process/, python/ and requests/ together. It is a little longer than other
+// files, because each of its steps hands over to all three.
 #include "qvm/Engine.hpp"
 
 #include <unistd.h>
@@ -20,6 +22,7 @@
 #include "krutil/capabilities_api/CapabilitiesChanged.hpp"
 #include "krutil/io/PrintableErrorEvent.hpp"
 #include "msg_svc/protobuf/ustring.hpp"
+#include "qvm/process/EachSecond.hpp"
 #include "qvm/process/ForkedChild.hpp"
 #include "qvm/python/EngineModule.hpp"
 #include "qvm/python/PythonText.hpp"
@@ -78,12 +81,12 @@ std::unique_ptr<IIPResult> resultOf(const Request& request, Interpreter::Ending 
 
 }  // namespace
 
-Engine::Engine(const Options& options, Log& log, SilentClients silent)
+Engine::Engine(const Options& options, Log& log, Seat* seat)
     : options_(options),
       log_(log),
-      silent_(silent),
+      seat_(seat),
       recording_(startRecording(options, log)),
-      diary_(options.diary),
+      diary_(options.diary, [&log](const std::string& sentence) { log.say(sentence); }),
       queue_(options.queue),
       capabilities_({Capability::Debugging, Capability::InteractiveCommandLine, Capability::WebWindow}) {}
 
@@ -94,8 +97,9 @@ Engine::~Engine() {
 }
 
 ExitCode Engine::run(int in, int out) {
+    apply(options_.session);
     if (!open(in, out)) {
-        return exitCode_;
+        return finishFiles(exitCode_);
     }
     const MessageBounds bounds(session_->peer().limits);
     ForkGuard guard(*session_);
@@ -135,8 +139,15 @@ ExitCode Engine::run(int in, int out) {
     }
     announcer_->leave();
     session_->close();
-    const bool recorded = !recording_ || recording_->isComplete();
-    return exitCode_ == ExitCode::Ok && !recorded ? ExitCode::Lost : exitCode_;
+    return finishFiles(exitCode_);
+}
+
+// Says what the files of the session lack. That is in its exit code, where nothing else has gone wrong.
+ExitCode Engine::finishFiles(ExitCode code) {
+    bool complete = !recording_ || recording_->isComplete();
+    complete = diary_.finish() && complete;
+    complete = log_.finish() && complete;
+    return code == ExitCode::Ok && !complete ? ExitCode::Lost : code;
 }
 
 // Shakes hands. Returns false, and sets the exit code, when there is no session.
@@ -148,6 +159,9 @@ bool Engine::open(int in, int out) {
     config.sharedMemory = !options_.noSharedMemory;
     config.check = apps::precheck(!options_.noPrecheck);
     config.handshakeTimeout = options_.handshakeTimeout;
+    if (seat_ != nullptr) {
+        config.admission = seat_->admission();
+    }
     if (recording_) {
         recording_->beginSession(config.role, config.build);
         config.recorder = recording_.get();
@@ -160,15 +174,22 @@ bool Engine::open(int in, int out) {
     try {
         session_ = Session::open(in, out, std::move(config));
     } catch (const session_layer::HandshakeRefused& error) {
+        if (seat_ != nullptr && seat_->isRefused()) {
+            exitCode_ = ExitCode::Refused;
+            return false;
+        }
         return fail(error, ExitCode::Refused);
     } catch (const session_layer::ProtocolViolation& error) {
         return fail(error, ExitCode::Violation);
     } catch (const session_layer::StreamLost& error) {
-        if (silent_ == SilentClients::Counted && dynamic_cast<const session_layer::PeerSilent*>(&error) != nullptr) {
+        if (seat_ != nullptr && dynamic_cast<const session_layer::PeerSilent*>(&error) != nullptr) {
             exitCode_ = ExitCode::Silent;
             return false;
         }
         return fail(error, ExitCode::Lost);
+    }
+    if (seat_ != nullptr) {
+        seat_->leaveLine();
     }
     log_.note("session with " + session_->peer().build);
     capabilities_.setClient(session_->peer().capabilities);
@@ -177,7 +198,11 @@ bool Engine::open(int in, int out) {
 
 void Engine::serve() {
     descriptors_.emplace();
-    loop();
+    {
+        // A thread that waits with a descriptor that has become another file's spins, or waits for ever.
+        const EachSecond watch([this] { endWithout(descriptors_->areOurs()); });
+        loop();
+    }
     queue_.close();
     for (const Request& request : queue_.takeAll()) {
         announcer_->turn().refuse(request, queue_.refusal(RequestQueue::Put::Closed));
@@ -202,21 +227,23 @@ void Engine::loop() {
     }
 }
 
-// Running code may have closed what the threads of this process wait with. Nothing can be sent or waited for then; the
-// client finds its stream at an end.
-void Engine::checkDescriptors() {
+// Running code may have closed what the threads of this process wait with, or put other files there. Nothing can be
+// sent or waited for then; the client finds its stream at an end.
+void Engine::endWithout(bool descriptors) {
     // A session that is over has closed its own, and says so at once.
-    if (!descriptors_->areOpen() && !announcer_->awaitEnd(grace)) {
-        sendAll();
+    if (!descriptors && !announcer_->awaitEnd(grace)) {
+        if (std::this_thread::get_id() == mainThread_) {
+            sendAll();
+        }
         log_.say("Running code has closed descriptors of the engine, so its session cannot go on.");
-        ::_exit(static_cast<int>(ExitCode::Lost));
+        ::_exit(static_cast<int>(finishFiles(ExitCode::Lost)));
     }
 }
 
 // Outputs are sent from Python's own memory, which the next request might change. And a client that only sends must not
 // make this process grow. A cancel ends the wait, so what was returned at a prompt has been copied.
 void Engine::settle(Until until) {
-    checkDescriptors();
+    endWithout(descriptors_->areOpen());
     python_->unlocked([this, until] {
         const int interrupt = cancellation_.descriptor();
         until == Until::Room ? announcer_->waitForRoom(interrupt) : announcer_->waitUntilWritten(interrupt);
@@ -475,7 +502,7 @@ void Engine::onEnd(const SessionEnd& end) {
     queue_.close();
     // Nobody listens any more, so running code is not waited for.
     if (!announcer_->end(grace)) {
-        ::_exit(static_cast<int>(exitCode_));
+        ::_exit(static_cast<int>(finishFiles(exitCode_)));
     }
 }
 

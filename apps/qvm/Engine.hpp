@@ -23,6 +23,7 @@
 #include "qvm/process/Log.hpp"
 #include "qvm/process/OutputCapture.hpp"
 #include "qvm/process/OwnDescriptors.hpp"
+#include "qvm/process/Seat.hpp"
 #include "qvm/python/EngineServices.hpp"
 #include "qvm/python/Interpreter.hpp"
 #include "qvm/requests/Announcer.hpp"
@@ -39,7 +40,7 @@ namespace qvm {
 enum class ExitCode : int {
     Ok = 0,
     Usage = 2,
-    Lost = 3,       ///< cannot serve, or the client went away
+    Lost = 3,       ///< cannot serve, the client went away, or a file lacks what should be in it
     Violation = 4,  ///< the client broke the protocol
     Refused = 5,    ///< protocol, version or features do not match
     Silent = 6,     ///< a client of a listening engine left before it said anything; for the listener only
@@ -50,12 +51,10 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
                private EngineServices,
                private PromptHost {
   public:
-    /// How a client is told of that leaves before it says anything.
-    enum class SilentClients { Said, Counted };
-
-    /// `options` and `log` must outlive the object. Throws std::system_error when a file of the options cannot be
-    /// opened. For silent clients that somebody counts, run() returns ExitCode::Silent.
-    Engine(const Options& options, Log& log, SilentClients silent = SilentClients::Said);
+    /// `seat` is the session's place among those of a listening engine; null for an engine of one session. With it,
+    /// run() returns ExitCode::Silent for a client that leaves before it says anything, because the listener counts
+    /// these. All three must outlive the object. Throws std::system_error when a file of the options cannot be opened.
+    Engine(const Options& options, Log& log, Seat* seat = nullptr);
     ~Engine() override;
 
     /// Serves one session over the two descriptors, which it takes over, from the handshake to its end. Call once; the
@@ -93,12 +92,13 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
     void settle() override { settle(Until::Written); }
 
     bool open(int in, int out);
+    ExitCode finishFiles(ExitCode code);
     void serve();
     void loop();
     std::optional<Request> next();
     bool handle(const Request& request, PyObject* frame);
     Interpreter::Ending runCode(const Request& request, PyObject* frame);
-    void checkDescriptors();
+    void endWithout(bool descriptors);
     enum class Until { Room, Written };
     void settle(Until until);
     const Request* requestOfThisThread() const noexcept;
@@ -106,7 +106,7 @@ class Engine : private foundation::msg_svc::transport::layers::session::SessionH
 
     const Options& options_;
     Log& log_;
-    const SilentClients silent_;
+    Seat* const seat_;
     const std::thread::id mainThread_ = std::this_thread::get_id();
     ExitCode exitCode_ = ExitCode::Ok;                  // of the I/O thread, until close() has joined it
     const std::unique_ptr<apps::Recording> recording_;  // null without one

@@ -16,8 +16,11 @@
 #include <chrono>
 #include <cstring>
 #include <filesystem>
+#include <set>
 #include <stdexcept>
 #include <system_error>
+#include <utility>
+#include <vector>
 
 #include "common/Build.hpp"
 #include "common/KrutilSession.hpp"
@@ -129,7 +132,11 @@ sigset_t watchedSignals() {
 Listener::Listener(const Options& options, Log& log) : Listener(options, log, -1) {}
 
 Listener::Listener(const Options& options, Log& log, int socket)
-    : options_(options), log_(log), users_(options.allowUsers), socket_(socket >= 0 ? socket : newSocket()) {
+    : options_(options),
+      log_(log),
+      users_(options.allowUsers),
+      socket_(socket >= 0 ? socket : newSocket()),
+      seats_(options.maxSessions) {
     // Before Python takes SIGINT: one that comes now is for this process, not for the code of a session.
     const sigset_t watched = watchedSignals();
     ::sigprocmask(SIG_BLOCK, &watched, nullptr);
@@ -196,12 +203,7 @@ void Listener::bindSocket() {
 ExitCode Listener::run() {
     log_.say("serving " + (options_.listenFds ? std::string("the socket of the service manager") : options_.listen));
     for (;;) {
-        // The socket stays readable while clients wait, so it is not watched while none can be accepted.
-        const bool paused = failedAccepts_ > 0;
-        std::array<pollfd, 2> watched{{{signals_, POLLIN, 0}, {paused ? -1 : socket_, POLLIN, 0}}};
-        if (::poll(watched.data(), watched.size(), paused ? acceptPauseMilliseconds : -1) < 0 && errno != EINTR) {
-            failWithErrno("Cannot wait for clients");
-        }
+        const bool waiting = awaitSomething();
         signalfd_siginfo signal{};
         while (::read(signals_, &signal, sizeof(signal)) == static_cast<ssize_t>(sizeof(signal))) {
             if (signal.ssi_signo == SIGCHLD) {
@@ -211,18 +213,55 @@ ExitCode Listener::run() {
             endSessions();
             return ExitCode::Ok;
         }
-        if (paused || watched[1].revents != 0) {
-            accept();
+        for (const std::string& refusal : seats_.answer(Seats::Clock::now())) {
+            sayRefused(": " + refusal);
+        }
+        if (waiting) {
+            acceptOrMakeRoom();
         }
         if (connection_ >= 0) {
-            Engine engine(options_, log_, Engine::SilentClients::Counted);
+            Engine engine(options_, log_, &*seat_);
             return engine.run(connection_, connection_);
         }
     }
 }
 
+// Returns whether a client may be waiting that can be served, or that another one has to give way to.
+bool Listener::awaitSomething() {
+    // The socket stays readable while clients wait, so it is not watched while none can be accepted.
+    const bool paused = failedAccepts_ > 0;
+    bool watching = !paused;
+    int milliseconds = paused ? acceptPauseMilliseconds : -1;
+    if (!paused && !seats_.hasRoomForHandshake()) {
+        const auto next = seats_.nextWithdrawal();
+        const auto left = next ? std::chrono::ceil<std::chrono::milliseconds>(*next - Seats::Clock::now()).count() : -1;
+        watching = next && left <= 0;
+        milliseconds = watching ? -1 : static_cast<int>(left);
+    }
+    std::vector<pollfd> watched{{signals_, POLLIN, 0}, {watching ? socket_ : -1, POLLIN, 0}};
+    seats_.appendTo(watched);
+    if (::poll(watched.data(), watched.size(), milliseconds) < 0 && errno != EINTR) {
+        failWithErrno("Cannot wait for clients");
+    }
+    return paused || watched[1].revents != 0;
+}
+
+void Listener::acceptOrMakeRoom() {
+    if (seats_.hasRoomForHandshake()) {
+        accept();
+    } else if (const auto next = seats_.nextWithdrawal(); next && *next <= Seats::Clock::now()) {
+        sayRefused(": its handshake was the oldest of " + std::to_string(Seats::maxHandshakes) + " unfinished ones");
+        seats_.withdrawOldest();
+    }
+}
+
 void Listener::accept() {
-    const int connection = ::accept4(socket_, nullptr, nullptr, SOCK_CLOEXEC);
+    // Made before, so that a client waits where there is a descriptor for it and none for this.
+    std::array<int, 2> line{-1, -1};
+    const bool ready = ::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, line.data()) == 0;
+    posix::OwnedDescriptor ours(line[0]);
+    posix::OwnedDescriptor theirs(line[1]);
+    const int connection = ready ? ::accept4(socket_, nullptr, nullptr, SOCK_CLOEXEC) : -1;
     if (connection < 0 && isShortage(errno)) {
         if (failedAccepts_ == 0) {
             log_.say("cannot accept a client: " + std::generic_category().message(errno) + "; clients wait meanwhile");
@@ -243,31 +282,43 @@ void Listener::accept() {
         ::close(connection);
         return;
     }
-    if (sessions_.size() >= options_.maxSessions) {
-        const std::string count = std::to_string(sessions_.size());
-        sayRefused(": " + count + " sessions are open (--max-sessions)");
-        auto config = apps::krutilSession(session_layer::Role::Engine);
-        config.build = apps::buildString("krutil-qvm");
-        config.limits = options_.limits;
-        session_layer::Session::refuse(connection, config,
-                                       "it has " + count + (sessions_.size() == 1 ? " session" : " sessions") +
-                                           " and may have no more (--max-sessions); try again when one has ended");
+    if (seats_.areTaken(Seats::Clock::now())) {
+        sayRefused(": " + std::to_string(options_.maxSessions) + " sessions are open (--max-sessions)");
+        refuse(connection, fullOfSessions(options_.maxSessions));
         return;
     }
+    serve(connection, std::move(ours), std::move(theirs));
+}
+
+// Starts a process for the session, to which a line leads.
+void Listener::serve(int connection, posix::OwnedDescriptor ours, posix::OwnedDescriptor theirs) {
     const pid_t child = forkPrepared();
     if (child < 0) {
-        log_.say("refused a client: no process for its session: " + std::generic_category().message(errno));
-    } else if (child > 0) {
-        sessions_.insert(child);
-    } else {
-        ::close(socket_);
-        ::close(signals_);
-        const sigset_t watched = watchedSignals();
-        ::sigprocmask(SIG_UNBLOCK, &watched, nullptr);
-        connection_ = connection;
+        const std::string why = "no process for its session: " + std::generic_category().message(errno);
+        sayRefused(": " + why);
+        refuse(connection, "it has " + why + "; try again later");
         return;
     }
-    ::close(connection);
+    if (child > 0) {
+        seats_.add(child, std::move(ours));
+        ::close(connection);
+        return;
+    }
+    ::close(socket_);
+    ::close(signals_);
+    seats_.forget();
+    const sigset_t watched = watchedSignals();
+    ::sigprocmask(SIG_UNBLOCK, &watched, nullptr);
+    log_.startOver();
+    connection_ = connection;
+    seat_.emplace(std::move(theirs), options_.maxSessions, Seats::maxHandshakes, options_.handshakeTimeout);
+}
+
+void Listener::refuse(int connection, const std::string& refusal) {
+    auto config = apps::krutilSession(session_layer::Role::Engine);
+    config.build = apps::buildString("krutil-qvm");
+    config.limits = options_.limits;
+    session_layer::Session::refuse(connection, config, refusal);
 }
 
 void Listener::sayRefused(const std::string& why) {
@@ -291,7 +342,7 @@ void Listener::reap() {
         if (child <= 0) {
             return;
         }
-        sessions_.erase(child);
+        seats_.remove(child);
         if (WIFEXITED(status) && WEXITSTATUS(status) == static_cast<int>(ExitCode::Silent)) {
             countSilent();
         }
@@ -303,7 +354,8 @@ void Listener::reap() {
 }
 
 void Listener::endSessions() {
-    for (const pid_t child : sessions_) {
+    std::set<pid_t> sessions = seats_.processes();
+    for (const pid_t child : sessions) {
         ::kill(child, SIGTERM);
     }
     const sigset_t childSignal = [] {
@@ -313,22 +365,22 @@ void Listener::endSessions() {
         return signals;
     }();
     const auto deadline = std::chrono::steady_clock::now() + sessionPatience;
-    const auto reapQuietly = [this] {
+    const auto reapQuietly = [&sessions] {
         for (;;) {
             const pid_t child = ::waitpid(-1, nullptr, WNOHANG);
             if (child <= 0) {
                 return;
             }
-            sessions_.erase(child);
+            sessions.erase(child);
         }
     };
     reapQuietly();
-    while (!sessions_.empty() && std::chrono::steady_clock::now() < deadline) {
+    while (!sessions.empty() && std::chrono::steady_clock::now() < deadline) {
         const timespec wait{0, 50'000'000};
         ::sigtimedwait(&childSignal, nullptr, &wait);
         reapQuietly();
     }
-    for (const pid_t child : sessions_) {
+    for (const pid_t child : sessions) {
         ::kill(child, SIGKILL);
         ::waitpid(child, nullptr, 0);
     }

@@ -4,7 +4,7 @@
 #include <sys/types.h>
 
 #include <chrono>
-#include <set>
+#include <optional>
 #include <string>
 
 #include "common/RateLimit.hpp"
@@ -12,6 +12,8 @@
 #include "qvm/Options.hpp"
 #include "qvm/process/AdmittedUsers.hpp"
 #include "qvm/process/Log.hpp"
+#include "qvm/process/Seat.hpp"
+#include "qvm/process/Seats.hpp"
 
 namespace qvm {
 
@@ -34,14 +36,19 @@ class Listener {
     Listener& operator=(const Listener&) = delete;
 
     /// Accepts clients of the same user, and of options.allowUsers, until SIGTERM, SIGINT or SIGHUP, as far as they are
-    /// not ignored, then ends the sessions that are left. Clients beyond options.maxSessions are told so. While the
-    /// system has no descriptor for a client, clients wait. Returns how the process is to end: this one, or one that
-    /// was forked for a session.
+    /// not ignored, then ends the sessions that are left. Clients beyond options.maxSessions are told so, and so is the
+    /// client of the oldest handshake when too many are unfinished. While the system has no descriptor for a client,
+    /// clients wait. Returns how the process is to end: this one, or one that was forked for a session.
     ExitCode run();
 
   private:
     void bindSocket();
+    bool awaitSomething();
+    void acceptOrMakeRoom();
     void accept();
+    void serve(int connection, foundation::core::posix::OwnedDescriptor ours,
+               foundation::core::posix::OwnedDescriptor theirs);
+    void refuse(int connection, const std::string& refusal);
     void sayRefused(const std::string& why);
     void countSilent();
     void reap();
@@ -53,7 +60,7 @@ class Listener {
     int socket_ = -1;
     int signals_ = -1;
     ino_t inode_ = 0;
-    std::set<pid_t> sessions_;
+    Seats seats_;
     // Anybody who may connect could fill the log with these.
     apps::RateLimit refusals_{10, std::chrono::minutes(1)};
     apps::RateLimit silent_{1, std::chrono::hours(1)};
@@ -61,6 +68,7 @@ class Listener {
     unsigned failedAccepts_ = 0;
     // Set in a process that was forked for a session.
     int connection_ = -1;
+    std::optional<Seat> seat_;
 };
 
 }  // namespace qvm

@@ -1,12 +1,15 @@
 #include "qvm/Options.hpp"
 
 #include <CLI/CLI.hpp>
+#include <cstdint>
 #include <cstdlib>
+#include <limits>
 
 #include "common/Build.hpp"
 #include "common/HelpFormatter.hpp"
 #include "common/LimitOptions.hpp"
 #include "common/RecordOptions.hpp"
+#include "qvm/process/StandardDescriptors.hpp"
 
 namespace qvm {
 namespace {
@@ -69,6 +72,18 @@ OptionTable::OptionTable() {
                         "Memory that waiting requests may hold, such as 64MiB")
         ->group(sessions);
 
+    apps::addSizeOption(
+        app, "--limit-memory", options.session.memory,
+        "Memory that the process of a session may have, such as 8GiB; more is a MemoryError of its code",
+        std::numeric_limits<std::uint64_t>::max(), smallestMemoryLimit)
+        ->default_str("")
+        ->group(sessions);
+    app.add_option("--limit-descriptors", options.session.descriptors,
+                   "Descriptors that the process of a session may have at a time")
+        ->check(CLI::Range(neededDescriptors, 1'000'000'000))
+        ->type_name("COUNT")
+        ->group(sessions);
+
     app.add_flag("--no-zero-copy", options.noZeroCopy,
                  "Copy arrays into their messages, as QX_DISABLE_ZEROCOPY=1 does; clients must do the same")
         ->group(sessions);
@@ -107,7 +122,7 @@ OptionTable::OptionTable() {
         "Exit codes:\n"
         "  0  the session ended as agreed\n"
         "  2  wrong usage\n"
-        "  3  cannot serve, the client was lost, or a recording is not complete\n"
+        "  3  cannot serve, the client was lost, or a diary, a log or a recording is not complete\n"
         "  4  the client broke the protocol\n"
         "  5  version or feature refused, or the client is of a user that is not admitted");
 }

@@ -59,6 +59,12 @@ ExitCode serve(const qvm::Options& options, qvm::Log& log) {
     ::_exit(static_cast<int>(code));
 }
 
+// What the log lacks is in the exit code, where nothing else has gone wrong.
+[[noreturn]] void leave(ExitCode code, qvm::Log& log) {
+    const bool complete = log.finish();
+    leave(code == ExitCode::Ok && !complete ? ExitCode::Lost : code);
+}
+
 }  // namespace
 
 #if defined(KRUTIL_SANITIZED)
@@ -84,6 +90,7 @@ SANITIZER_HOOK const char* __lsan_default_suppressions() {
 int main(int argc, char** argv) {
     qvm::Options options = qvm::parseOptions(argc, argv);
     try {
+        qvm::checkDescriptorLimit();
         qvm::holdStandardDescriptors();
         ::signal(SIGPIPE, SIG_IGN);
         // A file that must not grow any more is an error of a write.
@@ -97,7 +104,7 @@ int main(int argc, char** argv) {
         const char* const environment = options.python.isolated ? nullptr : std::getenv("VIRTUAL_ENV");
         options.python.program = qvm::choosePython(options.python.program, environment != nullptr ? environment : "");
         krutil::protobuf::KrutilProtocol::init();
-        leave(serve(options, log));
+        leave(serve(options, log), log);
     } catch (const std::exception& error) {
         std::fprintf(stderr, "krutil-qvm: %s\n", error.what());
         leave(ExitCode::Lost);

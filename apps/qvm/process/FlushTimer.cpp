@@ -74,7 +74,11 @@ void FlushTimer::set(Time due) noexcept {
 void FlushTimer::run() {
     for (;;) {
         std::uint64_t ignored = 0;
-        if (::read(timer_.get(), &ignored, sizeof ignored) < 0 && errno != EINTR && errno != EAGAIN) {
+        if (::read(timer_.get(), &ignored, sizeof ignored) < 0) {
+            // Nothing is due then. What is to be flushed may not even be there yet.
+            if (errno == EINTR || errno == EAGAIN) {
+                continue;
+            }
             return;
         }
         if (ending_) {

@@ -7,6 +7,7 @@
 #include <ctime>
 
 #include "foundation/core/posix/writeFully.hpp"
+#include "qvm/process/StandardDescriptors.hpp"
 
 namespace qvm {
 namespace {
@@ -29,16 +30,12 @@ std::string stamped(std::string_view text) {
 
 }  // namespace
 
-Log::Log(const std::string& path) : stderr_(::fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, 100)), file_(path) {}
+Log::Log(const std::string& path)
+    : stderr_(::fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, firstPrivateDescriptor)),
+      file_(path, [this](const std::string& sentence) { tell(sentence); }) {}
 
 void Log::say(std::string_view text) noexcept {
-    try {
-        if (stderr_) {
-            posix::writeFully(stderr_.get(), "krutil-qvm: " + std::string(text) + "\n");
-        }
-    } catch (const std::bad_alloc&) {
-        // Nothing can be said without memory.
-    }
+    tell(text);
     note(text);
 }
 
@@ -48,6 +45,17 @@ void Log::note(std::string_view text) noexcept {
     }
     try {
         file_.append(stamped(text));
+    } catch (const std::bad_alloc&) {
+        // Nothing can be said without memory.
+    }
+}
+
+// To standard error only.
+void Log::tell(std::string_view text) const noexcept {
+    try {
+        if (stderr_) {
+            posix::writeFully(stderr_.get(), "krutil-qvm: " + std::string(text) + "\n");
+        }
     } catch (const std::bad_alloc&) {
         // As above.
     }

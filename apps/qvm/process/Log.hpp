@@ -21,7 +21,13 @@ class Log {
     /// To the file only.
     void note(std::string_view text) noexcept;
 
+    /// What the file lacks is told on standard error; see AppendFile.
+    bool finish() noexcept { return file_.finish(); }
+    void startOver() noexcept { file_.startOver(); }
+
   private:
+    void tell(std::string_view text) const noexcept;
+
     // A private duplicate: user code may close or redirect descriptor 2.
     posix::OwnedDescriptor stderr_;
     AppendFile file_;

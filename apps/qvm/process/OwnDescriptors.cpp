@@ -1,6 +1,7 @@
 #include "qvm/process/OwnDescriptors.hpp"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 
 #include <algorithm>
 #include <charconv>
@@ -24,6 +25,12 @@ OwnDescriptors::OwnDescriptors() {
                                       return flags < 0 || (flags & FD_CLOEXEC) == 0;
                                   }),
                    watched_.end());
+    for (const pollfd& each : watched_) {
+        struct stat status {};
+        if (::fstat(each.fd, &status) == 0) {
+            files_.push_back({each.fd, status.st_dev, status.st_ino});
+        }
+    }
 }
 
 bool OwnDescriptors::areOpen() noexcept {
@@ -31,6 +38,13 @@ bool OwnDescriptors::areOpen() noexcept {
     return ::poll(watched_.data(), watched_.size(), 0) <= 0 ||
            std::none_of(watched_.begin(), watched_.end(),
                         [](const pollfd& each) { return (each.revents & POLLNVAL) != 0; });
+}
+
+bool OwnDescriptors::areOurs() const noexcept {
+    return std::all_of(files_.begin(), files_.end(), [](const File& each) {
+        struct stat status {};
+        return ::fstat(each.descriptor, &status) == 0 && status.st_dev == each.device && status.st_ino == each.inode;
+    });
 }
 
 }  // namespace qvm

@@ -1,9 +1,12 @@
 #include "qvm/process/StandardDescriptors.hpp"
 
 #include <fcntl.h>
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include <cerrno>
+#include <stdexcept>
+#include <string>
 #include <system_error>
 
 namespace qvm {
@@ -22,6 +25,16 @@ int moveAside(int descriptor, const char* name) {
 }
 
 }  // namespace
+
+void checkDescriptorLimit() {
+    rlimit limit{};
+    if (::getrlimit(RLIMIT_NOFILE, &limit) == 0 && limit.rlim_cur < static_cast<rlim_t>(neededDescriptors)) {
+        throw std::runtime_error("This process may have " + std::to_string(limit.rlim_cur) +
+                                 " descriptors at a time (RLIMIT_NOFILE), and an engine needs " +
+                                 std::to_string(neededDescriptors) +
+                                 ". Raise the limit, for example with \"ulimit -n 1024\".");
+    }
+}
 
 void holdStandardDescriptors() {
     // The lowest free number is used, so this fills 0, 1 and 2 in turn.

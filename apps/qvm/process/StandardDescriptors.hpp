@@ -6,6 +6,14 @@ namespace qvm {
 /// Private descriptors have numbers from here on. Programs that run code dup onto low numbers.
 inline constexpr int firstPrivateDescriptor = 100;
 
+/// As many descriptors an engine must be allowed to have: those with private numbers, and some for the code that it
+/// runs.
+inline constexpr int neededDescriptors = 128;
+
+/// Throws std::runtime_error when the limit of this process is lower than neededDescriptors. Without this, what needs a
+/// private number would fail with words that do not name the limit.
+void checkDescriptorLimit();
+
 /// Makes sure that 0, 1 and 2 are open, so that nothing else lands on their numbers. Throws std::system_error.
 void holdStandardDescriptors();
 

@@ -3,6 +3,9 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 
+#include <memory>
+#include <vector>
+
 #include "apps/qvm/fixture/EngineFixture.hpp"
 
 namespace qvm_test {
@@ -98,14 +101,16 @@ TEST_F(HostileCodeTest, ClosedDescriptorsOfTheEngineEndTheSession) {
     EXPECT_EQ(engine_.process.wait(), 3);
 }
 
+// Code that lists the engine's descriptors.
+const std::string own =
+    "import fcntl, os\n"
+    "own = []\n"
+    "for n in range(3, 200):\n"
+    "    try:\n"
+    "        if fcntl.fcntl(n, fcntl.F_GETFD) & fcntl.FD_CLOEXEC: own.append(n)\n"
+    "    except OSError: pass\n";
+
 TEST_F(HostileCodeTest, EachDescriptorOfTheEngineIsMissed) {
-    const std::string own =
-        "import fcntl, os\n"
-        "own = []\n"
-        "for n in range(3, 200):\n"
-        "    try:\n"
-        "        if fcntl.fcntl(n, fcntl.F_GETFD) & fcntl.FD_CLOEXEC: own.append(n)\n"
-        "    except OSError: pass\n";
     const std::string count = client().eval(own + "print(len(own))").output();
     ASSERT_GT(std::stoi(count), 10);
     for (int i = 0; i < std::stoi(count); ++i) {
@@ -113,6 +118,32 @@ TEST_F(HostileCodeTest, EachDescriptorOfTheEngineIsMissed) {
         engine.client.enqueue(own + "os.close(own[" + std::to_string(i) + "])");
         EXPECT_EQ(engine.client.awaitEnd().reason, SessionEnd::Reason::Lost) << i;
         EXPECT_EQ(engine.process.wait(), 3) << i;
+    }
+}
+
+TEST_F(HostileCodeTest, OtherFilesInPlaceOfTheEnginesEndTheSession) {
+    client().enqueue("import os\nfor n in range(3, 300): os.dup2(0, n)");
+    EXPECT_EQ(client().awaitEnd().reason, SessionEnd::Reason::Lost);
+    EXPECT_EQ(engine_.process.wait(), 3);
+}
+
+TEST_F(HostileCodeTest, OtherFilesInPlaceOfTheEnginesEndTheSessionThoughTheCodeGoesOn) {
+    client().enqueue("import os, time\nfor n in range(3, 300): os.dup2(0, n)\ntime.sleep(1000)");
+    EXPECT_EQ(client().awaitEnd().reason, SessionEnd::Reason::Lost);
+    EXPECT_EQ(engine_.process.wait(), 3);
+}
+
+TEST_F(HostileCodeTest, EachDescriptorOfTheEngineIsMissedWhenAnotherFileHasItsNumber) {
+    const std::string count = client().eval(own + "print(len(own))").output();
+    ASSERT_GT(std::stoi(count), 10);
+    // All at a time: each engine looks when it has had nothing to do for a while.
+    std::vector<std::unique_ptr<EngineSession>> engines;
+    for (int i = 0; i < std::stoi(count); ++i) {
+        engines.push_back(std::make_unique<EngineSession>());
+        engines.back()->client.enqueue(own + "os.dup2(0, own[" + std::to_string(i) + "], inheritable=False)");
+    }
+    for (std::size_t i = 0; i < engines.size(); ++i) {
+        EXPECT_EQ(engines[i]->process.wait(), 3) << i;
     }
 }
 

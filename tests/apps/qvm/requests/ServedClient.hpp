@@ -52,8 +52,8 @@ class ServedClient {
     };
 
     test_support::TemporaryDirectory files_;
-    qvm::AppendFile diary_{files_.file("diary")};
     qvm::Log log_{files_.file("log")};
+    qvm::AppendFile diary_{files_.file("diary"), [this](const std::string& sentence) { log_.say(sentence); }};
     Client clientSaw_;
     Engine engineSaw_;
     testing_sessions::OpenedPair opened_;

@@ -1,0 +1,63 @@
+// What the process of a session may use of the machine.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "apps/qvm/fixture/EngineFixture.hpp"
+#include "support/TemporaryDirectory.hpp"
+
+namespace qvm_test {
+namespace {
+
+class SessionLimitsTest : public testing::Test {
+  protected:
+    void SetUp() override {
+#if defined(KRUTIL_SANITIZED)
+        GTEST_SKIP() << "sanitizers need memory and descriptors";
+#endif
+    }
+
+    // What a session has as its limit, as Python names it.
+    static std::string limit(EngineClient& client, const std::string& name) {
+        return client.eval("import resource\nprint(*resource.getrlimit(resource." + name + "))").output();
+    }
+
+    test_support::TemporaryDirectory directory_;
+    std::string path_ = directory_.file("private/socket");
+};
+
+TEST_F(SessionLimitsTest, TooMuchMemoryIsAnErrorOfTheCode) {
+    EngineSession engine({"--limit-memory", "512MiB"});
+    EXPECT_EQ(engine.client.eval("a = bytearray(256 << 20)\nlen(a)").shown(), "268435456\n");
+    EXPECT_EQ(engine.client.eval("b = bytearray(256 << 20)").errorId(), "MemoryError");
+    EXPECT_EQ(engine.client.goodbye().reason, session::SessionEnd::Reason::Finished);
+}
+
+TEST_F(SessionLimitsTest, TooManyDescriptorsAreAnErrorOfTheCode) {
+    EngineSession engine({"--limit-descriptors", "160"});
+    EXPECT_EQ(engine.client.eval("import os\nd = []\nwhile True: d.append(os.dup(0))").errorText(),
+              "[Errno 24] Too many open files");
+    EXPECT_EQ(engine.client.eval("[os.close(n) for n in d]\nlen(d) > 100").shown(), "True\n");
+    EXPECT_EQ(engine.client.goodbye().reason, session::SessionEnd::Reason::Finished);
+}
+
+TEST_F(SessionLimitsTest, EachSessionOfAListenerHasThem) {
+    EngineProcess engine({"--listen", path_, "--limit-memory", "1GiB", "--limit-descriptors", "200"});
+    engine.awaitStderr("krutil-qvm: serving " + path_ + "\n");
+    for (int i = 0; i < 2; ++i) {
+        EngineClient client(connectTo(path_));
+        EXPECT_EQ(limit(client, "RLIMIT_DATA"), "1073741824 1073741824\n");
+        EXPECT_EQ(limit(client, "RLIMIT_NOFILE"), "200 200\n");
+    }
+}
+
+TEST_F(SessionLimitsTest, AMemoryLimitLeavesMathematicsAlone) {
+    EngineSession engine({"--limit-memory", "1GiB"});
+    EXPECT_EQ(engine.client.eval("import numpy\na = numpy.ones((500, 500))\nprint((a @ a)[0, 0])").output(), "500.0\n");
+}
+
+}  // namespace
+}  // namespace qvm_test
