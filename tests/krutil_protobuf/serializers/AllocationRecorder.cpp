@@ -14,6 +14,7 @@ thread_local AllocationRecorder* current = nullptr;
 // Stands before each allocation that is in use.
 struct alignas(std::max_align_t) Mark {
     std::uint64_t value;
+    std::uint64_t size;
 };
 
 constexpr std::uint64_t inUse = 0x9E3779B97F4A7C15;
@@ -31,13 +32,16 @@ struct AllocationHooks {
             ++recorder->outstanding_;
             recorder->bytes_ += size;
             recorder->largest_ = std::max(recorder->largest_, size);
+            recorder->held_ += static_cast<std::ptrdiff_t>(size);
+            recorder->peak_ =
+                std::max(recorder->peak_, static_cast<std::size_t>(std::max<std::ptrdiff_t>(recorder->held_, 0)));
             if (array) {
                 ++recorder->arrays_;
                 recorder->lastArray_ = size;
             }
         }
         void* memory = std::malloc(sizeof(Mark) + std::max<std::size_t>(size, 1));
-        return memory != nullptr ? new (memory) Mark{inUse} + 1 : nullptr;
+        return memory != nullptr ? new (memory) Mark{inUse, size} + 1 : nullptr;
     }
 
     static void* allocateOrThrow(std::size_t size, bool array) {
@@ -52,10 +56,11 @@ struct AllocationHooks {
         if (memory == nullptr) {
             return;
         }
+        Mark* mark = static_cast<Mark*>(memory) - 1;
         if (current != nullptr) {
             --current->outstanding_;
+            current->held_ -= static_cast<std::ptrdiff_t>(mark->size);
         }
-        Mark* mark = static_cast<Mark*>(memory) - 1;
         mark->value = 0;
         std::free(mark);
     }

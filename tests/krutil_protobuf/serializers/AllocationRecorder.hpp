@@ -24,6 +24,9 @@ class AllocationRecorder {
     /// Bytes asked for by a single allocation, at most.
     std::size_t largest() const noexcept { return largest_; }
 
+    /// Bytes in use at once, at most, of those allocated meanwhile. Releases of older ones count down.
+    std::size_t peak() const noexcept { return peak_; }
+
     /// Allocations of arrays (new[]), and the size of the last of them.
     std::size_t arrays() const noexcept { return arrays_; }
     std::size_t lastArray() const noexcept { return lastArray_; }
@@ -45,6 +48,8 @@ class AllocationRecorder {
     std::size_t allocations_ = 0;
     std::size_t bytes_ = 0;
     std::size_t largest_ = 0;
+    std::ptrdiff_t held_ = 0;
+    std::size_t peak_ = 0;
     std::size_t arrays_ = 0;
     std::size_t lastArray_ = 0;
     long outstanding_ = 0;
