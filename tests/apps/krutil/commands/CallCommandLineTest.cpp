@@ -24,13 +24,13 @@ using foundation::korveldata::MemoryOrder;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 
-std::variant<Options, Finished> parse(std::vector<const char*> arguments) {
+std::variant<Options, Finished> parseAsCall(std::vector<const char*> arguments) {
     arguments.insert(arguments.begin(), {"krutil", "call"});
     return parseCommandLine(static_cast<int>(arguments.size()), arguments.data());
 }
 
 CallOptions parseCall(const std::vector<const char*>& arguments) {
-    return std::get<CallOptions>(std::get<Options>(parse(arguments)).command);
+    return std::get<CallOptions>(std::get<Options>(parseAsCall(arguments)).command);
 }
 
 TEST(CallCommandLineTest, AFunctionWithoutArgumentsHasOneOutput) {
@@ -75,22 +75,22 @@ TEST(CallCommandLineTest, AFunctionMayBeCalledLikeACommand) {
 }
 
 TEST(CallCommandLineTest, NoZeroCopyIsForCodeToo) {
-    EXPECT_TRUE(std::get<Options>(parse({"f", "--no-zero-copy"})).connection.noZeroCopy);
+    EXPECT_TRUE(std::get<Options>(parseAsCall({"f", "--no-zero-copy"})).connection.noZeroCopy);
     const std::vector<const char*> eval{"krutil", "eval", "--no-zero-copy", "1"};
     EXPECT_TRUE(std::get<Options>(parseCommandLine(4, eval.data())).connection.noZeroCopy);
-    EXPECT_FALSE(std::get<Options>(parse({"f"})).connection.noZeroCopy);
+    EXPECT_FALSE(std::get<Options>(parseAsCall({"f"})).connection.noZeroCopy);
 }
 
 TEST(CallCommandLineTest, NoSharedMemoryIsForCodeToo) {
-    EXPECT_TRUE(std::get<Options>(parse({"f", "--no-shared-memory"})).connection.noSharedMemory);
+    EXPECT_TRUE(std::get<Options>(parseAsCall({"f", "--no-shared-memory"})).connection.noSharedMemory);
     const std::vector<const char*> eval{"krutil", "eval", "--no-shared-memory", "1"};
     EXPECT_TRUE(std::get<Options>(parseCommandLine(4, eval.data())).connection.noSharedMemory);
-    EXPECT_FALSE(std::get<Options>(parse({"f"})).connection.noSharedMemory);
+    EXPECT_FALSE(std::get<Options>(parseAsCall({"f"})).connection.noSharedMemory);
 }
 
 TEST(CallCommandLineTest, WrongCommandLines) {
     const auto sentence = [](const std::vector<const char*>& arguments) {
-        const auto finished = std::get<Finished>(parse(arguments));
+        const auto finished = std::get<Finished>(parseAsCall(arguments));
         EXPECT_EQ(finished.code, ExitCode::Usage);
         return finished.err;
     };

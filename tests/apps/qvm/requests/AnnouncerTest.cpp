@@ -34,7 +34,7 @@ Limits smallFrames(std::uint64_t size) {
     return limits;
 }
 
-RequestParts numbered(std::uint64_t number) {
+RequestParts requestNumbered(std::uint64_t number) {
     RequestParts parts;
     parts.number = number;
     return parts;
@@ -61,8 +61,8 @@ Warning warningOf(std::size_t units, bool disabled = false) {
 
 TEST(AnnouncerTest, EventsOfATurnTravelOnTheStreamOfTheirRequestInOrder) {
     ServedClient client;
-    const qvm::Request first = client.send(numbered(1));
-    const qvm::Request second = client.send(numbered(2));
+    const qvm::Request first = client.send(requestNumbered(1));
+    const qvm::Request second = client.send(requestNumbered(2));
     {
         Announcer::Turn turn = client.announcer().turn();
         EXPECT_TRUE(turn.isServing());
@@ -78,7 +78,7 @@ TEST(AnnouncerTest, EventsOfATurnTravelOnTheStreamOfTheirRequestInOrder) {
 
 TEST(AnnouncerTest, OthersWaitForTheirTurn) {
     ServedClient client;
-    const qvm::Request request = client.send(numbered(1));
+    const qvm::Request request = client.send(requestNumbered(1));
     std::future<void> other;
     {
         Announcer::Turn turn = client.announcer().turn();
@@ -93,21 +93,21 @@ TEST(AnnouncerTest, OthersWaitForTheirTurn) {
 
 TEST(AnnouncerTest, DiscardedRequestHasItsErrorInTheReply) {
     ServedClient client;
-    const qvm::Request request = client.send(numbered(3));
+    const qvm::Request request = client.send(requestNumbered(3));
     client.announcer().turn().discard(request, error(u"too late"));
     EXPECT_THAT(client.received(), ElementsAre("3 discarded", "3 last", "3 reply 2 too late"));
 }
 
 TEST(AnnouncerTest, RefusedRequestHasTheReasonInTheReply) {
     ServedClient client;
-    const qvm::Request request = client.send(numbered(3));
+    const qvm::Request request = client.send(requestNumbered(3));
     client.announcer().turn().refuse(request, "The engine is busy.");
     EXPECT_THAT(client.received(), ElementsAre("3 discarded", "3 last", "3 reply 5 The engine is busy."));
 }
 
 TEST(AnnouncerTest, ResultThatTheClientDoesNotAcceptBecomesAnErrorThatSaysSo) {
     ServedClient client(smallFrames(1000));
-    const qvm::Request request = client.send(numbered(1));
+    const qvm::Request request = client.send(requestNumbered(1));
     client.announcer().turn().finish(request,
                                      std::make_unique<IIPResult>(request.id(), error(std::u16string(1000, u'x'))));
     EXPECT_THAT(client.received(),
@@ -119,7 +119,7 @@ TEST(AnnouncerTest, ResultThatTheClientDoesNotAcceptBecomesAnErrorThatSaysSo) {
 
 TEST(AnnouncerTest, ClientThatAcceptsNotEvenThatIsAnException) {
     ServedClient client(smallFrames(40));
-    const qvm::Request request = client.send(numbered(1));
+    const qvm::Request request = client.send(requestNumbered(1));
     EXPECT_THROW(client.announcer().turn().finish(
                      request, std::make_unique<IIPResult>(request.id(), error(std::u16string(1000, u'x')))),
                  foundation::msg_svc::transport::layers::session::LimitExceeded);
@@ -128,7 +128,7 @@ TEST(AnnouncerTest, ClientThatAcceptsNotEvenThatIsAnException) {
 
 TEST(AnnouncerTest, EventThatTheClientDoesNotAcceptIsToldToTheLog) {
     ServedClient client(smallFrames(1000));
-    client.send(numbered(1));
+    client.send(requestNumbered(1));
     {
         Announcer::Turn turn = client.announcer().turn();
         EXPECT_FALSE(turn.publish(1, textOf(1, std::u16string(1000, u'x'))));
@@ -142,7 +142,7 @@ TEST(AnnouncerTest, EventThatTheClientDoesNotAcceptIsToldToTheLog) {
 
 TEST(AnnouncerTest, TextGoesWhereItsTargetSays) {
     ServedClient client;
-    client.send(numbered(7));
+    client.send(requestNumbered(7));
     Announcer& announcer = client.announcer();
     announcer.announceText({7, IDType(0, 7), StreamTypeEnum::ERROR_STREAM, false, false, false}, u"plain");
     announcer.announceText({7, IDType(0, 7), StreamTypeEnum::OUTPUT_STREAM, true, true, false}, u"sh\u00f6wn");
@@ -156,7 +156,7 @@ TEST(AnnouncerTest, TextGoesWhereItsTargetSays) {
 
 TEST(AnnouncerTest, WarningThatIsShownTravelsTwice) {
     ServedClient client;
-    const qvm::Request request = client.send(numbered(4));
+    const qvm::Request request = client.send(requestNumbered(4));
     client.announcer().announceWarning(&request, warningOf(2));
     client.announcer().announceWarning(&request, warningOf(3, true));
     client.announcer().announceWarning(nullptr, warningOf(1));
@@ -169,7 +169,7 @@ TEST(AnnouncerTest, WarningThatIsShownTravelsTwice) {
 
 TEST(AnnouncerTest, WarningThatTheClientDoesNotAcceptIsShortened) {
     ServedClient client(smallFrames(800));
-    const qvm::Request request = client.send(numbered(4));
+    const qvm::Request request = client.send(requestNumbered(4));
     client.announcer().announceWarning(&request, warningOf(300));
     // A hundred units in all, half of them for the message.
     const std::string cut = " " + std::string(25, 'i') + "... | " + std::string(25, 'f') + "... | " +
@@ -180,7 +180,7 @@ TEST(AnnouncerTest, WarningThatTheClientDoesNotAcceptIsShortened) {
 
 TEST(AnnouncerTest, NothingIsSentAfterTheShutdownEvent) {
     ServedClient client;
-    const qvm::Request request = client.send(numbered(1));
+    const qvm::Request request = client.send(requestNumbered(1));
     client.announcer().shutDown();
     {
         Announcer::Turn turn = client.announcer().turn();

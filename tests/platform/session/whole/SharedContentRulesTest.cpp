@@ -206,7 +206,7 @@ std::ostream& operator<<(std::ostream& out, const Wrong& wrong) {
     return out << wrong.name;
 }
 
-std::string nameOf(const testing::TestParamInfo<Wrong>& info) {
+std::string nameOfWrong(const testing::TestParamInfo<Wrong>& info) {
     std::string name = info.param.name;
     std::replace_if(
         name.begin(), name.end(), [](char c) { return std::isalnum(static_cast<unsigned char>(c)) == 0; }, '_');
@@ -267,7 +267,7 @@ INSTANTIATE_TEST_SUITE_P(
               "bytes from 64 on"},
         Wrong{"small", [] { return anonymousMemory(2 * mebi, 2 * mebi, allSeals); }, 0, mebi - 1,
               "shared content of frame 1 on stream 1: expected 1048576 bytes or more, got 1048575"}),
-    nameOf);
+    nameOfWrong);
 
 // What an engine refuses for its bytes alone.
 std::string refusalOf(const std::string& bytes, SessionConfig config = sharingConfig(Role::Engine)) {
