@@ -2,8 +2,9 @@
 #pragma once
 
 #include <poll.h>
-#include <sys/types.h>
 
+#include <cstdint>
+#include <utility>
 #include <vector>
 
 namespace qvm {
@@ -22,13 +23,16 @@ class OwnDescriptors {
     /// their own, such as event and timer descriptors, are not told apart from each other.
     bool areOurs() const noexcept;
 
-  private:
+    /// What a descriptor leads to: major and minor number of the device, and the inode there.
     struct File {
         int descriptor;
-        dev_t device;
-        ino_t inode;
+        std::pair<std::uint32_t, std::uint32_t> device;
+        std::uint64_t inode;
+
+        bool operator==(const File&) const = default;
     };
 
+  private:
     std::vector<pollfd> watched_;
     std::vector<File> files_;
 };
