@@ -45,13 +45,13 @@ namespace wire = krutil::protobuf;
 
 constexpr std::size_t million = 1'000'000;
 
-const SinkTraits outTraits(false, true, false, true, false, false);
-const SinkTraits errTraits(false, false, true, false, true, true);
+const SinkTraits callOutTraits(false, true, false, true, false, false);
+const SinkTraits callErrTraits(false, false, true, false, true, true);
 
 boost::shared_ptr<const IIP> callWith(boost::shared_ptr<FEvalIIP::Data> data, std::uint64_t client = 3,
                                       std::uint64_t server = 4, IqmStreamID streamID = IqmStreamID::ekIqmJavaStream) {
-    return boost::make_shared<FEvalIIP>("console", std::string("numpy.dot"), 2, std::move(data), streamID, outTraits,
-                                        errTraits, client, server, true);
+    return boost::make_shared<FEvalIIP>("console", std::string("numpy.dot"), 2, std::move(data), streamID,
+                                        callOutTraits, callErrTraits, client, server, true);
 }
 
 boost::shared_ptr<const IIP> call(std::vector<Array>&& arguments, std::uint64_t client = 3, std::uint64_t server = 4,
@@ -131,7 +131,7 @@ TEST_F(FEvalIIPTest, AFunctionGivenAsAnArrayThrowsAndItsArgumentsStayInTheStream
     const auto request =
         boost::make_shared<const FEvalIIP>("console", std::make_shared<Array>(small(7)), 2,
                                            FEvalIIP::Data::makeClientSideData(EDIDataWrapper({large(), small(1)})),
-                                           IqmStreamID::ekIqmJavaStream, outTraits, errTraits, 3, 4, true);
+                                           IqmStreamID::ekIqmJavaStream, callOutTraits, callErrTraits, 3, 4, true);
     EXPECT_THROW(write(request, 1), boost::bad_get);
     ASSERT_EQ(indexes(frames()), (std::vector<FrameIndex>{1, 2, 3}));
     EXPECT_EQ(transport::contentOf(*frames()[1]).tag, "krutil:QDA");
@@ -162,8 +162,8 @@ TEST_F(FEvalIIPTest, TheRebuiltRequestTakesFourValuesFromItsCore) {
     ASSERT_NE(back, nullptr);
     EXPECT_EQ(back->getPluginType(), "console");
     EXPECT_EQ(back->getStreamID(), IqmStreamID::ekIqmJavaStream);
-    EXPECT_EQ(back->getOutTraits(), outTraits);
-    EXPECT_EQ(back->getErrTraits(), errTraits);
+    EXPECT_EQ(back->getOutTraits(), callOutTraits);
+    EXPECT_EQ(back->getErrTraits(), callErrTraits);
     EXPECT_EQ(back->getFunctionName(), "numpy.dot");
     EXPECT_EQ(back->getNlhs(), 2U);
     EXPECT_EQ(back->getClientQvmID(), 3U);

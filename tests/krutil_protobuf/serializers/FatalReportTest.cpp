@@ -5,7 +5,7 @@
 
 #include <boost/make_shared.hpp>
 
-#include <limits>
+#include <climits>
 
 #include "DebugLoopEventSerializer.hpp"
 #include "EvalIIPSerializer.hpp"
@@ -38,8 +38,6 @@ using krutil::protobuf_serializer::toProtobuf;
 using transport::readObject;
 namespace modes = krutil::cmddistributor::WhenToDequeue;
 namespace wire = krutil::protobuf;
-
-constexpr int intMin = std::numeric_limits<int>::min();
 
 const std::string streamTypeOut =
     "fatal: Unsupported krutil::io::StreamTypeEnum value (StreamTypeSerializer:28, static krutil::protobuf::StreamType "
@@ -79,34 +77,34 @@ using FatalReportDeathTest = fatal::FatalTest;
 // ---- The conversions ------------------------------------------------------------------------------------------------
 
 TEST_F(FatalReportDeathTest, StreamTypes) {
-    for (const int number : {3, -1, intMin}) {
+    for (const int number : {3, -1, INT_MIN}) {
         EXPECT_FATAL(StreamTypeSerializer::toProtobuf(static_cast<krutil::io::StreamTypeEnum>(number)), streamTypeOut);
         EXPECT_FATAL(StreamTypeSerializer::fromProtobuf(static_cast<wire::StreamType>(number)), streamTypeIn);
     }
 }
 
 TEST_F(FatalReportDeathTest, StreamIdentifiers) {
-    for (const int number : {7, -3, 1, 999, intMin}) {
+    for (const int number : {7, -3, 1, 999, INT_MIN}) {
         EXPECT_FATAL(IIPSerializer::toProtobuf(static_cast<cmddistributor::IqmStreamID>(number)), streamIDOut);
         EXPECT_FATAL(IIPSerializer::fromProtobuf(static_cast<wire::IqmStreamID>(number)), streamIDIn);
     }
 }
 
 TEST_F(FatalReportDeathTest, CodeTypesOfThisProcess) {
-    for (const int number : {4, -1, intMin}) {
+    for (const int number : {4, -1, INT_MIN}) {
         EXPECT_FATAL(EvalIIPSerializer::toProtobuf(static_cast<cmddistributor::CodeType>(number)), codeTypeOut);
     }
 }
 
 TEST_F(FatalReportDeathTest, DequeueModesOfThisProcess) {
-    for (const int number : {8, -1, intMin}) {
+    for (const int number : {8, -1, INT_MIN}) {
         EXPECT_FATAL(IIPEnqueueMessageSerializer::toProtobuf(static_cast<modes::WhenToDequeue>(number)),
                      dequeueModeOut);
     }
 }
 
 TEST_F(FatalReportDeathTest, ExecutionStatuses) {
-    for (const int number : {6, -1, intMin}) {
+    for (const int number : {6, -1, INT_MIN}) {
         EXPECT_FATAL(toProtobuf(static_cast<krutil::cmddistributor::inExecutionStatus>(number)), statusOut);
         EXPECT_FATAL(fromProtobuf(static_cast<wire::ExecutionStatus>(number)), statusIn);
     }
@@ -117,7 +115,7 @@ TEST_F(FatalReportDeathTest, LoopStatesAndLoopsOfThisProcess) {
         EXPECT_FATAL(DebugLoopEventSerializer::toProtobuf(static_cast<cmddistributor::DebugLoopEvent::State>(number)),
                      loopStateOut);
     }
-    for (const int number : {-2, 12, intMin}) {
+    for (const int number : {-2, 12, INT_MIN}) {
         EXPECT_FATAL(DebugLoopEventSerializer::toProtobuf(static_cast<krutil::prompt::InputRequester>(number)),
                      loopOut);
     }

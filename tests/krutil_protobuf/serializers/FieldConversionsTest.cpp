@@ -5,7 +5,7 @@
 #include <google/protobuf/stubs/logging.h>
 #include <gtest/gtest.h>
 
-#include <limits>
+#include <climits>
 #include <type_traits>
 
 #include "EvalIIPSerializer.hpp"
@@ -29,9 +29,6 @@ using krutil::protobuf_serializer::ustring_to_utf8;
 using krutil::protobuf_serializer::utf8_to_ustring;
 using transport::errorText;
 namespace wire = krutil::protobuf;
-
-constexpr int intMin = std::numeric_limits<int>::min();
-constexpr int intMax = std::numeric_limits<int>::max();
 
 // Without a fixed underlying type, a number outside the list would be undefined behaviour before anything could test
 // it.
@@ -193,19 +190,19 @@ TEST_F(IllFormedFieldTextTest, TheComplaintGoesToTheHostsLogHandler) {
 
 TEST(WireEnumTest, AnUnknownCodeTypeIsALogicErrorThatEndsInTheNumber) {
     const std::string prefix = "Invalid enum krutil::protobuf::CodeType field value = ";
-    for (const int number : {4, 9, -1, intMin, intMax}) {
+    for (const int number : {4, 9, -1, INT_MIN, INT_MAX}) {
         EXPECT_EQ(
             errorText<std::logic_error>([&] { EvalIIPSerializer::fromProtobuf(static_cast<wire::CodeType>(number)); }),
             prefix + std::to_string(number));
     }
     EXPECT_EQ(
-        errorText<std::logic_error>([&] { EvalIIPSerializer::fromProtobuf(static_cast<wire::CodeType>(intMin)); }),
+        errorText<std::logic_error>([&] { EvalIIPSerializer::fromProtobuf(static_cast<wire::CodeType>(INT_MIN)); }),
         "Invalid enum krutil::protobuf::CodeType field value = -2147483648");
 }
 
 TEST(WireEnumTest, AnUnknownDequeueModeIsALogicErrorWithAWordOrderOfItsOwn) {
     const std::string prefix = "Invalid enum field value krutil::protobuf::IIPEnqueueMessage.WhenToDequeue = ";
-    for (const int number : {8, -1, intMin, intMax}) {
+    for (const int number : {8, -1, INT_MIN, INT_MAX}) {
         EXPECT_EQ(errorText<std::logic_error>(
                       [&] { IIPEnqueueMessageSerializer::fromProtobuf(static_cast<wire::WhenToDequeue>(number)); }),
                   prefix + std::to_string(number));

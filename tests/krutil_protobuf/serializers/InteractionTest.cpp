@@ -5,6 +5,7 @@
 
 #include <bit>
 #include <boost/make_shared.hpp>
+#include <climits>
 #include <limits>
 #include <stdexcept>
 
@@ -42,8 +43,6 @@ using transport::errorText;
 using transport::readObject;
 namespace wire = krutil::protobuf;
 
-constexpr int intMin = std::numeric_limits<int>::min();
-
 template <class Event>
 const Event& asEvent(const samples::Object& object) {
     using foundation::msg_svc::eventmgr::BaseEvent;
@@ -74,7 +73,7 @@ TEST(IIPCancelMessageTest, AnAbsentEvenIfRunningReadsAsFalse) {
 }
 
 TEST(IIPCancelReplyTest, AnyStatusPassesUncheckedInBothDirections) {
-    for (const int number : {0, 1, 2, 3, 7, -1, intMin}) {
+    for (const int number : {0, 1, 2, 3, 7, -1, INT_MIN}) {
         const wire::IIPCancelReply proto =
             IIPCancelReplySerializer::toProtobuf(IIPCancelReply(static_cast<IIPCancelReply::CancelStatus>(number)));
         EXPECT_EQ(static_cast<int>(proto.status()), number);
@@ -120,14 +119,14 @@ TEST(DebugLoopEventTest, StateZeroIsRefusedAlthoughItIsTheDefault) {
     EXPECT_EQ(errorText<std::logic_error>([] { readObject("krutil:DebugLoopEvent", ""); }), prefix + "0");
     EXPECT_EQ(debugLoopRefusal(3, 0), prefix + "3");
     EXPECT_EQ(debugLoopRefusal(-1, 0), prefix + "-1");
-    EXPECT_EQ(debugLoopRefusal(intMin, 0), prefix + "-2147483648");
+    EXPECT_EQ(debugLoopRefusal(INT_MIN, 0), prefix + "-2147483648");
 }
 
 TEST(DebugLoopEventTest, LoopsBelowMinusOneAndAbove11AreRefused) {
     const std::string prefix = "Invalid enum krutil::protobuf::InputRequester field value = ";
     EXPECT_EQ(debugLoopRefusal(1, 12), prefix + "12");
     EXPECT_EQ(debugLoopRefusal(1, -2), prefix + "-2");
-    EXPECT_EQ(debugLoopRefusal(1, intMin), prefix + "-2147483648");
+    EXPECT_EQ(debugLoopRefusal(1, INT_MIN), prefix + "-2147483648");
     EXPECT_EQ(debugLoopRefusal(1, -1), "no exception");
 }
 

@@ -10,6 +10,7 @@
 #include <limits>
 #include <vector>
 
+#include "apps/krutil/arrays/MadeArray.hpp"
 #include "foundation/korveldata/ArrayFactory.hpp"
 
 namespace krutil_client {
@@ -18,14 +19,8 @@ namespace {
 using foundation::korveldata::Array;
 using foundation::korveldata::ArrayFactory;
 using foundation::korveldata::ElementType;
-using foundation::korveldata::ElementTypeOf;
 using foundation::korveldata::MemoryOrder;
 using Complex = std::complex<double>;
-
-template <class T>
-Array make(const std::vector<std::uint64_t>& dimensions, const std::vector<T>& elements) {
-    return ArrayFactory().createArray(ElementTypeOf<T>::value, dimensions, MemoryOrder::RowMajor, elements.data());
-}
 
 struct Good {
     const char* text;

@@ -10,6 +10,7 @@
 #include <numeric>
 #include <vector>
 
+#include "apps/krutil/arrays/MadeArray.hpp"
 #include "foundation/korveldata/ArrayFactory.hpp"
 
 namespace krutil_client {
@@ -18,14 +19,7 @@ namespace {
 using foundation::korveldata::Array;
 using foundation::korveldata::ArrayFactory;
 using foundation::korveldata::ElementType;
-using foundation::korveldata::ElementTypeOf;
 using foundation::korveldata::MemoryOrder;
-
-template <class T>
-Array make(const std::vector<std::uint64_t>& dimensions, const std::vector<T>& elements,
-           MemoryOrder order = MemoryOrder::RowMajor) {
-    return ArrayFactory().createArray(ElementTypeOf<T>::value, dimensions, order, elements.data());
-}
 
 Array counted(const std::vector<std::uint64_t>& dimensions, MemoryOrder order = MemoryOrder::RowMajor) {
     std::vector<std::int32_t> elements(

@@ -17,6 +17,7 @@
 #include <sstream>
 #include <vector>
 
+#include "apps/krutil/arrays/MadeArray.hpp"
 #include "foundation/korveldata/ArrayFactory.hpp"
 #include "krutil/base/ExitCode.hpp"
 #include "support/TemporaryDirectory.hpp"
@@ -27,7 +28,6 @@ namespace {
 using foundation::korveldata::Array;
 using foundation::korveldata::ArrayFactory;
 using foundation::korveldata::ElementType;
-using foundation::korveldata::ElementTypeOf;
 using foundation::korveldata::MemoryOrder;
 using ::testing::HasSubstr;
 
@@ -88,12 +88,6 @@ std::string npy(const std::string& header, const std::string& content = {}, char
 
 std::string headerOf(const std::string& descr, const std::string& shape) {
     return "{'descr': '" + descr + "', 'fortran_order': False, 'shape': " + shape + ", }\n";
-}
-
-template <class T>
-Array make(const std::vector<std::uint64_t>& dimensions, const std::vector<T>& elements,
-           MemoryOrder order = MemoryOrder::RowMajor) {
-    return ArrayFactory().createArray(ElementTypeOf<T>::value, dimensions, order, elements.data());
 }
 
 const std::vector<std::pair<const char*, ElementType>> types{{"bool", ElementType::Bool},

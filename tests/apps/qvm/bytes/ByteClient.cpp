@@ -11,14 +11,6 @@
 namespace qvm_test {
 namespace {
 
-std::uint64_t number(const std::string& bytes, std::size_t position, std::size_t count) {
-    std::uint64_t value = 0;
-    for (std::size_t i = 0; i < count; ++i) {
-        value |= std::uint64_t{static_cast<unsigned char>(bytes.at(position + i))} << (8 * i);
-    }
-    return value;
-}
-
 bool isReply(const std::string& tag) {
     return tag == "krutil:IIPReply" || tag == "krutil:IIPCancelReply";
 }
@@ -41,11 +33,11 @@ Received ByteClient::read() {
             return {};
         }
         ReceivedFrame frame;
-        const auto kind = static_cast<unsigned>(number(header, 0, 1));
+        const auto kind = static_cast<unsigned>(wire::number(header, 0, 1));
         frame.kind = kind & 0x7FU;
-        frame.tag = end_.read(number(header, 2, 2));
-        frame.content = end_.read(number(header, 16, 8));
-        message.stream = static_cast<std::uint32_t>(number(header, 4, 4));
+        frame.tag = end_.read(wire::number(header, 2, 2));
+        frame.content = end_.read(wire::number(header, 16, 8));
+        message.stream = static_cast<std::uint32_t>(wire::number(header, 4, 4));
         message.frames.push_back(std::move(frame));
         if ((kind & 0x80U) != 0 || message.frames.back().kind == 4) {
             break;

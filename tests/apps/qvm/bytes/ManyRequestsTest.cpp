@@ -12,14 +12,6 @@
 namespace qvm_test {
 namespace {
 
-std::uint64_t number(const std::string& bytes, std::size_t position, std::size_t size) {
-    std::uint64_t value = 0;
-    for (std::size_t i = size; i-- > 0;) {
-        value = value << 8 | static_cast<unsigned char>(bytes.at(position + i));
-    }
-    return value;
-}
-
 // What an engine has written after the handshake.
 struct Account {
     std::vector<unsigned> replies;  // by stream ID
@@ -32,9 +24,9 @@ Account accountOf(const std::string& bytes, std::size_t streams) {
     Account account;
     account.replies.resize(streams + 1);
     for (std::size_t position = 0; position + 24 <= bytes.size();) {
-        const auto tagSize = static_cast<std::size_t>(number(bytes, position + 2, 2));
-        const auto stream = static_cast<std::size_t>(number(bytes, position + 4, 4));
-        const auto contentSize = static_cast<std::size_t>(number(bytes, position + 16, 8));
+        const auto tagSize = static_cast<std::size_t>(wire::number(bytes, position + 2, 2));
+        const auto stream = static_cast<std::size_t>(wire::number(bytes, position + 4, 4));
+        const auto contentSize = static_cast<std::size_t>(wire::number(bytes, position + 16, 8));
         account.lastTag = bytes.substr(position + 24, tagSize);
         const std::string content = bytes.substr(position + 24 + tagSize, contentSize);
         if (tagSize == 0) {

@@ -16,6 +16,15 @@ inline std::string little(std::uint64_t number, int count) {
     return bytes;
 }
 
+/// The number that `count` bytes at `position` are, the least significant first. Throws std::out_of_range without them.
+inline std::uint64_t number(const std::string& bytes, std::size_t position, int count) {
+    std::uint64_t value = 0;
+    for (int i = 0; i < count; ++i) {
+        value |= std::uint64_t{static_cast<unsigned char>(bytes.at(position++))} << (8 * i);
+    }
+    return value;
+}
+
 struct Header {
     unsigned kind = 1;
     bool last = true;
