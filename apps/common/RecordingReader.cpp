@@ -53,7 +53,7 @@ std::string rangeText(std::uint64_t first, std::uint64_t size) {
 
 }  // namespace
 
-RecordingReader::RecordingReader(const std::string& file, std::uint64_t keep, std::function<void(int)> wait)
+RecordingReader::RecordingReader(const std::string& file, std::function<void(int)> wait, std::uint64_t keep)
     : packets_(file, std::move(wait)), keep_(keep) {}
 
 // Which bytes of its unit a packet has: its comment says so, one without such a comment is a unit.

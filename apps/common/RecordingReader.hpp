@@ -59,10 +59,10 @@ struct RecordedSession {
 /// synchronised.
 class RecordingReader {
   public:
-    /// "-" reads standard input. Of each unit the first `keep` bytes are kept. `wait` is called with the descriptor
-    /// before each read, which may block otherwise; empty for nothing. Throws std::system_error with a sentence.
-    explicit RecordingReader(const std::string& file, std::uint64_t keep = std::numeric_limits<std::uint64_t>::max(),
-                             std::function<void(int)> wait = nullptr);
+    /// "-" reads standard input. `wait` is called with the descriptor before each read, which may block otherwise;
+    /// empty for nothing. Of each unit the first `keep` bytes are kept. Throws std::system_error with a sentence.
+    explicit RecordingReader(const std::string& file, std::function<void(int)> wait = nullptr,
+                             std::uint64_t keep = std::numeric_limits<std::uint64_t>::max());
 
     /// The next unit; empty at the end of what is there. A later call goes on when there is more. Throws
     /// RecordingError, and std::system_error when the file cannot be read.

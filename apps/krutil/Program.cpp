@@ -1,7 +1,6 @@
 #include "krutil/Program.hpp"
 
 #include <fcntl.h>
-#include <poll.h>
 #include <termios.h>
 #include <unistd.h>
 
@@ -209,11 +208,9 @@ bool wantsAnother(Terminal& terminal) {
     ssize_t got = -1;
     try {
         while (got < 0) {
-            std::array<pollfd, 2> watched{pollfd{STDIN_FILENO, POLLIN, 0}, pollfd{terminal.interrupt.fd(), POLLIN, 0}};
-            ::poll(watched.data(), watched.size(), -1);
-            terminal.interrupt.dispatch();
-            got = watched[0].revents != 0 ? ::read(STDIN_FILENO, answer.data(), answer.size()) : -1;
-            if (got < 0 && watched[0].revents != 0 && errno != EINTR) {
+            terminal.interrupt.waitForInput(STDIN_FILENO);
+            got = ::read(STDIN_FILENO, answer.data(), answer.size());
+            if (got < 0 && errno != EINTR) {
                 got = 0;
             }
         }
@@ -269,7 +266,7 @@ ExitCode runCommand(const Options& options, const ReplayOptions& replay, Printer
 
 ExitCode runCommand(const Options&, const InspectOptions& inspect, Printer&, Terminal& terminal) {
     if (!inspect.redacted.empty()) {
-        if (const auto note = redactRecording(inspect.file, inspect.redacted)) {
+        if (const auto note = redactRecording(inspect.file, inspect.redacted, terminal.interrupt)) {
             terminal.err.write("krutil: " + *note + "\n");
         }
         return ExitCode::Ok;

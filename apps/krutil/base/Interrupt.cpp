@@ -1,9 +1,11 @@
 #include "krutil/base/Interrupt.hpp"
 
 #include <fcntl.h>
+#include <poll.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include <array>
 #include <atomic>
 #include <cerrno>
 #include <csignal>
@@ -60,6 +62,15 @@ void Interrupt::dispatch(const std::function<void()>& before) {
         // A copy: the action may replace itself.
         const auto action = action_;
         action();
+    }
+}
+
+void Interrupt::waitForInput(int input) {
+    std::array<pollfd, 2> watched{pollfd{input, POLLIN, 0}, pollfd{fd(), POLLIN, 0}};
+    while (watched[0].revents == 0) {
+        // A signal ends the call, so fd() is looked at again.
+        ::poll(watched.data(), watched.size(), -1);
+        dispatch();
     }
 }
 

@@ -29,6 +29,10 @@ class Interrupt {
     /// reaches the caller.
     void dispatch(const std::function<void()>& before = nullptr);
 
+    /// Returns when `input` has bytes or has ended, however long that takes, and calls dispatch() until then and once
+    /// before it returns. A call that reads after that does not wait.
+    void waitForInput(int input);
+
     /// Makes fd() readable without a Ctrl-C, so that whatever waits looks around. For signal handlers.
     static void wake() noexcept;
 

@@ -39,8 +39,8 @@ bool show(const std::vector<Compared>& all, Output& out) {
 }
 
 // The session that can be said to a client.
-Talk onlyTalk(const std::string& file) {
-    std::vector<Talk> talks = readTalks(file);
+Talk onlyTalk(const std::string& file, Interrupt& interrupt) {
+    std::vector<Talk> talks = readTalks(file, interrupt);
     const auto refuse = [&file](const std::string& reason) {
         throw Failure(ExitCode::Usage, "cannot replay '" + file + "' to a client: " + reason);
     };
@@ -65,7 +65,7 @@ ExitCode serveRecording(const ConnectionOptions& connection, const ReplayOptions
                       "with --serve, standard input and output carry the session with a client: expected a file with a "
                       "name, in a command that a client starts as its engine");
     }
-    const Talk talk = onlyTalk(options.file);
+    const Talk talk = onlyTalk(options.file, interrupt);
     const Served served = serve(posix::OwnedDescriptor(STDIN_FILENO), posix::OwnedDescriptor(STDOUT_FILENO), talk,
                                 connection.handshakeTimeout, options.patience, interrupt,
                                 [&err](const std::string& sentence) { err.write(sentence + "\n"); });
@@ -75,7 +75,7 @@ ExitCode serveRecording(const ConnectionOptions& connection, const ReplayOptions
 ExitCode replayRecording(const ConnectionOptions& connection, const ReplayOptions& options, Output& out,
                          Interrupt& interrupt) {
     bool same = true;
-    for (const Talk& talk : readTalks(options.file)) {
+    for (const Talk& talk : readTalks(options.file, interrupt)) {
         EngineProcess engine = findEngine(connection);
         const Played played = play(engine.takeStream(), talk, connection.handshakeTimeout, options.patience, interrupt,
                                    [&engine] { engine.takeTerminalBack(); });

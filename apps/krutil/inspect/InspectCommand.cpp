@@ -1,9 +1,6 @@
 #include "krutil/inspect/InspectCommand.hpp"
 
-#include <poll.h>
-
 #include <algorithm>
-#include <array>
 #include <cmath>
 #include <limits>
 #include <nlohmann/json.hpp>
@@ -62,8 +59,9 @@ class Inspection {
         : options_(options),
           out_(out),
           err_(err),
-          reader_(options.file, options.hex || options.lint ? std::numeric_limits<std::uint64_t>::max() : keptBytes,
-                  [&interrupt](int fd) { waitFor(fd, interrupt); }),
+          reader_(
+              options.file, [&interrupt](int fd) { interrupt.waitForInput(fd); },
+              options.hex || options.lint ? std::numeric_limits<std::uint64_t>::max() : keptBytes),
           messages_(options.hex) {}
 
     ExitCode run() {
@@ -92,17 +90,6 @@ class Inspection {
     }
 
   private:
-    // A pipe may be silent for long.
-    static void waitFor(int fd, Interrupt& interrupt) {
-        std::array<pollfd, 2> watched{pollfd{fd, POLLIN, 0}, pollfd{interrupt.fd(), POLLIN, 0}};
-        while (watched[0].revents == 0) {
-            ::poll(watched.data(), watched.size(), -1);
-            if (watched[1].revents != 0) {
-                interrupt.dispatch();
-            }
-        }
-    }
-
     void say(const char* event, const std::string& sentence) {
         if (options_.json) {
             out_.write(jsonLine({{"event", event}, {"text", sentence}}));

@@ -8,6 +8,7 @@
 #include "common/PcapngBlocks.hpp"
 #include "common/RecordingReader.hpp"
 #include "krutil/base/ExitCode.hpp"
+#include "krutil/base/Interrupt.hpp"
 #include "krutil/inspect/NewFile.hpp"
 #include "krutil/inspect/Redaction.hpp"
 
@@ -54,9 +55,9 @@ class Copy {
 
 }  // namespace
 
-std::optional<std::string> redactRecording(const std::string& file, const std::string& out) {
+std::optional<std::string> redactRecording(const std::string& file, const std::string& out, Interrupt& interrupt) {
     try {
-        apps::RecordingReader reader(file);
+        apps::RecordingReader reader(file, [&interrupt](int fd) { interrupt.waitForInput(fd); });
         Copy copy(out);
         std::size_t sessions = 0;
         while (auto unit = reader.next()) {

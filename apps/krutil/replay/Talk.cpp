@@ -8,6 +8,7 @@
 #include "common/FrameBytes.hpp"
 #include "common/RecordingReader.hpp"
 #include "krutil/base/ExitCode.hpp"
+#include "krutil/base/Interrupt.hpp"
 
 namespace krutil_client {
 namespace {
@@ -167,11 +168,11 @@ std::string framesOf(const Said& said) {
     return bytes;
 }
 
-std::vector<Talk> readTalks(const std::string& file) {
+std::vector<Talk> readTalks(const std::string& file, Interrupt& interrupt) {
     std::vector<TalkReader> readers;
     std::uint64_t last = 0;
     try {
-        apps::RecordingReader reader(file);
+        apps::RecordingReader reader(file, [&interrupt](int fd) { interrupt.waitForInput(fd); });
         while (const auto unit = reader.next()) {
             for (std::size_t i = readers.size(); i <= unit->session; ++i) {
                 readers.emplace_back(file, reader.sessions()[i]);

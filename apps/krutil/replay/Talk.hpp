@@ -11,6 +11,8 @@
 
 namespace krutil_client {
 
+class Interrupt;
+
 /// A frame of a message. A content that was in shared memory is data like any other.
 struct SaidFrame {
     bool tagged = false;
@@ -67,7 +69,7 @@ struct Talk {
 
 /// The sessions of a recording that can be replayed. Throws Failure with a sentence for one that cannot be read, and
 /// for one that cannot be replayed: it begins without the handshake, or has frames of which only the beginnings are
-/// there.
-std::vector<Talk> readTalks(const std::string& file);
+/// there. Throws what `interrupt` throws while the file, a pipe perhaps, says nothing.
+std::vector<Talk> readTalks(const std::string& file, Interrupt& interrupt);
 
 }  // namespace krutil_client

@@ -206,7 +206,7 @@ TEST_F(RecordingReaderTest, KeepsAsMuchOfAUnitAsIsAskedFor) {
     Recording made = recording();
     made.beginSession(Recording::Role::Client, "krutil");
     record(made, Recording::Direction::Sent, Recording::Part::Frame, std::string(600'000, 'a'));
-    RecordingReader reader(file_, 262'130);
+    RecordingReader reader(file_, nullptr, 262'130);
     const auto unit = reader.next();
     ASSERT_TRUE(unit.has_value());
     EXPECT_EQ(unit->bytes.size(), 262'130U);

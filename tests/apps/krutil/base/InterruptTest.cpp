@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include <csignal>
+#include <thread>
 
 #include "krutil/base/ExitCode.hpp"
 
@@ -69,6 +70,35 @@ TEST(InterruptTest, WakingIsNoCtrlC) {
     EXPECT_TRUE(readable(interrupt.fd()));
     interrupt.dispatch();
     EXPECT_FALSE(readable(interrupt.fd()));
+}
+
+TEST(InterruptTest, InputIsWaitedForUntilCtrlC) {
+    Interrupt interrupt;
+    int ends[2];
+    ASSERT_EQ(::pipe(ends), 0);
+    const foundation::core::posix::OwnedDescriptor input(ends[0]);
+    foundation::core::posix::OwnedDescriptor output(ends[1]);
+    ::raise(SIGINT);
+    EXPECT_THROW(interrupt.waitForInput(input.get()), Cancelled);
+    // Ctrl-C counts where there is input, too: a file without end always has some.
+    ASSERT_EQ(::write(output.get(), "1", 1), 1);
+    interrupt.waitForInput(input.get());
+    ::raise(SIGINT);
+    EXPECT_THROW(interrupt.waitForInput(input.get()), Cancelled);
+    char byte = 0;
+    ASSERT_EQ(::read(input.get(), &byte, 1), 1);
+    // An action that does not throw, and a wake-up, are no input.
+    int pressed = 0;
+    interrupt.setAction([&] {
+        ++pressed;
+        output.reset();
+    });
+    Interrupt::wake();
+    std::thread person([main = ::pthread_self()] { ::pthread_kill(main, SIGINT); });
+    interrupt.waitForInput(input.get());
+    person.join();
+    EXPECT_EQ(pressed, 1);
+    EXPECT_EQ(::read(input.get(), &byte, 1), 0);
 }
 
 TEST(InterruptTest, CtrlCAfterItsEndDoesNothing) {

@@ -12,6 +12,7 @@
 
 #include "common/Recording.hpp"
 #include "krutil/base/ExitCode.hpp"
+#include "krutil/base/Interrupt.hpp"
 #include "support/Pcapng.hpp"
 #include "support/TemporaryDirectory.hpp"
 
@@ -47,9 +48,9 @@ class RedactedCopyTest : public ::testing::Test {
     }
 
     // The sentence with which a copy is refused.
-    std::string refusal() const {
+    std::string refusal() {
         try {
-            redactRecording(file_, out_);
+            redactRecording(file_, out_, interrupt_);
         } catch (const Failure& failure) {
             EXPECT_EQ(failure.code(), ExitCode::Usage);
             return failure.what();
@@ -60,11 +61,12 @@ class RedactedCopyTest : public ::testing::Test {
     const test_support::TemporaryDirectory directory_{};
     const std::string file_ = directory_.file("session.pcapng");
     const std::string out_ = directory_.file("redacted.pcapng");
+    Interrupt interrupt_{};
 };
 
 TEST_F(RedactedCopyTest, HasTheSamePackets) {
     recordSession();
-    EXPECT_EQ(redactRecording(file_, out_), std::nullopt);
+    EXPECT_EQ(redactRecording(file_, out_, interrupt_), std::nullopt);
     EXPECT_EQ(std::filesystem::file_size(out_), std::filesystem::file_size(file_));
     const auto before = test_support::packetsOf(contentOf(file_));
     const auto now = test_support::packetsOf(contentOf(out_));
@@ -87,7 +89,7 @@ TEST_F(RedactedCopyTest, HasTheSamePackets) {
 
 TEST_F(RedactedCopyTest, CutFramesStayCut) {
     recordSession(100);
-    EXPECT_EQ(redactRecording(file_, out_), std::nullopt);
+    EXPECT_EQ(redactRecording(file_, out_, interrupt_), std::nullopt);
     const auto packets = test_support::packetsOf(contentOf(out_));
     EXPECT_EQ(packets.back().comment, "bytes 0-99 of 600024");
     EXPECT_EQ(packets.back().original, 16U + 600'024U);
@@ -109,7 +111,7 @@ TEST_F(RedactedCopyTest, WhatIsNoRecordingIsRefused) {
 TEST_F(RedactedCopyTest, BeginningOfAFrameIsLeftOut) {
     recordSession();
     std::filesystem::resize_file(file_, std::filesystem::file_size(file_) - 100);
-    const auto note = redactRecording(file_, out_);
+    const auto note = redactRecording(file_, out_, interrupt_);
     ASSERT_TRUE(note);
     EXPECT_THAT(*note, ::testing::StartsWith("the recording ends within a block, at byte "));
     EXPECT_EQ(test_support::packetsOf(contentOf(out_)).size(), 4U);
