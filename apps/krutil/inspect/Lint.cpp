@@ -60,17 +60,6 @@ std::map<std::string, std::string> featuresOf(const msg_svc::protobuf::SessionVe
     return features;
 }
 
-rules::Limits limitsOf(const msg_svc::protobuf::SessionHello& hello) {
-    rules::Limits limits;
-    limits.tag = std::min<std::uint64_t>(hello.limits().tag(), rules::Limits::longestTag);
-    limits.taggedFrame = hello.limits().taggedframe();
-    limits.arrayMessage = hello.limits().arraymessage();
-    limits.message = hello.limits().message();
-    limits.frames = hello.limits().frames();
-    limits.parts = hello.limits().parts() != 0 ? hello.limits().parts() : rules::WireWalk::anyParts;
-    return limits;
-}
-
 }  // namespace
 
 void Lint::takeHello(const apps::RecordedUnit& unit, End& end) {
@@ -144,8 +133,8 @@ void Lint::settle(const apps::RecordedSession& recorded, Session& session) {
     config.check = apps::precheck(true);
     const auto features = featuresOf(*client.verdict);
     session.checker = std::make_unique<rules::SessionChecker>(
-        config, rules::SessionChecker::Settled{limitsOf(*client.hello),
-                                               limitsOf(*engine.hello),
+        config, rules::SessionChecker::Settled{rules::limitsFrom(client.hello->limits()),
+                                               rules::limitsFrom(engine.hello->limits()),
                                                {features.begin(), features.end()},
                                                probed && client.descriptors && engine.descriptors,
                                                features.contains("KEEPALIVE")});

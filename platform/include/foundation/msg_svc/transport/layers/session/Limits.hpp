@@ -3,6 +3,10 @@
 
 #include <cstdint>
 
+namespace msg_svc::protobuf {
+class SessionLimits;
+}
+
 namespace foundation::msg_svc::transport::layers::session {
 
 /// Each end states its own limits in the handshake, so that a sender refuses first what the receiver would refuse. A
@@ -19,5 +23,8 @@ struct Limits {
 
     bool operator==(const Limits&) const = default;  ///< the same in every part
 };
+
+/// What an end accepts that has told these limits in its first message.
+Limits limitsFrom(const ::msg_svc::protobuf::SessionLimits& told);
 
 }  // namespace foundation::msg_svc::transport::layers::session

@@ -270,13 +270,7 @@ std::string join(const std::vector<std::string>& mismatches) {
 Peer peerOf(const SessionHello& hello) {
     Peer peer;
     peer.build = sentence(hello.build(), longestBuild);
-    peer.limits.tag = std::min<std::uint64_t>(hello.limits().tag(), Limits::longestTag);
-    peer.limits.taggedFrame = hello.limits().taggedframe();
-    peer.limits.arrayMessage = hello.limits().arraymessage();
-    peer.limits.message = hello.limits().message();
-    peer.limits.frames = hello.limits().frames();
-    // An end that does not know this limit has none.
-    peer.limits.parts = hello.limits().parts() != 0 ? hello.limits().parts() : WireWalk::anyParts;
+    peer.limits = limitsFrom(hello.limits());
     for (const std::uint64_t number : hello.capabilities()) {
         // Capabilities that this end has no bit for are none that it could use.
         if (number <= 63) {
