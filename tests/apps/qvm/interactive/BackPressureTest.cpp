@@ -148,7 +148,8 @@ class BackPressureTest : public testing::TestWithParam<EventKind> {
             const std::uint64_t now = numbers_.count();
             same = now > 0 && now == last && sleeps(engine_.process.pid()) ? same + 1 : 0;
             last = now;
-            grown_ = residentBytes(engine_.process.pid()) - std::min(before, residentBytes(engine_.process.pid()));
+            const std::size_t resident = residentBytes(engine_.process.pid());
+            grown_ = resident - std::min(before, resident);
             return same >= 30 || grown_ > mostGrowth;
         }));
         EXPECT_LE(grown_, mostGrowth) << "after " << numbers_.count() << " events";
