@@ -35,7 +35,8 @@ class ForkTest : public testing::Test {
     EngineSession engine_;
 };
 
-// The thread sanitizer does not support forks of processes with threads; this suite is not run under it.
+// The thread sanitizer does not support forks of processes with threads, and loses signals that such a child is ended by;
+// this suite is not run under it.
 using ThreadForkTest = ForkTest;
 
 TEST_F(ForkTest, ForkedChildWritesToThePlainDescriptors) {
@@ -128,7 +129,7 @@ TEST_F(ThreadForkTest, ThreadThatForksLeavesAChildThatEndsWithIt) {
     expectWholeSession();
 }
 
-TEST_F(ForkTest, MultiprocessingWorks) {
+TEST_F(ThreadForkTest, MultiprocessingWorks) {
     const Evaluation result = client().eval(
         "import multiprocessing\n"
         "def square(x):\n"
