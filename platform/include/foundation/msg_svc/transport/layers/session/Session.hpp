@@ -74,7 +74,7 @@ class Session {
     /// peer that is gone must not end it.
     ///
     /// Throws HandshakeRefused, ProtocolViolation (the peer does not speak this layout), StreamLost (closed or timed
-    /// out), std::out_of_range (unknown protocol name here).
+    /// out), std::out_of_range (unknown protocol name here), std::system_error (the process may have no more threads).
     static std::unique_ptr<Session> open(int in, int out, SessionConfig config);
 
     /// Tells the peer at the other end of a new socket that there is no session for it, with this sentence. The peer's

@@ -2,18 +2,22 @@
 
 #include <pthread.h>
 
+#include <system_error>
+
 #include "foundation/core/posix/SignalsBlocked.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 
 void IoThread::start() {
-    std::call_once(started_, [this] {
-        const core::posix::SignalsBlocked blocked;
+    const core::posix::SignalsBlocked blocked;
+    try {
         thread_ = std::thread([this] {
             ::pthread_setname_np(::pthread_self(), "session-io");
             io_.run();
         });
-    });
+    } catch (const std::system_error& error) {
+        throw std::system_error(error.code(), "The thread of a session cannot be started");
+    }
 }
 
 void IoThread::join() {

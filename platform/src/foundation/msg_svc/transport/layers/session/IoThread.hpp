@@ -8,24 +8,23 @@
 
 namespace foundation::msg_svc::transport::layers::session {
 
-/// Runs what is posted to an `io_context`. Members may be called from any thread.
+/// Runs what is posted to an `io_context`. Members may be called from any thread, but start() once and before them.
 class IoThread {
   public:
     explicit IoThread(asio::io_context& io) : io_(io), work_(io.get_executor()) {}
 
-    /// Starts the thread, unless it was started. Signals are not delivered to it.
+    /// Starts the thread. Signals are not delivered to it. Throws std::system_error where the process may have no more.
     void start();
 
     /// Lets the thread end when nothing is left to be done. On the thread itself.
     void release() { work_.reset(); }
 
-    /// Waits for the thread's end. Several threads may, and it may not have been started.
+    /// Waits for the thread's end. Several threads may.
     void join();
 
   private:
     asio::io_context& io_;
     asio::executor_work_guard<asio::io_context::executor_type> work_;
-    std::once_flag started_;
     std::mutex joinMutex_;
     std::thread thread_;
 };

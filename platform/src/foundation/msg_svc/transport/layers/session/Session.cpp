@@ -122,7 +122,10 @@ Session::Impl::Impl(StreamDescriptors& stream, SessionConfig sessionConfig, Sett
       shared_(settlement.sharedMemory ? std::make_unique<lending::SharedMemory>(config.role, outgoing_) : nullptr),
       keepAlive_(io_, config, settlement.keepAlive, exchanges_, outgoing_),
       incoming_(io_, stream.in, config, settlement.registry, settlement.arrayTag, exchanges_, outgoing_, shared_.get(),
-                keepAlive_, *this) {}
+                keepAlive_, *this) {
+    // Here and not when it is needed, because an end of the session must not fail.
+    thread_.start();
+}
 
 void Session::Impl::start(SessionHandler& handler) {
     asio::post(io_, [this, &handler] {
@@ -134,7 +137,6 @@ void Session::Impl::start(SessionHandler& handler) {
             keepAlive_.start();
         }
     });
-    thread_.start();
 }
 
 framing::StreamID Session::Impl::newStreamID() {
@@ -336,7 +338,6 @@ void Session::Impl::close(std::chrono::milliseconds patience) {
     if (abandoned) {
         return;
     }
-    thread_.start();
     asio::post(io_, [this, patience] {
         beginClose(patience);
         // The thread outlives the stream until somebody waits for it here, so that a session which ended before it was
@@ -352,7 +353,6 @@ void Session::Impl::abort(const std::string& text) {
     }
     incoming_.silence();
     asio::post(io_, [this, text] { onViolation(text); });
-    thread_.start();
 }
 
 void Session::Impl::finish(SessionEnd end, const std::string& abortReason) {
