@@ -35,8 +35,8 @@ class ForkTest : public testing::Test {
     EngineSession engine_;
 };
 
-// The thread sanitizer does not support forks of processes with threads, and loses signals that such a child is ended by;
-// this suite is not run under it.
+// The thread sanitizer does not support forks of processes with threads, and loses signals that such a child is ended
+// by; this suite is not run under it.
 using ThreadForkTest = ForkTest;
 
 TEST_F(ForkTest, ForkedChildWritesToThePlainDescriptors) {
