@@ -1,0 +1,147 @@
+"""Client or engine with system calls that go wrong, at each of their call sites in turn.
+
+Whatever goes wrong: the programs end in time, by themselves, with one of their exit codes and not by a signal; nobody is
+left behind; and either the output is whole or a sentence says what has happened.
+
+    faults_test.py PROGRAM KRUTIL KRUTIL-QVM LIBRARY
+
+PROGRAM, krutil or krutil-qvm, is the one whose calls go wrong. LIBRARY makes them go wrong (Faults.cpp).
+"""
+
+import concurrent.futures
+import ctypes
+import errno
+import os
+import pathlib
+import re
+import subprocess
+import sys
+import tempfile
+import time
+import unittest
+
+PROGRAM, CLIENT, ENGINE, LIBRARY = sys.argv[1:5]
+
+# Longer than any time limit of the programs.
+PATIENCE = 60
+
+# Output in many pieces, by Python and past it, and a value.
+CODE = """\
+import os
+for i in range(20): print("line", i)
+b = os.write(1, b"past Python\\n")
+6 * 7
+"""
+OUTPUT = "".join(f"line {i}\n" for i in range(20)) + "past Python\n42\n"
+
+MANY_LINES = 'for i in range(5000): print("long " * 20)'
+
+# What each call may fail with that a machine out of something returns, or a peer that has gone.
+ERRORS = {
+    "read": [errno.EIO], "readv": [errno.ECONNRESET], "recv": [errno.ECONNRESET], "recvmsg": [errno.ECONNRESET],
+    "write": [errno.ENOSPC], "writev": [errno.EPIPE], "send": [errno.EPIPE], "sendmsg": [errno.EPIPE, errno.ENOMEM],
+    "poll": [errno.ENOMEM], "ppoll": [errno.ENOMEM], "epoll_wait": [errno.EINTR],
+    "open": [errno.EMFILE, errno.ENOSPC], "socket": [errno.EMFILE], "socketpair": [errno.EMFILE],
+    "pipe": [errno.EMFILE], "pipe2": [errno.EMFILE], "eventfd": [errno.EMFILE], "timerfd_create": [errno.EMFILE],
+    "epoll_create1": [errno.EMFILE], "memfd_create": [errno.EMFILE, errno.ENOMEM], "dup2": [errno.EMFILE],
+    "ftruncate": [errno.ENOSPC], "fork": [errno.EAGAIN], "pthread_create": [errno.EAGAIN], "mmap": [errno.ENOMEM],
+}
+
+# Where these failed for ever, no program could work.
+WAITING = ("poll@", "ppoll@", "epoll_wait@", "read@")
+
+
+def adopt_orphans() -> None:
+    """Processes whose parent ends become children of this one, so that it sees who is left."""
+    pr_set_child_subreaper = 36
+    ctypes.CDLL(None).prctl(pr_set_child_subreaper, 1, 0, 0, 0)
+
+
+class Session:
+    """One run of the client with an engine, in a directory of its own."""
+
+    def __init__(self, rule: str, code: str = CODE) -> None:
+        with tempfile.TemporaryDirectory() as directory:
+            path = pathlib.Path(directory)
+            command = [CLIENT, "eval", "--record", path / "client.pcapng", "--trace-to", path / "trace", "--diary", "--log",
+                       "--engine", f"{ENGINE} --stdio --isolated --diary {path}/diary --log {path}/log "
+                                   f"--record {path}/engine.pcapng", code]
+            environment = dict(os.environ, LD_PRELOAD=LIBRARY, KRUTIL_FAULTS=f"{PROGRAM} {rule}")
+            try:
+                ended = subprocess.run(command, stdin=subprocess.DEVNULL, capture_output=True, env=environment, text=True,
+                                       errors="backslashreplace", timeout=PATIENCE)
+            except subprocess.TimeoutExpired as expired:
+                self.code, self.output, self.errors = None, str(expired.stdout), str(expired.stderr)
+            else:
+                self.code, self.output, self.errors = ended.returncode, ended.stdout, ended.stderr
+            self.files = sorted(os.listdir(directory))
+
+    def fault(self) -> str:
+        """What is wrong with how it went; empty for nothing."""
+        if self.code is None:
+            return f"did not end within {PATIENCE} s"
+        if not 0 <= self.code <= 6:
+            return f"ended with {self.code}"
+        lines = self.errors.splitlines()
+        if any(not re.match(r"krutil(-qvm)?: .|\s|Traceback|OSError|BlockingIOError|EOFError", line) for line in lines):
+            return "said something that is no sentence"
+        # What comes past Python has no place in what Python prints.
+        whole = sorted(self.output.splitlines()) == sorted(OUTPUT.splitlines())
+        if not whole and not lines:
+            return "lost output without a word"
+        if not whole and self.code == 0:
+            return "lost output and ended with 0"
+        if not set(self.files) <= {"client.pcapng", "engine.pcapng", "trace", "diary", "log"}:
+            return f"left {self.files}"
+        return ""
+
+    def __str__(self) -> str:
+        return f"exit code {self.code}\n--- output\n{self.output}\n--- errors\n{self.errors}"
+
+
+def left_behind() -> list[str]:
+    """Children that do not end: names of those that are alive still after a while."""
+    deadline = time.monotonic() + 20
+    while True:
+        try:
+            child, _ = os.waitpid(-1, os.WNOHANG)
+        except ChildProcessError:
+            return []
+        if child == 0 and time.monotonic() > deadline:
+            children = pathlib.Path(f"/proc/self/task/{os.getpid()}/children").read_text().split()
+            return [pathlib.Path(f"/proc/{each}/cmdline").read_text().replace("\0", " ") for each in children]
+        if child == 0:
+            time.sleep(0.05)  # there is nothing to wait for but their ends, which waitpid() tells
+
+
+class FaultsTest(unittest.TestCase):
+    def test_bytes_one_at_a_time_change_nothing(self):
+        session = Session("short")
+        self.assertEqual((session.code, session.output, session.errors), (0, OUTPUT, ""))
+
+    def test_interrupted_calls_change_nothing(self):
+        session = Session("interrupted")
+        self.assertEqual((session.code, session.output, session.errors), (0, OUTPUT, ""))
+
+    def test_streams_that_are_full_change_nothing(self):
+        session = Session("narrow", MANY_LINES)
+        self.assertEqual((session.code, session.output, session.errors), (0, ("long " * 20 + "\n") * 5000, ""))
+
+    def test_each_call_site_may_fail(self):
+        with tempfile.NamedTemporaryFile("r") as listed:
+            session = Session(f"list {listed.name}")
+            self.assertEqual((session.code, session.output, session.errors), (0, OUTPUT, ""))
+            sites = sorted(set(listed.read().split()))
+        self.assertGreater(len(sites), 20)
+        rules = [f"{times} {site} {error}" for site in sites for error in ERRORS[site.split("@")[0]]
+                 for times in (("once",) if site.startswith(WAITING) else ("once", "always"))]
+        with concurrent.futures.ThreadPoolExecutor(len(os.sched_getaffinity(0))) as workers:
+            faults = [f"{rule}: {session.fault()}\n{session}" for rule, session in zip(rules, workers.map(Session, rules))
+                      if session.fault()]
+        self.assertEqual(faults, [], "\n\n".join(faults))
+        self.assertEqual(left_behind(), [])
+
+
+if __name__ == "__main__":
+    adopt_orphans()
+    unittest.main(argv=sys.argv[:1])
