@@ -4,10 +4,10 @@
 #include <string_view>
 #include <utility>
 
+#include "common/FrameBytes.hpp"
+
 namespace apps {
 namespace {
-
-constexpr std::uint64_t headerSize = 24;
 
 // Tags are shorter, unless a peer's limit was raised.
 constexpr std::uint64_t longestTag = 128;
@@ -37,16 +37,8 @@ std::string firstBytes(std::span<const iovec> unit, std::uint64_t count) {
     return bytes;
 }
 
-std::uint32_t littleEndian(std::string_view bytes) {
-    std::uint32_t number = 0;
-    for (std::size_t i = bytes.size(); i > 0; --i) {
-        number = number << 8U | static_cast<unsigned char>(bytes[i - 1]);
-    }
-    return number;
-}
-
 std::string tagOf(const std::string& frame) {
-    return frame.substr(headerSize, littleEndian(std::string_view(frame).substr(2, 2)));
+    return frame.substr(FrameHeader::size, headerOf(frame).tagSize);
 }
 
 std::uint64_t costOf(const RecordedState::Unit& unit) {
@@ -68,41 +60,39 @@ void RecordedState::note(Direction direction, Part part, std::uint64_t nanosecon
         handshake_.push_back(std::move(kept));
         return;
     }
-    const std::string begin = firstBytes(unit, headerSize + longestTag);
-    if (begin.size() < headerSize) {
+    const std::string begin = firstBytes(unit, FrameHeader::size + longestTag);
+    if (begin.size() < FrameHeader::size) {
         return;
     }
-    const bool last = (static_cast<unsigned char>(begin[0]) & 0x80U) != 0;
-    const std::uint64_t header =
-        std::min<std::uint64_t>(begin.size(), headerSize + littleEndian(std::string_view(begin).substr(2, 2)));
-    const std::uint32_t stream = littleEndian(std::string_view(begin).substr(4, 4));
+    const FrameHeader header = headerOf(begin);
+    const std::uint64_t head = std::min<std::uint64_t>(begin.size(), FrameHeader::size + header.tagSize);
     const bool client = direction == fromClient_;
-    switch (static_cast<unsigned char>(begin[0]) & 0x7FU) {
-        case 1:  // tagged
-        case 2:  // data
-        case 5:  // shared data
+    switch (static_cast<FrameKind>(header.kind)) {
+        case FrameKind::Tagged:
+        case FrameKind::Data:
+        case FrameKind::SharedData:
             break;
-        case 3:
-            keep(kept, unit, header, goodbye_);
+        case FrameKind::Goodbye:
+            keep(kept, unit, head, goodbye_);
             return;
         default:
             return;
     }
     Begun& message = begun_[client ? 0 : 1];
-    if (!last || client) {
-        message.leftOut = message.leftOut || !keep(kept, unit, header, message.frames);
+    if (!header.last || client) {
+        message.leftOut = message.leftOut || !keep(kept, unit, head, message.frames);
         if (message.leftOut) {
             drop(message.frames);
         }
     }
-    if (!last) {
+    if (!header.last) {
         return;
     }
     if (client) {
-        clientSaid(stream, message);
+        clientSaid(header.stream, message);
     } else {
         drop(message.frames);
-        engineSaid(stream, tagOf(begin), std::move(kept), unit, header);
+        engineSaid(header.stream, tagOf(begin), std::move(kept), unit, head);
     }
     message.leftOut = false;
 }
@@ -117,7 +107,7 @@ void RecordedState::clientSaid(std::uint32_t stream, Begun& message) {
 }
 
 void RecordedState::engineSaid(std::uint32_t stream, const std::string& tag, Unit unit, std::span<const iovec> bytes,
-                               std::uint64_t header) {
+                               std::uint64_t head) {
     const auto exchange = exchanges_.find(stream);
     if (exchange == exchanges_.end()) {
         return;
@@ -127,7 +117,7 @@ void RecordedState::engineSaid(std::uint32_t stream, const std::string& tag, Uni
             break;
         case Meaning::State:
         case Meaning::Loop:
-            keep(std::move(unit), bytes, header, exchange->second);
+            keep(std::move(unit), bytes, head, exchange->second);
             break;
         case Meaning::Resumed: {
             // As if the prompt had never been there.
@@ -145,9 +135,9 @@ void RecordedState::engineSaid(std::uint32_t stream, const std::string& tag, Uni
     }
 }
 
-// Returns whether there was room.
-bool RecordedState::keep(Unit unit, std::span<const iovec> bytes, std::uint64_t header, Units& where) {
-    for (const std::uint64_t count : {unit.size <= wholeFrame ? unit.size : header, header}) {
+// Returns whether there was room. `head` bytes are the header and the tag.
+bool RecordedState::keep(Unit unit, std::span<const iovec> bytes, std::uint64_t head, Units& where) {
+    for (const std::uint64_t count : {unit.size <= wholeFrame ? unit.size : head, head}) {
         if (used_ + count + overhead <= bound_) {
             unit.bytes = firstBytes(bytes, count);
             used_ += costOf(unit);

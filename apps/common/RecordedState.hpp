@@ -62,11 +62,11 @@ class RecordedState {
         bool leftOut = false;  ///< there was no room for one of them
     };
 
-    bool keep(Unit unit, std::span<const iovec> bytes, std::uint64_t header, Units& where);
+    bool keep(Unit unit, std::span<const iovec> bytes, std::uint64_t head, Units& where);
     void drop(Units& units);
     void clientSaid(std::uint32_t stream, Begun& message);
     void engineSaid(std::uint32_t stream, const std::string& tag, Unit unit, std::span<const iovec> bytes,
-                    std::uint64_t header);
+                    std::uint64_t head);
 
     std::uint64_t bound_;
     std::uint64_t used_ = 0;

@@ -17,26 +17,16 @@ using UnitKind = apps::RecordedUnit::Kind;
 // In the content of a frame that says where its bytes are: the third number is how many.
 constexpr std::size_t sharedContentSize = 24;
 
-std::uint64_t littleEndian64(std::string_view bytes) {
-    std::uint64_t value = 0;
-    for (std::size_t i = 0; i < sizeof value; ++i) {
-        value |= std::uint64_t{static_cast<unsigned char>(bytes[i])} << (8 * i);
-    }
-    return value;
-}
-
 InspectedFrame frameOf(apps::RecordedUnit unit) {
     InspectedFrame frame;
     if (unit.kind == UnitKind::Frame && unit.bytes.size() >= FrameHeader::size) {
-        FrameHeader::Bytes bytes;
-        std::copy_n(unit.bytes.begin(), bytes.size(), bytes.begin());
-        frame.header = foundation::msg_svc::transport::layers::session::decode(bytes);
+        frame.header = apps::headerOf(unit.bytes);
         frame.content = frame.header.contentSize;
         const std::string_view behind = std::string_view(unit.bytes).substr(FrameHeader::size);
         if (frame.header.is(FrameKind::Tagged)) {
             frame.tag = behind.substr(0, frame.header.tagSize);
         } else if (frame.header.is(FrameKind::SharedData) && behind.size() >= sharedContentSize) {
-            frame.content = littleEndian64(behind.substr(16));
+            frame.content = apps::littleEndian(behind.substr(16, 8));
         }
     }
     frame.unit = std::move(unit);

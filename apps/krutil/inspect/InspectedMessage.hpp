@@ -9,13 +9,13 @@
 #include <unordered_map>
 #include <vector>
 
+#include "common/FrameBytes.hpp"
 #include "common/RecordingReader.hpp"
-#include "foundation/msg_svc/transport/layers/session/FrameHeader.hpp"
 
 namespace krutil_client {
 
-using FrameHeader = foundation::msg_svc::transport::layers::session::FrameHeader;
-using FrameKind = foundation::msg_svc::transport::layers::session::FrameKind;
+using apps::FrameHeader;
+using apps::FrameKind;
 
 /// One frame of a message, as far as it was recorded and kept.
 struct InspectedFrame {

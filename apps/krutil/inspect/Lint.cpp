@@ -5,6 +5,7 @@
 #include <stdexcept>
 #include <string_view>
 
+#include "common/FrameBytes.hpp"
 #include "common/KrutilSession.hpp"
 #include "common/Precheck.hpp"
 #include "krutil/base/ExitCode.hpp"
@@ -24,21 +25,13 @@ constexpr std::uint32_t layoutVersion = 1;
     throw std::runtime_error(what + ": expected " + expected + ", got " + got);
 }
 
-std::uint32_t littleEndian32(std::string_view bytes) {
-    std::uint32_t value = 0;
-    for (std::size_t i = 0; i < sizeof value; ++i) {
-        value |= std::uint32_t{static_cast<unsigned char>(bytes[i])} << (8 * i);
-    }
-    return value;
-}
-
 // The message of a part of the handshake, behind a head that ends with its length.
 template <class Body>
 Body bodyOf(std::string_view unit, std::size_t head, const std::string& what) {
     if (unit.size() < head) {
         broken("size of a " + what, "at least " + std::to_string(head) + " bytes", std::to_string(unit.size()));
     }
-    const std::uint32_t length = littleEndian32(unit.substr(head - 4));
+    const std::uint64_t length = apps::littleEndian(unit.substr(head - 4, 4));
     unit.remove_prefix(head);
     if (length > longestBody || length != unit.size()) {
         broken("length in a " + what, "the " + std::to_string(unit.size()) + " bytes behind it, at most 65536",
@@ -71,7 +64,7 @@ void Lint::takeHello(const apps::RecordedUnit& unit, End& end) {
         broken("first message", "one in each direction", "another one");
     }
     auto hello = bodyOf<msg_svc::protobuf::SessionHello>(bytes, 16, "first message");
-    if (const std::uint32_t layout = littleEndian32(bytes.substr(helloMagic.size())); layout != layoutVersion) {
+    if (const std::uint64_t layout = apps::littleEndian(bytes.substr(helloMagic.size(), 4)); layout != layoutVersion) {
         broken("layout version of a first message", std::to_string(layoutVersion), std::to_string(layout));
     }
     if (!hello.has_limits()) {

@@ -10,17 +10,19 @@
 #include <regex>
 #include <span>
 
+#include "common/FrameBytes.hpp"
 #include "common/MessageNames.hpp"
 
 namespace krutil_client {
 namespace {
 
+using apps::FrameHeader;
+using apps::FrameKind;
 using google::protobuf::Descriptor;
 using google::protobuf::FieldDescriptor;
 using google::protobuf::internal::WireFormatLite;
 using Bytes = std::span<char>;
 
-constexpr std::size_t headerSize = 24;
 constexpr std::size_t sizeOfPlace = 24;
 constexpr std::string_view knownMagic = "\x89KRUTIL\n";
 
@@ -189,33 +191,36 @@ void redactMessage(Bytes bytes, const Descriptor* type, int depth) {
 }
 
 void redactFrame(Bytes frame) {
-    enum Kind : unsigned { Tagged = 1, Data, Goodbye, Abort, Shared, Return, KeepAlive };
-    const unsigned kind = frame.empty() ? 0U : static_cast<unsigned char>(frame[0]) & 0x7FU;
     // What is no frame may be what a program has printed.
-    if (frame.size() < headerSize || kind < Tagged || kind > KeepAlive) {
+    if (frame.size() < FrameHeader::size) {
         hide(frame);
         return;
     }
-    const auto tagSize = static_cast<std::size_t>(static_cast<unsigned char>(frame[2])) |
-                         static_cast<std::size_t>(static_cast<unsigned char>(frame[3])) << 8U;
-    const Bytes tag = frame.subspan(headerSize, std::min(tagSize, frame.size() - headerSize));
-    const Bytes content = frame.subspan(headerSize + tag.size());
+    const FrameHeader header = apps::headerOf({frame.data(), frame.size()});
+    const auto kind = static_cast<FrameKind>(header.kind);
+    if (kind < FrameKind::Tagged || kind > FrameKind::KeepAlive) {
+        hide(frame);
+        return;
+    }
+    const Bytes behind = frame.subspan(FrameHeader::size);
+    const Bytes tag = behind.first(std::min<std::size_t>(header.tagSize, behind.size()));
+    const Bytes content = behind.subspan(tag.size());
     const Descriptor* const type = messageType(apps::messageNameOfTag({tag.data(), tag.size()}));
     if (type == nullptr) {
         hide(tag);
     }
     switch (kind) {
-        case Tagged:
+        case FrameKind::Tagged:
             if (type == nullptr) {
                 hide(content);
             } else {
                 redactMessage(content, type, 1);
             }
             break;
-        case Data:
+        case FrameKind::Data:
             hide(content, '\0');
             break;
-        case Shared:
+        case FrameKind::SharedData:
             hide(content.subspan(std::min(sizeOfPlace, content.size())), '\0');
             break;
         default:

@@ -8,15 +8,15 @@
 
 #include <algorithm>
 #include <fstream>
-#include <functional>
 #include <iterator>
-#include <memory>
 #include <nlohmann/json.hpp>
 #include <set>
 #include <string>
+#include <string_view>
 #include <vector>
 
-#include "common/MessageNames.hpp"
+#include "common/FrameBytes.hpp"
+#include "common/MessageWalk.hpp"
 #include "krutil.protobuf.IIPEnqueueMessage.pb.h"
 #include "krutil.protobuf.IssuedWarningEvent.pb.h"
 #include "msg_svc.protobuf.SessionHandshake.pb.h"
@@ -37,14 +37,6 @@ std::string redacted(const std::string& bytes, RecordedUnit::Kind kind = Recorde
     return unit.bytes;
 }
 
-std::size_t littleEndian(const std::string& bytes, std::size_t at, std::size_t size) {
-    std::size_t number = 0;
-    for (std::size_t i = size; i > 0; --i) {
-        number = number << 8U | static_cast<unsigned char>(bytes.at(at + i - 1));
-    }
-    return number;
-}
-
 struct Frame {
     std::string tag;
     std::string content;
@@ -54,11 +46,12 @@ struct Frame {
 std::vector<Frame> framesOf(const std::string& bytes) {
     std::vector<Frame> frames;
     for (std::size_t at = 0; at < bytes.size();) {
-        const std::size_t tag = littleEndian(bytes, at + 2, 2);
-        const std::size_t content = littleEndian(bytes, at + 16, 8);
-        frames.push_back(
-            {bytes.substr(at + 24, tag), bytes.substr(at + 24 + tag, content), bytes.substr(at, 24 + tag + content)});
-        at += 24 + tag + content;
+        const apps::FrameHeader header = apps::headerOf(std::string_view(bytes).substr(at));
+        const std::size_t content = at + apps::FrameHeader::size + header.tagSize;
+        const std::size_t end = content + header.contentSize;
+        frames.push_back({bytes.substr(content - header.tagSize, header.tagSize), bytes.substr(content, end - content),
+                          bytes.substr(at, end - at)});
+        at = end;
     }
     return frames;
 }
@@ -71,58 +64,19 @@ std::string taggedFrame(const std::string& tag, const std::string& content) {
     return bytes + tag + content;
 }
 
-std::unique_ptr<Message> parsed(const std::string& tag, const std::string& content) {
-    const auto* const type =
-        google::protobuf::DescriptorPool::generated_pool()->FindMessageTypeByName(apps::messageNameOfTag(tag));
-    if (type == nullptr) {
-        return nullptr;
-    }
-    std::unique_ptr<Message> message(google::protobuf::MessageFactory::generated_factory()->GetPrototype(type)->New());
-    return message->ParsePartialFromString(content) ? std::move(message) : nullptr;
-}
-
-// Calls `see` with each text of a message.
-void forEachText(const Message& message, const std::function<void(const std::string&)>& see) {
-    const auto& reflection = *message.GetReflection();
-    std::vector<const FieldDescriptor*> fields;
-    reflection.ListFields(message, &fields);
-    for (const FieldDescriptor* field : fields) {
-        const int count = field->is_repeated() ? reflection.FieldSize(message, field) : 1;
-        for (int i = 0; i < count; ++i) {
-            if (field->cpp_type() == FieldDescriptor::CPPTYPE_MESSAGE) {
-                forEachText(field->is_repeated() ? reflection.GetRepeatedMessage(message, field, i)
-                                                 : reflection.GetMessage(message, field),
-                            see);
-            } else if (field->cpp_type() == FieldDescriptor::CPPTYPE_STRING) {
-                see(field->is_repeated() ? reflection.GetRepeatedString(message, field, i)
-                                         : reflection.GetString(message, field));
-            }
-        }
-    }
-}
-
-// Which fields a message has, how often and how long.
-std::string shapeOf(const Message& message) {
-    const auto& reflection = *message.GetReflection();
-    std::vector<const FieldDescriptor*> fields;
-    reflection.ListFields(message, &fields);
+// Which fields a message and those within it have, how often, and how long their texts are.
+std::string shapeOf(Message& message) {
     std::string shape;
-    for (const FieldDescriptor* field : fields) {
-        const int count = field->is_repeated() ? reflection.FieldSize(message, field) : 1;
-        shape += field->name() + "*" + std::to_string(count) + "(";
-        for (int i = 0; i < count; ++i) {
-            if (field->cpp_type() == FieldDescriptor::CPPTYPE_MESSAGE) {
-                shape += shapeOf(field->is_repeated() ? reflection.GetRepeatedMessage(message, field, i)
-                                                      : reflection.GetMessage(message, field));
-            } else if (field->cpp_type() == FieldDescriptor::CPPTYPE_STRING) {
-                shape += std::to_string((field->is_repeated() ? reflection.GetRepeatedString(message, field, i)
-                                                              : reflection.GetString(message, field))
-                                            .size()) +
-                         " ";
-            }
+    apps::forEachMessage(message, [&shape](Message& each) {
+        const auto& reflection = *each.GetReflection();
+        std::vector<const FieldDescriptor*> fields;
+        reflection.ListFields(each, &fields);
+        for (const FieldDescriptor* field : fields) {
+            const int count = field->is_repeated() ? reflection.FieldSize(each, field) : 1;
+            shape += field->full_name() + "*" + std::to_string(count) + " ";
         }
-        shape += ")";
-    }
+    });
+    apps::forEachText(message, [&shape](std::string& text) { shape += std::to_string(text.size()) + " "; });
     return shape;
 }
 
@@ -155,15 +109,15 @@ TEST(RedactionTest, NoTextOfAnyTypeSurvives) {
             ASSERT_EQ(after.size(), frame.bytes.size());
             EXPECT_EQ(after.substr(0, 24), frame.bytes.substr(0, 24));
             const std::string content = after.substr(after.size() - frame.content.size());
-            const auto before = parsed(frame.tag, frame.content);
+            const auto before = apps::parsedMessage(frame.tag, frame.content);
             if (!before) {
                 continue;
             }
-            const auto now = parsed(frame.tag, content);
+            const auto now = apps::parsedMessage(frame.tag, content);
             ASSERT_TRUE(now);
             EXPECT_EQ(shapeOf(*now), shapeOf(*before));
             EXPECT_EQ(after.substr(24, frame.tag.size()), frame.tag);
-            forEachText(*before, [&](const std::string& text) {
+            apps::forEachText(*before, [&](std::string& text) {
                 EXPECT_EQ(survivor(text, content), "");
                 texts += text.size() >= 4 ? 1U : 0U;
             });
