@@ -1,7 +1,6 @@
 #include "krutil/session/TlsRelay.hpp"
 
 #include <gtest/gtest.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -13,6 +12,7 @@
 #include "apps/krutil/session/TlsServer.hpp"
 #include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "krutil/base/ExitCode.hpp"
+#include "support/LoopbackSocket.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 namespace krutil_client {
@@ -203,19 +203,12 @@ TEST_F(TlsConnectionTest, AHostThatIsNotThereIsAFailure) {
 }
 
 TEST_F(TlsConnectionTest, ItEndsWhereTheOtherEndSaysNothing) {
-    const foundation::core::posix::OwnedDescriptor silent(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    sockaddr_in bound{};
-    bound.sin_family = AF_INET;
-    bound.sin_addr.s_addr = ::htonl(INADDR_LOOPBACK);
-    ASSERT_EQ(::bind(silent.get(), reinterpret_cast<const sockaddr*>(&bound), sizeof(bound)), 0);
-    ASSERT_EQ(::listen(silent.get(), 1), 0);
-    socklen_t size = sizeof(bound);
-    ::getsockname(silent.get(), reinterpret_cast<sockaddr*>(&bound), &size);
+    const test_support::LoopbackSocket silent;
     {
         const TlsServer server("IP:127.0.0.1", authority_, [](SSL*) {});
         failureAt(address(server));
     }
-    TlsRelay relay({"127.0.0.1", std::to_string(::ntohs(bound.sin_port)), "", "", authority_});
+    TlsRelay relay({"127.0.0.1", silent.port(), "", "", authority_});
     ::close(relay.takeStream());
 }
 

@@ -1,9 +1,7 @@
 // What a TlsRelay connects to, in a thread of the test.
 #pragma once
 
-#include <arpa/inet.h>
 #include <gtest/gtest.h>
-#include <netinet/in.h>
 #include <openssl/ec.h>
 #include <openssl/pem.h>
 #include <openssl/ssl.h>
@@ -18,6 +16,7 @@
 #include <utility>
 
 #include "foundation/core/posix/OwnedDescriptor.hpp"
+#include "support/LoopbackSocket.hpp"
 
 namespace krutil_client {
 
@@ -30,8 +29,7 @@ class TlsServer {
     /// `name` is whom the certificate is for, such as "IP:127.0.0.1". It is written to the file `authority`. Versions
     /// of TLS above `newest` are not spoken; 0 for all that there are.
     TlsServer(const std::string& name, const std::string& authority, Serve serve, int newest = 0)
-        : socket_(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)),
-          key_(::EVP_EC_gen("P-256"), &::EVP_PKEY_free),
+        : key_(::EVP_EC_gen("P-256"), &::EVP_PKEY_free),
           certificate_(::X509_new(), &::X509_free),
           context_(::SSL_CTX_new(::TLS_server_method()), &::SSL_CTX_free),
           serve_(std::move(serve)) {
@@ -45,14 +43,6 @@ class TlsServer {
             ::SSL_CTX_set_security_level(context_.get(), 0);
             ::SSL_CTX_set_max_proto_version(context_.get(), newest);
         }
-        sockaddr_in address{};
-        address.sin_family = AF_INET;
-        address.sin_addr.s_addr = ::htonl(INADDR_LOOPBACK);
-        EXPECT_EQ(::bind(socket_.get(), reinterpret_cast<const sockaddr*>(&address), sizeof(address)), 0);
-        EXPECT_EQ(::listen(socket_.get(), 1), 0);
-        socklen_t size = sizeof(address);
-        ::getsockname(socket_.get(), reinterpret_cast<sockaddr*>(&address), &size);
-        port_ = std::to_string(::ntohs(address.sin_port));
         thread_ = std::thread([this] { run(); });
     }
 
@@ -61,7 +51,7 @@ class TlsServer {
     TlsServer(const TlsServer&) = delete;
     TlsServer& operator=(const TlsServer&) = delete;
 
-    const std::string& port() const { return port_; }
+    const std::string& port() const { return socket_.port(); }
 
   private:
     void makeCertificate(const std::string& name) {
@@ -91,12 +81,11 @@ class TlsServer {
         }
     }
 
-    const foundation::core::posix::OwnedDescriptor socket_;
+    const test_support::LoopbackSocket socket_;
     const std::unique_ptr<EVP_PKEY, decltype(&::EVP_PKEY_free)> key_;
     const std::unique_ptr<X509, decltype(&::X509_free)> certificate_;
     const std::unique_ptr<SSL_CTX, decltype(&::SSL_CTX_free)> context_;
     const Serve serve_;
-    std::string port_;
     std::thread thread_;
 };
 
