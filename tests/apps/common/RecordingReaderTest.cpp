@@ -8,21 +8,18 @@
 
 #include <algorithm>
 #include <fstream>
-#include <iterator>
 #include <string>
 #include <string_view>
 #include <system_error>
 #include <utility>
 #include <vector>
 
-#include "common/Recording.hpp"
-#include "support/TemporaryDirectory.hpp"
+#include "apps/common/RecordingFixture.hpp"
 
 namespace apps {
 namespace {
 
 using namespace std::string_literals;
-using test_support::TemporaryDirectory;
 using ::testing::HasSubstr;
 using Unit = RecordedUnit;
 
@@ -89,14 +86,11 @@ class Blocks {
 constexpr std::uint32_t inbound = 1;
 constexpr std::uint32_t outbound = 2;
 
-class RecordingReaderTest : public ::testing::Test {
+class RecordingReaderTest : public RecordingFixture {
   protected:
     void write(const std::string& bytes) const { std::ofstream(file_, std::ios::binary) << bytes; }
 
-    std::string written() const {
-        std::ifstream in(file_, std::ios::binary);
-        return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
-    }
+    std::string written() const { return test_support::contentOf(file_); }
 
     static std::vector<Unit> allOf(RecordingReader& reader) {
         std::vector<Unit> units;
@@ -124,17 +118,6 @@ class RecordingReaderTest : public ::testing::Test {
         return "none";
     }
 
-    Recording recording() const {
-        return Recording({file_}, [](const std::string&) {});
-    }
-
-    static void record(Recording& recording, Recording::Direction direction, Recording::Part part, std::string bytes) {
-        const iovec piece{bytes.data(), bytes.size()};
-        recording.record(direction, part, std::span(&piece, 1));
-    }
-
-    const TemporaryDirectory directory_{};
-    const std::string file_ = directory_.file("session.pcapng");
     const Blocks blocks_{};
     const std::string begin_ = blocks_.section() + blocks_.interface("client 7");
 };
@@ -142,8 +125,6 @@ class RecordingReaderTest : public ::testing::Test {
 TEST_F(RecordingReaderTest, ReadsWhatARecordingWrites) {
     Recording made = recording();
     made.setClock([] { return timespec{5, 6}; });
-    using Direction = Recording::Direction;
-    using Part = Recording::Part;
     made.beginSession(Recording::Role::Engine, "krutil-qvm 1");
     record(made, Direction::Sent, Part::Handshake, firstMessage);
     record(made, Direction::Received, Part::Handshake, firstMessage);
@@ -190,8 +171,8 @@ TEST_F(RecordingReaderTest, ReadsWhatARecordingWrites) {
 TEST_F(RecordingReaderTest, CutFramesSayWhatIsMissing) {
     Recording made({file_, 300'000}, [](const std::string&) {});
     made.beginSession(Recording::Role::Client, "krutil");
-    record(made, Recording::Direction::Sent, Recording::Part::Frame, std::string(400'000, 'a'));
-    record(made, Recording::Direction::Sent, Recording::Part::Frame, "whole");
+    record(made, Direction::Sent, Part::Frame, std::string(400'000, 'a'));
+    record(made, Direction::Sent, Part::Frame, "whole");
     RecordingReader reader(file_);
     const std::vector<Unit> units = allOf(reader);
     ASSERT_EQ(units.size(), 2U);
@@ -205,7 +186,7 @@ TEST_F(RecordingReaderTest, CutFramesSayWhatIsMissing) {
 TEST_F(RecordingReaderTest, KeepsAsMuchOfAUnitAsIsAskedFor) {
     Recording made = recording();
     made.beginSession(Recording::Role::Client, "krutil");
-    record(made, Recording::Direction::Sent, Recording::Part::Frame, std::string(600'000, 'a'));
+    record(made, Direction::Sent, Part::Frame, std::string(600'000, 'a'));
     RecordingReader reader(file_, nullptr, 262'130);
     const auto unit = reader.next();
     ASSERT_TRUE(unit.has_value());

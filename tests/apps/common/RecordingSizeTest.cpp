@@ -5,37 +5,28 @@
 #include <unistd.h>
 
 #include <filesystem>
-#include <fstream>
-#include <iterator>
 #include <limits>
 #include <stdexcept>
 #include <string>
 #include <vector>
 
-#include "common/Recording.hpp"
-#include "support/Pcapng.hpp"
-#include "support/TemporaryDirectory.hpp"
+#include "apps/common/RecordingFixture.hpp"
 
 namespace apps {
 namespace {
 
-using Direction = Recording::Direction;
-using Part = Recording::Part;
-using test_support::packetsOf;
-using test_support::RecordedPacket;
-using test_support::TemporaryDirectory;
 using ::testing::ElementsAre;
 
 constexpr std::uint64_t bound = RecordOptions::smallestSize;
 
-class RecordingSizeTest : public ::testing::Test {
+class RecordingSizeTest : public RecordingFixture {
   protected:
     Recording recording(const std::string& file, std::uint64_t snap = std::numeric_limits<std::uint64_t>::max()) {
         RecordOptions options;
         options.snap = snap;
         options.file = file;
         options.size = bound;
-        return Recording(options, [this](const std::string& sentence) { complaints_.push_back(sentence); });
+        return RecordingFixture::recording(options);
     }
 
     // A tagged frame that is a message.
@@ -46,20 +37,6 @@ class RecordingSizeTest : public ::testing::Test {
         bytes[4] = static_cast<char>(stream);
         return bytes + tag + std::string(content, 'c');
     }
-
-    static void record(Recording& recording, Direction direction, Part part, std::string unit) {
-        const iovec piece{unit.data(), unit.size()};
-        recording.record(direction, part, {&piece, 1});
-    }
-
-    std::vector<RecordedPacket> recorded(const std::string& file) const {
-        std::ifstream in(file, std::ios::binary);
-        return packetsOf(std::string(std::istreambuf_iterator<char>(in), {}));
-    }
-
-    const TemporaryDirectory directory_{};
-    const std::string file_ = directory_.file("session.pcapng");
-    std::vector<std::string> complaints_{};
 };
 
 TEST_F(RecordingSizeTest, LaterFileBeginsWithWhatIsOpen) {

@@ -11,47 +11,23 @@
 #include <csignal>
 #include <filesystem>
 #include <fstream>
-#include <iterator>
 #include <string>
 #include <system_error>
 #include <vector>
 
-#include "support/Pcapng.hpp"
-#include "support/TemporaryDirectory.hpp"
+#include "apps/common/RecordingFixture.hpp"
 
 namespace apps {
 namespace {
 
-using Direction = Recording::Direction;
-using Part = Recording::Part;
-using test_support::packetsOf;
-using test_support::RecordedPacket;
-using test_support::TemporaryDirectory;
+using test_support::contentOf;
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
 
 constexpr std::size_t largestPart = 262'128;
 
-std::string contentOf(const std::string& path) {
-    std::ifstream in(path, std::ios::binary);
-    return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
-}
-
-class RecordingTest : public ::testing::Test {
+class RecordingTest : public RecordingFixture {
   protected:
-    Recording recording(RecordOptions options = {}) {
-        options.file = file_;
-        return Recording(options, [this](const std::string& sentence) { complaints_.push_back(sentence); });
-    }
-
-    static void record(Recording& recording, Direction direction, Part part, std::vector<std::string> pieces) {
-        std::vector<iovec> unit;
-        for (std::string& piece : pieces) {
-            unit.push_back({piece.data(), piece.size()});
-        }
-        recording.record(direction, part, unit);
-    }
-
     // The text of the exception with which a recording refuses its file.
     std::string refusal() {
         try {
@@ -61,17 +37,13 @@ class RecordingTest : public ::testing::Test {
         }
         return "none";
     }
-
-    const TemporaryDirectory directory_{};
-    const std::string file_ = directory_.file("session.pcapng");
-    std::vector<std::string> complaints_{};
 };
 
 TEST_F(RecordingTest, HasTheseBytes) {
     Recording made = recording();
     made.setClock([] { return timespec{0x12345678, 1}; });
     made.beginSession(Recording::Role::Client, "krutil 1");
-    record(made, Direction::Sent, Part::Handshake, {"he", "", "llo"});
+    recordPieces(made, Direction::Sent, Part::Handshake, {"he", "", "llo"});
     const std::string pid = std::to_string(::getpid());
     const std::string name = "client " + pid + std::string((4 - (7 + pid.size()) % 4) % 4, '\0');
     const auto little = [](std::size_t value) { return std::string{static_cast<char>(value), 0, 0, 0}; };
@@ -122,10 +94,10 @@ TEST_F(RecordingTest, DirectionsAndTimesAreThoseOfTheUnits) {
     Recording made = recording();
     made.beginSession(Recording::Role::Engine, "krutil-qvm");
     made.setClock([] { return timespec{1, 2}; });
-    record(made, Direction::Received, Part::Handshake, {"one"});
+    record(made, Direction::Received, Part::Handshake, "one");
     made.setClock([] { return timespec{5'000'000'000, 999'999'999}; });
-    record(made, Direction::Sent, Part::Frame, {"two"});
-    const std::vector<RecordedPacket> packets = packetsOf(contentOf(file_));
+    record(made, Direction::Sent, Part::Frame, "two");
+    const std::vector<RecordedPacket> packets = recorded(file_);
     ASSERT_EQ(packets.size(), 2U);
     EXPECT_EQ(packets[0].interface, "engine " + std::to_string(::getpid()));
     EXPECT_EQ(packets[0].flags, 1U);
@@ -141,10 +113,10 @@ TEST_F(RecordingTest, LargeUnitSpansPackets) {
     Recording made = recording();
     made.beginSession(Recording::Role::Client, "krutil");
     const std::string whole = std::string(largestPart - 1, 'a') + 'b';
-    record(made, Direction::Sent, Part::Frame, {whole});
-    record(made, Direction::Sent, Part::Frame, {whole.substr(0, 100), whole.substr(100), "c"});
-    record(made, Direction::Sent, Part::Handshake, {std::string(2 * largestPart, 'd'), "ee"});
-    const std::vector<RecordedPacket> packets = packetsOf(contentOf(file_));
+    record(made, Direction::Sent, Part::Frame, whole);
+    recordPieces(made, Direction::Sent, Part::Frame, {whole.substr(0, 100), whole.substr(100), "c"});
+    recordPieces(made, Direction::Sent, Part::Handshake, {std::string(2 * largestPart, 'd'), "ee"});
+    const std::vector<RecordedPacket> packets = recorded(file_);
     ASSERT_EQ(packets.size(), 6U);
     EXPECT_TRUE(packets[0].data == whole);
     EXPECT_EQ(packets[0].comment, "");
@@ -164,10 +136,10 @@ TEST_F(RecordingTest, LargeUnitSpansPackets) {
 TEST_F(RecordingTest, SnapKeepsTheBeginningsOfFramesOnly) {
     Recording made = recording({{}, 30});
     made.beginSession(Recording::Role::Client, "krutil");
-    record(made, Direction::Sent, Part::Handshake, {std::string(31, 'h')});
-    record(made, Direction::Sent, Part::Frame, {std::string(30, 'f')});
-    record(made, Direction::Sent, Part::Frame, {std::string(25, 'g'), std::string(1'000'000, 'g')});
-    const std::vector<RecordedPacket> packets = packetsOf(contentOf(file_));
+    record(made, Direction::Sent, Part::Handshake, std::string(31, 'h'));
+    record(made, Direction::Sent, Part::Frame, std::string(30, 'f'));
+    recordPieces(made, Direction::Sent, Part::Frame, {std::string(25, 'g'), std::string(1'000'000, 'g')});
+    const std::vector<RecordedPacket> packets = recorded(file_);
     ASSERT_EQ(packets.size(), 3U);
     EXPECT_EQ(packets[0].data, std::string(31, 'h'));
     EXPECT_EQ(packets[0].original, 47U);
@@ -182,8 +154,8 @@ TEST_F(RecordingTest, SnapKeepsTheBeginningsOfFramesOnly) {
 TEST_F(RecordingTest, SnapBeyondAPacketCutsTheLastOne) {
     Recording made = recording({{}, largestPart + 10});
     made.beginSession(Recording::Role::Client, "krutil");
-    record(made, Direction::Sent, Part::Frame, {std::string(600'000, 'f')});
-    const std::vector<RecordedPacket> packets = packetsOf(contentOf(file_));
+    record(made, Direction::Sent, Part::Frame, std::string(600'000, 'f'));
+    const std::vector<RecordedPacket> packets = recorded(file_);
     ASSERT_EQ(packets.size(), 2U);
     EXPECT_EQ(packets[0].original, 262'144U);
     EXPECT_EQ(packets[1].data, std::string(10, 'f'));
@@ -194,8 +166,8 @@ TEST_F(RecordingTest, SnapBeyondAPacketCutsTheLastOne) {
 TEST_F(RecordingTest, SnapKeepsHeaders) {
     Recording made = recording({{}, 1});
     made.beginSession(Recording::Role::Client, "krutil");
-    record(made, Direction::Sent, Part::Frame, {std::string(25, 'f')});
-    EXPECT_EQ(packetsOf(contentOf(file_)).at(0).comment, "bytes 0-23 of 25");
+    record(made, Direction::Sent, Part::Frame, std::string(25, 'f'));
+    EXPECT_EQ(recorded(file_).at(0).comment, "bytes 0-23 of 25");
 }
 
 TEST_F(RecordingTest, OriginalLengthEndsWithItsField) {
@@ -205,25 +177,25 @@ TEST_F(RecordingTest, OriginalLengthEndsWithItsField) {
     std::string header(24, 'h');
     const std::array<iovec, 2> unit{iovec{header.data(), header.size()}, iovec{header.data(), std::size_t{5} << 30U}};
     made.record(Direction::Sent, Part::Frame, unit);
-    EXPECT_EQ(packetsOf(contentOf(file_)).at(0).original, 4'294'967'295U);
-    EXPECT_EQ(packetsOf(contentOf(file_)).at(0).comment, "bytes 0-23 of 5368709144");
+    EXPECT_EQ(recorded(file_).at(0).original, 4'294'967'295U);
+    EXPECT_EQ(recorded(file_).at(0).comment, "bytes 0-23 of 5368709144");
 }
 
 TEST_F(RecordingTest, SecondSessionIsASectionOfItsOwn) {
     Recording made = recording();
     made.beginSession(Recording::Role::Client, "krutil");
-    record(made, Direction::Sent, Part::Handshake, {"first"});
+    record(made, Direction::Sent, Part::Handshake, "first");
     const std::string before = contentOf(file_);
     made.beginSession(Recording::Role::Client, "krutil");
     EXPECT_EQ(contentOf(file_).substr(before.size(), 4), "\x0a\x0d\x0d\x0a");
-    record(made, Direction::Sent, Part::Handshake, {"second"});
-    EXPECT_EQ(packetsOf(contentOf(file_)).at(1).data, "second");
+    record(made, Direction::Sent, Part::Handshake, "second");
+    EXPECT_EQ(recorded(file_).at(1).data, "second");
 }
 
 TEST_F(RecordingTest, FullDiskIsToldOnceAndLeavesWholePackets) {
     Recording made = recording();
     made.beginSession(Recording::Role::Client, "krutil");
-    record(made, Direction::Sent, Part::Frame, {"fits"});
+    record(made, Direction::Sent, Part::Frame, "fits");
     EXPECT_TRUE(made.isComplete());
     const std::string before = contentOf(file_);
     struct rlimit limit {};
@@ -231,10 +203,10 @@ TEST_F(RecordingTest, FullDiskIsToldOnceAndLeavesWholePackets) {
     const auto handling = std::signal(SIGXFSZ, SIG_IGN);
     const struct rlimit small { before.size() + 50, limit.rlim_max };
     ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &small), 0);
-    record(made, Direction::Sent, Part::Frame, {std::string(100, 'x')});
+    record(made, Direction::Sent, Part::Frame, std::string(100, 'x'));
     ::setrlimit(RLIMIT_FSIZE, &limit);
     std::signal(SIGXFSZ, handling);
-    record(made, Direction::Sent, Part::Frame, {"would fit again"});
+    record(made, Direction::Sent, Part::Frame, "would fit again");
     EXPECT_FALSE(made.isComplete());
     EXPECT_THAT(complaints_, ElementsAre("cannot write to '" + file_ + "': File too large; the recording ends here"));
     EXPECT_EQ(contentOf(file_), before);

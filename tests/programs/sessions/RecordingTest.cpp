@@ -7,12 +7,12 @@
 #include <csignal>
 #include <filesystem>
 #include <fstream>
-#include <iterator>
 #include <string>
 #include <vector>
 
 #include "programs/support/Program.hpp"
 #include "programs/support/Relay.hpp"
+#include "support/FileContent.hpp"
 #include "support/Pcapng.hpp"
 #include "support/TemporaryDirectory.hpp"
 
@@ -31,8 +31,7 @@ constexpr std::uint32_t outbound = 2;
 class ProgramRecordingTest : public ::testing::Test {
   protected:
     std::vector<RecordedPacket> recorded(const std::string& file) const {
-        std::ifstream in(file, std::ios::binary);
-        return packetsOf(std::string(std::istreambuf_iterator<char>(in), {}));
+        return packetsOf(test_support::contentOf(file));
     }
 
     std::string engine(const std::string& options) const {

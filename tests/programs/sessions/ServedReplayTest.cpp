@@ -5,17 +5,18 @@
 
 #include <csignal>
 #include <fstream>
-#include <iterator>
 #include <string>
 #include <utility>
 #include <vector>
 
 #include "programs/support/Program.hpp"
+#include "support/FileContent.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 namespace programs_test {
 namespace {
 
+using test_support::contentOf;
 using test_support::TemporaryDirectory;
 using namespace std::string_literals;
 using ::testing::AllOf;
@@ -72,11 +73,6 @@ class ServedReplayTest : public ::testing::Test {
         return runClient(withRecordedEngine(arguments), how);
     }
 
-    static std::string bytesOf(const std::string& file) {
-        std::ifstream in(file, std::ios::binary);
-        return {std::istreambuf_iterator<char>(in), {}};
-    }
-
     const TemporaryDirectory directory_{};
     const std::string file_ = directory_.file("session.pcapng");
 };
@@ -105,7 +101,7 @@ TEST_F(ServedReplayTest, ArraysThatWereInSharedMemoryTravelAsBytes) {
     const Ran served = serve({"call", "numpy.add", array, array, "-o", now});
     EXPECT_EQ(served.err, "2 of 2 messages of the client as in the recording\nengine exited with 0\n");
     EXPECT_EQ(served.exitCode, 0);
-    EXPECT_EQ(bytesOf(now), bytesOf(before));
+    EXPECT_EQ(contentOf(now), contentOf(before));
 
     // Other elements, in frames of their own.
     ASSERT_EQ(runClient({"call", "numpy.ones", "150000", "-o", array}).exitCode, 0);
@@ -118,7 +114,7 @@ TEST_F(ServedReplayTest, ArraysThatWereInSharedMemoryTravelAsBytes) {
                      "bytes differ from byte 6 on\n"
                      "1 of 2 messages of the client as in the recording\n"
                      "engine exited with 1\n"));
-    EXPECT_EQ(bytesOf(now), bytesOf(before));
+    EXPECT_EQ(contentOf(now), contentOf(before));
 }
 
 TEST_F(ServedReplayTest, CancelNamesTheRequestThatItNamed) {
@@ -263,7 +259,7 @@ TEST_F(ServedReplayTest, RecordingsThatCannotBeServedAreRefused) {
     EXPECT_EQ(refusal().exitCode, 2);
 
     ASSERT_EQ(record({"eval", "1"}).exitCode, 0);
-    const std::string once = bytesOf(file_);
+    const std::string once = contentOf(file_);
     std::ofstream(file_, std::ios::binary | std::ios::app) << once;
     EXPECT_EQ(refusal().err, "krutil: cannot replay '" + file_ + "' to a client: expected one session, got 2\n");
     EXPECT_EQ(refusal().exitCode, 2);

@@ -7,43 +7,30 @@
 
 #include <filesystem>
 #include <fstream>
-#include <iterator>
 #include <string>
 
-#include "common/Recording.hpp"
+#include "apps/common/RecordingFixture.hpp"
 #include "krutil/base/ExitCode.hpp"
 #include "krutil/base/Interrupt.hpp"
-#include "support/Pcapng.hpp"
-#include "support/TemporaryDirectory.hpp"
 
 namespace krutil_client {
 namespace {
 
 using apps::Recording;
+using test_support::contentOf;
 
-std::string contentOf(const std::string& path) {
-    std::ifstream in(path, std::ios::binary);
-    return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
-}
-
-class RedactedCopyTest : public ::testing::Test {
+class RedactedCopyTest : public apps::RecordingFixture {
   protected:
-    static void record(Recording& recording, Recording::Direction direction, Recording::Part part, std::string unit) {
-        const iovec piece{unit.data(), unit.size()};
-        recording.record(direction, part, {&piece, 1});
-    }
-
-    void recordSession(std::uint64_t snap = std::numeric_limits<std::uint64_t>::max()) const {
+    void recordSession(std::uint64_t snap = std::numeric_limits<std::uint64_t>::max()) {
         apps::RecordOptions options;
-        options.file = file_;
         options.snap = snap;
-        Recording made(options, [](const std::string& sentence) { ADD_FAILURE() << sentence; });
+        Recording made = recording(options);
         made.beginSession(Recording::Role::Client, "krutil 0.1.0");
-        record(made, Recording::Direction::Sent, Recording::Part::Handshake, "\x89KRUTIL\n12345678secret greeting");
-        record(made, Recording::Direction::Received, Recording::Part::Handshake, "\x89KRUTIL\n12345678secret greeting");
-        record(made, Recording::Direction::Sent, Recording::Part::Handshake, "verdict");
-        record(made, Recording::Direction::Received, Recording::Part::Handshake, "verdict");
-        record(made, Recording::Direction::Sent, Recording::Part::Frame,
+        record(made, Direction::Sent, Part::Handshake, "\x89KRUTIL\n12345678secret greeting");
+        record(made, Direction::Received, Part::Handshake, "\x89KRUTIL\n12345678secret greeting");
+        record(made, Direction::Sent, Part::Handshake, "verdict");
+        record(made, Direction::Received, Part::Handshake, "verdict");
+        record(made, Direction::Sent, Part::Frame,
                std::string("\x82") + std::string(23, '\0') + std::string(600'000, 's'));
     }
 
@@ -58,8 +45,6 @@ class RedactedCopyTest : public ::testing::Test {
         return "none";
     }
 
-    const test_support::TemporaryDirectory directory_{};
-    const std::string file_ = directory_.file("session.pcapng");
     const std::string out_ = directory_.file("redacted.pcapng");
     Interrupt interrupt_{};
 };
@@ -68,8 +53,8 @@ TEST_F(RedactedCopyTest, HasTheSamePackets) {
     recordSession();
     EXPECT_EQ(redactRecording(file_, out_, interrupt_), std::nullopt);
     EXPECT_EQ(std::filesystem::file_size(out_), std::filesystem::file_size(file_));
-    const auto before = test_support::packetsOf(contentOf(file_));
-    const auto now = test_support::packetsOf(contentOf(out_));
+    const auto before = recorded(file_);
+    const auto now = recorded(out_);
     ASSERT_EQ(now.size(), before.size());
     for (std::size_t i = 0; i < now.size(); ++i) {
         EXPECT_EQ(now[i].interface, before[i].interface);
@@ -90,7 +75,7 @@ TEST_F(RedactedCopyTest, HasTheSamePackets) {
 TEST_F(RedactedCopyTest, CutFramesStayCut) {
     recordSession(100);
     EXPECT_EQ(redactRecording(file_, out_, interrupt_), std::nullopt);
-    const auto packets = test_support::packetsOf(contentOf(out_));
+    const auto packets = recorded(out_);
     EXPECT_EQ(packets.back().comment, "bytes 0-99 of 600024");
     EXPECT_EQ(packets.back().original, 16U + 600'024U);
 }
@@ -114,7 +99,7 @@ TEST_F(RedactedCopyTest, BeginningOfAFrameIsLeftOut) {
     const auto note = redactRecording(file_, out_, interrupt_);
     ASSERT_TRUE(note);
     EXPECT_THAT(*note, ::testing::StartsWith("the recording ends within a block, at byte "));
-    EXPECT_EQ(test_support::packetsOf(contentOf(out_)).size(), 4U);
+    EXPECT_EQ(recorded(out_).size(), 4U);
 }
 
 }  // namespace
