@@ -96,16 +96,17 @@ class TextSerializer : public SerializerAPI<Family, boost::shared_ptr<const Fami
   private:
     static void appendBulk(MessageStream& stream, const std::shared_ptr<Bulk>& bulk, StreamID streamID,
                            FrameIndex index) {
-        char* const address = framing::BufferAllocator::adopt(
+        auto share = std::make_unique<std::shared_ptr<Bulk>>(bulk);
+        std::unique_ptr<char[], std::function<void(char*)>> bytes(nullptr, &framing::BufferAllocator::release);
+        bytes.reset(framing::BufferAllocator::adopt(
             bulk->bytes.data(), bulk->bytes.size(),
             [](void* owner) {
-                const std::unique_ptr<std::shared_ptr<Bulk>> share(static_cast<std::shared_ptr<Bulk>*>(owner));
-                (*share)->dropped = true;
+                const std::unique_ptr<std::shared_ptr<Bulk>> last(static_cast<std::shared_ptr<Bulk>*>(owner));
+                (*last)->dropped = true;
             },
-            new std::shared_ptr<Bulk>(bulk));
-        FrameBuffer buffer(
-            std::unique_ptr<char[], std::function<void(char*)>>(address, &framing::BufferAllocator::release),
-            bulk->bytes.size());
+            share.get()));
+        share.release();
+        FrameBuffer buffer(std::move(bytes), bulk->bytes.size());
         std::unique_ptr<framing::Frame> frame = std::make_unique<framing::DataFrame>(
             static_cast<framing::FrameType>(4), streamID, std::move(buffer), bulk->shareable, index);
         stream.append(frame);

@@ -35,7 +35,7 @@ struct SessionEnd {
     /// What has ended it.
     enum class Reason {
         Finished,   ///< both ends were done: the engine's shutdown event was the last message
-        Lost,       ///< the byte stream ended or failed early
+        Lost,       ///< the byte stream ended or failed early, or there was no memory for what had to be done
         Violation,  ///< this end refused what the peer sent, or the peer refused what this end sent
         Closed,     ///< close() was called here
     };
@@ -44,7 +44,8 @@ struct SessionEnd {
 };
 
 /// Receives what arrives. All calls come from the session's I/O thread, one at a time; they must not block, and must
-/// not destroy the session. An exception that leaves one closes the session as a violation with its text.
+/// not destroy the session. An exception that leaves one closes the session as a violation with its text;
+/// with std::bad_alloc the session is lost.
 class SessionHandler {
   public:
     virtual ~SessionHandler();
@@ -115,9 +116,10 @@ class Session {
     /// Serializes an object and hands it to the stream: written at once as far as the stream takes it, the rest by the
     /// I/O thread. Never blocks. Order on the wire is the order of the calls. After the session's end these do nothing.
     ///
-    /// Throws LimitExceeded (the session goes on, nothing was sent), and whatever the serializer throws (nothing was
-    /// sent either). A message of a new exchange needs a stream ID from newStreamID(); an event needs an open
-    /// exchange's ID or 0; a reply closes its exchange.
+    /// Throws LimitExceeded (the session goes on, nothing was sent), whatever the serializer throws (nothing was sent
+    /// either), and std::bad_alloc (the same; or the session is lost, if it was said already). A message of a new
+    /// exchange needs a stream ID from newStreamID(); an event needs an open exchange's ID or 0; a reply closes its
+    /// exchange.
     void send(framing::StreamID stream, const boost::shared_ptr<const exchange::Message>& message);
     /// The same for a reply (engines only).
     void send(framing::StreamID stream, const boost::shared_ptr<const exchange::Reply>& reply,

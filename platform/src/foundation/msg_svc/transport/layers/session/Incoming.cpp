@@ -110,6 +110,8 @@ bool Incoming::read() {
     ssize_t count = 0;
     try {
         count = shared_ == nullptr ? readSome(descriptor_, pieces) : shared_->borrower.read(descriptor_, pieces);
+    } catch (const std::bad_alloc&) {
+        throw;
     } catch (const std::exception& failure) {
         owner_.onViolation(failure.what());
         return false;
@@ -153,6 +155,9 @@ void Incoming::takeItems() {
         contentArrived_ = reader_.contentArrived();
         contentSize_ = reader_.contentSize();
         keptMemory_.watch();
+    } catch (const std::bad_alloc&) {
+        // No fault of the peer's, and no room for a sentence.
+        throw;
     } catch (const std::exception& failure) {
         owner_.onViolation(failure.what());
     } catch (...) {

@@ -2,18 +2,32 @@
 
 #include <pthread.h>
 
+#include <new>
 #include <system_error>
+#include <utility>
 
 #include "foundation/core/posix/SignalsBlocked.hpp"
 
 namespace foundation::msg_svc::transport::layers::session {
 
-void IoThread::start() {
+// Whether everything is done.
+bool IoThread::run() {
+    try {
+        io_.run();
+        return true;
+    } catch (const std::bad_alloc&) {
+        return false;
+    }
+}
+
+void IoThread::start(std::function<void()> onOutOfMemory) {
     const core::posix::SignalsBlocked blocked;
     try {
-        thread_ = std::thread([this] {
+        thread_ = std::thread([this, outOfMemory = std::move(onOutOfMemory)] {
             ::pthread_setname_np(::pthread_self(), "session-io");
-            io_.run();
+            while (!run()) {
+                outOfMemory();
+            }
         });
     } catch (const std::system_error& error) {
         throw std::system_error(error.code(), "The thread of a session cannot be started");

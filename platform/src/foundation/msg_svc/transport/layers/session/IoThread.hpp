@@ -1,6 +1,7 @@
 // The thread on which a session reads, and writes what the stream did not take at once.
 #pragma once
 
+#include <functional>
 #include <mutex>
 #include <thread>
 
@@ -13,8 +14,10 @@ class IoThread {
   public:
     explicit IoThread(asio::io_context& io) : io_(io), work_(io.get_executor()) {}
 
-    /// Starts the thread. Signals are not delivered to it. Throws std::system_error where the process may have no more.
-    void start();
+    /// Starts the thread. Signals are not delivered to it. `onOutOfMemory` is called on it when something that was
+    /// posted has thrown std::bad_alloc; the rest goes on. Throws std::system_error where the process may have no more
+    /// threads.
+    void start(std::function<void()> onOutOfMemory);
 
     /// Lets the thread end when nothing is left to be done. On the thread itself.
     void release() { work_.reset(); }
@@ -23,6 +26,8 @@ class IoThread {
     void join();
 
   private:
+    bool run();
+
     asio::io_context& io_;
     asio::executor_work_guard<asio::io_context::executor_type> work_;
     std::mutex joinMutex_;

@@ -230,15 +230,23 @@ void Outgoing::awaitHangUp() {
 }
 
 void Outgoing::close() {
-    std::vector<OutgoingPieces> dropped;
     {
         const std::lock_guard lock(mutex_);
         state_ = State::Closed;
-        dropped = queue_.takeAll(false);
         descriptor_ = -1;
         updateEvents();
     }
-    drop(dropped);
+    // One by one, because that takes no memory, which may be why the session ends.
+    const auto takeLast = [this] {
+        const std::lock_guard lock(mutex_);
+        return queue_.takeLast();
+    };
+    while (std::optional<OutgoingPieces> dropped = takeLast()) {
+        const Total total{dropped->bytes(), dropped->answer() ? 1U : 0U};
+        dropped.reset();
+        const std::lock_guard lock(mutex_);
+        uncount(total);
+    }
     ErrorCode ignored;
     stream_.close(ignored);
 }

@@ -214,6 +214,15 @@ int OutgoingQueue::writeOnce(int descriptor, std::vector<OutgoingPieces>& writte
     return 0;
 }
 
+std::optional<OutgoingPieces> OutgoingQueue::takeLast() noexcept {
+    if (messages_.empty()) {
+        return std::nullopt;
+    }
+    std::optional<OutgoingPieces> last(std::move(messages_.back()));
+    messages_.pop_back();
+    return last;
+}
+
 std::vector<OutgoingPieces> OutgoingQueue::takeAll(bool keepBegun) {
     std::vector<OutgoingPieces> taken;
     const std::size_t kept = keepBegun && !messages_.empty() && messages_.front().begun() ? 1 : 0;

@@ -108,6 +108,9 @@ class OutgoingQueue {
     /// understand what follows.
     std::vector<OutgoingPieces> takeAll(bool keepBegun);
 
+    /// Takes the last message out, begun or not. Takes no memory.
+    std::optional<OutgoingPieces> takeLast() noexcept;
+
   private:
     std::deque<OutgoingPieces> messages_;
     std::vector<iovec> pieces_;     // of a write, kept for the next one

@@ -14,6 +14,7 @@
 #include "foundation/msg_svc/transport/layers/session/Handshake.hpp"
 #include "foundation/msg_svc/transport/layers/session/Incoming.hpp"
 #include "foundation/msg_svc/transport/layers/session/IoThread.hpp"
+#include "foundation/msg_svc/transport/layers/session/LastResort.hpp"
 #include "foundation/msg_svc/transport/layers/session/ObjectWriter.hpp"
 #include "foundation/msg_svc/transport/layers/session/Outgoing.hpp"
 #include "foundation/msg_svc/transport/layers/session/PrintableText.hpp"
@@ -52,8 +53,8 @@ class Session::Impl final : private Incoming::Owner, private Outgoing::Owner {
     void send(framing::StreamID stream, const Shared<T>& object, Urgency urgency);
     void sayGoodbye();
     void sendHeld();
-    bool waitForRoom(int interrupt) { return abandoned || outgoing_.waitForRoom(interrupt); }
-    bool waitUntilWritten(int interrupt) { return abandoned || outgoing_.waitUntilWritten(interrupt); }
+    bool waitForRoom(int interrupt);
+    bool waitUntilWritten(int interrupt);
     void close(std::chrono::milliseconds patience);
     void abort(const std::string& text);
     void abandonInChild() noexcept;
@@ -76,6 +77,8 @@ class Session::Impl final : private Incoming::Owner, private Outgoing::Owner {
     // Any thread. `say` runs with the mutex of the exchanges held; it may throw, or return false to send nothing.
     template <class Say>
     void submit(OutgoingPieces message, Outgoing::Hold hold, Say say);
+    template <class Write>
+    auto orEnd(Write write);
     bool isDone(Role role) const;
 
     // I/O thread.
@@ -93,6 +96,7 @@ class Session::Impl final : private Incoming::Owner, private Outgoing::Owner {
     void lose(const std::string& text) { finish({SessionEnd::Reason::Lost, text}, {}); }
     void finish(SessionEnd end, const std::string& abortReason);
     void closeDown();
+    void onOutOfMemory();
 
     const ObjectWriter writer_;
     SharedExchanges exchanges_;
@@ -103,12 +107,14 @@ class Session::Impl final : private Incoming::Owner, private Outgoing::Owner {
     const std::unique_ptr<lending::SharedMemory> shared_;  // null without shared memory
     KeepAlive keepAlive_;
     Incoming incoming_;
+    LastResort lastResort_;
 
     // Of the I/O thread.
     SessionHandler* handler_ = nullptr;
     Stage stage_ = Stage::Open;
     int writeError_ = 0;
     SessionEnd end_{SessionEnd::Reason::Closed, {}};
+    SessionEnd outOfMemory_{SessionEnd::Reason::Lost, "there is no memory left for the session"};
 };
 
 Session::Impl::Impl(StreamDescriptors& stream, SessionConfig sessionConfig, Settlement settled)
@@ -122,9 +128,10 @@ Session::Impl::Impl(StreamDescriptors& stream, SessionConfig sessionConfig, Sett
       shared_(settlement.sharedMemory ? std::make_unique<lending::SharedMemory>(config.role, outgoing_) : nullptr),
       keepAlive_(io_, config, settlement.keepAlive, exchanges_, outgoing_),
       incoming_(io_, stream.in, config, settlement.registry, settlement.arrayTag, exchanges_, outgoing_, shared_.get(),
-                keepAlive_, *this) {
+                keepAlive_, *this),
+      lastResort_(io_, [this] { onOutOfMemory(); }) {
     // Here and not when it is needed, because an end of the session must not fail.
-    thread_.start();
+    thread_.start([this] { onOutOfMemory(); });
 }
 
 void Session::Impl::start(SessionHandler& handler) {
@@ -189,20 +196,39 @@ void Session::Impl::send(framing::StreamID stream, const Shared<T>& object, Urge
            });
 }
 
+// What was said and not written cannot be taken back, so a session without memory for it is over.
+template <class Write>
+auto Session::Impl::orEnd(Write write) {
+    try {
+        return write();
+    } catch (const std::bad_alloc&) {
+        lastResort_.call();
+        throw;
+    }
+}
+
 template <class Say>
 void Session::Impl::submit(OutgoingPieces message, Outgoing::Hold hold, Say say) {
     // Dropped when the lock is released.
     std::vector<OutgoingPieces> done;
     const std::lock_guard lock(exchanges_.mutex);
     if (outgoing_.isOpen() && say()) {
-        done = outgoing_.push(std::move(message), hold);
+        orEnd([&] { done = outgoing_.push(std::move(message), hold); });
     }
 }
 
 void Session::Impl::sendHeld() {
     if (!abandoned) {
-        outgoing_.sendHeld();
+        orEnd([this] { outgoing_.sendHeld(); });
     }
+}
+
+bool Session::Impl::waitForRoom(int interrupt) {
+    return abandoned || orEnd([&] { return outgoing_.waitForRoom(interrupt); });
+}
+
+bool Session::Impl::waitUntilWritten(int interrupt) {
+    return abandoned || orEnd([&] { return outgoing_.waitUntilWritten(interrupt); });
 }
 
 void Session::Impl::sayGoodbye() {
@@ -394,6 +420,14 @@ void Session::Impl::closeDown() {
     if (handler_ != nullptr) {
         handler_->onEnd(end_);
     }
+}
+
+// Whatever the thread had to do is not done. What is left to do takes no memory.
+void Session::Impl::onOutOfMemory() {
+    if (advance(Stage::Ending)) {
+        end_ = std::move(outOfMemory_);
+    }
+    closeDown();
 }
 
 void Session::Impl::abandonInChild() noexcept {
