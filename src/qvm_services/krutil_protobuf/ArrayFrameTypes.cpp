@@ -19,7 +19,7 @@ constexpr std::array<std::uint8_t, 25> elementTypes{0, 0, 0,  6,  7,  8,  9,  10
                                                     1, 2, 15, 14, 16, 17, 18, 19, 20, 21, 22, 23};
 
 // What leads there leads back, but for code 3 and the frame types below 3.
-constexpr bool tablesAgree() {
+consteval bool tablesAgree() {
     for (std::size_t code = 1; code < frameTypes.size(); ++code) {
         if (code != 3 && elementTypes[frameTypes[code]] != code) {
             return false;

@@ -14,7 +14,9 @@ class QVMShutdownEventSerializer final
   public:
     QVMShutdownEventSerializer();
 
-    static void fill() {}
+    /// Says that there is nothing to fill, and is never called.
+    static void fill();
+
     static boost::shared_ptr<const foundation::msg_svc::eventmgr::BaseEvent> fromProtobuf(
         const protobuf::QVMShutdownEvent& proto);
 };

@@ -53,7 +53,7 @@ class TaggedSerializer<Derived, SerializerAPI<T, Ptr, Ret>, Object, ProtoMessage
 
     Ret deserialize(FrameIndex frameIndex, const std::unique_ptr<Message>& message,
                     const std::shared_ptr<const Registry>& registry, const SerializationContext& context) const final {
-        if constexpr (requires { Derived::manyParts; }) {
+        if constexpr (requires { requires Derived::manyParts; }) {
             // The stack has room for what is usual, so that the arena seldom allocates.
             alignas(std::max_align_t) std::array<char, 12288> block;
             google::protobuf::ArenaOptions options;

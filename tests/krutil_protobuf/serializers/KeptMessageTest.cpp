@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <boost/make_shared.hpp>
 #include <string>
 #include <thread>
@@ -163,6 +164,28 @@ TEST_F(KeptMessageTest, ALargeMessageIsNotKept) {
     });
 }
 
+TEST_F(KeptMessageTest, AMessageOfTheBoundIsKeptOnce) {
+    onFreshThread([] {
+        for (int i = 0; i < 2; ++i) {
+            {
+                KeptText kept;
+                // The field's number and length take four bytes.
+                (*kept).set_text(std::string(KeptText::mostBytes - 4, 'x'));
+                EXPECT_EQ((*kept).ByteSizeLong(), KeptText::mostBytes);
+                kept.keep();
+            }
+            {
+                KeptText same;
+                EXPECT_EQ((*same).text().size(), KeptText::mostBytes - 4);
+                (*same).set_text("x");
+                (*same).ByteSizeLong();
+                same.keep();
+            }
+            EXPECT_EQ((*KeptText()).text(), "");
+        }
+    });
+}
+
 // Each write makes another part large, so that without a bound all parts would be large in the end.
 TEST_F(KeptMessageTest, WhatIsKeptDoesNotGrowWithTheNumberOfWrites) {
     constexpr int parts = 1000;
@@ -203,6 +226,28 @@ TEST_F(KeptMessageTest, AThreadMayWriteToItsVeryEnd) {
     EXPECT_EQ(frames, written(registry_, textEvent(u"last words")));
 }
 
+struct KeepsAtTheVeryEnd {
+    std::string* found = nullptr;
+    ~KeepsAtTheVeryEnd() {
+        {
+            KeptText kept;
+            (*kept).set_text("last words");
+            kept.keep();
+        }
+        *found = (*KeptText()).text();
+    }
+};
+
+TEST_F(KeptMessageTest, AThreadThatEndsKeepsNothing) {
+    std::string found = "nobody has looked";
+    onFreshThread([&found] {
+        static thread_local KeepsAtTheVeryEnd atTheEnd;
+        atTheEnd.found = &found;
+        KeptText().keep();
+    });
+    EXPECT_EQ(found, "");
+}
+
 class DroppingStream final : public transport::MessageStream {
   public:
     void append(std::unique_ptr<transport::Frame>& frame) override { frame.reset(); }
@@ -228,13 +273,18 @@ TEST_F(KeptMessageTest, EachAllocationIsCounted) {
     for (const Allocations& expected : {
              Allocations{"krutil:TextBaseEvent", 2, 4},
              Allocations{"krutil:IIPEnqueueMessage", 6, 13},
+             Allocations{"krutil:IIPResult", 3, 7},
              Allocations{"krutil:IIPReply", 4, 3},
              Allocations{"korvel:lang:diagnostic:IssuedWarningEvent", 3, 14},
+             Allocations{"korvel:lang:diagnostic:IssuedEnabledWarningEvent", 3, 21},
              Allocations{"krutil:PrintableErrorEvent", 4, 9},
          }) {
         const samples::SampleSet& set = samples::sampleSet(expected.serializer);
         const auto& serializer = *registry_->find(set.serializer);
-        const samples::Object& typical = set.samples.front().object;
+        const samples::Object& typical =
+            std::find_if(set.samples.begin(), set.samples.end(), [](const samples::Sample& sample) {
+                return sample.name == "typical";
+            })->object;
         const auto write = [&] { samples::write(serializer, typical, 7, 1, stream, registry_, {}); };
         write();
         EXPECT_EQ(allocationsOf(write), expected.writing) << set.serializer;

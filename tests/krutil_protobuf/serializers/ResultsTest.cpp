@@ -64,6 +64,15 @@ TEST(RuntimeExceptionTest, FramesKeepTheirOrder) {
     EXPECT_EQ(fromProtobuf(toProtobuf(root)), root);
 }
 
+TEST(RuntimeExceptionTest, AFrameByItselfRoundTrips) {
+    const StackFrame frame{u"\u00E4.py", "f", 12.5};
+    const wire::StackFrame proto = toProtobuf(frame);
+    EXPECT_EQ(proto.file(), "\xC3\xA4.py");
+    EXPECT_EQ(proto.func(), "f");
+    EXPECT_EQ(proto.line(), 12.5);
+    EXPECT_EQ(fromProtobuf(proto), frame);
+}
+
 TEST(RuntimeExceptionTest, ALineOf12Point5SurvivesAndALineOf0IsSentAsNothing) {
     const wire::RuntimeException proto = toProtobuf(exceptionWith({{u"", "", 12.5}, {u"", "", 0}}));
     EXPECT_EQ(proto.frames(0).line(), 12.5);
