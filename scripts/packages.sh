@@ -53,6 +53,7 @@ javascript_packages=(nodejs npm)
 # What ./scripts/debian-packages needs besides.
 debian_packages=(debhelper dh-python dpkg-dev python3-all python3-setuptools lintian)
 clang_packages=(libclang-rt-14-dev)
+coverage_packages=(llvm-14)
 tidy_packages=(clang-tidy)
 reference_packages=(doxygen)
 
