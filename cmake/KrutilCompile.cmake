@@ -47,9 +47,12 @@ add_library(krutil_compile_options INTERFACE)
 target_link_libraries(krutil_compile_options INTERFACE krutil_generated_options)
 target_compile_options(krutil_compile_options INTERFACE -Wall -Wextra -Wconversion -Wshadow
     $<$<BOOL:${KRUTIL_WERROR}>:-Werror>)
+
+# A source that is compiled together with others sees their names. GCC takes it for a header, too, and so a private type
+# that uses an unnamed namespace for a mistake.
+add_library(krutil_unity_options INTERFACE)
+target_compile_options(krutil_unity_options INTERFACE
+    -Wno-shadow $<$<CXX_COMPILER_ID:GNU>:-Wno-subobject-linkage>)
 if(CMAKE_UNITY_BUILD)
-    # A source of a unity build sees the names of the others. GCC takes it for a header, too, and so a private type that
-    # uses an unnamed namespace for a mistake.
-    target_compile_options(krutil_compile_options INTERFACE
-        -Wno-shadow $<$<CXX_COMPILER_ID:GNU>:-Wno-subobject-linkage>)
+    target_link_libraries(krutil_compile_options INTERFACE krutil_unity_options)
 endif()
