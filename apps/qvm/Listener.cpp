@@ -304,6 +304,8 @@ void Listener::serve(int connection, posix::OwnedDescriptor ours, posix::OwnedDe
         ::close(connection);
         return;
     }
+    // What code sends to its process group is for this session alone, and it has no terminal.
+    ::setsid();
     ::close(socket_);
     ::close(signals_);
     seats_.forget();
