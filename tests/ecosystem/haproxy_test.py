@@ -65,12 +65,16 @@ class HAProxyTest(unittest.TestCase):
         os.chmod(cls.directory, 0o711)
         openssl("req", "-x509", "-newkey", "rsa:2048", "-nodes", "-days", "1", "-subj", "/CN=authority",
                 "-keyout", cls.path("authority.key"), "-out", cls.path("authority.pem"))
-        for name in "proxy", "alice", "mallory":
-            openssl("req", "-newkey", "rsa:2048", "-nodes", "-subj", f"/CN={name}", "-keyout", cls.path(name + ".key"),
+        # Her name, but her own authority.
+        openssl("req", "-x509", "-newkey", "rsa:2048", "-nodes", "-days", "1", "-subj", "/CN=alice",
+                "-keyout", cls.path("stranger.key"), "-out", cls.path("stranger.pem"))
+        for name in "proxy", "alice", "mallory", "expired":
+            subject = "alice" if name == "expired" else name
+            openssl("req", "-newkey", "rsa:2048", "-nodes", "-subj", f"/CN={subject}", "-keyout", cls.path(name + ".key"),
                     "-out", cls.path("request"))
             with open(cls.path("extensions"), "w", encoding="utf-8") as file:
                 file.write("subjectAltName=DNS:localhost\n" if name == "proxy" else f"subjectAltName=DNS:{name}\n")
-            openssl("x509", "-req", "-days", "1", "-in", cls.path("request"), "-CA", cls.path("authority.pem"),
+            openssl("x509", "-req", "-days", "-1" if name == "expired" else "1", "-in", cls.path("request"), "-CA", cls.path("authority.pem"),
                     "-CAkey", cls.path("authority.key"), "-CAcreateserial", "-extfile", cls.path("extensions"),
                     "-out", cls.path(name + ".pem"))
         with open(cls.path("proxy.pem"), "a", encoding="utf-8") as both:
@@ -207,9 +211,15 @@ class HAProxyTest(unittest.TestCase):
 
     def test_clients_that_are_not_meant_are_refused(self):
         address, authority = self.options()[:2], self.options()[-2:]
-        self.assertIn("krutil: the TLS connection to the engine failed before the session began: ",
-                      self.refusal(*address, *authority))
+        refused = "krutil: the TLS connection to the engine failed before the session began: "
+        self.assertEqual(self.refusal(*address, *authority), refused + "tlsv13 alert certificate required\n")
+        self.assertEqual(self.refusal(*self.options("stranger")), refused + "tlsv1 alert unknown ca\n")
+        self.assertEqual(self.refusal(*self.options("expired")), refused + "sslv3 alert certificate expired\n")
         self.assertIn(" before the session began: ", self.refusal(*self.options("mallory")))
+        # An engine would say that somebody has connected.
+        for engine in self.engines.values():
+            engine.terminate()
+            self.assertEqual(engine.stderr.read(), "")
 
     def test_a_proxy_that_is_not_meant_is_refused(self):
         address = self.options()[:2]

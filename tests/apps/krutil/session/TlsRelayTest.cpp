@@ -186,9 +186,74 @@ TEST_F(TlsConnectionTest, ACertificateOfAnotherAuthorityIsRefused) {
     EXPECT_EQ(failureAt(address(server)), "the certificate there is not accepted: self-signed certificate");
 }
 
+TEST_F(TlsConnectionTest, ACertificateThatHasExpiredIsRefused) {
+    const TlsServer server("IP:127.0.0.1", authority_, [](SSL*) { ADD_FAILURE(); }, {.ago = 60});
+    EXPECT_EQ(failureAt(address(server)), "the certificate there is not accepted: certificate has expired");
+}
+
+// What a proxy makes of a client's certificate. Nothing of the session is looked at, though it has been sent.
+class TlsClientTest : public TlsConnectionTest {
+  protected:
+    // Why the session of a client with this certificate does not begin.
+    std::string failureWith(const std::string& certificate, const std::string& key) const {
+        const TlsServer server("IP:127.0.0.1", authority_, [](SSL*) { ADD_FAILURE(); }, {.clients = known_});
+        TlsRelay relay({"127.0.0.1", server.port(), certificate, key, authority_});
+        const foundation::core::posix::OwnedDescriptor stream(relay.takeStream());
+        // The relay may have gone already.
+        static_cast<void>(::send(stream.get(), "the session", 11, MSG_NOSIGNAL));
+        readAll(stream.get());
+        return relay.failure();
+    }
+
+    std::string write(const TlsCertificate& certificate, const std::string& name) const {
+        certificate.write(files_.file(name + ".pem"));
+        certificate.writeKey(files_.file(name + ".key"));
+        return files_.file(name);
+    }
+
+    const std::string alice_ = write(TlsCertificate("DNS:alice"), "alice");
+    const std::string known_ = alice_ + ".pem";
+};
+
+TEST_F(TlsClientTest, TheOneThatIsKnownIsServed) {
+    std::string got(11, '\0');
+    {
+        const TlsServer server(
+            "IP:127.0.0.1", authority_,
+            [&got](SSL* connection) { ::SSL_read(connection, got.data(), static_cast<int>(got.size())); },
+            {.clients = known_});
+        TlsRelay relay({"127.0.0.1", server.port(), alice_ + ".pem", alice_ + ".key", authority_});
+        const foundation::core::posix::OwnedDescriptor stream(relay.takeStream());
+        EXPECT_EQ(::write(stream.get(), "the session", 11), 11);
+        readAll(stream.get());
+    }
+    EXPECT_EQ(got, "the session");
+}
+
+TEST_F(TlsClientTest, NoneIsRefused) {
+    EXPECT_EQ(failureWith("", ""), "tlsv13 alert certificate required");
+}
+
+TEST_F(TlsClientTest, OneOfAnotherAuthorityIsRefused) {
+    const std::string mallory = write(TlsCertificate("DNS:alice"), "mallory");
+    EXPECT_EQ(failureWith(mallory + ".pem", mallory + ".key"), "tlsv1 alert unknown ca");
+}
+
+TEST_F(TlsClientTest, OneThatHasExpiredIsRefused) {
+    const TlsCertificate expired("DNS:alice", 60);
+    // It would be known.
+    write(expired, "alice");
+    EXPECT_EQ(failureWith(alice_ + ".pem", alice_ + ".key"), "sslv3 alert certificate expired");
+}
+
+TEST_F(TlsClientTest, AKeyOfAnotherCertificateIsRefused) {
+    const std::string mallory = write(TlsCertificate("DNS:alice"), "mallory");
+    EXPECT_EQ(refusal({"localhost", "1", alice_ + ".pem", mallory + ".key", known_}),
+              "--key: cannot use the file '" + mallory + ".key': key values mismatch");
+}
+
 TEST_F(TlsConnectionTest, OldVersionsAreRefused) {
-    const TlsServer server(
-        "IP:127.0.0.1", authority_, [](SSL*) { ADD_FAILURE(); }, TLS1_1_VERSION);
+    const TlsServer server("IP:127.0.0.1", authority_, [](SSL*) { ADD_FAILURE(); }, {.newest = TLS1_1_VERSION});
     EXPECT_EQ(failureAt(address(server)), "tlsv1 alert protocol version");
 }
 
