@@ -5,6 +5,7 @@ import secrets
 import shlex
 import shutil
 import socket
+import struct
 import subprocess
 import threading
 import time
@@ -28,6 +29,9 @@ Command = Union[str, Sequence[str]]
 
 # The engine need not know who asks, but refuses 0.
 _ANY_ENGINE = 1
+
+# What the kernel tells of the other end of a socket: process, user, group.
+_PEER = struct.Struct("iII")
 
 # What all evaluations and calls begin with. Serialized messages can be joined, and to serialize this each time takes
 # longer than all the rest of them.
@@ -275,7 +279,8 @@ def connect(path: "str | os.PathLike[str]", *, on_input: Optional[OnInput] = Non
           timeout: float = 10) -> Session:
     """Begins a session with an engine that listens (`krutil-qvm --listen PATH`). The arguments are those of `start()`.
 
-    Raises `OSError` when nothing listens there.
+    Raises `OSError` when nothing listens there, and `Refused` when another user's engine does: whoever has made the
+    socket gets the code.
 
     >>> with krutil.connect(listening_engine) as session:
     ...     session.eval("1 + 1").value
@@ -284,6 +289,10 @@ def connect(path: "str | os.PathLike[str]", *, on_input: Optional[OnInput] = Non
     connection = socket.socket(socket.AF_UNIX)
     try:
         connection.connect(os.fspath(path))
+        _, user, _ = _PEER.unpack(connection.getsockopt(socket.SOL_SOCKET, socket.SO_PEERCRED, _PEER.size))
+        if user != os.geteuid():
+            raise Refused(f"cannot connect to '{os.fspath(path)}': the engine there runs as user {user}, not as user "
+                          f"{os.geteuid()} as this program does")
         return Session(connection, on_input=on_input, on_debug=on_debug, on_text=on_text,
                        on_display=on_display, limits=limits, timeout=timeout)
     except BaseException:

@@ -9,6 +9,7 @@ import os
 import pickle
 import queue
 import signal
+import socket
 import subprocess
 import sys
 import tempfile
@@ -578,6 +579,24 @@ class StartTest(unittest.TestCase):
     def test_nothing_listens(self):
         with tempfile.TemporaryDirectory() as directory, self.assertRaises(FileNotFoundError):
             krutil.connect(os.path.join(directory, "engine"))
+
+    @unittest.skipUnless(os.geteuid() == 0, "needs to become another user")
+    def test_an_engine_of_another_user(self):
+        with tempfile.TemporaryDirectory() as directory, socket.socket(socket.AF_UNIX) as listening:
+            path = os.path.join(directory, "engine")
+            listening.bind(path)
+            os.seteuid(65534)
+            try:
+                listening.listen()
+            finally:
+                os.seteuid(0)
+            with self.assertRaises(krutil.Refused) as caught:
+                krutil.connect(path)
+            self.assertEqual(str(caught.exception), f"cannot connect to '{path}': the engine there runs as user 65534, not "
+                                                    f"as user 0 as this program does")
+            accepted, _ = listening.accept()
+            with accepted:
+                self.assertEqual(accepted.recv(1), b"")
 
     def test_ends_that_do_not_agree_on_zero_copy(self):
         set_zero_copy(self, False)
