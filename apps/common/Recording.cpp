@@ -1,7 +1,5 @@
 #include "common/Recording.hpp"
 
-#include <fcntl.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -18,35 +16,14 @@
 namespace apps {
 namespace {
 
-namespace posix = foundation::core::posix;
-
 // So much is always kept of a frame.
 constexpr std::uint64_t frameHeader = 24;
 
 constexpr std::uint64_t largestPart = pcapng::longestPacket - pcapng::tags.size();
 
 // Errors have the name that the user gave.
-posix::OwnedDescriptor openRecording(const std::string& path, const std::string& name, bool& regular) {
-    const std::string cannot = "cannot record to '" + name + "'";
-    posix::OwnedDescriptor file(
-        ::open(path.c_str(), O_WRONLY | O_CREAT | O_NOFOLLOW | O_NOCTTY | O_CLOEXEC, S_IRUSR | S_IWUSR));
-    struct stat status {};
-    if (!file || ::fstat(file.get(), &status) != 0) {
-        throw std::system_error(errno, std::generic_category(), cannot);
-    }
-    regular = S_ISREG(status.st_mode);
-    if (!S_ISCHR(status.st_mode) && status.st_uid != ::geteuid()) {
-        throw std::runtime_error(cannot + ": it belongs to user " + std::to_string(status.st_uid) +
-                                 "; name a file of your own");
-    }
-    if (regular && status.st_nlink > 1) {
-        throw std::runtime_error(cannot + ": the file has " + std::to_string(status.st_nlink) +
-                                 " names; name a new one");
-    }
-    if (regular && (::ftruncate(file.get(), 0) != 0 || ::fchmod(file.get(), S_IRUSR | S_IWUSR) != 0)) {
-        throw std::system_error(errno, std::generic_category(), cannot);
-    }
-    return file;
+OwnFile openRecording(const std::string& path, const std::string& name) {
+    return openOwnFile(path, Begin::Empty, "cannot record to '" + name + "'");
 }
 
 timespec now() {
@@ -74,9 +51,9 @@ Recording::Recording(const RecordOptions& options, std::function<void(const std:
       limit_(options.size),
       complain_(std::move(complain)),
       clock_(now),
-      descriptor_(openRecording(path_, file_, regular_)) {
+      opened_(openRecording(path_, file_)) {
     if (limit_ != 0) {
-        if (!regular_) {
+        if (!opened_.regular) {
             throw std::runtime_error(
                 "cannot record to '" + file_ +
                 "': expected a regular file, because its size is bounded; leave out --record-size");
@@ -158,7 +135,7 @@ bool Recording::makeRoom(std::uint64_t bytes) {
     if (std::rename(path_.c_str(), (path_ + ".1").c_str()) != 0) {
         throw std::system_error(errno, std::generic_category(), "cannot rename '" + file_ + "' to '" + file_ + ".1'");
     }
-    descriptor_ = openRecording(path_, file_, regular_);
+    opened_ = openRecording(path_, file_);
     written_ = 0;
     fresh_ = true;
     return true;
@@ -190,14 +167,14 @@ void Recording::write() {
     if (!complete_) {
         return;
     }
-    if (posix::writeFully(descriptor_.get(), block_)) {
+    if (foundation::core::posix::writeFully(opened_.descriptor.get(), block_)) {
         written_ += block_.size();
         return;
     }
     const std::string reason = std::generic_category().message(errno);
     // Readers take a part of a block for damage. Where that cannot be undone, they still read what is before it.
-    if (regular_ && ::ftruncate(descriptor_.get(), static_cast<off_t>(written_)) != 0) {
-        regular_ = false;
+    if (opened_.regular && ::ftruncate(opened_.descriptor.get(), static_cast<off_t>(written_)) != 0) {
+        opened_.regular = false;
     }
     end("cannot write to '" + file_ + "': " + reason);
 }

@@ -9,9 +9,9 @@
 #include <optional>
 #include <string>
 
+#include "common/OwnFile.hpp"
 #include "common/PcapngBlocks.hpp"
 #include "common/RecordedState.hpp"
-#include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "foundation/msg_svc/transport/layers/session/SessionConfig.hpp"
 
 namespace apps {
@@ -38,9 +38,8 @@ class Recording final : public foundation::msg_svc::transport::layers::session::
   public:
     using Role = foundation::msg_svc::transport::layers::session::Role;
 
-    /// Creates the file for this user alone, or empties one that is there. Of what is there already, regular files and
-    /// pipes must belong to this user; symbolic links and files with several names are not followed, so that nobody
-    /// else says where a recording goes. Throws std::system_error and std::runtime_error with a sentence.
+    /// Creates the file for this user alone, or empties one that is there and is this user's; see openOwnFile(). Throws
+    /// std::runtime_error with a sentence.
     Recording(const RecordOptions& options, std::function<void(const std::string&)> complain);
 
     /// A session begins in which this process has that role; `build` names the program. To be called before its
@@ -71,8 +70,7 @@ class Recording final : public foundation::msg_svc::transport::layers::session::
     const std::uint64_t limit_;  ///< bytes of a file; 0 for none
     const std::function<void(const std::string&)> complain_;
     Clock clock_;
-    bool regular_ = false;  ///< a file, which can be cut
-    foundation::core::posix::OwnedDescriptor descriptor_;
+    OwnFile opened_;  ///< a regular one can be cut
 
     mutable std::mutex mutex_;
     std::string block_;                   ///< that is being written; its memory is kept for the next one

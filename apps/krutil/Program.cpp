@@ -136,6 +136,9 @@ class AskingClient {
             // Most commands end without a question.
             if (!terminal_.editor) {
                 terminal_.editor.emplace(terminal_.out, terminal_.lastLine, history_, color_);
+                if (const std::string& refusal = terminal_.editor->historyRefusal(); !refusal.empty()) {
+                    terminal_.err.write("krutil: " + refusal + "\n");
+                }
             }
             terminal_.editor->type(std::exchange(typed_, {}));
             return terminal_.editor->read(client_.conversation(), complete_, what, prompt, done);

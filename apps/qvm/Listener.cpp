@@ -27,6 +27,7 @@
 #include "common/Precheck.hpp"
 #include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "foundation/msg_svc/transport/layers/session/Session.hpp"
+#include "qvm/process/AppendFile.hpp"
 #include "qvm/process/StandardDescriptors.hpp"
 #include "qvm/python/PythonStart.hpp"
 
@@ -144,6 +145,8 @@ Listener::Listener(const Options& options, Log& log, int socket)
         preparePython(options_.python);
         // Made once, before sessions are forked.
         apps::precheck(!options_.noPrecheck);
+        // Each session opens it again. What is wrong with it is said here, and not to each client.
+        const AppendFile diary(options_.diary, {});
         if (socket < 0) {
             bindSocket();
         } else if (::fcntl(socket, F_SETFL, O_NONBLOCK) != 0) {

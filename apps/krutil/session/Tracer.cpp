@@ -1,6 +1,5 @@
 #include "krutil/session/Tracer.hpp"
 
-#include <fcntl.h>
 #include <google/protobuf/descriptor.h>
 #include <google/protobuf/io/zero_copy_stream_impl_lite.h>
 #include <google/protobuf/message.h>
@@ -12,8 +11,10 @@
 #include <cstring>
 #include <iostream>
 #include <memory>
+#include <stdexcept>
 
 #include "common/MessageNames.hpp"
+#include "common/OwnFile.hpp"
 #include "foundation/core/posix/writeFully.hpp"
 #include "foundation/vantor/carrier/framing/TaggedFrame.hpp"
 #include "krutil/base/ExitCode.hpp"
@@ -94,10 +95,12 @@ Tracer::Tracer(bool toStandardError, const std::optional<std::string>& file, boo
     if (!file) {
         return;
     }
-    file_.reset(::open(fileName_.c_str(), O_WRONLY | O_CREAT | (goesOn ? 0 : O_TRUNC) | O_APPEND | O_CLOEXEC, 0600));
-    if (file_.get() < 0) {
-        const std::string reason = std::strerror(errno);
-        throw Failure(ExitCode::Usage, "cannot open '" + fileName_ + "' for the trace: " + reason);
+    try {
+        file_ = apps::openOwnFile(fileName_, goesOn ? apps::Begin::AtEnd : apps::Begin::Empty,
+                                  "cannot open '" + fileName_ + "' for the trace")
+                    .descriptor;
+    } catch (const std::runtime_error& error) {
+        throw Failure(ExitCode::Usage, error.what());
     }
 }
 

@@ -26,7 +26,7 @@ std::string traceLine(const foundation::msg_svc::transport::layers::session::Fra
 class Tracer {
   public:
     /// `file` is emptied, unless the trace of a session before goes on there (`goesOn`), or created for this user
-    /// alone. Throws Failure (Usage) when it cannot be opened.
+    /// alone; see apps::openOwnFile(). Throws Failure (Usage) when it cannot be opened or is not this user's.
     Tracer(bool toStandardError, const std::optional<std::string>& file, bool goesOn = false);
 
     void operator()(const foundation::msg_svc::transport::layers::session::FrameTrace& trace);

@@ -87,6 +87,8 @@ class LineEditor::Impl {
     Impl(const Impl&) = delete;
     Impl& operator=(const Impl&) = delete;
 
+    const std::string& historyRefusal() const noexcept { return codeHistory_.refusal(); }
+
     void type(const std::string& keys) { ::el_wpush(editor_, toWide(keys).c_str()); }
 
     ReadLine read(Conversation& conversation, const Complete& complete, For what, const std::string& prompt,
@@ -482,6 +484,10 @@ LineEditor::~LineEditor() = default;
 ReadLine LineEditor::read(Conversation& conversation, const Complete& complete, For what, const std::string& prompt,
                           const std::function<bool()>& done) {
     return impl_->read(conversation, complete, what, prompt, done);
+}
+
+const std::string& LineEditor::historyRefusal() const noexcept {
+    return impl_->historyRefusal();
 }
 
 void LineEditor::type(const std::string& keys) {

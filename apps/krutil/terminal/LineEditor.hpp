@@ -42,6 +42,9 @@ class LineEditor {
     ReadLine read(Conversation& conversation, const Complete& complete, For what, const std::string& prompt,
                   const std::function<bool()>& done);
 
+    /// See LineHistory::refusal().
+    const std::string& historyRefusal() const noexcept;
+
     /// Takes keys that have been typed and read elsewhere: the next line begins with them.
     void type(const std::string& keys);
 

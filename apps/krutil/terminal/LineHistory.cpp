@@ -12,6 +12,7 @@
 #include <stdexcept>
 #include <utility>
 
+#include "common/OwnFile.hpp"
 #include "foundation/core/posix/OwnedDescriptor.hpp"
 
 namespace krutil_client {
@@ -43,12 +44,21 @@ posix::OwnedDescriptor lock(const std::string& file) {
     return locked && ::flock(locked.get(), LOCK_EX) == 0 ? std::move(locked) : posix::OwnedDescriptor();
 }
 
-// None for anything but a file of its own.
+// Why a file that is there is no history of this user; empty when it is one, or none is there.
+std::string whyNot(const std::string& file) {
+    struct stat status {};
+    if (::lstat(file.c_str(), &status) != 0) {
+        return {};
+    }
+    return S_ISREG(status.st_mode) ? apps::objectionTo(status) : "it is no regular file";
+}
+
+// None for anything but a file of this user's own.
 posix::OwnedDescriptor openFile(const std::string& file, int flags) {
     posix::OwnedDescriptor opened(::open(file.c_str(), flags | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK, 0600));
     struct stat status {};
-    const bool usable =
-        opened && ::fstat(opened.get(), &status) == 0 && S_ISREG(status.st_mode) && ::fchmod(opened.get(), 0600) == 0;
+    const bool usable = opened && ::fstat(opened.get(), &status) == 0 && S_ISREG(status.st_mode) &&
+                        apps::objectionTo(status).empty() && ::fchmod(opened.get(), 0600) == 0;
     return usable ? std::move(opened) : posix::OwnedDescriptor();
 }
 
@@ -79,6 +89,9 @@ LineHistory::LineHistory(std::string file) : file_(std::move(file)), history_(ma
     if (file_.empty()) {
         return;
     }
+    if (const std::string why = whyNot(file_); !why.empty()) {
+        refusal_ = "the history '" + file_ + "' is not used: " + why + "; move it away, or use --no-history";
+    }
     const posix::OwnedDescriptor locked = lock(file_);
     if (locked && openFile(file_, O_RDWR)) {
         HistEventW event{};
@@ -100,7 +113,10 @@ void LineHistory::add(const wchar_t* line) {
         return;
     }
     std::error_code ignored;
-    std::filesystem::create_directories(std::filesystem::path(file_).parent_path(), ignored);
+    const auto directory = std::filesystem::path(file_).parent_path();
+    if (std::filesystem::create_directories(directory, ignored)) {
+        std::filesystem::permissions(directory, std::filesystem::perms::owner_all, ignored);
+    }
     const posix::OwnedDescriptor locked = lock(file_);
     posix::OwnedDescriptor opened = locked ? openFile(file_, O_RDWR | O_CREAT) : posix::OwnedDescriptor();
     if (opened) {

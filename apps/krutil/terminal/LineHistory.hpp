@@ -24,6 +24,10 @@ class LineHistory {
     LineHistory(const LineHistory&) = delete;
     LineHistory& operator=(const LineHistory&) = delete;
 
+    /// A sentence when there is a file, and it is not read or written because it may be another user's; otherwise
+    /// empty.
+    const std::string& refusal() const noexcept { return refusal_; }
+
     /// What the editor takes its lines from.
     HistoryW* get() const noexcept { return history_; }
 
@@ -40,6 +44,7 @@ class LineHistory {
 
   private:
     const std::string file_;
+    std::string refusal_;
     HistoryW* const history_;
 };
 

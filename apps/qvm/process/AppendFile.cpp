@@ -1,6 +1,5 @@
 #include "qvm/process/AppendFile.hpp"
 
-#include <fcntl.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -8,16 +7,15 @@
 #include <system_error>
 #include <utility>
 
+#include "common/OwnFile.hpp"
+
 namespace qvm {
 
 AppendFile::AppendFile(const std::string& path, Complain complain) : path_(path), complain_(std::move(complain)) {
     if (path.empty()) {
         return;
     }
-    descriptor_.reset(::open(path.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0600));
-    if (!descriptor_) {
-        throw std::system_error(errno, std::generic_category(), "Cannot append to \"" + path + "\"");
-    }
+    descriptor_ = apps::openOwnFile(path, apps::Begin::AtEnd, "Cannot append to \"" + path + "\"").descriptor;
 }
 
 void AppendFile::append(std::string_view text) noexcept {

@@ -22,8 +22,8 @@ class AppendFile {
     /// Tells a person a sentence. Called from any thread that appends; must not throw.
     using Complain = std::function<void(const std::string& sentence)>;
 
-    /// Opens or creates the file (mode 0600). An empty path makes an object that drops what it is given. Throws
-    /// std::system_error when the file cannot be opened.
+    /// Opens or creates the file as apps::openOwnFile() does. An empty path makes an object that drops what it is
+    /// given. Throws std::runtime_error when the file cannot be opened or is not this user's.
     AppendFile(const std::string& path, Complain complain);
 
     explicit operator bool() const noexcept { return static_cast<bool>(descriptor_); }

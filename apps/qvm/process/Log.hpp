@@ -12,7 +12,7 @@ namespace qvm {
 /// error that the program was started with as well. May be used from any thread, and by several processes at once.
 class Log {
   public:
-    /// `path` is empty for no file. Throws std::system_error when the file cannot be opened.
+    /// `path` is empty for no file. Throws std::runtime_error as AppendFile does.
     explicit Log(const std::string& path);
 
     /// To standard error and the file.

@@ -233,6 +233,19 @@ TEST_F(TerminalReplTest, TheHistoryIsKeptForItsOwnerOnly) {
     leave();
 }
 
+TEST_F(TerminalReplTest, AHistoryThatMayBeAnotherUsersIsNotUsedAndSaid) {
+    std::filesystem::create_directory(directory / "krutil");
+    std::ofstream(directory / "elsewhere") << "precious\n";
+    std::filesystem::create_hard_link(directory / "elsewhere", directory / "krutil/history");
+    begin();
+    EXPECT_THAT(terminal->sent(),
+                HasSubstr("krutil: the history '" + (directory / "krutil/history").string() +
+                          "' is not used: the file has 2 names; move it away, or use --no-history\r\n"));
+    evaluate("6 * 7", "42\r\n");
+    leave();
+    EXPECT_EQ(std::filesystem::file_size(directory / "elsewhere"), 9U);
+}
+
 TEST_F(TerminalReplTest, WithoutHistoryNothingIsKept) {
     begin({"repl", "--no-history"});
     evaluate("1");

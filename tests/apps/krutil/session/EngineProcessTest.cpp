@@ -11,6 +11,7 @@
 
 #include "krutil/base/ExitCode.hpp"
 #include "programs/support/Program.hpp"
+#include "support/AnotherUser.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 namespace krutil_client {
@@ -115,6 +116,33 @@ TEST(EngineProcessTest, ASocketPathHasALimit) {
             EXPECT_EQ(failure.what(), "cannot connect to '" + path + "': a socket's path has 1 to 107 bytes");
         }
     }
+}
+
+TEST(EngineProcessTest, AnEngineOfAnotherUserIsRefusedBeforeAByteIsSent) {
+    if (!test_support::AnotherUser::isPossible()) {
+        GTEST_SKIP() << "needs to become another user";
+    }
+    const test_support::TemporaryDirectory directory;
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    directory.file("s").copy(address.sun_path, sizeof address.sun_path - 1);
+    const foundation::core::posix::OwnedDescriptor listener(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    ASSERT_EQ(::bind(listener.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    {
+        const test_support::AnotherUser nobody;
+        ASSERT_EQ(::listen(listener.get(), 1), 0);
+    }
+    try {
+        EngineProcess::connect(address.sun_path);
+        FAIL();
+    } catch (const Failure& failure) {
+        EXPECT_EQ(failure.code(), ExitCode::Stream);
+        EXPECT_EQ(failure.what(), "cannot connect to '" + directory.file("s") +
+                                      "': the engine there runs as user 65534, not as user 0 as this program does");
+    }
+    const foundation::core::posix::OwnedDescriptor accepted(::accept(listener.get(), nullptr, nullptr));
+    char byte = 0;
+    EXPECT_EQ(::read(accepted.get(), &byte, 1), 0);
 }
 
 TEST(EngineProcessTest, AConnectionIsNoChild) {

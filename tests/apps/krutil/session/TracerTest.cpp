@@ -129,11 +129,29 @@ TEST_F(TracerFileTest, LinesAreOnStandardErrorAsWellIfThatIsWanted) {
 
 TEST_F(TracerFileTest, AFileThatIsThereIsEmptiedAndANewOneIsForThisUserAlone) {
     std::ofstream(file()) << "older";
+    std::filesystem::permissions(file(), std::filesystem::perms(0644));
     const Tracer emptied(false, file());
     EXPECT_EQ(content(), "");
+    EXPECT_EQ(std::filesystem::status(file()).permissions(), std::filesystem::perms(0600));
     std::filesystem::remove(file());
     const Tracer created(false, file());
     EXPECT_EQ(std::filesystem::status(file()).permissions(), std::filesystem::perms(0600));
+}
+
+TEST_F(TracerFileTest, AFileThatMayBeAnotherUsersIsRefused) {
+    std::ofstream(file() + ".other") << "precious";
+    std::filesystem::create_hard_link(file() + ".other", file());
+    for (const bool goesOn : {false, true}) {
+        try {
+            const Tracer tracer(false, file(), goesOn);
+            ADD_FAILURE() << "expected a failure";
+        } catch (const Failure& failure) {
+            EXPECT_EQ(failure.code(), ExitCode::Usage);
+            EXPECT_EQ(failure.what(),
+                      "cannot open '" + file() + "' for the trace: the file has 2 names; name a file of your own");
+        }
+    }
+    EXPECT_EQ(content(), "precious");
 }
 
 TEST_F(TracerFileTest, LinesOfSeveralThreadsAreWhole) {

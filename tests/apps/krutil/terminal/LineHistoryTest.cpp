@@ -16,13 +16,16 @@
 #include <vector>
 
 #include "krutil/base/Text.hpp"
+#include "support/AnotherUser.hpp"
 #include "support/Pipe.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 namespace krutil_client {
 namespace {
 
+using test_support::AnotherUser;
 using ::testing::ElementsAre;
+using ::testing::IsEmpty;
 using ::testing::SizeIs;
 
 class LineHistoryTest : public ::testing::Test {
@@ -166,6 +169,40 @@ TEST_F(LineHistoryTest, TheFileIsForItsOwnerOnly) {
     EXPECT_EQ(modeOf(file), 0600U);
 }
 
+TEST_F(LineHistoryTest, AFileThatMayBeAnotherUsersIsRefused) {
+    const std::string precious = directory.file("precious");
+    LineHistory(file).add(L"before\n");
+    std::filesystem::create_hard_link(file, precious);
+    {
+        LineHistory history(file);
+        EXPECT_EQ(history.refusal(),
+                  "the history '" + file + "' is not used: the file has 2 names; move it away, or use --no-history");
+        EXPECT_THAT(linesOf(history), IsEmpty());
+        history.add(L"1\n");
+        EXPECT_THAT(linesOf(history), ElementsAre("1\n"));
+    }
+    std::filesystem::remove(precious);
+    EXPECT_THAT(linesInFile(), ElementsAre("before\n"));
+    EXPECT_EQ(LineHistory(file).refusal(), "");
+}
+
+TEST_F(LineHistoryTest, AFileOfAnotherUserIsRefused) {
+    if (!AnotherUser::isPossible()) {
+        GTEST_SKIP() << "needs a file of another user";
+    }
+    LineHistory(file).add(L"a trap\n");
+    std::filesystem::permissions(file, std::filesystem::perms(0666));
+    ASSERT_EQ(::chown(file.c_str(), AnotherUser::number, AnotherUser::number), 0);
+    LineHistory history(file);
+    EXPECT_EQ(history.refusal(),
+              "the history '" + file + "' is not used: it belongs to user 65534; move it away, or use --no-history");
+    EXPECT_THAT(linesOf(history), IsEmpty());
+    const auto size = std::filesystem::file_size(file);
+    history.add(L"1\n");
+    EXPECT_EQ(std::filesystem::file_size(file), size);
+    EXPECT_EQ(modeOf(file), 0666U);
+}
+
 TEST_F(LineHistoryTest, WithoutAFileLinesAreRememberedOnly) {
     LineHistory history{std::string()};
     history.add(L"1\n");
@@ -181,10 +218,13 @@ TEST_F(LineHistoryTest, WhatCannotBeAHistoryIsLeftAlone) {
         LineHistory history(file);
         history.add(L"1\n");
         EXPECT_THAT(linesOf(history), ElementsAre("1\n"));
+        EXPECT_EQ(history.refusal(),
+                  "the history '" + file + "' is not used: it is no regular file; move it away, or use --no-history");
     }
     EXPECT_EQ(std::filesystem::file_size(target), 9U);
     LineHistory(directory.file("")).add(L"1\n");
     LineHistory("/dev/null/history").add(L"1\n");
+    EXPECT_EQ(LineHistory("/dev/null/history").refusal(), "");
 }
 
 }  // namespace

@@ -7,10 +7,12 @@
 #include <unistd.h>
 
 #include <array>
+#include <cerrno>
 #include <filesystem>
 
 #include "apps/qvm/fixture/EngineFixture.hpp"
 #include "foundation/core/posix/OwnedDescriptor.hpp"
+#include "support/AnotherUser.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 namespace qvm_test {
@@ -58,6 +60,29 @@ TEST(InheritedSocketTest, AConnectionIsOneSession) {
     EXPECT_EQ(client.eval("6 * 7").shown(), "42\n");
     EXPECT_EQ(client.goodbye().reason, session::SessionEnd::Reason::Finished);
     EXPECT_EQ(engine.wait(), 0);
+}
+
+TEST(InheritedSocketTest, AConnectionOfAnotherUserIsRefused) {
+    if (!test_support::AnotherUser::isPossible()) {
+        GTEST_SKIP() << "needs to become another user";
+    }
+    std::array<int, 2> pair{};
+    {
+        const test_support::AnotherUser nobody;
+        ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair.data()), 0);
+    }
+    const OwnedDescriptor ours(pair[0]);
+    OwnedDescriptor theirs(pair[1]);
+    ASSERT_EQ(::write(ours.get(), "not looked at", 13), 13);
+    EngineProcess engine({"--listen-fds"}, theirs.get());
+    theirs.reset();
+    EXPECT_EQ(engine.wait(), 5);
+    EXPECT_EQ(engine.stderrText(),
+              "krutil-qvm: refused a client of user 65534, since this engine serves user 0 only\n");
+    // What is closed with bytes that nobody has read.
+    char byte = 0;
+    EXPECT_EQ(::read(ours.get(), &byte, 1), -1);
+    EXPECT_EQ(errno, ECONNRESET);
 }
 
 TEST(InheritedSocketTest, NoneIsAnError) {

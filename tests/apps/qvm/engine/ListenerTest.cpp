@@ -12,6 +12,8 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <iomanip>
+#include <sstream>
 
 #include "apps/qvm/fixture/EngineFixture.hpp"
 #include "support/TemporaryDirectory.hpp"
@@ -119,14 +121,43 @@ TEST_F(ListenerTest, FileThatIsNoSocketIsLeftAlone) {
     EXPECT_EQ(contentsOf(path_), "precious");
 }
 
+TEST_F(ListenerTest, LinkInThePlaceOfTheSocketIsLeftAlone) {
+    serve();
+    const std::string link = directory_.file("private/link");
+    // To a socket that is served, to a file, and to nothing.
+    for (const std::string& target : {path_, directory_.file("file"), directory_.file("private/nothing")}) {
+        std::ofstream(directory_.file("file")) << "precious";
+        ASSERT_EQ(::symlink(target.c_str(), link.c_str()), 0);
+        EXPECT_EQ(refusal(link), "krutil-qvm: \"" + link + "\" exists and is not a socket.\n");
+        EXPECT_EQ(std::filesystem::read_symlink(link), target);
+        ::unlink(link.c_str());
+    }
+    EXPECT_EQ(contentsOf(directory_.file("file")), "precious");
+    EXPECT_FALSE(std::filesystem::exists(directory_.file("private/nothing")));
+}
+
 TEST_F(ListenerTest, DirectoryThatIsOpenToOthersIsRefused) {
     const std::string open = directory_.file("open");
     ::mkdir(open.c_str(), 0700);
-    ::chmod(open.c_str(), 0750);
-    EXPECT_EQ(refusal(open + "/socket"),
-              "krutil-qvm: The directory \"" + open +
-                  "\" is open to other users (mode 0750, expected 0700): put the socket into "
-                  "a directory of your own.\n");
+    for (const mode_t mode : {0750U, 0701U, 0770U, 01777U}) {
+        ::chmod(open.c_str(), mode);
+        std::ostringstream digits;
+        digits << std::oct << std::setfill('0') << std::setw(4) << mode;
+        EXPECT_EQ(refusal(open + "/socket"), "krutil-qvm: The directory \"" + open +
+                                                 "\" is open to other users (mode " + digits.str() +
+                                                 ", expected 0700): put the socket into a directory of your own.\n");
+        EXPECT_TRUE(std::filesystem::is_empty(open));
+    }
+}
+
+TEST_F(ListenerTest, ItsFilesMayNotBeAnotherUsers) {
+    std::ofstream(directory_.file("other")) << "precious";
+    std::filesystem::create_hard_link(directory_.file("other"), directory_.file("log"));
+    EngineProcess engine({"--listen", path_, "--log", directory_.file("log")});
+    EXPECT_EQ(engine.wait(), 3);
+    EXPECT_EQ(engine.stderrText(), "krutil-qvm: Cannot append to \"" + directory_.file("log") +
+                                       "\": the file has 2 names; name a file of your own\n");
+    EXPECT_EQ(contentsOf(directory_.file("other")), "precious");
 }
 
 TEST_F(ListenerTest, DirectoryThatIsALinkIsRefused) {
@@ -167,13 +198,16 @@ TEST_F(ListenerTest, ClientOfAnotherUserIsRefused) {
         if (::connect(connection, reinterpret_cast<const sockaddr*>(&address), sizeof(address)) != 0) {
             ::_exit(2);
         }
+        // Whoever began to read it would say that this is no session. It may come too late.
+        static_cast<void>(::send(connection, "GET /", 5, MSG_NOSIGNAL));
         char byte = 0;
-        ::_exit(::read(connection, &byte, 1) == 0 ? 0 : 3);
+        ::_exit(::read(connection, &byte, 1) <= 0 ? 0 : 3);
     }
     int status = 0;
     ASSERT_EQ(::waitpid(child, &status, 0), child);
     EXPECT_EQ(WEXITSTATUS(status), 0);
-    engine_->awaitStderr("refused a client of user 65534, since this engine serves user 0 only\n");
+    const std::string refused = "krutil-qvm: refused a client of user 65534, since this engine serves user 0 only\n";
+    EXPECT_EQ(engine_->awaitStderr(refused), "krutil-qvm: serving " + path_ + "\n" + refused);
 }
 
 // Whether a process of the user `user` that connects is answered.
