@@ -144,7 +144,9 @@ TEST_F(RecorderTest, SharedContentFollowsItsFrameAtBothEnds) {
     const framing::StreamID second = pair.client->newStreamID();
     pair.client->send(second, question("q", {bulkOf(mebi)}));
     pair.engineSaw.waitForLines(2);
-    const auto sent = units_.frames();
+    // What comes back may be there already, or not yet.
+    std::vector<std::string> sent = units_.frames();
+    std::erase_if(sent, [](const std::string& unit) { return unit[0] == '<'; });
     ASSERT_THAT(sent, SizeIs(4));
     EXPECT_TRUE(sent[0] == "> " + wire::data(first, 1, false, std::string(mebi, 'b')));
     const std::string shared = wire::sharedData(second, 1, 0, 0, mebi);
