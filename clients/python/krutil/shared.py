@@ -75,6 +75,11 @@ def _mapped(address: Optional[int], size: int, protection: int, flags: int, desc
     return int(made)
 
 
+# Memory of arrays, by address. Each use of it is one step of a dict, which no other thread comes between: memory goes in
+# any thread, at any time.
+_memories: "dict[int, weakref.ref[_Memory]]" = {}
+
+
 class _Memory:
     """Memory of this process that engines may map, as what NumPy makes arrays of. It lives as long as any of these."""
 
@@ -96,12 +101,10 @@ class _Memory:
 
     def __del__(self) -> None:
         if self.descriptor >= 0:
+            # First: while it is unmapped other threads run, and their arrays may come to lie where it was.
+            _memories.pop(self.address, None)
             _libc.munmap(self.address, self.size)
             os.close(self.descriptor)
-
-
-# By address, from which on they are looked for.
-_memories: "weakref.WeakValueDictionary[int, _Memory]" = weakref.WeakValueDictionary()
 
 
 def empty(shape: Union[int, Sequence[int]], dtype: Any = float, order: str = "C") -> numpy.typing.NDArray[Any]:
@@ -129,7 +132,7 @@ def empty(shape: Union[int, Sequence[int]], dtype: Any = float, order: str = "C"
     except OSError as error:
         raise MemoryError(f"there is no shared memory for {model.nbytes} bytes: {error.strerror}") from None
     array: Any = numpy.ndarray(model.shape, model.dtype, numpy.asarray(memory), order="F" if model.flags.fnc else "C")
-    _memories[memory.address] = memory
+    _memories[memory.address] = weakref.ref(memory)
     return array  # type: ignore[no-any-return]
 
 
@@ -145,7 +148,10 @@ class Place:
         if elements.nbytes < SMALLEST:
             return None
         address = elements.ctypes.data
-        for memory in list(_memories.values()):
+        for reference in list(_memories.values()):
+            memory = reference()
+            if memory is None:
+                continue
             offset = address - memory.address
             if 0 <= offset <= memory.size - elements.nbytes and offset % mmap.PAGESIZE == 0:
                 return Place(memory, offset, elements.nbytes)

@@ -5,6 +5,8 @@ import mmap
 import os
 import socket
 import struct
+import sys
+import threading
 import unittest
 from unittest import mock
 
@@ -151,6 +153,51 @@ def memory(size=SIZE, seals=1 | 2 | 4 | 16, filled=True, content=b""):
     os.pwrite(descriptor, content, 0)
     fcntl.fcntl(descriptor, fcntl.F_ADD_SEALS, seals)
     return descriptor
+
+
+class PlaceTest(unittest.TestCase):
+    def test_elements_lie_in_their_own_memory(self):
+        array = krutil.empty((2, MiB), numpy.uint8)
+        place = shared.Place.of(array[1])
+        self.assertEqual((place.memory.address, place.offset, place.size), (array.ctypes.data, MiB, MiB))
+        self.assertIsNone(shared.Place.of(numpy.empty(MiB, numpy.uint8)))
+
+    def test_memory_that_goes_is_not_found(self):
+        array = krutil.empty(2 * MiB, numpy.uint8)
+        address = array.ctypes.data
+        unmap, found = shared._libc.munmap, []
+
+        def observed(begin, size):
+            # Arrays of other threads may lie here from now on.
+            if begin == address:
+                elements = mock.Mock(nbytes=MiB, ctypes=mock.Mock(data=address + MiB))
+                found.append(shared.Place.of(elements))
+            return unmap(begin, size)
+
+        with mock.patch.object(shared, "_libc", mock.Mock(wraps=shared._libc, munmap=observed)):
+            del array
+        self.assertEqual(found, [None])
+
+    def test_threads_find_their_own_memory(self):
+        found = []
+
+        def look():
+            for size in [MiB, 4 * MiB] * 100:
+                array = krutil.empty(size, numpy.uint8)
+                place = shared.Place.of(array)
+                found.append(place is not None and place.memory.address == array.ctypes.data)
+
+        interval = sys.getswitchinterval()
+        sys.setswitchinterval(1e-6)
+        try:
+            threads = [threading.Thread(target=look) for _ in range(4)]
+            for thread in threads:
+                thread.start()
+            for thread in threads:
+                thread.join()
+        finally:
+            sys.setswitchinterval(interval)
+        self.assertEqual(found, [True] * 800)
 
 
 class SharingEngine(ScriptedEngine):
