@@ -1,3 +1,5 @@
+// A session and how it ends. Somewhat long, because each way to its end is told beside the others.
+
 #include "foundation/msg_svc/transport/layers/session/Session.hpp"
 
 #include <algorithm>
