@@ -118,26 +118,33 @@ TEST(EngineProcessTest, ASocketPathHasALimit) {
     }
 }
 
+// A Unix socket of that path, which does not listen yet.
+foundation::core::posix::OwnedDescriptor socketAt(const std::string& path) {
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    path.copy(address.sun_path, sizeof address.sun_path - 1);
+    foundation::core::posix::OwnedDescriptor made(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    EXPECT_EQ(::bind(made.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    return made;
+}
+
 TEST(EngineProcessTest, AnEngineOfAnotherUserIsRefusedBeforeAByteIsSent) {
     if (!test_support::AnotherUser::isPossible()) {
         GTEST_SKIP() << "needs to become another user";
     }
     const test_support::TemporaryDirectory directory;
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    directory.file("s").copy(address.sun_path, sizeof address.sun_path - 1);
-    const foundation::core::posix::OwnedDescriptor listener(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    ASSERT_EQ(::bind(listener.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    const std::string path = directory.file("s");
+    const auto listener = socketAt(path);
     {
         const test_support::AnotherUser nobody;
         ASSERT_EQ(::listen(listener.get(), 1), 0);
     }
     try {
-        EngineProcess::connect(address.sun_path);
+        EngineProcess::connect(path);
         FAIL();
     } catch (const Failure& failure) {
         EXPECT_EQ(failure.code(), ExitCode::Stream);
-        EXPECT_EQ(failure.what(), "cannot connect to '" + directory.file("s") +
+        EXPECT_EQ(failure.what(), "cannot connect to '" + path +
                                       "': the engine there runs as user 65534, not as user 0 as this program does");
     }
     const foundation::core::posix::OwnedDescriptor accepted(::accept(listener.get(), nullptr, nullptr));
@@ -147,13 +154,10 @@ TEST(EngineProcessTest, AnEngineOfAnotherUserIsRefusedBeforeAByteIsSent) {
 
 TEST(EngineProcessTest, AConnectionIsNoChild) {
     const test_support::TemporaryDirectory directory;
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    directory.file("s").copy(address.sun_path, sizeof address.sun_path - 1);
-    const foundation::core::posix::OwnedDescriptor listener(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
-    ASSERT_EQ(::bind(listener.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address), 0);
+    const std::string path = directory.file("s");
+    const auto listener = socketAt(path);
     ASSERT_EQ(::listen(listener.get(), 1), 0);
-    auto engine = EngineProcess::connect(address.sun_path);
+    auto engine = EngineProcess::connect(path);
     EXPECT_FALSE(engine.isChild());
     EXPECT_EQ(engine.watch(), -1);
     EXPECT_FALSE(engine.waitForEnd(60s));
