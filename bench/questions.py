@@ -75,14 +75,12 @@ def beside_jupyter(run):
     return [{"label": "", "size": None, "times": [{"name": name, "seconds": all} for name, all in times.items()]}]
 
 
-def python_client(contests, fewer=1):
+def python_client(contests):
     """Asks the client for Python. `contests` are triples: a question to the C++ client, what is put before its labels, and
-    what the client for Python does for them. They have their turns one after the other. The C++ client answers all of its
-    question each time, so a long one is asked by so many times `fewer`."""
+    what the client for Python does for them. They have their turns one after the other."""
     def measure(run):
         import python_client as client
         sys.path.insert(0, run.program("python"))
-        run = dataclasses.replace(run, repetitions=max(3, run.repetitions // fewer))
         return [row for question, label, make in contests for row in _beside_cpp(run, client, question, label, make)]
     return measure
 
@@ -139,7 +137,7 @@ QUESTIONS = [
              python_client([("evaluation", "", "evaluations")])),
     Question("python-arrays", "Calls with 64 MiB by the client for Python", CPP_CLIENT,
              python_client([("arrays", "over the socket, ", "arrays"),
-                            ("shared-arrays", "in shared memory, ", "shared_arrays")], fewer=3), conditions=REUSED),
+                            ("shared-arrays", "in shared memory, ", "shared_arrays")]), conditions=REUSED),
     Question("lines-shown", "200,000 lines printed and shown by `krutil`, the whole process",
              "`python3 -u` that prints them", processes.lines_shown, conditions=FILES),
     Question("start", "`krutil eval 1+1` with an engine of its own, the whole process", "`python3 -c 1+1`",

@@ -1,5 +1,6 @@
 """NumPy arrays in messages, and back, without copying the elements of large ones."""
 
+import functools
 from typing import Any, Union
 
 import numpy
@@ -48,29 +49,44 @@ def add_argument(frames: list[Frame], value: Any, zero_copy: bool) -> int:
     if isinstance(value, str):
         units = numpy.frombuffer(value.encode("utf-16-le", "surrogatepass"), "<u2")
         array, code = units.reshape(1, units.size), _TEXT
-    elif isinstance(value, numpy.ma.MaskedArray):
-        raise TypeError("argument: a masked array would lose its mask; use its data, or filled()")
     else:
-        array = numpy.asarray(value)
-        array = array.astype(array.dtype.newbyteorder("<"), copy=False)
-        found = _CODES.get(array.dtype)
-        if found is None:
-            raise TypeError(f"argument: expected an array of bool, of integers of 8 to 64 bits, of single, double or "
-                            f"complex numbers, or a str; got {type(value).__name__} with elements of {array.dtype}")
-        code = found
+        array, code = _sendable(value)
     if not (array.flags.c_contiguous or array.flags.f_contiguous):
         array = numpy.ascontiguousarray(array)
-    in_rows = array.flags.c_contiguous
-    description = Array(elementType=code, dimensions=array.shape, order=_ROW_MAJOR if in_rows else _COLUMN_MAJOR)
-    flat = (array if in_rows else array.T).reshape(-1).view(numpy.uint8)
-    elements = flat.data
+    order = _ROW_MAJOR if array.flags.c_contiguous else _COLUMN_MAJOR
+    elements = numpy.ndarray(array.nbytes, numpy.uint8, array if order == _ROW_MAJOR else array.T).data
     if zero_copy and elements.nbytes >= _DATA_FRAME_FROM:
-        frames.append(Frame(None, _FRAME_TYPES[code], elements, Place.of(flat)))
-        description.dataID = len(frames)
+        frames.append(Frame(None, _FRAME_TYPES[code], elements, Place.of(array)))
+        description = _of_data_frame(code, array.shape, order, len(frames))
     else:
-        description.inlineElements = bytes(elements)
-    frames.append(Frame(ARRAY_TAG, 29, description.SerializeToString()))
+        description = Array(elementType=code, dimensions=array.shape, order=order,
+                            inlineElements=bytes(elements)).SerializeToString()
+    frames.append(Frame(ARRAY_TAG, 29, description))
     return len(frames)
+
+
+@functools.lru_cache(maxsize=64)
+def _of_data_frame(code: int, shape: tuple[int, ...], order: int, index: int) -> bytes:
+    """The description of an array whose elements are in another frame. Calls in a loop send the same one each time."""
+    made: bytes = Array(elementType=code, dimensions=shape, order=order, dataID=index).SerializeToString()
+    return made
+
+
+def _sendable(value: Any) -> "tuple[numpy.typing.NDArray[Any], int]":
+    """The value as an array whose elements are as they are sent, and their code."""
+    # Nearly always it is one. Each step to find that out is slow after a large array, which leaves no code in the caches.
+    code = _CODES.get(value.dtype) if type(value) is numpy.ndarray else None
+    if code is not None:
+        return value, code
+    if isinstance(value, numpy.ma.MaskedArray):
+        raise TypeError("argument: a masked array would lose its mask; use its data, or filled()")
+    array = numpy.asarray(value)
+    array = array.astype(array.dtype.newbyteorder("<"), copy=False)
+    code = _CODES.get(array.dtype)
+    if code is None:
+        raise TypeError(f"argument: expected an array of bool, of integers of 8 to 64 bits, of single, double or "
+                        f"complex numbers, or a str; got {type(value).__name__} with elements of {array.dtype}")
+    return array, code
 
 
 def take_value(message: Message, index: int, zero_copy: bool) -> Value:

@@ -1,5 +1,6 @@
 """A session with an engine: how it is begun, what can be asked, and how it ends."""
 
+import functools
 import os
 import secrets
 import shlex
@@ -180,7 +181,8 @@ class Session:
     # What prompts and requests need of it.
 
     def _submit_eval(self, code: str, mode: str) -> "Request[Result]":
-        return self._enqueue([], "krutil:EvalIIP", EvalIIP(cmd=code), mode, _eval_result)
+        # Partial: no field is required, so nobody need look for one that is missing.
+        return self._enqueue([], "krutil:EvalIIP", EvalIIP(cmd=code).SerializePartialToString(), mode, _eval_result)
 
     def _submit_file(self, path: "str | os.PathLike[str]", arguments: Sequence[str]) -> "Request[Result]":
         with tokenize.open(path) as file:
@@ -188,13 +190,13 @@ class Session:
         # A request of its own: the file may begin with what must be the first statement.
         self.submit(f"__import__('sys').argv = {[os.fspath(path), *arguments]!r}")
         request = EvalIIP(cmd=code, codeType=CodeType["ScriptType"])
-        return self._enqueue([], "krutil:EvalIIP", request, "DEQUEUE_AT_IDLE", _eval_result, os.path.abspath(path))
+        return self._enqueue([], "krutil:EvalIIP", request.SerializePartialToString(), "DEQUEUE_AT_IDLE", _eval_result,
+                             os.path.abspath(path))
 
     def _submit_call(self, function: str, arguments: Sequence[Any], outputs: int, mode: str) -> "Request[Any]":
         frames: list[Frame] = []
         indexes = [arrays.add_argument(frames, argument, self._zero_copy) for argument in arguments]
-        request = FEvalIIP(functionName=function, nlhs=outputs, dataIDs=indexes,
-                           clientQvmID=_ANY_ENGINE, serverQvmID=_ANY_ENGINE)
+        request = _call_request(function, outputs, tuple(indexes))
         return self._enqueue(frames, "krutil:FEvalIIP", request, mode, _call_result(outputs))
 
     def _submit_cancel(self, identifier: tuple[int, int], even_if_running: bool) -> "Future[CancelAnswer]":
@@ -205,10 +207,9 @@ class Session:
         self._dispatch.begin(lambda: answer, [Frame("krutil:IIPCancelMessage", 27, message.SerializeToString())])
         return answer
 
-    def _enqueue(self, frames: list[Frame], tag: str, request: Any, mode: str,
+    def _enqueue(self, frames: list[Frame], tag: str, request: bytes, mode: str,
                  make_result: Callable[["Request[Any]", Any], Any], name: str = "") -> "Request[Any]":
-        # Partial: no field is required, so nobody need look for one that is missing.
-        frames.append(Frame(tag, 29, _CORE + request.SerializePartialToString()))
+        frames.append(Frame(tag, 29, _CORE + request))
         identifier = self._identity, self._dispatch.next_number()
         enqueue = IIPEnqueueMessage(iipHandle=len(frames), dequeueMode=WhenToDequeue[mode], name=name)
         enqueue.iipid.hi, enqueue.iipid.lo = identifier
@@ -298,6 +299,14 @@ def connect(path: "str | os.PathLike[str]", *, on_input: Optional[OnInput] = Non
     except BaseException:
         connection.close()
         raise
+
+
+@functools.lru_cache(maxsize=64)
+def _call_request(function: str, outputs: int, indexes: tuple[int, ...]) -> bytes:
+    """What a call of the function says, without its arguments. Calls in a loop say the same each time."""
+    made: bytes = FEvalIIP(functionName=function, nlhs=outputs, dataIDs=indexes, clientQvmID=_ANY_ENGINE,
+                           serverQvmID=_ANY_ENGINE).SerializePartialToString()
+    return made
 
 
 def _eval_result(request: "Request[Any]", _: Any) -> Result:

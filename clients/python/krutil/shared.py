@@ -143,18 +143,19 @@ class Place:
         self.memory, self.offset, self.size = memory, offset, size
 
     @staticmethod
-    def of(elements: numpy.typing.NDArray[numpy.uint8]) -> "Optional[Place]":
+    def of(array: numpy.typing.NDArray[Any]) -> "Optional[Place]":
         """The place of elements that lie side by side, if it is one that a peer accepts."""
-        if elements.nbytes < SMALLEST:
+        size = array.nbytes
+        if size < SMALLEST:
             return None
-        address = elements.ctypes.data
+        address = array.__array_interface__["data"][0]
         for reference in list(_memories.values()):
             memory = reference()
             if memory is None:
                 continue
             offset = address - memory.address
-            if 0 <= offset <= memory.size - elements.nbytes and offset % mmap.PAGESIZE == 0:
-                return Place(memory, offset, elements.nbytes)
+            if 0 <= offset <= memory.size - size and offset % mmap.PAGESIZE == 0:
+                return Place(memory, offset, size)
         return None
 
 

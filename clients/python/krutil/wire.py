@@ -25,8 +25,8 @@ HEADER = struct.Struct("<BBHIQQ")
 
 ARRAY_TAG = "krutil:QDA"
 
-# A number: the socket module's own takes as long to combine with another as a system call.
-_CUT = int(socket.MSG_CTRUNC)
+# Numbers: the socket module's own take as long to combine with another as a system call.
+_CUT, _CLOSE_ON_EXEC, _WAIT_FOR_ALL = int(socket.MSG_CTRUNC), int(socket.MSG_CMSG_CLOEXEC), int(socket.MSG_WAITALL)
 
 Buffer = Union[bytes, bytearray, memoryview]
 
@@ -193,7 +193,7 @@ class Reader:
             self._view[:done] = self._view[begin:self._end]
             self._begin, self._end = 0, done
             while self._end < size:
-                self._end += self._receive(self._view[self._end:], self._end, size, what, *numbers)
+                self._end += self._receive(self._view[self._end:], 0, self._end, size, what, *numbers)
             begin, end = 0, size
         self._begin = end
         return self._buffer[begin:end]
@@ -207,7 +207,8 @@ class Reader:
         target[:done] = self._view[self._begin:self._end]
         self._begin = self._end = 0
         while done < size:
-            done += self._receive(target[done:], done, size, what, *numbers)
+            # The system comes back when all is there, or nothing more will come.
+            done += self._receive(target[done:], _WAIT_FOR_ALL, done, size, what, *numbers)
         return target
 
     def usual_message(self, limits: Limits) -> Optional[Message]:
@@ -216,7 +217,7 @@ class Reader:
         with it. Waits until something has arrived."""
         if self._begin == self._end:
             self._begin = 0
-            self._end = self._receive(self._view, 0, HEADER.size, "the header of frame %d", 1)
+            self._end = self._receive(self._view, 0, 0, HEADER.size, "the header of frame %d", 1)
         buffer, begin, arrived = self._buffer, self._begin, self._end
         frames: list[Frame] = []
         stream, room = 0, limits.message
@@ -246,17 +247,17 @@ class Reader:
         """What has come behind all that was read."""
         return bytes(self._view[self._begin:self._end])
 
-    def _receive(self, target: memoryview, done: int, size: int, what: str, *numbers: int) -> int:
+    def _receive(self, target: memoryview, flags: int, done: int, size: int, what: str, *numbers: int) -> int:
         if self.deadline is not None:
             self._socket.settimeout(max(self.deadline - time.monotonic(), 1e-3))
         try:
             if self.descriptors is None:
-                count = self._socket.recv_into(target)
+                count = self._socket.recv_into(target, 0, flags)
             else:
-                count, ancillary, flags, _ = self._socket.recvmsg_into([target], DescriptorQueue.SPACE,
-                                                                       socket.MSG_CMSG_CLOEXEC)
-                if ancillary or flags & _CUT:
-                    self.descriptors.add(ancillary, flags)
+                count, ancillary, told, _ = self._socket.recvmsg_into([target], DescriptorQueue.SPACE,
+                                                                      flags | _CLOSE_ON_EXEC)
+                if ancillary or told & _CUT:
+                    self.descriptors.add(ancillary, told)
         except ConnectionResetError:
             count = 0  # The engine has closed the stream without reading all that was sent to it.
         if count == 0:
@@ -385,8 +386,8 @@ Piece = Union[Buffer, HeaderWithDescriptor]
 
 def message_bytes(stream: int, frames: Sequence[Frame], peer: Limits,
                   lender: "Optional[Lender]" = None) -> tuple[list[Piece], int]:
-    """The pieces of a message, to be sent in this order, and how many bytes they have, lent ones included. What the
-    peer does not accept is a `ValueError`. Contents that have a place are lent, if there is a lender."""
+    """The pieces of a message, to be sent in this order, and how many bytes they have. What the peer does not accept is
+    a `ValueError`. Contents that have a place are lent, if there is a lender."""
     if len(frames) > peer.frames:
         raise ValueError(f'the request has {len(frames)} frames; the engine accepts {peer.frames} (its limit "frames")')
     buffers: list[Piece] = []
@@ -411,12 +412,14 @@ def message_bytes(stream: int, frames: Sequence[Frame], peer: Limits,
         buffers.append(frame.content)
     if total > peer.message:
         raise ValueError(f'the request has {total} bytes; the engine accepts {peer.message} (its limit "message")')
+    size = total + len(frames) * HEADER.size
     for at, frame in lent:
         assert frame.place is not None and lender is not None
         content = lender.lend(frame.place)
+        size += len(content) - len(frame.content)
         header = HEADER.pack(SHARED_DATA, frame.type, 0, stream, at // 2 + 1, len(content))
         buffers[at:at + 2] = HeaderWithDescriptor(header, frame.place.memory.descriptor), content
-    return buffers, total + len(frames) * HEADER.size
+    return buffers, size
 
 
 def return_bytes(number: int, still_mapped: bool) -> bytes:

@@ -12,8 +12,11 @@ from .wire import HeaderWithDescriptor, Piece
 # As many buffers as one system call takes.
 _MOST_BUFFERS = 1024
 
-# A Unix socket takes so many bytes whole or not at all, however small its buffer is.
+# A Unix socket takes so many bytes whole or not at all, with what is beside them, however small its buffer is.
 _WHOLE = 2_048
+
+# So many descriptors may be ahead of the bytes of their frames.
+_MOST_DESCRIPTORS = 16
 
 # A number: what the socket module makes of two of its own takes as long as a system call.
 _AT_ONCE = int(socket.MSG_NOSIGNAL | socket.MSG_DONTWAIT)
@@ -37,13 +40,8 @@ class Writer:
     def send(self, buffers: Sequence[Piece], size: int) -> None:
         """Takes the buffers of a message, of so many bytes, which must stay as they are until they are sent. For one
         caller at a time."""
-        if size <= _WHOLE and self._writes_whole and not self._unwritten:
-            try:
-                # Nothing so small comes with a descriptor.
-                self._socket.sendmsg(buffers, [], _AT_ONCE)  # type: ignore[arg-type]
-                return
-            except OSError:
-                pass  # The thread waits for room, and knows what to do when the stream has ended.
+        if size <= _WHOLE and self._writes_whole and not self._unwritten and self._sent_at_once(buffers):
+            return
         self._hand_over(buffers)
 
     def send_return(self, frame: bytes) -> None:
@@ -62,6 +60,17 @@ class Writer:
         self._hand_over(last)
         self._queue.put(None)
         self._thread.join(timeout)
+
+    def _sent_at_once(self, pieces: Sequence[Piece]) -> bool:
+        descriptors = [piece.descriptor for piece in pieces if isinstance(piece, HeaderWithDescriptor)]
+        if len(descriptors) > _MOST_DESCRIPTORS:
+            return False
+        buffers = [piece.data if isinstance(piece, HeaderWithDescriptor) else piece for piece in pieces]
+        try:
+            self._socket.sendmsg(buffers, _beside(descriptors), _AT_ONCE)
+            return True
+        except OSError:
+            return False  # The thread waits for room, and knows what to do when the stream has ended.
 
     def _hand_over(self, buffers: Sequence[Piece]) -> None:
         self._unwritten.append(None)
@@ -94,8 +103,7 @@ class Writer:
         self._write_together(waiting, descriptor)
 
     def _write_together(self, buffers: list[memoryview], descriptor: Optional[int]) -> None:
-        beside = [] if descriptor is None else \
-            [(socket.SOL_SOCKET, socket.SCM_RIGHTS, array.array("i", [descriptor]))]
+        beside = _beside([] if descriptor is None else [descriptor])
         while buffers:
             sent = self._socket.sendmsg(buffers[:_MOST_BUFFERS], beside, socket.MSG_NOSIGNAL)
             beside = []
@@ -106,3 +114,8 @@ class Writer:
             del buffers[:done]
             if sent:
                 buffers[0] = buffers[0][sent:]
+
+
+def _beside(descriptors: Sequence[int]) -> "list[tuple[int, int, array.array[int]]]":
+    """What goes with the first byte so that the peer gets the descriptors."""
+    return [(socket.SOL_SOCKET, socket.SCM_RIGHTS, array.array("i", descriptors))] if descriptors else []

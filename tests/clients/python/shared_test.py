@@ -7,6 +7,7 @@ import socket
 import struct
 import sys
 import threading
+import types
 import unittest
 from unittest import mock
 
@@ -26,11 +27,18 @@ class Bytes:
 
     def __enter__(self):
         self.sent = self.received = 0
-        write, receive = Writer._write_together, wire.Reader._receive
+        write, write_at_once, receive = Writer._write_together, Writer._sent_at_once, wire.Reader._receive
 
         def counted_write(writer, buffers, descriptor):
             self.sent += sum(len(buffer) for buffer in buffers)
             return write(writer, buffers, descriptor)
+
+        def counted_write_at_once(writer, pieces):
+            done = write_at_once(writer, pieces)
+            if done:
+                self.sent += sum(len(piece.data if isinstance(piece, wire.HeaderWithDescriptor) else piece)
+                                 for piece in pieces)
+            return done
 
         def counted_receive(reader, *arguments):
             count = receive(reader, *arguments)
@@ -38,6 +46,7 @@ class Bytes:
             return count
 
         self._patches = [mock.patch.object(Writer, "_write_together", counted_write),
+                         mock.patch.object(Writer, "_sent_at_once", counted_write_at_once),
                          mock.patch.object(wire.Reader, "_receive", counted_receive)]
         for patch in self._patches:
             patch.start()
@@ -61,6 +70,7 @@ class EngineTest(unittest.TestCase):
                 a[:] = n
                 self.assertEqual(float(session.call("numpy.sum", a, timeout=PATIENCE)), n * 1024 * 1024)
             self.assertLess(count.sent, 8 * KiB)
+            self.assertGreater(count.sent, 5 * 100)
             self.await_returns(session)
 
     def test_a_result_is_not_received(self):
@@ -170,7 +180,7 @@ class PlaceTest(unittest.TestCase):
         def observed(begin, size):
             # Arrays of other threads may lie here from now on.
             if begin == address:
-                elements = mock.Mock(nbytes=MiB, ctypes=mock.Mock(data=address + MiB))
+                elements = types.SimpleNamespace(nbytes=MiB, __array_interface__={"data": (address + MiB, False)})
                 found.append(shared.Place.of(elements))
             return unmap(begin, size)
 

@@ -15,7 +15,7 @@ class Stream:
         self._pieces = [piece for piece in pieces if piece]
         self.reads = 0
 
-    def recv_into(self, target):
+    def recv_into(self, target, size=0, flags=0):
         self.reads += 1
         if not self._pieces:
             return 0

@@ -1,10 +1,12 @@
 """How bytes leave a session: whole messages, in order, and never at the cost of whoever sends them."""
 
+import os
 import socket
 import struct
 import threading
 import unittest
 
+from krutil.wire import HeaderWithDescriptor
 from krutil.writer import Writer
 from scripted import PATIENCE
 
@@ -43,6 +45,36 @@ class WriterTest(unittest.TestCase):
         for number in range(100):
             self.writer.send([b"head", b"%04d" % number], 8)
             self.assertEqual(self.peer.recv(100, socket.MSG_DONTWAIT), b"head%04d" % number)
+
+    def with_descriptors(self, count):
+        """Pieces of a message with so many descriptors, and its bytes."""
+        places = [os.open("/dev/null", os.O_RDONLY) for _ in range(count)]
+        for place in places:
+            self.addCleanup(os.close, place)
+        pieces = [piece for number, place in enumerate(places)
+                  for piece in (HeaderWithDescriptor(b"head%04d" % number, place), b"content")]
+        return pieces, b"".join(b"head%04dcontent" % number for number in range(count))
+
+    def test_a_small_message_with_descriptors_is_written_before_send_returns(self):
+        pieces, sent = self.with_descriptors(16)
+        for _ in range(20):
+            self.writer.send(pieces, len(sent))
+            data, descriptors, _, _ = socket.recv_fds(self.peer, 1000, 17, socket.MSG_DONTWAIT)
+            for each in descriptors:
+                os.close(each)
+            self.assertEqual((data, len(descriptors)), (sent, 16))
+
+    def test_more_than_sixteen_descriptors_never_are_ahead_of_their_frames(self):
+        pieces, sent = self.with_descriptors(17)
+        self.writer.send(pieces, len(sent))
+        received = 0
+        while received < len(sent):
+            # What comes with a descriptor ends before the next one.
+            data, descriptors, _, _ = socket.recv_fds(self.peer, 1000, 17)
+            for each in descriptors:
+                os.close(each)
+            self.assertEqual((data, len(descriptors)), (b"head%04dcontent" % (received // 15), 1))
+            received += len(data)
 
     def test_a_small_message_stays_behind_a_large_one(self):
         large = bytes(LARGE)
