@@ -74,7 +74,8 @@ OptionTable::OptionTable() {
 
     apps::addSizeOption(
         app, "--limit-memory", options.session.memory,
-        "Memory that the process of a session may have, such as 8GiB; more is a MemoryError of its code",
+        "Memory that the process of a session may have, such as 8GiB; more is a MemoryError of its code. Without this "
+        "option it is what the machine has",
         std::numeric_limits<std::uint64_t>::max(), smallestMemoryLimit)
         ->default_str("")
         ->group(sessions);
@@ -82,6 +83,7 @@ OptionTable::OptionTable() {
                    "Descriptors that the process of a session may have at a time")
         ->check(CLI::Range(neededDescriptors, 1'000'000'000))
         ->type_name("COUNT")
+        ->capture_default_str()
         ->group(sessions);
 
     app.add_flag("--no-zero-copy", options.noZeroCopy,

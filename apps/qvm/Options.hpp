@@ -30,7 +30,7 @@ struct Options {
     bool noSharedMemory = false;   ///< large arrays travel as bytes, also between processes of one machine
     bool noPrecheck = false;       ///< numbers that end the process are not looked for in what arrives
     std::size_t maxSessions = 64;  ///< sessions at a time of a listening engine
-    SessionLimits session;
+    SessionLimits session = usualSessionLimits();
     std::chrono::milliseconds handshakeTimeout{10'000};
     PythonConfig python;         ///< its program is empty when the command line names none
     std::string diary;           ///< file that text of sinks with the diary trait is appended to; empty for none

@@ -1,6 +1,7 @@
 #include "qvm/process/SessionLimits.hpp"
 
 #include <sys/resource.h>
+#include <sys/sysinfo.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -24,7 +25,21 @@ void lower(__rlimit_resource resource, std::uint64_t most, const char* failure) 
     }
 }
 
+// Zero if the system does not say it.
+std::uint64_t memoryOfTheMachine() {
+#if defined(KRUTIL_SANITIZED)
+    return 0;
+#else
+    struct sysinfo info {};
+    return ::sysinfo(&info) == 0 ? (std::uint64_t{info.totalram} + info.totalswap) * info.mem_unit : 0;
+#endif
+}
+
 }  // namespace
+
+SessionLimits usualSessionLimits() {
+    return {memoryOfTheMachine(), 65'536};
+}
 
 // RLIMIT_DATA and not RLIMIT_AS: what is only reserved or only read does not count. That is half of the address space
 // of a session, with NumPy or without.

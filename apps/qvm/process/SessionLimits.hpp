@@ -11,6 +11,10 @@ struct SessionLimits {
     std::uint64_t descriptors = 0;  ///< descriptors at a time (RLIMIT_NOFILE)
 };
 
+/// What ordinary work does not come near: as much memory as the machine has, swap included, and 65,536 descriptors.
+/// Memory is not bounded in a build with sanitizers, which reserve more.
+SessionLimits usualSessionLimits();
+
 /// Memory that a session may be bounded to at least; one that has nothing to do has some 40 MB.
 inline constexpr std::uint64_t smallestMemoryLimit = std::uint64_t{64} << 20;
 

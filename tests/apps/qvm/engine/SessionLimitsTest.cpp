@@ -1,7 +1,11 @@
 // What the process of a session may use of the machine.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <sys/sysinfo.h>
 
+#include <algorithm>
+#include <cstdint>
 #include <memory>
 #include <string>
 #include <vector>
@@ -42,6 +46,26 @@ TEST_F(SessionLimitsTest, TooManyDescriptorsAreAnErrorOfTheCode) {
               "[Errno 24] Too many open files");
     EXPECT_EQ(engine.client.eval("[os.close(n) for n in d]\nlen(d) > 100").shown(), "True\n");
     EXPECT_EQ(engine.client.goodbye().reason, session::SessionEnd::Reason::Finished);
+}
+
+TEST_F(SessionLimitsTest, ByDefaultASessionMayHaveWhatTheMachineHas) {
+    struct sysinfo machine {};
+    ASSERT_EQ(::sysinfo(&machine), 0);
+    rlimit memory{};
+    ASSERT_EQ(::getrlimit(RLIMIT_DATA, &memory), 0);
+    const auto most = (std::uint64_t{machine.totalram} + machine.totalswap) * machine.mem_unit;
+    EngineSession engine;
+    EXPECT_EQ(limit(engine.client, "RLIMIT_DATA"), std::to_string(std::min(memory.rlim_cur, most)) + " " +
+                                                       std::to_string(std::min(memory.rlim_max, most)) + "\n");
+}
+
+TEST_F(SessionLimitsTest, ByDefaultASessionMayHaveManyDescriptors) {
+    rlimit descriptors{};
+    ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &descriptors), 0);
+    EngineSession engine;
+    EXPECT_EQ(limit(engine.client, "RLIMIT_NOFILE"),
+              std::to_string(std::min<rlim_t>(descriptors.rlim_cur, 65'536)) + " " +
+                  std::to_string(std::min<rlim_t>(descriptors.rlim_max, 65'536)) + "\n");
 }
 
 TEST_F(SessionLimitsTest, EachSessionOfAListenerHasThem) {
