@@ -16,7 +16,9 @@ using session::SessionRecorder;
 using testing::ElementsAre;
 using testing::SizeIs;
 
-constexpr std::size_t mebi = 1U << 20;
+// Of an array that is shared. No other test's arrays have it: memory is kept by size, and the whole process has one
+// pool.
+constexpr std::size_t sharedSize = 3U << 20;
 
 // Keeps the units: "> " before what was sent, "< " before what was received, "h" for those of the handshake.
 class KeptUnits final : public SessionRecorder {
@@ -139,20 +141,20 @@ TEST_F(RecorderTest, SharedContentFollowsItsFrameAtBothEnds) {
 
     // Memory is kept for the second one of its size.
     const framing::StreamID first = pair.client->newStreamID();
-    pair.client->send(first, question("q", {bulkOf(mebi)}));
+    pair.client->send(first, question("q", {bulkOf(sharedSize)}));
     pair.engineSaw.waitForLines(1);
     const framing::StreamID second = pair.client->newStreamID();
-    pair.client->send(second, question("q", {bulkOf(mebi)}));
+    pair.client->send(second, question("q", {bulkOf(sharedSize)}));
     pair.engineSaw.waitForLines(2);
     // What comes back may be there already, or not yet.
     std::vector<std::string> sent = units_.frames();
     std::erase_if(sent, [](const std::string& unit) { return unit[0] == '<'; });
     ASSERT_THAT(sent, SizeIs(4));
-    EXPECT_TRUE(sent[0] == "> " + wire::data(first, 1, false, std::string(mebi, 'b')));
-    const std::string shared = wire::sharedData(second, 1, 0, 0, mebi);
+    EXPECT_TRUE(sent[0] == "> " + wire::data(first, 1, false, std::string(sharedSize, 'b')));
+    const std::string shared = wire::sharedData(second, 1, 0, 0, sharedSize);
     EXPECT_EQ(sent[2].substr(0, 2 + 24), "> " + shared.substr(0, 24));
-    EXPECT_EQ(sent[2].substr(2 + 40, 8), wire::little(mebi, 8));
-    EXPECT_TRUE(sent[2].substr(2 + 48) == std::string(mebi, 'b'));
+    EXPECT_EQ(sent[2].substr(2 + 40, 8), wire::little(sharedSize, 8));
+    EXPECT_TRUE(sent[2].substr(2 + 48) == std::string(sharedSize, 'b'));
     std::vector<std::string> received = engineUnits.frames();
     std::erase_if(received, [](const std::string& unit) { return unit[0] == '>'; });
     ASSERT_THAT(received, SizeIs(4));
