@@ -2,9 +2,11 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/mman.h>
 
 #include <cstring>
 #include <map>
+#include <new>
 #include <string>
 #include <vector>
 
@@ -36,6 +38,19 @@ std::string varint(std::uint64_t value) {
     return bytes + static_cast<char>(value);
 }
 
+// A frame of so many bytes, of which only the first ones are not 0. It takes no memory for the others.
+framing::TaggedFrame hugeFrame(const std::string& tag, const std::string& begin, std::size_t size) {
+    void* const memory =
+        ::mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE, -1, 0);
+    if (memory == MAP_FAILED) {
+        throw std::bad_alloc();
+    }
+    std::memcpy(memory, begin.data(), begin.size());
+    framing::FrameBuffer buffer(
+        framing::FrameBuffer::first_type(static_cast<char*>(memory), [size](char* all) { ::munmap(all, size); }), size);
+    return {framing::FrameType::Object, 1, tag, std::move(buffer), 1};
+}
+
 // A field of wire type 2.
 std::string block(std::uint64_t number, const std::string& content) {
     return varint(number << 3U | 2U) + varint(content.size()) + content;
@@ -62,8 +77,12 @@ class WireWalkTest : public testing::Test {
   protected:
     // What the walk says without the name of the frame; "whole" when it accepts.
     std::string verdict(const std::string& content, std::uint64_t mostParts = WireWalk::anyParts) const {
+        return verdictOf(walkedFrame("test:every", content), mostParts);
+    }
+
+    std::string verdictOf(const framing::TaggedFrame& frame, std::uint64_t mostParts = WireWalk::anyParts) const {
         try {
-            walk_.check(walkedFrame("test:every", content), mostParts);
+            walk_.check(frame, mostParts);
             return "whole";
         } catch (const session::ProtocolViolation& violation) {
             const std::string text = violation.what();
@@ -93,6 +112,19 @@ TEST_F(WireWalkTest, WholeMessages) {
           "\x22\x85\x80\x80\x80\x00"s + "bytes", "\xF8\xFF\xFF\xFF\x0F\x01"s, "\xA3\x06\xAB\x06\xAC\x06\xA4\x06"s}) {
         EXPECT_EQ(agreed(content), "whole") << testing::PrintToString(content);
     }
+}
+
+TEST_F(WireWalkTest, FramesAndFieldsAreNoLargerThanTheParserTakes) {
+    constexpr std::size_t largestFrame = 2'147'483'647;
+    const std::string name = "test:every";
+    EXPECT_EQ(verdictOf(hugeFrame(name, "\x08\x01", largestFrame)),
+              ", byte 2: expected a field number from 1 on, got 0");
+    EXPECT_EQ(verdictOf(hugeFrame(name, "\x08\x01", largestFrame + 1)),
+              ", byte 0: expected at most 2147483647 bytes, got 2147483648");
+    constexpr std::size_t largestField = largestFrame - 16;
+    EXPECT_EQ(verdictOf(hugeFrame(name, "\x22" + varint(largestField), 6 + largestField)), "whole");
+    EXPECT_EQ(verdictOf(hugeFrame(name, "\x22" + varint(largestField + 1), 6 + largestField + 1)),
+              ", byte 0, field bytes: expected a length of at most 2147483631, got 2147483632");
 }
 
 TEST_F(WireWalkTest, FieldsOfAnotherWireTypeAreSkipped) {

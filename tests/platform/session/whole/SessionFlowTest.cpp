@@ -9,6 +9,7 @@
 
 #include "platform/session/support/TestSessions.hpp"
 #include "platform/session/support/WireBytes.hpp"
+#include "support/Eventually.hpp"
 
 namespace testing_sessions {
 namespace {
@@ -45,6 +46,80 @@ TEST_F(SessionFlowTest, SendNeverWaitsForAPeerThatDoesNotRead) {
     std::thread reader([&] { EXPECT_EQ(end.peer->read(sent).size(), sent); });
     EXPECT_TRUE(end.session->waitUntilWritten());
     reader.join();
+}
+
+// A client that sends more than its stream takes, and reads what an engine says. The engine says something new whenever
+// something of it was read, so that there is always more than one read takes.
+class EndlesslyTold : public Recorder {
+  public:
+    EndlesslyTold(Session& session, wire::ByteEnd& engine) : session_(session), engine_(engine) {}
+
+    void onEvent(framing::StreamID /*stream*/, const boost::shared_ptr<const eventmgr::BaseEvent>& /*event*/) override {
+        if (events_++ == 0) {
+            session_.send(1, question("q", {bulkOf(sent - 24 - 24 - std::string(questionTag).size() - 1)}));
+            for (int ahead = 0; ahead < 4; ++ahead) {
+                engine_.write(something());
+            }
+        }
+        const std::uint64_t written = session_.traffic().written - before_;
+        received_ += engine_.read(written - received_).size();
+        if (received_ == sent || events_ == most) {
+            if (!done_) {
+                done_ = true;
+                result_.set_value(received_);
+            }
+        } else {
+            engine_.write(something());
+        }
+    }
+
+    static std::string something() { return wire::tagged(0, 1, true, noticeTag, std::string(30'000, 'n')); }
+
+    /// Bytes of what the client had to say when all of it was written, or when so much was read that it should have
+    /// been.
+    std::size_t waitUntilWritten() { return result_.get_future().get(); }
+
+    static constexpr std::size_t sent = 1U << 20;
+
+  private:
+    static constexpr std::size_t most = 2'000;
+
+    Session& session_;
+    wire::ByteEnd& engine_;
+    const std::uint64_t before_ = session_.traffic().written;
+    std::size_t events_ = 0;
+    std::size_t received_ = 0;
+    bool done_ = false;
+    std::promise<std::size_t> result_;
+};
+
+TEST_F(SessionFlowTest, PeerThatNeverStopsSendingLetsTheSessionWrite) {
+    const Ends ends = pipes();
+    // Room for more than one read takes.
+    ASSERT_GE(::fcntl(ends.otherOut, F_SETPIPE_SZ, 1 << 20), 1 << 20);
+    wire::ByteEnd engine(ends.otherIn, ends.otherOut);
+    const auto session = openWith(engine, ends, configOf(Role::Client));
+    EndlesslyTold told(*session, engine);
+    session->start(told);
+    engine.write(EndlesslyTold::something());
+    EXPECT_EQ(told.waitUntilWritten(), EndlesslyTold::sent);
+    session->close(milliseconds(0));
+}
+
+TEST_F(SessionFlowTest, TrafficTellsOfTheFrameThatIsArriving) {
+    SessionWithBytes end(configOf(Role::Engine));
+    std::promise<std::pair<std::uint64_t, std::uint64_t>> whenTold;
+    end.saw.answerWith([&](framing::StreamID, const Question&) {
+        const session::Traffic traffic = end.session->traffic();
+        whenTold.set_value(std::pair(traffic.arriving, traffic.arrived));
+    });
+    const std::string bytes = wire::tagged(1, 1, true, questionTag, std::string(100'000, 'q'));
+    end.peer->write(bytes.substr(0, bytes.size() - 40'000));
+    EXPECT_TRUE(test_support::eventually([&] { return end.session->traffic().arrived == 60'000; }));
+    EXPECT_EQ(end.session->traffic().arriving, 100'000U);
+    end.peer->write(bytes.substr(bytes.size() - 40'000));
+    // Whoever is told of a message finds that it has arrived.
+    EXPECT_EQ(whenTold.get_future().get(), std::pair(std::uint64_t{0}, std::uint64_t{0}));
 }
 
 TEST_F(SessionFlowTest, WaitForRoomReturnsAtOnceWhenThereIsRoom) {
@@ -323,6 +398,14 @@ TEST_F(SessionFlowTest, EngineWhoseClientClosesUponTheShutdownEventIsFinished) {
     end.peer->read(24 + 13);
     end.peer->close();
     EXPECT_EQ(end.saw.waitForEnd().reason, Reason::Finished);
+}
+
+TEST_F(SessionFlowTest, NothingIsDeliveredAfterThePeersAbortWhileOutputIsUnwritten) {
+    SessionWithBytes end(configOf(Role::Engine));
+    fill(*end.session);
+    end.peer->write(wire::abort("enough") + wire::tagged(1, 1, true, questionTag, "q"));
+    end.saw.waitForEnd();
+    EXPECT_THAT(end.saw.lines(), ElementsAre("end: violation: the peer closed the session: enough"));
 }
 
 TEST_F(SessionFlowTest, CloseWithoutCeremonyIsClosedHereAndLostThere) {

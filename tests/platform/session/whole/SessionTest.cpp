@@ -266,6 +266,30 @@ TEST_F(SessionTest, AbandonedSessionIsInertInTheChildAndWholeInTheParent) {
     EXPECT_THAT(pair->clientSaw.waitForLines(1), ElementsAre("answer 1 a"));
 }
 
+// As an engine's is that talks on its standard input and output.
+TEST_F(SessionTest, AbandonedSessionOnStandardInputLetsGoOfIt) {
+    const int standardInput = ::fcntl(STDIN_FILENO, F_DUPFD_CLOEXEC, 3);
+    ASSERT_GE(standardInput, 0);
+    Ends ends = pipes();
+    ASSERT_EQ(::dup2(ends.in, STDIN_FILENO), STDIN_FILENO);
+    ::close(ends.in);
+    ends.in = STDIN_FILENO;
+    {
+        wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+        const auto session = openWith(peer, ends, configOf(Role::Client));
+        const pid_t child = ::fork();
+        if (child == 0) {
+            session->abandonInChild();
+            ::_exit(::fcntl(STDIN_FILENO, F_GETFD) < 0 ? 0 : 1);
+        }
+        int status = 0;
+        ASSERT_EQ(::waitpid(child, &status, 0), child);
+        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
+    }
+    EXPECT_EQ(::dup2(standardInput, STDIN_FILENO), STDIN_FILENO);
+    ::close(standardInput);
+}
+
 TEST_F(SessionTest, ManySessionsLeaveNoDescriptorBehind) {
     const auto next = [] {
         const int descriptor = ::dup(0);
