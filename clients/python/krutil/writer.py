@@ -60,6 +60,9 @@ class Writer:
         self._hand_over(last)
         self._queue.put(None)
         self._thread.join(timeout)
+        # Arrays that the peer has lent keep this object, to be returned. What they keep is never freed if it keeps them in
+        # turn, because the garbage collector does not look into arrays. So they must not lead to a program's functions.
+        self._on_failure = _do_nothing
 
     def _sent_at_once(self, pieces: Sequence[Piece]) -> bool:
         descriptors = [piece.descriptor for piece in pieces if isinstance(piece, HeaderWithDescriptor)]
@@ -114,6 +117,10 @@ class Writer:
             del buffers[:done]
             if sent:
                 buffers[0] = buffers[0][sent:]
+
+
+def _do_nothing() -> None:
+    pass
 
 
 def _beside(descriptors: Sequence[int]) -> "list[tuple[int, int, array.array[int]]]":

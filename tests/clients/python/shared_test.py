@@ -1,6 +1,7 @@
 """Shared memory: with the real engine, and with scripts that keep to its rules or break them."""
 
 import fcntl
+import gc
 import mmap
 import os
 import socket
@@ -93,6 +94,29 @@ class EngineTest(unittest.TestCase):
             kept = [session.call("numpy.full", MiB, float(n), timeout=PATIENCE) for n in range(6)]
         for n, result in enumerate(kept):
             self.assertTrue((result == n).all())
+
+    def test_results_that_a_program_keeps_go_with_it(self):
+        class Program:
+            """Refers to its results, and the session to it."""
+
+            def __init__(self):
+                with krutil.start(on_input=self.answer) as session:
+                    # The first of a size travels as bytes.
+                    self.results = [session.call("numpy.zeros", SIZE, timeout=PATIENCE) for _ in range(3)]
+
+            def answer(self, question):
+                return ""
+
+        def mapped():
+            with open("/proc/self/maps", encoding="utf-8") as maps:
+                return sum("/memfd:" in line for line in maps)
+        gc.collect()
+        before = mapped()
+        program = Program()
+        self.assertGreater(mapped(), before)
+        del program
+        gc.collect()
+        self.assertEqual(mapped(), before)
 
     def test_descriptors_are_closed(self):
         a = krutil.empty(MiB)
