@@ -9,7 +9,6 @@ PROGRAM, krutil or krutil-qvm, is the one whose calls go wrong. LIBRARY makes th
 """
 
 import concurrent.futures
-import ctypes
 import errno
 import os
 import pathlib
@@ -20,6 +19,7 @@ import tempfile
 import unittest
 
 from eventually import eventually
+from processes import adopt_orphans
 
 PROGRAM, CLIENT, ENGINE, LIBRARY = sys.argv[1:5]
 
@@ -50,12 +50,6 @@ ERRORS = {
 
 # Where these failed for ever, no program could work.
 WAITING = ("poll@", "ppoll@", "epoll_wait@", "read@")
-
-
-def adopt_orphans() -> None:
-    """Processes whose parent ends become children of this one, so that it sees who is left."""
-    pr_set_child_subreaper = 36
-    ctypes.CDLL(None).prctl(pr_set_child_subreaper, 1, 0, 0, 0)
 
 
 class Session:

@@ -7,11 +7,9 @@ watched: they must not grow. That is judged when it lasts a minute or longer.
 krutil and krutil-qvm are found in the PATH. Ends with status 1 when anything is wrong; what is wrong is told.
 """
 
-import dataclasses
 import os
 import random
 import signal
-import statistics
 import subprocess
 import sys
 import tempfile
@@ -21,8 +19,9 @@ import traceback
 
 import krutil
 import numpy
+from eventually import PATIENCE
+from processes import Listener, growth, usage
 
-PATIENCE = 120
 RELAY = os.path.join(os.path.dirname(os.path.abspath(__file__)), "relay.py")
 SETUP = r"""
 import os, threading, time, warnings
@@ -41,31 +40,6 @@ class Wrong(Exception):
 def expect(what, expected, got):
     if got != expected:
         raise Wrong(f"{what}: expected {str(expected)[:200]}, got {str(got)[:200]}")
-
-
-@dataclasses.dataclass
-class Usage:
-    """What a process uses: KiB of memory that is its own, descriptors, threads."""
-    memory: int
-    descriptors: int
-    threads: int
-
-
-def usage(pid):
-    """None when the process is gone."""
-    try:
-        with open(f"/proc/{pid}/smaps_rollup", encoding="ascii") as file:
-            memory = sum(int(line.split()[1]) for line in file if line.startswith("Private_"))
-        with open(f"/proc/{pid}/status", encoding="ascii") as file:
-            threads = next(int(line.split()[1]) for line in file if line.startswith("Threads:"))
-        return Usage(memory, len(os.listdir(f"/proc/{pid}/fd")), threads)
-    except (FileNotFoundError, ProcessLookupError, StopIteration):
-        return None
-
-
-def children(pid):
-    with open(f"/proc/{pid}/task/{pid}/children", encoding="ascii") as file:
-        return [int(child) for child in file.read().split()]
 
 
 class Soak:
@@ -275,38 +249,10 @@ class Visitors:
         self.expect_lines(self.client("print(0)"), 1, lambda stream: stream.read())
 
 
-class Listener:
-    """An engine that listens in a directory of its own."""
-
-    def __init__(self, directory, name, *options):
-        self.path = os.path.join(directory, name, "engine")
-        self.process = subprocess.Popen(["krutil-qvm", "--listen", self.path, *options], stderr=subprocess.PIPE, text=True)
-        expect("first words of a listener", f"krutil-qvm: serving {self.path}\n", self.process.stderr.readline())
-        self.said = []
-        self.reader = threading.Thread(target=lambda: self.said.extend(self.process.stderr))
-        self.reader.start()
-
-    def stop(self):
-        """All of its sessions have ended with their clients. It may have said of some that they were killed."""
-        deadline = time.monotonic() + PATIENCE
-        while (left := children(self.process.pid)) and time.monotonic() < deadline:
-            time.sleep(0.05)
-        self.process.terminate()
-        exit_code = self.process.wait(PATIENCE)
-        self.reader.join(PATIENCE)
-        self.process.stderr.close()
-        expect("processes of sessions that are left", [], left)
-        expect("words of a listener", [], [line for line in self.said if "the stream ended" not in line])
-        expect("exit code of a listener", 0, exit_code)
-
-
-def growth(samples):
-    """What is used in the last third more than in the second, as a Usage of differences of medians."""
-    third = len(samples) // 3
-    middle, last = samples[third:2 * third], samples[2 * third:]
-    return Usage(*(int(statistics.median(getattr(each, field.name) for each in last)
-                       - statistics.median(getattr(each, field.name) for each in middle))
-                   for field in dataclasses.fields(Usage)))
+def stop(listener):
+    """All of its sessions have ended with their clients. It may have said of some that they were killed."""
+    expect("exit code of a listener", 0, listener.stop())
+    expect("words of a listener", [], [line for line in listener.said()[1:] if "the stream ended" not in line])
 
 
 def report(soak, seconds):
@@ -355,7 +301,7 @@ def main():
             time.sleep(0.05)
         for name, listener in listeners.items():
             try:
-                listener.stop()
+                stop(listener)
             except Exception:
                 soak.fail(f"{name}: listener")
     report(soak, time.monotonic() - begin)
