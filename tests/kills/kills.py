@@ -64,6 +64,11 @@ def expect(what, expected, got):
         raise Wrong(f"{what}: expected {str(expected)[:500]}, got {str(got)[:500]}")
 
 
+def expect_one_of(what, allowed, got):
+    if got not in allowed:
+        raise Wrong(f"{what}: expected one of {allowed}, got {str(got)[:500]}")
+
+
 def expect_like(what, pattern, got):
     if not re.fullmatch(pattern, got):
         raise Wrong(f"{what}: expected what matches {pattern}, got {got[:500]!r}")
@@ -187,7 +192,7 @@ class Work:
                 expect_like(what, lost, str(error))
                 any_lost = any_lost or number not in self.cancelled
             except krutil.Cancelled:
-                expect(f"{what} is one that was to be cancelled", True, number in self.cancelled)
+                expect_one_of(f"the only request that may be cancelled, where {what} was", self.cancelled, number)
             else:
                 expect(f"whether a request before {what}, which has an answer, was lost", False, any_lost)
                 expect(f"the result of {what} is right", True, right(result))
@@ -426,7 +431,7 @@ class Worker:
         if outcome != "answered before":
             eventually(lambda: len(self.listener.said()) > self.lines, "the listener's words about a killed session")
         said = self.listener_lines()
-        expect("number of lines of the listener about a killed session", True, len(said) <= 1)
+        expect("lines of the listener about a killed session but one", [], said[1:])
         for line in said:
             expect_like("words of the listener", SESSION_KILLED, line)
 
@@ -497,7 +502,7 @@ class Worker:
             moment.pass_bytes(client.stdout.fileno())
             client.kill()
             code = client.wait(PATIENCE)
-        expect("exit code of krutil", True, code == -signal.SIGKILL or (code == 0 and not endless))
+        expect_one_of("exit code of krutil", [-signal.SIGKILL] if endless else [-signal.SIGKILL, 0], code)
         return endless
 
     def expect_end_of_engine(self, endless):
@@ -506,7 +511,7 @@ class Worker:
         if not codes:
             expect("words without an engine", [], said)
             return "without an engine"
-        expect("exit codes of engines", True, codes == [3] or (codes == [0] and not endless))
+        expect_one_of("exit codes of engines", [[3]] if endless else [[3], [0]], codes)
         expect("number of lines of an engine that ended with " + str(codes[0]), 1 if codes == [3] else 0, len(said))
         for line in said:
             expect_like("words of the engine", CLIENT_LOST, line)
@@ -517,7 +522,7 @@ class Worker:
         self.expect_service()
         eventually(lambda: not children(self.listener.process.pid), "the end of each session of the listener")
         said = self.listener_lines()
-        expect("number of lines of the listener about a killed client", True, len(said) <= 1)
+        expect("lines of the listener about a killed client but one", [], said[1:])
         for line in said:
             expect_like("words of the listener", f"{CLIENT_LOST}|{SILENT}", line)
         return "answered before, or silent" if not said else "lost" if "handshake" not in said[0] else "before it began"
