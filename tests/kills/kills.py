@@ -42,7 +42,7 @@ LONGEST_WAIT = 0.3
 KILLED = r"killed by signal 9"
 GONE = r"(Broken pipe|Connection reset by peer)"
 WRITING = rf"(; writing to it had failed: {GONE})?"
-CLIENT_LOST = (rf"krutil-qvm: (cannot (read from|write to) the stream during the handshake: {GONE}|"
+CLIENT_LOST = (rf"krutil-qvm: (cannot (read from|write to) the stream( during the handshake)?: {GONE}|"
                r"the peer closed the stream during the handshake: .* had arrived|"
                r"the client has gone before the engine's shutdown event|"
                r"the stream ended (between two messages, without the client's goodbye|in the middle of a message: .* "
