@@ -4,6 +4,9 @@
 
 #include <algorithm>
 #include <chrono>
+#include <cstring>
+#include <random>
+#include <typeinfo>
 
 #include "apps/qvm/calls/CallFixture.hpp"
 #include "apps/qvm/fixture/EngineFixture.hpp"
@@ -294,6 +297,64 @@ TEST_F(EngineCancelTest, ThousandsOfCancelsReachNoOtherRequest) {
         ASSERT_EQ(untouched.shown(), std::to_string(i) + "\n");
     }
     EXPECT_GT(cancelled, 0);
+}
+
+// In place of what the thread sanitizer cannot show, because no signal reaches this code there: calls are interrupted
+// at all moments, most of them about when they end. Each of them ends once, with its value or with the interruption, as
+// the reply to the cancel says; the call behind it has its value. A second reply to one request would end the session.
+TEST_F(InterruptedCodeTest, InterruptsAtAnyMomentEndOnlyTheCallThatIsMeant) {
+#if defined(KRUTIL_SANITIZED)
+    constexpr std::uint64_t rounds = 300;
+#else
+    constexpr std::uint64_t rounds = 5'000;
+#endif
+    client().eval("def count(number):\n    for i in range(5_000): pass\n    return number\n");
+    const auto numbered = [](std::uint64_t number) {
+        Array array = ArrayFactory().createArray(ElementType::UInt64, {1});
+        std::memcpy(array.mutableData(), &number, sizeof number);
+        return callOf("count", {array});
+    };
+    const auto numberIn = [](const Evaluation& call) {
+        std::uint64_t number = 0;
+        std::memcpy(&number, outputsOf(call).at(0).data(), sizeof number);
+        return number;
+    };
+    std::mt19937 random(1);
+    std::chrono::nanoseconds usual = std::chrono::microseconds(100);
+    std::uint64_t interrupted = 0;
+    std::uint64_t returned = 0;
+    for (std::uint64_t i = 0; i < rounds; ++i) {
+        const IDType meant = client().enqueue(numbered(2 * i));
+        const IDType next = client().enqueue(numbered(2 * i + 1));
+        // Not a wait for anything, but a moment of chance.
+        const auto moment =
+            std::chrono::steady_clock::now() + usual * std::uniform_int_distribution<int>(0, 200)(random) / 100;
+        while (std::chrono::steady_clock::now() < moment) {
+        }
+        const IIPCancelReply::CancelStatus status = client().cancel(meant);
+        const Evaluation result = client().await(meant);
+        if (status == IIPCancelReply::UNABLE_TO_CANCEL_ALREADY_DONE) {
+            ASSERT_FALSE(result.error) << i << " " << result.errorText();
+            ASSERT_EQ(numberIn(result), 2 * i);
+            ++returned;
+            usual = usual * 9 / 10;
+        } else {
+            ASSERT_TRUE(result.error) << i << " " << status;
+            ASSERT_EQ(result.error->getExecutionStatus(), inEXECUTION_CTRLC) << i;
+            ASSERT_EQ(result.errorId(), "KeyboardInterrupt") << i;
+            const cmddistributor::IIPResult& plain = *result.reply->getResult();
+            ASSERT_EQ(typeid(plain), typeid(cmddistributor::IIPResult)) << i << " has outputs as well";
+            ASSERT_EQ(result.discarded(), status == IIPCancelReply::SUCCESSFUL_CANCEL) << i;
+            ++interrupted;
+            usual = usual * 11 / 10 + std::chrono::nanoseconds(1'000);
+        }
+        const Evaluation untouched = client().await(next);
+        ASSERT_FALSE(untouched.error) << i << " " << untouched.errorText();
+        ASSERT_EQ(numberIn(untouched), 2 * i + 1);
+    }
+    EXPECT_GT(interrupted, rounds / 10);
+    EXPECT_GT(returned, rounds / 10);
+    EXPECT_EQ(client().eval("1 + 1").shown(), "2\n");
 }
 
 TEST_F(EngineCancelTest, CancelOfTheOuterRequestEndsItsPrompt) {
