@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <sys/eventfd.h>
+#include <sys/mman.h>
 #include <unistd.h>
 
 #include <future>
@@ -406,6 +407,22 @@ TEST_F(SessionFlowTest, NothingIsDeliveredAfterThePeersAbortWhileOutputIsUnwritt
     end.peer->write(wire::abort("enough") + wire::tagged(1, 1, true, questionTag, "q"));
     end.saw.waitForEnd();
     EXPECT_THAT(end.saw.lines(), ElementsAre("end: violation: the peer closed the session: enough"));
+}
+
+// As a recorded one is that an engine is given as its standard input.
+TEST_F(SessionFlowTest, WhatTheClientSaysMayBeAFile) {
+    const std::string said = wire::helloBytes(wire::hello(msg_svc::protobuf::SessionHello::CLIENT)) +
+                             wire::verdictBytes(wire::acceptance()) + wire::tagged(1, 1, true, questionTag, "q") +
+                             wire::goodbye();
+    Ends ends = pipes();
+    ::close(ends.in);
+    ends.in = ::memfd_create("said", MFD_CLOEXEC);
+    ASSERT_EQ(::pwrite(ends.in, said.data(), said.size(), 0), static_cast<ssize_t>(said.size()));
+    wire::ByteEnd peer(ends.otherIn, ends.otherOut);
+    Recorder saw;
+    const auto session = Session::open(ends.in, ends.out, configOf(Role::Engine));
+    session->start(saw);
+    EXPECT_THAT(saw.waitForLines(2), ElementsAre("question 1 q", "goodbye"));
 }
 
 TEST_F(SessionFlowTest, CloseWithoutCeremonyIsClosedHereAndLostThere) {
