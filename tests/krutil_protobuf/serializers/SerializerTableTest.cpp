@@ -9,7 +9,6 @@
 #include <algorithm>
 #include <cctype>
 #include <stdexcept>
-#include <thread>
 #include <typeindex>
 
 #include "cmddistributor/DebugLoopEvent.hpp"
@@ -177,27 +176,6 @@ TEST(SerializerTableTest, EverySampleSetIsOfARegisteredSerializer) {
     const auto names = registeredNames();
     for (const SampleSet& set : samples::sampleSets()) {
         EXPECT_NE(std::find(names.begin(), names.end(), set.serializer), names.end()) << set.serializer;
-    }
-}
-
-TEST(SerializerTableTest, SerializersMayBeCalledFromSeveralThreadsAtOnce) {
-    const auto work = [] {
-        for (const auto& serializer : registry()->serializers()) {
-            const SampleSet& set = samples::sampleSet(serializer->name());
-            for (const samples::Sample& sample : set.samples) {
-                const auto frames = transport::writtenFrames(*serializer, sample.object, registry());
-                samples::read(*serializer, frames.back().index, transport::makeMessage(frames), registry(),
-                              SerializationContext());
-            }
-        }
-    };
-    work();
-    std::vector<std::thread> threads;
-    for (int i = 0; i < 4; ++i) {
-        threads.emplace_back(work);
-    }
-    for (std::thread& thread : threads) {
-        thread.join();
     }
 }
 
