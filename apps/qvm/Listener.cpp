@@ -147,6 +147,11 @@ Listener::Listener(const Options& options, Log& log, int socket)
         apps::precheck(!options_.noPrecheck);
         // Each session opens it again. What is wrong with it is said here, and not to each client.
         const AppendFile diary(options_.diary, {});
+        // The signals are blocked: without this, only SIGKILL would end the engine.
+        signals_ = ::signalfd(-1, &watched, SFD_CLOEXEC | SFD_NONBLOCK);
+        if (signals_ < 0) {
+            failWithErrno("Cannot watch for signals");
+        }
         if (socket < 0) {
             bindSocket();
         } else if (::fcntl(socket, F_SETFL, O_NONBLOCK) != 0) {
@@ -154,9 +159,11 @@ Listener::Listener(const Options& options, Log& log, int socket)
         }
     } catch (...) {
         ::close(socket_);
+        if (signals_ >= 0) {
+            ::close(signals_);
+        }
         throw;
     }
-    signals_ = ::signalfd(-1, &watched, SFD_CLOEXEC | SFD_NONBLOCK);
 }
 
 Listener::~Listener() {
@@ -197,6 +204,11 @@ void Listener::bindSocket() {
     const int bound = ::bind(socket_, reinterpret_cast<const sockaddr*>(&address), sizeof(address));
     ::umask(before);
     if (bound != 0 || ::listen(socket_, SOMAXCONN) != 0) {
+        const int error = errno;
+        if (bound == 0) {
+            ::unlink(path.c_str());
+        }
+        errno = error;
         failWithErrno("Cannot serve \"" + path + "\"");
     }
     ::lstat(path.c_str(), &status);
