@@ -10,13 +10,17 @@
 //     narrow                sockets and pipes take as little as the kernel lets them, so that they are full most of the
 //     time
 //
+// With KRUTIL_FAULTS_UNFORKED in the environment, processes that the program has forked work normally.
+//
 // A call site is the address to which the call returns, counted from the start of its module.
 #include <dlfcn.h>
 #include <fcntl.h>
 #include <poll.h>
 #include <pthread.h>
 #include <sys/epoll.h>
+#include <sys/file.h>
 #include <sys/mman.h>
+#include <sys/signalfd.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/uio.h>
@@ -51,7 +55,7 @@ class Rule {
 
     // 0, or the error with which a call has to fail.
     int errorOf(std::string_view call, const void* returnsTo) {
-        if (kind_ != "list" && kind_ != "once" && kind_ != "always") {
+        if ((kind_ != "list" && kind_ != "once" && kind_ != "always") || (unforked_ && ::getpid() != first_)) {
             return 0;
         }
         const std::optional<Dl_info> module = ownModule(returnsTo);
@@ -126,6 +130,9 @@ class Rule {
     std::string kind_;
     std::string argument_;
     int error_ = 0;
+    const bool unforked_ = std::getenv("KRUTIL_FAULTS_UNFORKED") != nullptr;
+    // The first call comes before any fork: a program opens files when it begins.
+    const pid_t first_ = ::getpid();
     std::atomic<bool> failed_{false};
     std::mutex mutex_;
     std::set<std::string> sites_;
@@ -219,6 +226,41 @@ struct Pieces {
 KRUTIL_ORIGINAL(int, socket, int, int, int)
 extern "C" int socket(int domain, int type, int protocol) {
     return KRUTIL_CALL(socket, domain, type, protocol);
+}
+
+KRUTIL_ORIGINAL(int, bind, int, const sockaddr*, socklen_t)
+extern "C" int bind(int descriptor, const sockaddr* address, socklen_t size) {
+    return KRUTIL_CALL(bind, descriptor, address, size);
+}
+
+KRUTIL_ORIGINAL(int, listen, int, int)
+extern "C" int listen(int descriptor, int backlog) {
+    return KRUTIL_CALL(listen, descriptor, backlog);
+}
+
+KRUTIL_ORIGINAL(int, accept4, int, sockaddr*, socklen_t*, int)
+extern "C" int accept4(int descriptor, sockaddr* address, socklen_t* size, int flags) {
+    return KRUTIL_CALL(accept4, descriptor, address, size, flags);
+}
+
+KRUTIL_ORIGINAL(int, getsockopt, int, int, int, void*, socklen_t*)
+extern "C" int getsockopt(int descriptor, int level, int option, void* value, socklen_t* size) {
+    return KRUTIL_CALL(getsockopt, descriptor, level, option, value, size);
+}
+
+KRUTIL_ORIGINAL(int, signalfd, int, const sigset_t*, int)
+extern "C" int signalfd(int descriptor, const sigset_t* signals, int flags) {
+    return KRUTIL_CALL(signalfd, descriptor, signals, flags);
+}
+
+KRUTIL_ORIGINAL(int, flock, int, int)
+extern "C" int flock(int descriptor, int operation) {
+    return KRUTIL_CALL(flock, descriptor, operation);
+}
+
+KRUTIL_ORIGINAL(int, mkdir, const char*, mode_t)
+extern "C" int mkdir(const char* path, mode_t mode) {
+    return KRUTIL_CALL(mkdir, path, mode);
 }
 
 KRUTIL_ORIGINAL(int, socketpair, int, int, int, int*)

@@ -9,7 +9,6 @@ PROGRAM, krutil or krutil-qvm, is the one whose calls go wrong. LIBRARY makes th
 """
 
 import concurrent.futures
-import errno
 import os
 import pathlib
 import re
@@ -18,8 +17,9 @@ import sys
 import tempfile
 import unittest
 
+from errors_of_calls import rules
 from eventually import eventually
-from processes import adopt_orphans
+from processes import adopt_orphans, all_have_ended
 
 PROGRAM, CLIENT, ENGINE, LIBRARY = sys.argv[1:5]
 
@@ -36,17 +36,6 @@ b = os.write(1, b"past Python\\n")
 OUTPUT = "".join(f"line {i}\n" for i in range(20)) + "past Python\n42\n"
 
 MANY_LINES = 'for i in range(5000): print("long " * 20)'
-
-# What each call may fail with that a machine out of something returns, or a peer that has gone.
-ERRORS = {
-    "read": [errno.EIO], "readv": [errno.ECONNRESET], "recv": [errno.ECONNRESET], "recvmsg": [errno.ECONNRESET],
-    "write": [errno.ENOSPC], "writev": [errno.EPIPE], "send": [errno.EPIPE], "sendmsg": [errno.EPIPE, errno.ENOMEM],
-    "poll": [errno.ENOMEM], "ppoll": [errno.ENOMEM], "epoll_wait": [errno.EINTR],
-    "open": [errno.EMFILE, errno.ENOSPC], "socket": [errno.EMFILE], "socketpair": [errno.EMFILE],
-    "pipe": [errno.EMFILE], "pipe2": [errno.EMFILE], "eventfd": [errno.EMFILE], "timerfd_create": [errno.EMFILE],
-    "epoll_create1": [errno.EMFILE], "memfd_create": [errno.EMFILE, errno.ENOMEM], "dup2": [errno.EMFILE],
-    "ftruncate": [errno.ENOSPC], "fork": [errno.EAGAIN], "pthread_create": [errno.EAGAIN], "mmap": [errno.ENOMEM],
-}
 
 # Where these failed for ever, no program could work.
 WAITING = ("poll@", "ppoll@", "epoll_wait@", "read@")
@@ -94,17 +83,6 @@ class Session:
         return f"exit code {self.code}\n--- output\n{self.output}\n--- errors\n{self.errors}"
 
 
-def all_have_ended() -> bool:
-    """Takes leave of children that have ended, those that were left to this process among them."""
-    while True:
-        try:
-            child, _ = os.waitpid(-1, os.WNOHANG)
-        except ChildProcessError:
-            return True
-        if child == 0:
-            return False
-
-
 class FaultsTest(unittest.TestCase):
     def test_bytes_one_at_a_time_change_nothing(self):
         session = Session("short")
@@ -124,10 +102,9 @@ class FaultsTest(unittest.TestCase):
             self.assertEqual((session.code, session.output, session.errors), (0, OUTPUT, ""))
             sites = sorted(set(listed.read().split()))
         self.assertGreater(len(sites), 20)
-        rules = [f"{times} {site} {error}" for site in sites for error in ERRORS[site.split("@")[0]]
-                 for times in (("once",) if site.startswith(WAITING) else ("once", "always"))]
+        tried = rules(sites, WAITING)
         with concurrent.futures.ThreadPoolExecutor(len(os.sched_getaffinity(0))) as workers:
-            faults = [f"{rule}: {session.fault()}\n{session}" for rule, session in zip(rules, workers.map(Session, rules))
+            faults = [f"{rule}: {session.fault()}\n{session}" for rule, session in zip(tried, workers.map(Session, tried))
                       if session.fault()]
         self.assertEqual(faults, [], "\n\n".join(faults))
         eventually(all_have_ended, "the end of each process")

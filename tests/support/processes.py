@@ -54,14 +54,31 @@ def adopt_orphans():
     ctypes.CDLL(None).prctl(pr_set_child_subreaper, 1, 0, 0, 0)
 
 
+def all_have_ended():
+    """Takes leave of children that have ended, those that were left to this process among them."""
+    while True:
+        try:
+            child, _ = os.waitpid(-1, os.WNOHANG)
+        except ChildProcessError:
+            return True
+        if child == 0:
+            return False
+
+
 class Listener:
     """An engine that listens in a directory of its own."""
 
-    def __init__(self, directory, name, *options):
+    def __init__(self, directory, name, *options, env=None):
         self.path = os.path.join(directory, name, "engine")
         self._said = tempfile.TemporaryFile()
-        self.process = subprocess.Popen(["krutil-qvm", "--listen", self.path, *options], stderr=self._said)
-        eventually(lambda: self.said() or self.process.poll() is not None, "the first words of a listener")
+        self.process = subprocess.Popen(["krutil-qvm", "--listen", self.path, *options], stderr=self._said, env=env)
+        eventually(lambda: self.has_spoken() or self.process.poll() is not None, "the first words of a listener")
+        self.expect_serving()
+
+    def has_spoken(self):
+        return bool(self.said())
+
+    def expect_serving(self):
         if self.said() != [f"krutil-qvm: serving {self.path}"]:
             raise AssertionError(f"first words of a listener: expected that it serves {self.path}, got {self.said()}")
 
