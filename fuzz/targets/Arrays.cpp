@@ -53,9 +53,11 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     }
     Array array = std::get<Array>(*object);
     const std::uint64_t sum = sumOf(array);
-    std::uint64_t count = 1;
-    for (const std::uint64_t extent : array.dimensions()) {
-        fuzz::require(extent == 0 || count <= UINT64_MAX / extent, "the number of elements is the dimensions' product");
+    const auto& extents = array.dimensions();
+    // One extent of 0 is enough, whatever the product of the others would be.
+    std::uint64_t count = std::find(extents.begin(), extents.end(), 0) == extents.end() ? 1 : 0;
+    for (const std::uint64_t extent : extents) {
+        fuzz::require(count == 0 || count <= UINT64_MAX / extent, "the number of elements is the dimensions' product");
         count *= extent;
     }
     fuzz::require(count == array.numberOfElements(), "the number of elements is the dimensions' product");

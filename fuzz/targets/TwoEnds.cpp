@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <array>
+#include <cerrno>
 #include <cstdint>
 #include <exception>
 #include <future>
@@ -44,18 +45,23 @@ struct Direction {
         std::size_t sent = 0;
         while (sent < held.size()) {
             const ssize_t took = ::send(to, held.data() + sent, held.size() - sent, MSG_NOSIGNAL);
-            if (took <= 0) {
+            if (took < 0 && errno != EINTR) {
                 break;
             }
-            sent += static_cast<std::size_t>(took);
+            sent += static_cast<std::size_t>(std::max<ssize_t>(took, 0));
         }
         held.clear();
     }
 
-    // Exactly so many bytes of the handshake.
+    // Exactly so many bytes of the handshake. The clock that watches a search interrupts what waits.
     std::string read(std::size_t size) const {
         std::string bytes(size, '\0');
-        require(::recv(from, bytes.data(), size, MSG_WAITALL) == static_cast<ssize_t>(size), "an end shakes hands");
+        std::size_t done = 0;
+        while (done < size) {
+            const ssize_t got = ::recv(from, bytes.data() + done, size - done, 0);
+            require(got > 0 || (got < 0 && errno == EINTR), "an end shakes hands");
+            done += static_cast<std::size_t>(std::max<ssize_t>(got, 0));
+        }
         return bytes;
     }
 
