@@ -33,11 +33,13 @@ OwnDescriptors::OwnDescriptors() {
         std::from_chars(name.data(), name.data() + name.size(), descriptor);
         watched_.push_back({descriptor, 0, 0});
     }
-    // Looked at when the directory itself is closed again.
+    // Looked at when the directory itself is closed again. The seals come first: what is closed in between is not kept.
     watched_.erase(std::remove_if(watched_.begin(), watched_.end(),
                                   [](const pollfd& each) {
+                                      const int seals = ::fcntl(each.fd, F_GET_SEALS);
                                       const int flags = ::fcntl(each.fd, F_GETFD);
-                                      return flags < 0 || (flags & FD_CLOEXEC) == 0;
+                                      const bool isShared = seals >= 0 && (seals & F_SEAL_SHRINK) != 0;
+                                      return flags < 0 || (flags & FD_CLOEXEC) == 0 || isShared;
                                   }),
                    watched_.end());
     for (const pollfd& each : watched_) {

@@ -13,7 +13,8 @@ namespace qvm {
 /// the engine looks now and then.
 class OwnDescriptors {
   public:
-    /// Remembers what is open now and closed on exec: so not 0 to 2, nor what the program was started with.
+    /// Remembers what is open now and closed on exec: so not 0 to 2, nor what the program was started with. Sealed
+    /// memory is left out: it is the peer's, of an array that has just come, and is closed as soon as it is mapped.
     OwnDescriptors();
 
     /// Whether all are open still. One system call; a number that another file has now counts as open.
