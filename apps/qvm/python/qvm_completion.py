@@ -7,7 +7,7 @@ from keyword import kwlist as _keywords
 from types import ModuleType
 
 from qvm_look import (ABSENT, MAX_ENTRIES, attribute, attribute_names, column_names, entries, field_names, function_of,
-                      is_exactly, is_one_of, look_up, own_names)
+                      is_exactly, is_one_of, look_up, own_names, text_signature)
 from qvm_reading import Reading
 
 _MAX_CANDIDATES = 1000
@@ -19,8 +19,8 @@ def complete(text, cursor, scopes):
     """Begin and end of what is replaced, and the candidates. scopes are namespaces, from the innermost."""
     reading = Reading(text[:cursor])
     begin, found = _complete(reading, text[:cursor], scopes)
-    # A candidate is one line.
-    found = list(islice((each for each in found if each.isprintable()), _MAX_CANDIDATES))
+    # A candidate is one line, and is there once, so that a single one is taken at once.
+    found = list(islice((each for each in dict.fromkeys(found) if each.isprintable()), _MAX_CANDIDATES))
     # Those that close a text take the place of its closing quotes.
     closes = reading.inside and found and found[0].endswith(reading.inside) and text.startswith(reading.inside, cursor)
     return begin, cursor + len(reading.inside) if closes else cursor, found
@@ -96,11 +96,26 @@ def _keywords_of(thing):
         return []
     found = function_of(thing)
     if found is None:
-        return []
+        return [name + "=" for name in _named_in(text_signature(thing) or "")]
     function, filled = found
     code = function.__code__
     names = code.co_varnames[:code.co_argcount + code.co_kwonlyargcount]
     return [name + "=" for name in names[max(filled, code.co_posonlyargcount):] if name.isidentifier()]
+
+
+def _named_in(signature):
+    """The parameters of a text signature that a call can name."""
+    names, depth, before = [], 0, ""
+    for token in Reading(signature.replace("\n", " ")).tokens:
+        if depth == 1 and before in ("(", ","):
+            if token.text == "/":
+                names.clear()
+            elif token.kind == "word":
+                names.append(token.text)
+        if token.kind == "sign":
+            depth += (token.text in "([{") - (token.text in ")]}")
+        before = token.text
+    return names
 
 
 def _files(code, begin):

@@ -5,10 +5,10 @@ import warnings
 from _ast import PyCF_ONLY_AST
 from codeop import PyCF_ALLOW_INCOMPLETE_INPUT, PyCF_DONT_IMPLY_DEDENT
 from inspect import CO_VARARGS, CO_VARKEYWORDS, cleandoc
-from types import (BuiltinFunctionType, FunctionType, GetSetDescriptorType, MethodDescriptorType, MethodType,
-                   MethodWrapperType, ModuleType, NoneType, WrapperDescriptorType)
+from types import FunctionType, GetSetDescriptorType, MethodType, ModuleType, NoneType
 
-from qvm_look import (ABSENT, class_attribute, function_of, is_class, is_one_of, look_up, own_names)
+from qvm_look import (ABSENT, C_FUNCTIONS, class_attribute, function_of, is_class, is_one_of, look_up, own_names,
+                      text_signature)
 from qvm_reading import Reading
 
 _PARSING = PyCF_ONLY_AST | PyCF_DONT_IMPLY_DEDENT | PyCF_ALLOW_INCOMPLETE_INPUT
@@ -17,8 +17,6 @@ _HEAP_TYPE = 1 << 9
 
 _flags = type.__dict__["__flags__"].__get__
 _name = type.__dict__["__name__"].__get__
-_text_signature = type.__dict__["__text_signature__"].__get__
-_C_FUNCTIONS = BuiltinFunctionType, MethodDescriptorType, MethodWrapperType, WrapperDescriptorType
 
 
 def inspect(text, cursor, scopes):
@@ -47,14 +45,10 @@ def _parameters(thing):
     found = function_of(thing)
     if found is not None:
         return _python_parameters(*found)
-    text = None
-    if is_one_of(thing, *_C_FUNCTIONS):
-        text = thing.__text_signature__
-    elif is_class(thing):
-        text = _text_signature(thing)
-    if type(text) is str:
+    text = text_signature(thing)
+    if text is not None:
         return re.sub(r"\$\w+(, /)?(, )?", "", text)
-    return "(...)" if is_one_of(thing, *_C_FUNCTIONS) or is_class(thing) else None
+    return "(...)" if is_one_of(thing, *C_FUNCTIONS) or is_class(thing) else None
 
 
 def _python_parameters(function, filled):
@@ -95,7 +89,7 @@ def _default(value):
 def _documentation(thing):
     while type(thing) is MethodType:
         thing = thing.__func__
-    if is_one_of(thing, FunctionType, *_C_FUNCTIONS):
+    if is_one_of(thing, FunctionType, *C_FUNCTIONS):
         text = thing.__doc__
     elif type(thing) is ModuleType:
         text = look_up(own_names(thing), "__doc__")

@@ -6,8 +6,9 @@ type(), their namespaces from the descriptors of type itself, and names are comp
 
 import sys
 from itertools import islice
-from types import (ClassMethodDescriptorType, FunctionType, GetSetDescriptorType, MappingProxyType,
-                   MemberDescriptorType, MethodDescriptorType, MethodType, ModuleType, WrapperDescriptorType)
+from types import (BuiltinFunctionType, ClassMethodDescriptorType, FunctionType, GetSetDescriptorType, MappingProxyType,
+                   MemberDescriptorType, MethodDescriptorType, MethodType, MethodWrapperType, ModuleType,
+                   WrapperDescriptorType)
 
 # What a look-up gives where there is nothing, or nothing that can be had without running code.
 ABSENT = object()
@@ -15,8 +16,11 @@ ABSENT = object()
 # No more entries of one namespace are looked at.
 MAX_ENTRIES = 100_000
 
+C_FUNCTIONS = BuiltinFunctionType, MethodDescriptorType, MethodWrapperType, WrapperDescriptorType
+
 _mro = type.__dict__["__mro__"].__get__
 _class_names = type.__dict__["__dict__"].__get__
+_text_signature = type.__dict__["__text_signature__"].__get__
 
 # Attributes that NumPy's own code computes from an array.
 _ARRAY_ATTRIBUTES = ("T", "dtype", "flags", "itemsize", "nbytes", "ndim", "shape", "size", "strides")
@@ -198,3 +202,12 @@ def function_of(thing):
                 return None
             thing, filled = called, filled + 1
     return None
+
+
+def text_signature(thing):
+    """The parameters of a function or a class that is not of Python, as its code states them; None where it does not.
+    One that a call fills in by itself has a dollar sign."""
+    text = thing.__text_signature__ if is_one_of(thing, *C_FUNCTIONS) else None
+    if is_class(thing):
+        text = _text_signature(thing)
+    return text if type(text) is str else None

@@ -153,6 +153,14 @@ TEST_F(CompletionTest, ParametersOfFunctions) {
     EXPECT_THAT(candidates("thing.method("), ElementsAre("value="));
     EXPECT_THAT(candidates("Thing.method("), ElementsAre("self=", "value="));
     EXPECT_THAT(candidates("thing("), ElementsAre("depth="));
+    // Functions and classes of C, as far as they state their parameters.
+    EXPECT_THAT(candidates("sorted([], "), ElementsAre("key=", "reverse="));
+    EXPECT_THAT(candidates("'text'.split(max"), ElementsAre("maxsplit=", "max"));
+    EXPECT_THAT(candidates("open('f', err"), ElementsAre("errors="));
+    EXPECT_THAT(candidates("print(1, end"), ElementsAre("end="));
+    EXPECT_THAT(candidates("enumerate([], star"), ElementsAre("start="));
+    EXPECT_THAT(candidates("len(ob"), ElementsAre("object"));
+    EXPECT_THAT(candidates("max(default"), ElementsAre());
 }
 
 TEST_F(CompletionTest, ModulesAndWhatTheyDefineBehindImport) {
@@ -163,6 +171,8 @@ TEST_F(CompletionTest, ModulesAndWhatTheyDefineBehindImport) {
     EXPECT_THAT(candidates("from xml.et"), ElementsAre("etree"));
     EXPECT_THAT(candidates("from xml.etree import ElementT"), ElementsAre("ElementTree"));
     EXPECT_THAT(candidates("from os import getpi"), ElementsAre("getpid"));
+    // A name of the module and a module of its own, once.
+    EXPECT_THAT(candidates("from os import path"), ElementsAre("path", "pathconf", "pathconf_names", "pathsep"));
     EXPECT_THAT(candidates("import os as o"), ElementsAre());
     EXPECT_EQ(value("[name for name in set(sys.modules) - before if name[:3] in ('col', 'ite', 'xml', 'num')]"),
               "[]\n");
