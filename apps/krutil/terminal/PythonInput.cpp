@@ -181,7 +181,9 @@ std::string indentationAfter(std::string_view code) {
     if (scanner.inString()) {
         return {};
     }
-    const std::string_view line = lastLineOf(code);
+    // What goes on over several lines is as deep as the first of them.
+    const auto& starts = scanner.starts();
+    const std::string_view line = open ? lastLineOf(code) : lineOf(code.substr(starts.empty() ? 0 : starts.back().at));
     std::string blanks(line.substr(0, std::min(line.find_first_not_of(" \t"), line.size())));
     if (scanner.deeper()) {
         return blanks += step;

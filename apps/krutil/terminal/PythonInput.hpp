@@ -18,7 +18,8 @@ bool needsMoreLines(std::string_view code);
 bool isWhole(std::string_view code);
 
 /// The blanks that a line behind `code` begins with: one step more than the last line when that begins a block or opens
-/// a bracket, one step less when it leaves a block. None in a string.
+/// a bracket, one step less when it leaves a block. A statement of several lines is as deep as its first one. None in a
+/// string.
 std::string indentationAfter(std::string_view code);
 
 /// The statements of `code`, each with all its lines; comments and empty lines between them belong to the one before. A

@@ -137,11 +137,14 @@ def _indentation(text):
     reading = Reading(text)
     if reading.inside and reading.inside != "comment":
         return ""
-    lines = [line for line in text.split("\n") if line.strip()]
-    blanks = lines[-1][:len(lines[-1]) - len(lines[-1].lstrip())]
-    words = [token.text for token in reading.tokens if token.text != "\n"]
-    if words[-1] == ":" or (reading.open and words[-1] in ("(", "[", "{")):
+    while reading.tokens[-1].text == "\n":
+        reading.tokens.pop()
+    statement, last = reading.statement(), reading.tokens[-1]
+    # What goes on over several lines is as deep as the first of them.
+    begin = text.rfind("\n", 0, (last if reading.open else statement[0]).begin) + 1
+    blanks = re.compile(r"[^\S\n]*").match(text, begin).group()
+    if last.text == ":" or (reading.open and last.text in ("(", "[", "{")):
         return blanks + "    "
-    if not reading.open and lines[-1].split()[0] in ("break", "continue", "pass", "raise", "return"):
+    if not reading.open and statement[0].text in ("break", "continue", "pass", "raise", "return"):
         return blanks[:-4]
     return blanks

@@ -74,6 +74,11 @@ TEST(PythonInputTest, ALineIsIndentedByTheOneBefore) {
         {"def f():\n    return (", "        "},
         {"return", ""},
         {"    x = '''a:", ""},
+        {"def f():\n    \"\"\"Doc.\n\nMore.\"\"\"", "    "},
+        {"    x = f(1,\n          2)", "    "},
+        {"    if (x and\n            y):", "        "},
+        {"    return (1,\n            2)", ""},
+        {"    x = 1 + \\\n2", "    "},
         {"@decorated", ""},
     };
     for (const auto& [code, blanks] : cases) {

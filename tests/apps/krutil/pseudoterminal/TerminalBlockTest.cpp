@@ -105,10 +105,19 @@ TEST_F(TerminalBlockTest, LinesAreIndentedAsTheirBlock) {
     terminal->expectBottom({">>> def f(a):", "...     " + at});
     terminal->type("if a:\r");
     terminal->expectBottom({"...     if a:", "...         " + at});
-    terminal->type("return (\r");
-    terminal->expectBottom({"...         return (", "...             " + at});
+    terminal->type("b = (\r");
+    terminal->expectBottom({"...         b = (", "...             " + at});
+    // A statement of several lines is as deep as its first one.
     terminal->type("a)\r");
-    terminal->expectBottom({"...             a)", "...             " + at});
+    terminal->expectBottom({"...             a)", "...         " + at});
+    terminal->type("return b\r");
+    terminal->expectBottom({"...         return b", "...     " + at});
+    terminal->type("for c in ():\r");
+    terminal->expectBottom({"...     for c in ():", "...         " + at});
+    terminal->type("if c:\r");
+    terminal->expectBottom({"...         if c:", "...             " + at});
+    terminal->type("c = 0\r");
+    terminal->expectBottom({"...             c = 0", "...             " + at});
     // One step back for each.
     terminal->type(std::string(backspace) + backspace + "return 0\r");
     terminal->expectBottom({"...     return 0", "... " + at});

@@ -131,6 +131,12 @@ TEST_F(InspectionTest, CodeIsCompleteIncompleteOrInvalid) {
     EXPECT_EQ(complete("def f():\n    if x:\n        return 1"), "incomplete:    ");
     EXPECT_EQ(complete("x = f("), "incomplete:    ");
     EXPECT_EQ(complete("x = f(1,\n      2,"), "incomplete:      ");
+    // A statement of several lines is as deep as its first one.
+    EXPECT_EQ(complete("def f():\n    '''Doc.\n\nMore.'''"), "incomplete:    ");
+    EXPECT_EQ(complete("def f():\n    x = g(1,\n          2)"), "incomplete:    ");
+    EXPECT_EQ(complete("def f():\n    if (x and\n            y):\n"), "incomplete:        ");
+    EXPECT_EQ(complete("if x:\n    return (1,\n            2)"), "incomplete:");
+    EXPECT_EQ(complete("if x:\n    y\n# why\n    z"), "incomplete:    ");
     EXPECT_EQ(complete("x = '''text"), "incomplete:");
     EXPECT_EQ(complete("x = \\"), "incomplete:");
     EXPECT_EQ(complete("@decorator"), "incomplete:");
