@@ -22,18 +22,20 @@ constexpr int shownElements = 1000;
 constexpr const char* helpText = R"(Python code is evaluated on the engine. A block ends with an empty line.
   :timing on|off      say how long each request took
   :debugger on|off    whether breakpoint() stops here
-  :queue              list what runs and what waits on the engine, and what each end can do
+  :queue              list what runs and what waits, and what each end can do
   :queue cancel N     cancel the request with this number in the list
   :full               show the last value whole
-  :restart            end the session and start a new one, without what this one holds
+  :restart            end the session, and start a new one without its names
   ?NAME, NAME?        tell about a name
   :help               this text
   :quit               leave, as Ctrl-D does
-Ctrl-C drops what has been typed, or cancels what runs; a second one within two seconds ends the engine.
-Tab completes, and lists when it is pressed again. Up and Down move in a block and through the history, Ctrl-P and Ctrl-N
-only through the history, Ctrl-R searches it. A value of more than 1,000 elements is cut.
-At debug> and keyboard>, :c goes on and :q (or Ctrl-D) quits; :help there tells the rest. Lines that are pasted there are
-sent at once; what :c leaves behind of them runs at the next prompt or when the code has ended.
+Ctrl-C drops what has been typed, or cancels what runs; a second one within two
+seconds ends the engine. Tab completes, and lists when it is pressed again. Up
+and Down move in a block and through the history, Ctrl-P and Ctrl-N only through
+the history, Ctrl-R searches it. A value of more than 1,000 elements is cut.
+At debug> and keyboard>, :c goes on and :q (or Ctrl-D) quits; :help there tells
+the rest. Lines that are pasted there are sent at once; what :c leaves behind of
+them runs at the next prompt or when the code has ended.
 )";
 
 // Ctrl-C drops a line, as long as this lives.
@@ -88,6 +90,8 @@ Next obey(Client& client, const std::string& command, Output& out) {
         client.setTiming(command == ":timing on");
     } else if (command == ":debugger on" || command == ":debugger off") {
         client.setDebugging(command == ":debugger on");
+    } else if (command == ":timing" || command == ":debugger") {
+        out.write("Write '" + command + " on' or '" + command + " off'.\n");
     } else if (command == ":help") {
         out.write(helpText);
     } else if (!obeyQueueCommand(client, command, out)) {

@@ -214,6 +214,10 @@ TEST_F(TerminalReplTest, TimingIsShownOnDemand) {
     evaluate("1", "answered after ");
     evaluate(":timing off");
     evaluate(":help", ":debugger on|off");
+    // Eighty columns are enough for it.
+    evaluate(":help", "runs; a second one within two\r\nseconds ends the engine.");
+    evaluate(":timing", "Write ':timing on' or ':timing off'.\r\n");
+    evaluate(":debugger", "Write ':debugger on' or ':debugger off'.\r\n");
     evaluate(":nonsense", "There is no command ':nonsense'; :help lists them.\r\n");
     leave(":quit\r");
 }
