@@ -165,8 +165,9 @@ class Session:
         await asyncio.to_thread(self._session.__exit__, kind, error, traceback)
 
     async def _wait(self, request: "Request[T]", on_text: Optional[OnText], timeout: Optional[float]) -> T:
+        limit = asyncio.timeout(timeout)
         try:
-            async with asyncio.timeout(timeout):
+            async with limit:
                 if on_text:
                     async for event in request.events():
                         if isinstance(event, Text):
@@ -175,6 +176,8 @@ class Session:
         except BaseException:
             if not request.done():
                 self._session._dispatch.cancel_all([request._request])
+            if limit.expired():
+                raise TimeoutError("there is no reply yet") from None
             raise
 
 

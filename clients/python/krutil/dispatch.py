@@ -11,7 +11,7 @@ from typing import TYPE_CHECKING, Any, Callable, Iterable, Optional, TypeVar, Un
 from .arrays import take_value
 from .displays import DisplayLine, OnDisplay, displays_from
 from .errors import Aborted, Error, Lost, as_text, error_from, remote_frames
-from .handshake import Settled
+from .handshake import Settled, how_it_ended
 from .prompts import KINDS, OnDebug, OnInput, Prompt
 from .requests import CancelAnswer, OnText, Request, State, Text, Value, Warned
 from .schema import (DebugLoopEvent, FEvalResult, IIPCancelReply, IIPReply, IIPResult, IssuedEnabledWarningEvent,
@@ -164,7 +164,7 @@ class Dispatch:
         except PeerAborted as reason:
             error = Aborted(f"the engine has aborted the session: {reason}")
         except (EndOfStream, OSError) as end:
-            error = Lost(f"the engine has gone{self._how_it_ended()}: {end}")
+            error = Lost(f"the engine has gone{how_it_ended(self._process)}: {end}")
         except Exception as fault:  # of this package; whoever waits must not wait for ever
             abort = "the program's handler failed"
             error = Aborted(f"this end of the session failed: {fault!r}")
@@ -363,15 +363,6 @@ class Dispatch:
         if self._error:
             return type(self._error)(str(self._error))
         return Lost("the session is closed" if self._closing else "the engine has ended the session")
-
-    def _how_it_ended(self) -> str:
-        if self._process is None:
-            return ""
-        try:
-            code = self._process.wait(1)
-        except subprocess.TimeoutExpired:
-            return ""
-        return f" (killed by signal {-code})" if code < 0 else f" (exit code {code})"
 
     def _on_write_failed(self) -> None:
         # The engine may have said why it does not read any more; it has a second for that to arrive.

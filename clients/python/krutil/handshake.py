@@ -3,8 +3,9 @@
 import os
 import socket
 import struct
+import subprocess
 import time
-from typing import Any, NamedTuple
+from typing import Any, NamedTuple, Optional
 
 from .errors import Aborted, Lost, Refused
 from .schema import SessionHello, SessionVerdict
@@ -37,9 +38,9 @@ class Settled(NamedTuple):
     shares: bool = False
 
 
-def shake_hands(connection: socket.socket, reader: Reader, limits: Limits, capabilities: list[int],
-                timeout: float) -> Settled:
-    """Begins a session on a connected socket, as its client.
+def shake_hands(connection: socket.socket, process: "Optional[subprocess.Popen[bytes]]", reader: Reader, limits: Limits,
+                capabilities: list[int], timeout: float) -> Settled:
+    """Begins a session on a connected socket, as its client; the engine's process is there if this end has started it.
 
     Raises `Refused` when the ends do not fit, `Aborted` when the engine breaks the protocol (or is none), and `Lost`
     when its stream ends or it has said nothing within the timeout, in seconds.
@@ -59,7 +60,7 @@ def shake_hands(connection: socket.socket, reader: Reader, limits: Limits, capab
     except Violation as violation:
         raise Aborted(f"the engine broke the protocol: {violation}") from None
     except EndOfStream as end:
-        raise Lost(f"the engine has gone during the handshake: {end}") from None
+        raise Lost(f"the engine has gone{how_it_ended(process)} during the handshake: {end}") from None
     except TimeoutError:
         raise Lost(f"the engine did not finish the handshake within {timeout:g} seconds") from None
     if not shares:
@@ -69,6 +70,17 @@ def shake_hands(connection: socket.socket, reader: Reader, limits: Limits, capab
     peer = theirs.limits
     return Settled(features.get("ZEROCOPY") == "enable",
                    Limits(peer.tag, peer.taggedFrame, peer.arrayMessage, peer.message, peer.frames), shares)
+
+
+def how_it_ended(process: "Optional[subprocess.Popen[bytes]]") -> str:
+    """What is known of the end of an engine whose stream has ended, in brackets."""
+    if process is None:
+        return ""
+    try:
+        code = process.wait(1)
+    except subprocess.TimeoutExpired:
+        return ""
+    return f" (killed by signal {-code})" if code < 0 else f" (exit code {code})"
 
 
 def settle(ours: Any, layout: int, theirs: Any) -> tuple[dict[str, str], list[str]]:

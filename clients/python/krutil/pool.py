@@ -7,7 +7,7 @@ from concurrent.futures import Executor, Future, ThreadPoolExecutor
 from typing import Any, Optional, Sequence, Union
 
 from .errors import Error, Lost
-from .session import Command, Session, start
+from .session import Command, Session, check_function, start
 
 
 class _Call:
@@ -52,6 +52,8 @@ class Pool(Executor):
     """
 
     def __init__(self, engines: Union[int, Sequence[Command]], *, timeout: float = 60) -> None:
+        if isinstance(engines, str):
+            raise TypeError(f"engines: expected a number or a list of commands, got a str; for one engine: [{engines!r}]")
         commands: Sequence[Optional[Command]] = [None] * engines if isinstance(engines, int) else list(engines)
         if not commands:
             raise ValueError("a pool needs one engine or more")
@@ -71,6 +73,7 @@ class Pool(Executor):
     def submit(self, function: str, /, *arguments: Any, outputs: int = 1) -> "Future[Any]":  # type: ignore[override]
         """Has an engine call a function; arguments and outputs are those of `Session.call()`. An argument must stay as
         it is until the future is done. A call that waits for an engine can be cancelled, and one that runs cannot."""
+        check_function(function)
         call = _Call(function, arguments, outputs)
         with self._changed:
             if self._closed:

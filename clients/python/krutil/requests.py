@@ -132,7 +132,10 @@ class Request(Generic[T]):
         Raises `RemoteError`, `Cancelled`, `Refused`, `Aborted` or `Lost`, and `TimeoutError` when there is no reply
         within the timeout, in seconds. The request goes on then.
         """
-        error = self._future.exception(timeout)
+        try:
+            error = self._future.exception(timeout)
+        except TimeoutError:
+            raise TimeoutError("there is no reply yet") from None
         if error is not None:
             raise error
         return self._future.result()

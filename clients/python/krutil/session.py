@@ -1,5 +1,6 @@
 """A session with an engine: how it is begun, what can be asked, and how it ends."""
 
+import errno
 import functools
 import os
 import secrets
@@ -59,7 +60,7 @@ class Session:
             capabilities.append(WEB_WINDOW)
         reader = Reader(connection)
         self._process = process
-        settled = shake_hands(connection, reader, limits, capabilities, timeout)
+        settled = shake_hands(connection, process, reader, limits, capabilities, timeout)
         self._zero_copy = settled.zero_copy
         # The upper half of all identifiers; the lower one counts.
         self._identity = secrets.randbits(64)
@@ -181,6 +182,8 @@ class Session:
     # What prompts and requests need of it.
 
     def _submit_eval(self, code: str, mode: str) -> "Request[Result]":
+        if not isinstance(code, str):
+            raise TypeError(f"code: expected a str, got {type(code).__name__}")
         # Partial: no field is required, so nobody need look for one that is missing.
         return self._enqueue([], "krutil:EvalIIP", EvalIIP(cmd=code).SerializePartialToString(), mode, _eval_result)
 
@@ -194,6 +197,7 @@ class Session:
                              os.path.abspath(path))
 
     def _submit_call(self, function: str, arguments: Sequence[Any], outputs: int, mode: str) -> "Request[Any]":
+        check_function(function)
         frames: list[Frame] = []
         indexes = [arrays.add_argument(frames, argument, self._zero_copy) for argument in arguments]
         request = _call_request(function, outputs, tuple(indexes))
@@ -256,6 +260,8 @@ def start(command: Optional[Command] = None, *, on_input: Optional[OnInput] = No
     """
     words = ["krutil-qvm", "--stdio"] if command is None else \
         shlex.split(command) if isinstance(command, str) else list(command)
+    if not words:
+        raise ValueError("command: expected the words that run an engine, got none")
     program = shutil.which(words[0])
     if program is None:
         raise FileNotFoundError(f"there is no program '{words[0]}' to be the engine: put its directory into PATH, "
@@ -289,7 +295,11 @@ def connect(path: "str | os.PathLike[str]", *, on_input: Optional[OnInput] = Non
     """
     connection = socket.socket(socket.AF_UNIX)
     try:
-        connection.connect(os.fspath(path))
+        try:
+            connection.connect(os.fspath(path))
+        except OSError as error:
+            raise OSError(error.errno or errno.ENAMETOOLONG,
+                          f"no engine can be reached there: {error.strerror or error}", os.fspath(path)) from None
         _, user, _ = _PEER.unpack(connection.getsockopt(socket.SOL_SOCKET, socket.SO_PEERCRED, _PEER.size))
         if user != os.geteuid():
             raise Refused(f"cannot connect to '{os.fspath(path)}': the engine there runs as user {user}, not as user "
@@ -299,6 +309,13 @@ def connect(path: "str | os.PathLike[str]", *, on_input: Optional[OnInput] = Non
     except BaseException:
         connection.close()
         raise
+
+
+def check_function(function: object) -> None:
+    """A function of this process cannot be sent, so that it is given by mistake is said at once."""
+    if not isinstance(function, str):
+        raise TypeError("function: expected the name of a function of the engine, such as 'numpy.linalg.inv'; got "
+                        f"{type(function).__name__}")
 
 
 @functools.lru_cache(maxsize=64)

@@ -99,8 +99,9 @@ class AioTest(unittest.IsolatedAsyncioTestCase):
 
     async def test_a_timeout_cancels(self):
         async with self.begin() as session:
-            with self.assertRaises(TimeoutError):
+            with self.assertRaises(TimeoutError) as caught:
                 await session.eval("while True: pass", timeout=0.05)
+            self.assertEqual(str(caught.exception), "there is no reply yet")
             self.assertEqual((await session.eval("'goes on'", timeout=PATIENCE)).value, "'goes on'")
 
     async def test_an_exception_that_leaves_the_block_cancels_what_is_open(self):

@@ -275,6 +275,13 @@ class Behaviour:
             for bad in (None, object(), numpy.array(["a"]), numpy.float16(1), numpy.ma.array([1, 2], mask=[0, 1])):
                 with self.assertRaises(TypeError):
                     session.submit_call("print", bad)
+            for submit, bad, text in (
+                    (session.submit_call, numpy.sum, "function: expected the name of a function of the engine, such as "
+                                                     "'numpy.linalg.inv'; got function"),
+                    (session.submit, 1, "code: expected a str, got int")):
+                with self.assertRaises(TypeError) as caught:
+                    submit(bad)
+                self.assertEqual(str(caught.exception), text)
             self.assertEqual(session.eval("1", timeout=PATIENCE).value, "1")
 
     def test_large_arrays_are_not_copied(self):
@@ -349,10 +356,10 @@ class Behaviour:
 
     def test_a_timeout_cancels(self):
         with self.begin() as session:
-            with self.assertRaises(TimeoutError):
-                session.eval("while True: pass", timeout=0.05)
-            with self.assertRaises(TimeoutError):
-                session.eval("while True: pass", on_text=print, timeout=0.05)
+            for options in {}, {"on_text": print}:
+                with self.assertRaises(TimeoutError) as caught:
+                    session.eval("while True: pass", timeout=0.05, **options)
+                self.assertEqual(str(caught.exception), "there is no reply yet")
             self.assertEqual(session.eval("'goes on'", timeout=PATIENCE).value, "'goes on'")
 
     def test_an_exception_in_on_text_cancels(self):
@@ -573,12 +580,26 @@ class StartTest(unittest.TestCase):
     def test_a_program_that_ends(self):
         with self.assertRaises(krutil.Lost) as caught:
             krutil.start(["true"], timeout=PATIENCE)
-        self.assertEqual(str(caught.exception), "the engine has gone during the handshake: the stream ended after 0 of the "
-                                                "1 bytes of the engine's first message")
+        self.assertEqual(str(caught.exception), "the engine has gone (exit code 0) during the handshake: the stream ended "
+                                                "after 0 of the 1 bytes of the engine's first message")
+
+    def test_a_command_without_words(self):
+        for command in "", []:
+            with self.assertRaises(ValueError) as caught:
+                krutil.start(command)
+            self.assertEqual(str(caught.exception), "command: expected the words that run an engine, got none")
 
     def test_nothing_listens(self):
-        with tempfile.TemporaryDirectory() as directory, self.assertRaises(FileNotFoundError):
-            krutil.connect(os.path.join(directory, "engine"))
+        with tempfile.TemporaryDirectory() as directory:
+            path = os.path.join(directory, "engine")
+            with self.assertRaises(FileNotFoundError) as caught:
+                krutil.connect(path)
+            self.assertEqual(str(caught.exception),
+                             f"[Errno 2] no engine can be reached there: No such file or directory: '{path}'")
+            with self.assertRaises(OSError) as caught:
+                krutil.connect(path + "e" * 200)
+            self.assertEqual(str(caught.exception),
+                             f"[Errno 36] no engine can be reached there: AF_UNIX path too long: '{path}{'e' * 200}'")
 
     @unittest.skipUnless(os.geteuid() == 0, "needs to become another user")
     def test_an_engine_of_another_user(self):

@@ -58,6 +58,10 @@ class PoolTest(unittest.TestCase):
             with self.assertRaises(krutil.RemoteError) as caught:
                 pool.submit("int", "twelve").result(PATIENCE)
             self.assertEqual(caught.exception.identifier, "ValueError")
+            with self.assertRaises(TypeError) as caught:
+                pool.submit(numpy.linalg.inv, matrix)
+            self.assertEqual(str(caught.exception), "function: expected the name of a function of the engine, such as "
+                                                    "'numpy.linalg.inv'; got function")
             with self.assertRaises(TypeError):
                 pool.submit("len", object()).result(PATIENCE)
 
@@ -120,10 +124,14 @@ class PoolTest(unittest.TestCase):
             krutil.Pool(["krutil-qvm --stdio", self.path("nothing")])
         with self.assertRaises(krutil.Lost) as caught:
             krutil.Pool(["krutil-qvm --stdio", self.script("fails", "exit 3")])
-        self.assertTrue(str(caught.exception).startswith("the engine has gone during the handshake: "))
+        self.assertTrue(str(caught.exception).startswith("the engine has gone (exit code 3) during the handshake: "))
         with self.assertRaises(ValueError) as caught:
             krutil.Pool(0)
         self.assertEqual(str(caught.exception), "a pool needs one engine or more")
+        with self.assertRaises(TypeError) as caught:
+            krutil.Pool("krutil-qvm --stdio")
+        self.assertEqual(str(caught.exception), "engines: expected a number or a list of commands, got a str; for one "
+                                                "engine: ['krutil-qvm --stdio']")
 
     def test_an_engine_that_cannot_be_started_again(self):
         # The script runs an engine as often as there are files to take away.
