@@ -308,7 +308,8 @@ TEST_F(LintTest, FieldsAreCountedWhereTheirNumberIsLimited) {
     sayHello(counting);
     agree();
     EXPECT_EQ(takeFrame(Role::Engine, frame),
-              "frame \"krutil:TextBaseEvent\" exceeds the limit \"parts\": expected at most 99 fields, got more");
+              "frame \"krutil:TextBaseEvent\", byte 297, field text: expected at most 99 fields (limit \"parts\"), got "
+              "more");
     // An end that does not know this limit has none.
     startAnew();
     sayHello();

@@ -301,8 +301,8 @@ TEST(EnginePrecheckTest, MorePartsThanTheLimitAreRefused) {
     const auto engineWith = [&](const std::string& most) {
         return outcomeOf({{"krutil:EvalIIP", content}, enqueue(1)}, {"--limit-parts", most});
     };
-    const std::string why =
-        "frame \"krutil:EvalIIP\" exceeds the limit \"parts\": expected at most 1000 fields, got more";
+    const std::string why = "frame \"krutil:EvalIIP\", byte " + std::to_string(content.size() - 2) +
+                            ", field codeType: expected at most 1000 fields (limit \"parts\"), got more";
     EXPECT_EQ(engineWith("1001"), (Outcome{evaluated, {}, 0, {}}));
     EXPECT_EQ(engineWith("1000"), (Outcome{{}, why, 4, "krutil-qvm: " + why + "\n"}));
 }

@@ -223,7 +223,9 @@ TEST_F(WireWalkTest, PartsAreAllFieldsButPackedElements) {
 TEST_F(WireWalkTest, MorePartsThanAllowed) {
     const std::string three = block(3, "\x08\x01\x08\x02");
     EXPECT_EQ(verdict(three, 3), "whole");
-    EXPECT_EQ(verdict(three, 2), " exceeds the limit \"parts\": expected at most 2 fields, got more");
+    EXPECT_EQ(verdict(three, 2), ", byte 4, field self.one: expected at most 2 fields (limit \"parts\"), got more");
+    EXPECT_EQ(verdict("\xA3\x06\xA8\x06\x01\xA4\x06", 1),
+              ", byte 2, field 100.101: expected at most 1 fields (limit \"parts\"), got more");
     EXPECT_EQ(verdict("", 0), "whole");
 }
 

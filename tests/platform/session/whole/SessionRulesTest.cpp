@@ -349,7 +349,7 @@ TEST_F(PeerLimitsTest, PartsThatASenderWithoutMannersSends) {
     SessionWithBytes end(config);
     end.peer->write(root(1, questionTag, "\x08\x01\x08\x01\x08\x01"));
     EXPECT_EQ(end.saw.waitForEnd().text,
-              "frame \"test:question\" exceeds the limit \"parts\": expected at most 2 fields, got more");
+              "frame \"test:question\", byte 4, field hi: expected at most 2 fields (limit \"parts\"), got more");
 }
 
 TEST_F(PeerLimitsTest, Tag) {

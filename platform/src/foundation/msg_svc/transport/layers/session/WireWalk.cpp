@@ -131,9 +131,7 @@ class WireWalk::Content {
             return;
         }
         if (++parts_ > mostParts_) {
-            throw ProtocolViolation("frame " + quoted(frame_.tag()) +
-                                    " exceeds the limit \"parts\": expected at most " + std::to_string(mostParts_) +
-                                    " fields, got more");
+            fail("expected at most " + std::to_string(mostParts_) + " fields (limit \"parts\")", "more");
         }
         const Fields::Field* const field = levels_[depth_].fields->find(number_);
         switch (wireType) {
