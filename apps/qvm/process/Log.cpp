@@ -1,6 +1,5 @@
 #include "qvm/process/Log.hpp"
 
-#include <fcntl.h>
 #include <unistd.h>
 
 #include <array>
@@ -31,7 +30,7 @@ std::string stamped(std::string_view text) {
 }  // namespace
 
 Log::Log(const std::string& path)
-    : stderr_(::fcntl(STDERR_FILENO, F_DUPFD_CLOEXEC, firstPrivateDescriptor)),
+    : stderr_(duplicateAside(STDERR_FILENO, "Cannot keep standard error")),
       file_(path, [this](const std::string& sentence) { tell(sentence); }) {}
 
 void Log::say(std::string_view text) noexcept {
@@ -53,9 +52,7 @@ void Log::note(std::string_view text) noexcept {
 // To standard error only.
 void Log::tell(std::string_view text) const noexcept {
     try {
-        if (stderr_) {
-            posix::writeFully(stderr_.get(), "krutil-qvm: " + std::string(text) + "\n");
-        }
+        posix::writeFully(stderr_.get(), "krutil-qvm: " + std::string(text) + "\n");
     } catch (const std::bad_alloc&) {
         // As above.
     }

@@ -12,7 +12,8 @@ namespace qvm {
 /// error that the program was started with as well. May be used from any thread, and by several processes at once.
 class Log {
   public:
-    /// `path` is empty for no file. Throws std::runtime_error as AppendFile does.
+    /// `path` is empty for no file. Throws std::runtime_error as AppendFile does, and std::system_error when there is
+    /// no descriptor for the duplicate of standard error.
     explicit Log(const std::string& path);
 
     /// To standard error and the file.

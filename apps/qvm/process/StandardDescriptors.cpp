@@ -16,15 +16,15 @@ namespace {
     throw std::system_error(errno, std::generic_category(), what);
 }
 
-int moveAside(int descriptor, const char* name) {
-    const int moved = ::fcntl(descriptor, F_DUPFD_CLOEXEC, firstPrivateDescriptor);
-    if (moved < 0) {
-        fail(name);
-    }
-    return moved;
-}
-
 }  // namespace
+
+int duplicateAside(int descriptor, const char* failure) {
+    const int made = ::fcntl(descriptor, F_DUPFD_CLOEXEC, firstPrivateDescriptor);
+    if (made < 0) {
+        fail(failure);
+    }
+    return made;
+}
 
 void checkDescriptorLimit() {
     rlimit limit{};
@@ -49,8 +49,8 @@ void holdStandardDescriptors() {
 }
 
 ProtocolDescriptors moveProtocolAside() {
-    const int in = moveAside(STDIN_FILENO, "Cannot move standard input aside");
-    const int out = moveAside(STDOUT_FILENO, "Cannot move standard output aside");
+    const int in = duplicateAside(STDIN_FILENO, "Cannot move standard input aside");
+    const int out = duplicateAside(STDOUT_FILENO, "Cannot move standard output aside");
     giveToRunningCode();
     return {in, out};
 }

@@ -17,6 +17,10 @@ void checkDescriptorLimit();
 /// Makes sure that 0, 1 and 2 are open, so that nothing else lands on their numbers. Throws std::system_error.
 void holdStandardDescriptors();
 
+/// A close-on-exec duplicate with a private number, which the caller owns. Throws std::system_error that begins with
+/// `failure`.
+int duplicateAside(int descriptor, const char* failure);
+
 /// The pair of descriptors that a session reads from and writes to.
 struct ProtocolDescriptors {
     int in;
