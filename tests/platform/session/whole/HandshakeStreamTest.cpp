@@ -1,5 +1,6 @@
 // Handshakes on streams that carry something else, end, or take little; and what becomes of the descriptors.
 #include <fcntl.h>
+#include <sys/resource.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -282,6 +283,19 @@ TEST_F(HandshakeTest, UnknownProtocolNameIsOutOfRangeAndTheDescriptorsAreClosed)
 TEST_F(HandshakeTest, DescriptorThatIsNotOneIsRefused) {
     EXPECT_EQ(textOf<StreamLost>([] { Session::open(-1, -1, configOf(Role::Client)); }),
               "cannot use descriptor -1 for a session: Bad file descriptor");
+}
+
+// Each direction of a stream needs one of its own.
+TEST_F(HandshakeTest, StreamForWhichThereIsNoSecondDescriptorIsRefused) {
+    const Ends ends = socketPair();
+    const foundation::core::posix::OwnedDescriptor other(ends.otherIn);
+    struct rlimit before {};
+    ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &before), 0);
+    const struct rlimit none { 1, before.rlim_max };
+    ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &none), 0);
+    const std::string said = textOf<StreamLost>([&] { Session::open(ends.in, ends.in, configOf(Role::Client)); });
+    ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &before), 0);
+    EXPECT_EQ(said, "cannot use descriptor " + std::to_string(ends.in) + " for a session: Too many open files");
 }
 
 TEST_F(HandshakeTest, DescriptorsBecomeNonBlockingAndCloseOnExec) {

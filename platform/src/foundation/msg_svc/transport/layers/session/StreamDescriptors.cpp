@@ -12,12 +12,24 @@
 namespace foundation::msg_svc::transport::layers::session {
 namespace {
 
+[[noreturn]] void failToUse(int descriptor) {
+    throw StreamLost("cannot use descriptor " + std::to_string(descriptor) +
+                     " for a session: " + std::generic_category().message(errno));
+}
+
+int another(int descriptor) {
+    const int made = ::fcntl(descriptor, F_DUPFD_CLOEXEC, 0);
+    if (made < 0) {
+        failToUse(descriptor);
+    }
+    return made;
+}
+
 void prepare(int descriptor) {
     const int flags = ::fcntl(descriptor, F_GETFL);
     if (flags < 0 || ::fcntl(descriptor, F_SETFL, flags | O_NONBLOCK) < 0 ||
         ::fcntl(descriptor, F_SETFD, FD_CLOEXEC) < 0) {
-        throw StreamLost("cannot use descriptor " + std::to_string(descriptor) +
-                         " for a session: " + std::generic_category().message(errno));
+        failToUse(descriptor);
     }
 }
 
@@ -35,7 +47,7 @@ StreamDescriptors StreamDescriptors::takeOver(int in, int out) {
     StreamDescriptors stream;
     stream.in.reset(in);
     // The two directions are watched independently, and one descriptor can be watched only once.
-    stream.out.reset(in == out ? ::fcntl(in, F_DUPFD_CLOEXEC, 0) : out);
+    stream.out.reset(in == out ? another(in) : out);
     prepare(stream.in.get());
     prepare(stream.out.get());
     ignoreBrokenPipes();
