@@ -172,9 +172,10 @@ Listener::~Listener() {
     }
     ::close(socket_);
     ::close(signals_);
-    // Another engine may have taken the path over after someone removed the file.
+    // Another engine may have taken the path over after someone removed the file. One that cannot be looked at is this
+    // one's: nobody else had a reason to replace it.
     struct stat status {};
-    if (::lstat(options_.listen.c_str(), &status) == 0 && status.st_ino == inode_) {
+    if (::lstat(options_.listen.c_str(), &status) != 0 || status.st_ino == inode_) {
         ::unlink(options_.listen.c_str());
     }
 }
@@ -203,7 +204,7 @@ void Listener::bindSocket() {
     const mode_t before = ::umask(users_.areSeveral() ? 0111 : 0177);
     const int bound = ::bind(socket_, reinterpret_cast<const sockaddr*>(&address), sizeof(address));
     ::umask(before);
-    if (bound != 0 || ::listen(socket_, SOMAXCONN) != 0) {
+    if (bound != 0 || ::listen(socket_, SOMAXCONN) != 0 || ::lstat(path.c_str(), &status) != 0) {
         const int error = errno;
         if (bound == 0) {
             ::unlink(path.c_str());
@@ -211,7 +212,6 @@ void Listener::bindSocket() {
         errno = error;
         failWithErrno("Cannot serve \"" + path + "\"");
     }
-    ::lstat(path.c_str(), &status);
     inode_ = status.st_ino;
 }
 

@@ -4,6 +4,7 @@
 //
 //     list FILE             appends each call site, when it is first used, to the file: CALL@MODULE+OFFSET, a line each
 //     once SITE ERRNO       the first call of the site fails
+//     later SITE ERRNO      its third call fails
 //     always SITE ERRNO     every call of the site fails
 //     short                 a call that reads or writes bytes moves one
 //     interrupted           every other call that may wait fails with EINTR
@@ -17,6 +18,7 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <pthread.h>
+#include <signal.h>
 #include <sys/epoll.h>
 #include <sys/file.h>
 #include <sys/mman.h>
@@ -24,6 +26,7 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/uio.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -55,7 +58,8 @@ class Rule {
 
     // 0, or the error with which a call has to fail.
     int errorOf(std::string_view call, const void* returnsTo) {
-        if ((kind_ != "list" && kind_ != "once" && kind_ != "always") || (unforked_ && ::getpid() != first_)) {
+        if ((kind_ != "list" && kind_ != "once" && kind_ != "later" && kind_ != "always") ||
+            (unforked_ && ::getpid() != first_)) {
             return 0;
         }
         const std::optional<Dl_info> module = ownModule(returnsTo);
@@ -67,7 +71,7 @@ class Rule {
             list(site);
             return 0;
         }
-        const bool fails = site == argument_ && (kind_ == "always" || !failed_.exchange(true));
+        const bool fails = site == argument_ && (kind_ == "always" || calls_++ == (kind_ == "once" ? 0 : 2));
         return fails ? error_ : 0;
     }
 
@@ -133,7 +137,7 @@ class Rule {
     const bool unforked_ = std::getenv("KRUTIL_FAULTS_UNFORKED") != nullptr;
     // The first call comes before any fork: a program opens files when it begins.
     const pid_t first_ = ::getpid();
-    std::atomic<bool> failed_{false};
+    std::atomic<unsigned> calls_{0};
     std::mutex mutex_;
     std::set<std::string> sites_;
 };
@@ -248,6 +252,41 @@ extern "C" int getsockopt(int descriptor, int level, int option, void* value, so
     return KRUTIL_CALL(getsockopt, descriptor, level, option, value, size);
 }
 
+KRUTIL_ORIGINAL(int, connect, int, const sockaddr*, socklen_t)
+extern "C" int connect(int descriptor, const sockaddr* address, socklen_t size) {
+    return KRUTIL_CALL(connect, descriptor, address, size);
+}
+
+// Of the commands, those that make a descriptor; the others only look, or cannot fail for a descriptor that is there.
+KRUTIL_ORIGINAL(int, fcntl, int, int, void*)
+extern "C" int fcntl(int descriptor, int command, ...) {
+    va_list arguments;
+    va_start(arguments, command);
+    void* const argument = va_arg(arguments, void*);
+    va_end(arguments);
+    return command == F_DUPFD_CLOEXEC ? KRUTIL_CALL(fcntl, descriptor, command, argument)
+                                      : originalOffcntl()(descriptor, command, argument);
+}
+
+// What changes a descriptor's entry cannot fail. Nor does this one for what Asio adds for itself, without a look at the
+// result; it asks for EPOLLHUP where it adds others.
+KRUTIL_ORIGINAL(int, epoll_ctl, int, int, int, epoll_event*)
+extern "C" int epoll_ctl(int descriptor, int operation, int watched, epoll_event* event) {
+    return operation == EPOLL_CTL_ADD && (event->events & EPOLLHUP) != 0
+               ? KRUTIL_CALL(epoll_ctl, descriptor, operation, watched, event)
+               : originalOfepoll_ctl()(descriptor, operation, watched, event);
+}
+
+KRUTIL_ORIGINAL(int, timer_create, clockid_t, sigevent*, timer_t*)
+extern "C" int timer_create(clockid_t clock, sigevent* event, timer_t* timer) {
+    return KRUTIL_CALL(timer_create, clock, event, timer);
+}
+
+KRUTIL_ORIGINAL(int, lstat, const char*, struct stat*)
+extern "C" int lstat(const char* path, struct stat* status) {
+    return KRUTIL_CALL(lstat, path, status);
+}
+
 KRUTIL_ORIGINAL(int, signalfd, int, const sigset_t*, int)
 extern "C" int signalfd(int descriptor, const sigset_t* signals, int flags) {
     return KRUTIL_CALL(signalfd, descriptor, signals, flags);
@@ -256,6 +295,11 @@ extern "C" int signalfd(int descriptor, const sigset_t* signals, int flags) {
 KRUTIL_ORIGINAL(int, flock, int, int)
 extern "C" int flock(int descriptor, int operation) {
     return KRUTIL_CALL(flock, descriptor, operation);
+}
+
+KRUTIL_ORIGINAL(int, rename, const char*, const char*)
+extern "C" int rename(const char* from, const char* to) {
+    return KRUTIL_CALL(rename, from, to);
 }
 
 KRUTIL_ORIGINAL(int, mkdir, const char*, mode_t)

@@ -13,6 +13,8 @@ ERRORS = {
     "ftruncate": [errno.ENOSPC], "fork": [errno.EAGAIN], "pthread_create": [errno.EAGAIN], "mmap": [errno.ENOMEM],
     "bind": [errno.ENOSPC], "listen": [errno.EADDRINUSE], "accept4": [errno.EMFILE], "getsockopt": [errno.ENOBUFS],
     "signalfd": [errno.EMFILE], "flock": [errno.ENOLCK], "mkdir": [errno.ENOSPC],
+    "connect": [errno.EAGAIN], "fcntl": [errno.EMFILE], "epoll_ctl": [errno.ENOMEM], "timer_create": [errno.EAGAIN],
+    "lstat": [errno.EACCES], "rename": [errno.ENOSPC],
 }
 
 
