@@ -23,7 +23,7 @@ from processes import Listener, adopt_orphans, all_have_ended, children
 LIBRARY = sys.argv[1]
 
 # Where these failed for ever, no listener could work.
-WAITING = ("read@", "recv@", "send@krutil-qvm")
+WAITING = ("read@", "send@krutil-qvm")
 
 # What a session says whose client goes when its listener has.
 LEFT_SESSION = "krutil-qvm: the stream ended between two messages, without the client's goodbye"

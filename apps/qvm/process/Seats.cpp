@@ -73,7 +73,8 @@ std::vector<std::string> Seats::answer(Clock::time_point now) {
         const ssize_t count = each->line ? ::recv(each->line.get(), &word, 1, MSG_DONTWAIT) : -1;
         if (count == 1 && !each->withdrawn) {
             giveSeat(*each, now, refusals);
-        } else if (count == 0) {
+        } else if (count == 0 || (count < 0 && errno != EAGAIN && errno != EINTR)) {
+            // A line that fails would be reported as readable for ever.
             each->line.reset();
         }
         if (each->seated && !each->line) {
