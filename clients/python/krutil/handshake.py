@@ -120,6 +120,7 @@ def _hello(limits: Limits, capabilities: list[int]) -> Any:
     hello.limits.arrayMessage = limits.array_message
     hello.limits.message = limits.message
     hello.limits.frames = limits.frames
+    hello.limits.parts = limits.parts
     return hello
 
 

@@ -13,6 +13,7 @@ from dataclasses import dataclass
 from typing import TYPE_CHECKING, Any, Callable, Optional, Sequence, Union
 
 from .memory import memory_for
+from .parts import first_beyond
 
 if TYPE_CHECKING:
     from .shared import Borrower, Lender, Place
@@ -49,13 +50,14 @@ class PeerAborted(Exception):
 
 @dataclass(frozen=True)
 class Limits:
-    """What an end accepts, in bytes; `frames` is a number of frames."""
+    """What an end accepts, in bytes; `frames` is a number of frames, `parts` one of fields in a tagged frame."""
 
     tag: int = 128
     tagged_frame: int = 4 << 20
     array_message: int = 64 << 20
     message: int = 4 << 30
     frames: int = 65_536
+    parts: int = 262_144
 
     def of_content(self, tag: str) -> tuple[str, int]:
         """Name and number of the limit for the content of a tagged frame."""
@@ -76,8 +78,9 @@ class Frame:
 class Message:
     """A message that was read: frames that refer to each other by index, the last of which is the root."""
 
-    def __init__(self, stream: int, frames: list[Frame]) -> None:
+    def __init__(self, stream: int, frames: list[Frame], most_parts: int) -> None:
         self.stream = stream
+        self._most_parts = most_parts
         self.root = frames[-1].tag or ""
         self._frames: list[Optional[Frame]] = list(frames)
 
@@ -116,6 +119,12 @@ class Message:
         """The content as a message of Protocol Buffers. Bytes that are cut are refused: no engine sends them."""
         if frame.type != frame_type:
             raise self.unreadable(f'frame {index}: expected the frame type of "{tag}", got {frame.type}')
+        # A part takes two bytes or more, so nearly no content has to be counted.
+        if len(frame.content) // 2 > self._most_parts:
+            beyond = first_beyond(kind.DESCRIPTOR, memoryview(frame.content), self._most_parts)
+            if beyond is not None:
+                raise Violation(f'frame "{tag}", byte {beyond}: expected at most {self._most_parts} fields (limit "parts"), '
+                                'got more')
         made = kind()
         try:
             made.MergeFromString(frame.content)
@@ -240,7 +249,7 @@ class Reader:
             begin = end
             if kind & LAST:
                 self._begin = begin
-                return Message(stream, frames)
+                return Message(stream, frames, limits.parts)
         return None
 
     def buffered(self) -> bytes:
@@ -318,7 +327,7 @@ def read_message(reader: Reader, limits: Limits, borrower: "Optional[Borrower]" 
             if tag is None:
                 raise Violation(f"message on stream {stream}: expected a tagged frame as its last one, "
                                 "got a data frame")
-            return Message(stream, frames)
+            return Message(stream, frames, limits.parts)
 
 
 def _check_sizes(kind: int, number: int, stream: int, tag_size: int, size: int, total: int, limits: Limits) -> None:

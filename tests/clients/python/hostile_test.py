@@ -227,6 +227,13 @@ class ViolationTest(unittest.TestCase):
                        'number of frames of a message exceeds the limit "frames": expected at most 3 frames, got 4',
                        limits=krutil.Limits(frames=3))
 
+    def test_many_parts(self):
+        # Two bytes make an empty error, which is a large object. Those of a text are one part.
+        outcome = result().SerializeToString() + b"\x12\x80\x80\x80\x01" + b"\x32\x00" * MiB
+        self.violation(message(1, ("krutil:IIPResult", outcome), ("krutil:IIPReply", reply(1))),
+                       f'frame "krutil:IIPResult", byte {len(outcome) - 2 * MiB + 2 * (262_144 - 3)}: expected at most 262144 '
+                       'fields (limit "parts"), got more')
+
     def test_a_size_that_never_comes_takes_no_memory(self):
         claimed = 1 << 30
         before = reset_peak()

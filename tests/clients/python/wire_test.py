@@ -4,7 +4,7 @@ import unittest
 from unittest import mock
 
 import krutil
-from krutil import wire
+from krutil import parts, schema, wire
 from scripted import DONE, frame, message
 
 
@@ -86,6 +86,32 @@ class MessageTest(unittest.TestCase):
         with mock.patch.object(wire.Reader, "read", side_effect=AssertionError("a step for a part of a message")):
             read = wire.read_message(wire.Reader(stream), krutil.Limits())
         self.assertEqual((read.root, stream.reads), ("krutil:IIPReply", 1))
+
+
+class PartsTest(unittest.TestCase):
+    """In the content of a result, whose field 1 has numbers, and whose field 2 is an error with errors in field 6."""
+
+    def expect(self, content, *begins):
+        """Its fields begin at these bytes; one that is refused is the first beyond a limit."""
+        for most, begin in enumerate((*begins, None)):
+            self.assertEqual(parts.first_beyond(schema.IIPResult.DESCRIPTOR, memoryview(content), most), begin)
+
+    def test_fields_of_messages_inside_count(self):
+        self.expect(b"")
+        self.expect(b"\x0a\x02\x10\x01\x12\x04\x32\x02\x32\x00", 0, 2, 4, 6, 8)
+        self.expect(b"\x12\x02\x32\x00\x12\x02\x32\x00", 0, 2, 4, 6)
+
+    def test_bytes_of_others_do_not(self):
+        self.expect(b"\x12\x04\x1a\x02\x32\x00", 0, 2)
+        self.expect(b"\x7a\x02\x32\x00\x09" + b"\x08" * 8 + b"\x0d" + b"\x08" * 4 + b"\x08\xff\x01\x08\x01", 0, 4, 13, 18, 21)
+
+    def test_groups_are_fields_and_have_some(self):
+        self.expect(b"\x13\x12\x02\x32\x00\x14\x12\x02\x32\x00", 0, 1, 6, 8)
+
+    def test_what_is_not_whole_has_the_fields_before(self):
+        for fault in (b"\x80", b"\x0f", b"\x14", b"\x08" + b"\xff" * 11):
+            self.expect(b"\x08\x01" + fault, 0, *([] if fault in (b"\x80", b"\x14") else [2]))
+        self.expect(b"\x12\x05\x32\x00", 0)
 
 
 if __name__ == "__main__":
