@@ -137,7 +137,11 @@ void awaitStopped(pid_t pid) {
 }
 
 void resume(pid_t pid) {
-    signalOne(pid, SIGCONT);
+    // One that is just ending may search for leaks, for which another process stops its threads: this signal would undo
+    // that, and the search would wait for ever.
+    if (isStopped(pid)) {
+        signalOne(pid, SIGCONT);
+    }
 }
 
 std::map<int, std::string> descriptorsOf(pid_t pid) {
