@@ -49,7 +49,7 @@ ROOMS = (
     Room("src/qvm_services/krutil_protobuf", ("*.cpp", "*.hpp"), "krutil_protobuf_code",
          ("tests/krutil_protobuf/krutil_serializers_test",)),
     Room(SESSION, ("Exchanges.cpp", "FrameHeader.cpp", "Incoming.cpp", "WireWalk.cpp"), "krutil_platform_code",
-         ("tests/platform/session_parts_test", "tests/platform/session_test")),
+         ("tests/platform/session_parts_test", "tests/platform/session_memory_test", "tests/platform/session_test")),
 )
 
 

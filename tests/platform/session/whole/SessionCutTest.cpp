@@ -1,5 +1,8 @@
 // A whole session, cut at each of its bytes.
 
+#include <pty.h>
+#include <termios.h>
+
 #include <thread>
 
 #include "platform/session/support/TestSessions.hpp"
@@ -62,6 +65,34 @@ TEST_F(SessionCutTest, WhatAClientSays) {
     EXPECT_EQ(cutAt(Role::Engine, bytes, bytes.size()),
               (std::vector<std::string>{"question 1 first", "event 0 capabilities", "question 2 second", "goodbye"}));
     cutEverywhere(Role::Engine, bytes);
+}
+
+// A terminal that was hung up fails to be read, unlike a socket.
+TEST_F(SessionCutTest, ReadThatFailsEndsTheSessionWithTheReason) {
+    int hangsUp = -1;
+    int fails = -1;
+    ASSERT_EQ(::openpty(&fails, &hangsUp, nullptr, nullptr, nullptr), 0);
+    termios settings{};
+    ::tcgetattr(hangsUp, &settings);
+    ::cfmakeraw(&settings);
+    ::tcsetattr(hangsUp, TCSANOW, &settings);
+    SessionWithBytes end(configOf(Role::Engine), {fails, fails, hangsUp, hangsUp});
+    end.peer->write(wire::tagged(1, 1, true, questionTag, "first"));
+    end.saw.waitForLines(1);
+    end.peer->close();
+    EXPECT_THAT(end.saw.waitForEnd(), isEnd(Reason::Lost, "cannot read from the stream: Input/output error"));
+}
+
+// A read that gets as much as it asked for is followed by one that finds nothing and leaves an error number behind.
+TEST_F(SessionCutTest, StreamThatEndsLongAfterAReadThatFoundNothing) {
+    constexpr std::size_t askedFor = 4096;
+    SessionWithBytes end(configOf(Role::Engine));
+    const std::string whole = wire::tagged(1, 1, true, questionTag, "");
+    end.peer->write(wire::tagged(1, 1, true, questionTag, std::string(askedFor - whole.size(), 'q')));
+    end.saw.waitForLines(1);
+    end.peer->closeWriting();
+    EXPECT_THAT(end.saw.waitForEnd(),
+                isEnd(Reason::Lost, "the stream ended between two messages, without the client's goodbye"));
 }
 
 }  // namespace
