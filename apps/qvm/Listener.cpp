@@ -142,6 +142,9 @@ Listener::Listener(const Options& options, Log& log, int socket)
     const sigset_t watched = watchedSignals();
     ::sigprocmask(SIG_BLOCK, &watched, nullptr);
     try {
+        if (options_.sessionProcesses > 0) {
+            groups_.emplace(options_.sessionProcesses);
+        }
         preparePython(options_.python);
         // Made once, before sessions are forked.
         apps::precheck(!options_.noPrecheck);
@@ -316,6 +319,9 @@ void Listener::serve(int connection, posix::OwnedDescriptor ours, posix::OwnedDe
     }
     if (child > 0) {
         seats_.add(child, std::move(ours));
+        if (groups_) {
+            groups_->begun(child);
+        }
         ::close(connection);
         return;
     }
@@ -329,6 +335,9 @@ void Listener::serve(int connection, posix::OwnedDescriptor ours, posix::OwnedDe
     log_.startOver();
     connection_ = connection;
     seat_.emplace(std::move(theirs), options_.maxSessions, Seats::maxHandshakes, options_.handshakeTimeout);
+    if (groups_) {
+        groups_->join();
+    }
 }
 
 void Listener::refuse(int connection, const std::string& refusal) {
@@ -360,6 +369,9 @@ void Listener::reap() {
             return;
         }
         seats_.remove(child);
+        if (groups_) {
+            groups_->ended(child);
+        }
         if (WIFEXITED(status) && WEXITSTATUS(status) == static_cast<int>(ExitCode::Silent)) {
             countSilent();
         }

@@ -14,6 +14,7 @@
 #include "qvm/process/Log.hpp"
 #include "qvm/process/Seat.hpp"
 #include "qvm/process/Seats.hpp"
+#include "qvm/process/SessionGroups.hpp"
 
 namespace qvm {
 
@@ -61,6 +62,7 @@ class Listener {
     int signals_ = -1;
     ino_t inode_ = 0;
     Seats seats_;
+    std::optional<SessionGroups> groups_;  // with --limit-processes
     // Anybody who may connect could fill the log with these.
     apps::RateLimit refusals_{10, std::chrono::minutes(1)};
     apps::RateLimit silent_{1, std::chrono::hours(1)};

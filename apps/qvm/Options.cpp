@@ -9,6 +9,7 @@
 #include "common/HelpFormatter.hpp"
 #include "common/LimitOptions.hpp"
 #include "common/RecordOptions.hpp"
+#include "qvm/process/SessionGroups.hpp"
 #include "qvm/process/StandardDescriptors.hpp"
 
 namespace qvm {
@@ -85,6 +86,12 @@ OptionTable::OptionTable() {
         ->type_name("COUNT")
         ->capture_default_str()
         ->group(sessions);
+    app.add_option("--limit-processes", options.sessionProcesses,
+                   "Processes and threads that a session may have at a time; with --listen or --listen-fds, where a "
+                   "control group is delegated to the engine. Without this option they are not bounded")
+        ->check(CLI::Range(smallestProcessLimit, largestProcessLimit))
+        ->type_name("COUNT")
+        ->group(sessions);
 
     app.add_flag("--no-zero-copy", options.noZeroCopy,
                  "Copy arrays into their messages, as QX_DISABLE_ZEROCOPY=1 does; clients must do the same")
@@ -145,6 +152,9 @@ Options parseOptions(int argc, const char* const* argv) {
         }
         if (options.stdio && !options.allowUsers.empty()) {
             throw CLI::ValidationError("--allow-user goes with --listen or --listen-fds");
+        }
+        if (options.stdio && options.sessionProcesses > 0) {
+            throw CLI::ValidationError("--limit-processes goes with --listen or --listen-fds");
         }
     } catch (const CLI::ParseError& error) {
         const int status = table.app.exit(error);

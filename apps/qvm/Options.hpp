@@ -3,6 +3,7 @@
 
 #include <chrono>
 #include <cstddef>
+#include <cstdint>
 #include <functional>
 #include <string>
 #include <vector>
@@ -31,6 +32,7 @@ struct Options {
     bool noPrecheck = false;       ///< numbers that end the process are not looked for in what arrives
     std::size_t maxSessions = 64;  ///< sessions at a time of a listening engine
     SessionLimits session = usualSessionLimits();
+    std::uint64_t sessionProcesses = 0;  ///< processes and threads of each session of a listening engine; 0: any number
     std::chrono::milliseconds handshakeTimeout{10'000};
     PythonConfig python;         ///< its program is empty when the command line names none
     std::string diary;           ///< file that text of sinks with the diary trait is appended to; empty for none

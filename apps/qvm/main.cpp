@@ -5,6 +5,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <exception>
+#include <stdexcept>
 #include <string>
 
 #include "KrutilProtocol.hpp"
@@ -42,6 +43,11 @@ ExitCode serve(const qvm::Options& options, qvm::Log& log) {
     if (options.listenFds) {
         const qvm::InheritedSocket socket = qvm::takeInheritedSocket();
         qvm::giveToRunningCode();
+        if (!socket.listens && options.sessionProcesses > 0) {
+            throw std::runtime_error(
+                "--limit-processes goes with a socket that listens, and a connection was handed over. Let the service "
+                "manager bound this process, for example with TasksMax=.");
+        }
         if (!socket.listens) {
             return serveConnection(socket.descriptor, options, log);
         }

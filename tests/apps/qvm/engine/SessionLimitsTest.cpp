@@ -2,15 +2,18 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/resource.h>
+#include <sys/socket.h>
 #include <sys/sysinfo.h>
 
 #include <algorithm>
+#include <array>
 #include <cstdint>
 #include <memory>
 #include <string>
 #include <vector>
 
 #include "apps/qvm/fixture/EngineFixture.hpp"
+#include "foundation/core/posix/OwnedDescriptor.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 namespace qvm_test {
@@ -76,6 +79,33 @@ TEST_F(SessionLimitsTest, EachSessionOfAListenerHasThem) {
         EXPECT_EQ(limit(client, "RLIMIT_DATA"), "1073741824 1073741824\n");
         EXPECT_EQ(limit(client, "RLIMIT_NOFILE"), "200 200\n");
     }
+}
+
+TEST_F(SessionLimitsTest, ProcessesAreBoundedByAListenerOnly) {
+    EngineProcess engine({"--stdio", "--limit-processes", "20"});
+    EXPECT_EQ(engine.wait(), 2);
+    EXPECT_EQ(engine.stderrText(),
+              "--limit-processes goes with --listen or --listen-fds\nRun with --help for more information.\n");
+}
+
+TEST_F(SessionLimitsTest, ProcessesOfAConnectionAreBoundedByItsServiceManager) {
+    std::array<int, 2> pair{};
+    ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair.data()), 0);
+    const foundation::core::posix::OwnedDescriptor client(pair[0]);
+    const foundation::core::posix::OwnedDescriptor connection(pair[1]);
+    EngineProcess engine({"--listen-fds", "--limit-processes", "20"}, connection.get());
+    EXPECT_EQ(engine.wait(), 3);
+    EXPECT_EQ(
+        engine.stderrText(),
+        "krutil-qvm: --limit-processes goes with a socket that listens, and a connection was handed over. Let the "
+        "service manager bound this process, for example with TasksMax=.\n");
+}
+
+TEST_F(SessionLimitsTest, AnEngineHasProcessesOfItsOwn) {
+    EngineProcess engine({"--listen", path_, "--limit-processes", "15"});
+    EXPECT_EQ(engine.wait(), 2);
+    EXPECT_EQ(engine.stderrText(),
+              "--limit-processes: Value 15 not in range 16 to 4194304\nRun with --help for more information.\n");
 }
 
 TEST_F(SessionLimitsTest, AMemoryLimitLeavesMathematicsAlone) {
