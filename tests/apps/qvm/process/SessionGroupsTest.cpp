@@ -25,12 +25,12 @@ using test_support::contentOf;
 class SessionGroupsTest : public testing::Test {
   protected:
     SessionGroupsTest() {
-        put("self/cgroup", "4:memory:/other\n0::/user/engine\n");
+        put("self/cgroup", "4:memory:/other\n0::/run/engine\n");
         mounts("/");
-        put("mount/user/engine/cgroup.controllers", "cpu pids io\n");
-        put("mount/user/engine/cgroup.subtree_control", "\n");
-        put("mount/user/engine/cgroup.procs", "");
-        put("mount/user/engine/krutil-listener/cgroup.procs", "");
+        put("mount/run/engine/cgroup.controllers", "cpu pids io\n");
+        put("mount/run/engine/cgroup.subtree_control", "\n");
+        put("mount/run/engine/cgroup.procs", "");
+        put("mount/run/engine/krutil-listener/cgroup.procs", "");
         prepare(::getpid());
     }
 
@@ -50,9 +50,9 @@ class SessionGroupsTest : public testing::Test {
         put(group(session) + "/cgroup.procs", "");
     }
 
-    static std::string group(pid_t session) { return "mount/user/engine/krutil-session-" + std::to_string(session); }
+    static std::string group(pid_t session) { return "mount/run/engine/krutil-session-" + std::to_string(session); }
 
-    std::string in(const std::string& name) const { return contentOf(directory_.file("mount/user/engine/" + name)); }
+    std::string in(const std::string& name) const { return contentOf(directory_.file("mount/run/engine/" + name)); }
 
     bool has(pid_t session) const { return std::filesystem::exists(directory_.file(group(session))); }
 
@@ -103,8 +103,8 @@ TEST_F(SessionGroupsTest, ASessionIsBoundedBeforeItRuns) {
 }
 
 TEST_F(SessionGroupsTest, AMountMayShowAPartOfTheGroups) {
-    mounts("/user");
-    put("self/cgroup", "0::/user/user/engine\n");
+    mounts("/run");
+    put("self/cgroup", "0::/run/run/engine\n");
     const SessionGroups made = groups();
     EXPECT_EQ(in("krutil-listener/cgroup.procs"), "0");
 }
@@ -143,12 +143,12 @@ TEST_F(SessionGroupsTest, TheEndMakesAllAsItWas) {
         prepare(1);
         made.begun(1);
         empty(1);
-        std::filesystem::remove(directory_.file("mount/user/engine/krutil-listener/cgroup.procs"));
+        std::filesystem::remove(directory_.file("mount/run/engine/krutil-listener/cgroup.procs"));
     }
     EXPECT_FALSE(has(1));
     EXPECT_EQ(in("cgroup.subtree_control"), "-pids");
     EXPECT_EQ(in("cgroup.procs"), "0");
-    EXPECT_FALSE(std::filesystem::exists(directory_.file("mount/user/engine/krutil-listener")));
+    EXPECT_FALSE(std::filesystem::exists(directory_.file("mount/run/engine/krutil-listener")));
 }
 
 TEST_F(SessionGroupsTest, WhatIsLeftOfASessionStaysBounded) {
@@ -191,7 +191,7 @@ TEST_F(SessionGroupsTest, ASessionThatCannotBeBoundedSaysSo) {
 }
 
 TEST_F(SessionGroupsTest, EachStepThatFailsSaysWhereAndWhy) {
-    const std::string top = "mount/user/engine/";
+    const std::string top = "mount/run/engine/";
     std::filesystem::remove(directory_.file(top + "cgroup.subtree_control"));
     EXPECT_EQ(refusal(), "Cannot read \"" + top + "cgroup.subtree_control\": No such file or directory");
     // Opened to be read only.
@@ -212,12 +212,12 @@ TEST_F(SessionGroupsTest, EachStepThatFailsSaysWhereAndWhy) {
     EXPECT_EQ(refusal(), "\"" + top + "cgroup.controllers\" has \"cpu rpids\", and not \"pids\"");
     std::filesystem::remove_all(directory_.file("mount"));
     EXPECT_EQ(refusal(), "Cannot read \"" + top + "cgroup.controllers\": No such file or directory");
-    mounts("/use");
+    mounts("/ru");
     EXPECT_EQ(refusal(),
-              "\"self/mountinfo\" has no mount of the type \"cgroup2\" that shows the group \"/user/engine\"");
+              "\"self/mountinfo\" has no mount of the type \"cgroup2\" that shows the group \"/run/engine\"");
     std::filesystem::remove(directory_.file("self/mountinfo"));
     EXPECT_EQ(refusal(), "Cannot read \"self/mountinfo\": No such file or directory");
-    put("self/cgroup", "1:pids:/user/engine\n");
+    put("self/cgroup", "1:pids:/run/engine\n");
     EXPECT_EQ(refusal(), "\"self/cgroup\" has no line that begins with \"0::/\", the group of version 2");
     std::filesystem::remove(directory_.file("self/cgroup"));
     EXPECT_EQ(refusal(), "Cannot read \"self/cgroup\": No such file or directory");
