@@ -185,7 +185,7 @@ TEST_F(SessionGroupsTest, ASessionThatCannotBeBoundedSaysSo) {
     std::filesystem::remove(directory_.file(group(::getpid()) + "/cgroup.procs"));
     EXPECT_THAT([&] { made.join(); },
                 testing::ThrowsMessage<std::system_error>(expected + "No such file or directory"));
-    std::filesystem::remove_all(directory_.file("mount/user"));
+    std::filesystem::remove_all(directory_.file("mount/run"));
     EXPECT_THAT([&] { made.join(); },
                 testing::ThrowsMessage<std::system_error>(expected + "No such file or directory"));
 }
