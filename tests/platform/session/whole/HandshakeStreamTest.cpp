@@ -287,6 +287,9 @@ TEST_F(HandshakeTest, DescriptorThatIsNotOneIsRefused) {
 
 // Each direction of a stream needs one of its own.
 TEST_F(HandshakeTest, StreamForWhichThereIsNoSecondDescriptorIsRefused) {
+#if defined(KRUTIL_SANITIZED)
+    GTEST_SKIP() << "the undefined-behaviour sanitizer needs a descriptor to look at an object's type";
+#endif
     const Ends ends = socketPair();
     const foundation::core::posix::OwnedDescriptor other(ends.otherIn);
     struct rlimit before {};
