@@ -154,7 +154,9 @@ class Inspection {
         if (*options_.html == "-") {
             out_.write(page);
         } else {
-            NewFile(*options_.html).write(page);
+            NewFile file(*options_.html);
+            file.write(page);
+            file.keep();
         }
     }
 

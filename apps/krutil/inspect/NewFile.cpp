@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <system_error>
@@ -19,6 +20,12 @@ NewFile::NewFile(std::string name)
       file_(::open(name_.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOCTTY | O_CLOEXEC, S_IRUSR | S_IWUSR)) {
     if (!file_) {
         fail("create");
+    }
+}
+
+NewFile::~NewFile() {
+    if (!kept_) {
+        ::unlink(name_.c_str());
     }
 }
 

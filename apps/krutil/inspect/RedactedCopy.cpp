@@ -43,6 +43,8 @@ class Copy {
         }
     }
 
+    void keep() noexcept { file_.keep(); }
+
   private:
     // "client 123", and nothing behind.
     static std::string redactedProcess(const std::string& process) {
@@ -73,6 +75,7 @@ std::optional<std::string> redactRecording(const std::string& file, const std::s
             redact(*unit);
             copy.add(*unit);
         }
+        copy.keep();
         return reader.unfinished();
     } catch (const apps::RecordingError& error) {
         throw Failure(ExitCode::Usage, error.what());
