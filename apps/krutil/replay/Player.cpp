@@ -3,7 +3,9 @@
 #include <fcntl.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <map>
+#include <system_error>
 #include <utility>
 
 #include "krutil/base/ExitCode.hpp"
@@ -20,13 +22,22 @@ struct Exchange {
     long missing = 0;  ///< milestones that the engine has still to say
 };
 
+posix::OwnedDescriptor duplicateOf(int stream) {
+    posix::OwnedDescriptor made(::fcntl(stream, F_DUPFD_CLOEXEC, 0));
+    if (!made) {
+        throw Failure(ExitCode::Stream,
+                      "no descriptor to write to the engine: " + std::generic_category().message(errno));
+    }
+    return made;
+}
+
 class Player {
   public:
     Player(int stream, const Talk& talk, std::chrono::milliseconds patience, Interrupt& interrupt)
         : talk_(talk),
           patience_(patience),
-          stream_(posix::OwnedDescriptor(stream), posix::OwnedDescriptor(::fcntl(stream, F_DUPFD_CLOEXEC, 0)),
-                  "the engine", interrupt, [this](Said said) { hear(std::move(said)); }) {}
+          stream_(posix::OwnedDescriptor(stream), duplicateOf(stream), "the engine", interrupt,
+                  [this](Said said) { hear(std::move(said)); }) {}
 
     void shakeHands(std::chrono::milliseconds timeout) {
         const auto deadline = Clock::now() + timeout;

@@ -9,6 +9,7 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <system_error>
 #include <utility>
 
 #include "common/FrameBytes.hpp"
@@ -153,9 +154,11 @@ void SaidStream::writeSome() {
     const ssize_t written = ::write(outDescriptor_.get(), out_.data() + written_, out_.size() - written_);
     if (written > 0) {
         written_ += static_cast<std::size_t>(written);
-    } else if (errno != EAGAIN && errno != EINTR) {
+    } else if (errno == EPIPE || errno == ECONNRESET) {
         // The other end may have said why.
         written_ = out_.size();
+    } else if (errno != EAGAIN && errno != EINTR) {
+        throw Failure(ExitCode::Stream, "cannot write to " + peer_ + ": " + std::generic_category().message(errno));
     }
     if (written_ == out_.size()) {
         out_.clear();

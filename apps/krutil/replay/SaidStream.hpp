@@ -39,7 +39,8 @@ class SaidStream {
     Verdict readVerdict(Clock::time_point deadline);
 
     /// Writes and reads until `done`, or until the deadline, or until the other end has closed its direction and all is
-    /// written. Returns whether it is done. Throws Cancelled on Ctrl-C, and Failure for what is no frame.
+    /// written. Returns whether it is done. Throws Cancelled on Ctrl-C, and Failure for what is no frame and
+    /// where nothing can be written to an end that is there.
     bool run(Clock::time_point deadline, const std::function<bool()>& done);
 
     /// Writes what is left, ends this direction, and waits until the other end has closed its own. What comes meanwhile
