@@ -253,7 +253,10 @@ class LineEditor::Impl {
             if (got < 0 && (errno == EINTR || errno == EAGAIN)) {
                 continue;
             }
-            if (got <= 0) {
+            if (got < 0) {
+                failReading();
+            }
+            if (got == 0) {
                 return 0;
             }
             if (byte == '\0') {

@@ -5,8 +5,15 @@
 
 #include <array>
 #include <cerrno>
+#include <system_error>
+
+#include "krutil/base/ExitCode.hpp"
 
 namespace krutil_client {
+
+void failReading() {
+    throw Failure(ExitCode::Usage, "cannot read standard input: " + std::generic_category().message(errno));
+}
 
 bool isLineDropped(const std::exception_ptr& error) {
     try {
@@ -59,7 +66,9 @@ ReadLine LineReader::readOn(const std::function<bool()>& done) {
         const auto got = ::read(fd_, piece.data(), piece.size());
         if (got > 0) {
             rest_.append(piece.data(), static_cast<std::size_t>(got));
-        } else if (got == 0 || (errno != EINTR && errno != EAGAIN)) {
+        } else if (got < 0 && errno != EINTR && errno != EAGAIN) {
+            failReading();
+        } else if (got == 0) {
             if (!rest_.empty()) {
                 return {ReadLine::End::Newline, std::exchange(rest_, {})};
             }

@@ -30,6 +30,10 @@ struct ReadLine {
     std::string text;
 };
 
+/// Throws Failure (Usage) for a read of standard input that has failed, with the reason in errno. An error is no end of
+/// input: what comes behind it would be lost without a word.
+[[noreturn]] void failReading();
+
 /// Reads lines from a descriptor. What arrives in the session is delivered while it waits, and Ctrl-C is dispatched.
 /// Main thread only.
 class LineReader {
@@ -38,8 +42,8 @@ class LineReader {
     LineReader(int fd, Conversation& conversation, Output& out);
 
     /// Shows `prompt` and reads a line until `done` returns true. What a terminal holds of a line that is not wanted
-    /// any more is dropped. Throws what Conversation::run() and Output::write() throw. Whatever ends it, a terminal is
-    /// at the beginning of a line then.
+    /// any more is dropped. Throws Failure (Usage) where it cannot be read, and what Conversation::run() and
+    /// Output::write() throw. Whatever ends it, a terminal is at the beginning of a line then.
     ReadLine read(const std::string& prompt, const std::function<bool()>& done);
 
   private:
