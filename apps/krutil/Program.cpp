@@ -332,6 +332,8 @@ int runProgram(int argc, const char* const* argv) {
     std::signal(SIGPIPE, SIG_IGN);
     // A file that must not grow any more is one, too.
     std::signal(SIGXFSZ, SIG_IGN);
+    // Whoever ignores this one has the program begin so, and it would not see how its engine ends.
+    std::signal(SIGCHLD, SIG_DFL);
     apps::installProtobufLog();
     if (std::get<Options>(parsed).connection.noZeroCopy) {
         // Before the first serializer asks; an engine that is started here inherits it.

@@ -101,6 +101,8 @@ int main(int argc, char** argv) {
         ::signal(SIGPIPE, SIG_IGN);
         // A file that must not grow any more is an error of a write.
         ::signal(SIGXFSZ, SIG_IGN);
+        // Whoever ignores this one has the program begin so, and code would not see how processes that it starts end.
+        ::signal(SIGCHLD, SIG_DFL);
         qvm::Log log(options.log);
         apps::installProtobufLog();
         if (options.noZeroCopy) {
@@ -108,7 +110,7 @@ int main(int argc, char** argv) {
             ::setenv("QX_DISABLE_ZEROCOPY", "1", 1);
         }
         const char* const environment = options.python.isolated ? nullptr : std::getenv("VIRTUAL_ENV");
-        options.python.program = qvm::choosePython(options.python.program, environment != nullptr ? environment : "");
+        options.python.program = qvm::choosePython(options.namedPython, environment != nullptr ? environment : "");
         krutil::protobuf::KrutilProtocol::init();
         leave(serve(options, log), log);
     } catch (const std::exception& error) {
