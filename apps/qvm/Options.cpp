@@ -104,8 +104,10 @@ OptionTable::OptionTable() {
         ->group(sessions);
 
     const std::string python = "Python";
-    app.add_option("--python", options.python.program,
-                   "Interpreter whose packages code finds; otherwise bin/python3 of VIRTUAL_ENV, or the system's")
+    app.add_option(
+           "--python", options.namedPython,
+           "Interpreter whose packages code finds, also with --isolated; otherwise bin/python3 of VIRTUAL_ENV, or "
+           "the system's")
         ->type_name("FILE")
         ->group(python);
     app.add_flag("--isolated", options.python.isolated,

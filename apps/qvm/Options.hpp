@@ -5,6 +5,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <functional>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -34,7 +35,8 @@ struct Options {
     SessionLimits session = usualSessionLimits();
     std::uint64_t sessionProcesses = 0;  ///< processes and threads of each session of a listening engine; 0: any number
     std::chrono::milliseconds handshakeTimeout{10'000};
-    PythonConfig python;         ///< its program is empty when the command line names none
+    std::optional<std::string> namedPython;  ///< an interpreter, where the command line names one
+    PythonConfig python;                     ///< its program is chosen after the command line has been read
     std::string diary;           ///< file that text of sinks with the diary trait is appended to; empty for none
     apps::RecordOptions record;  ///< a listening engine adds the number of a session's process to the file's name
     std::string log;  ///< file of the engine's own messages and of sinks with the logging trait; empty for none

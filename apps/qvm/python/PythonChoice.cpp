@@ -70,14 +70,16 @@ Version versionOf(const fs::path& program) {
 
 }  // namespace
 
-std::string choosePython(const std::string& asked, const std::string& environment) {
-    if (asked.empty() && environment.empty()) {
+std::string choosePython(const std::optional<std::string>& asked, const std::string& environment) {
+    if (!asked && environment.empty()) {
         return QVM_PYTHON_EXECUTABLE;
     }
-    const std::string source = asked.empty() ? "VIRTUAL_ENV names" : "--python names";
+    const std::string source = !asked ? "VIRTUAL_ENV names" : "--python names";
     const std::string advice =
         std::string("; choose a Python ") + embeddedVersion() + ", such as --python " + QVM_PYTHON_EXECUTABLE;
-    const fs::path program = fs::absolute(asked.empty() ? fs::path(environment) / "bin" / "python3" : fs::path(asked));
+    const fs::path named = asked ? fs::path(*asked) : fs::path(environment) / "bin" / "python3";
+    // An empty name has no absolute form.
+    const fs::path program = named.empty() ? named : fs::absolute(named);
     const auto refuse = [&](const std::string& why) {
         return std::runtime_error(source + " \"" + program.string() + "\", " + why + advice);
     };

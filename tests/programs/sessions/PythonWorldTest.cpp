@@ -62,7 +62,17 @@ TEST_F(PythonWorldTest, PackagesAreThoseOfTheInterpreterThatIsNamed) {
     const std::string code = "import of_venv, sys\nprint(of_venv.name, sys.prefix, sys.executable)";
     const std::string expected = "of the environment " + file("venv") + " " + interpreter() + "\n";
     EXPECT_EQ(evalWith("--python " + quotedForShell(interpreter()), code).out, expected);
-    EXPECT_EQ(evalWith("--isolated --python " + quotedForShell(interpreter()), code).out, expected);
+}
+
+TEST_F(PythonWorldTest, InterpreterThatIsNamedCountsForAnIsolatedEngineToo) {
+    write(script("sibling.py"), "");
+    const std::string code =
+        "import importlib.util, sys\n"
+        "print(sys.prefix, [importlib.util.find_spec(name) is not None for name in ('of_venv', 'sibling')])";
+    const std::vector<std::string> environment{"PYTHONPATH=" + file("scripts"), "VIRTUAL_ENV=" + file("other")};
+    const std::string python = "--python " + quotedForShell(interpreter());
+    EXPECT_EQ(evalWith(python, code, environment).out, file("venv") + " [True, True]\n");
+    EXPECT_EQ(evalWith(python + " --isolated", code, environment).out, file("venv") + " [True, False]\n");
 }
 
 TEST_F(PythonWorldTest, WithoutOneTheActiveVirtualEnvironmentCounts) {
@@ -78,6 +88,7 @@ TEST_F(PythonWorldTest, InterpreterThatDoesNotFitIsRefused) {
     const std::string other = file("other/bin/python3");
     expectRefusal(evalWith("--python " + quotedForShell(other), "1"),
                   "--python names \"" + other + "\", which is not there");
+    expectRefusal(evalWith("--python ''", "1"), "--python names \"\", which is not there");
     expectRefusal(evalWith("", "1", {"VIRTUAL_ENV=" + file("other")}),
                   "VIRTUAL_ENV names \"" + other + "\", which is not there");
     expectRefusal(evalWith("--python " + quotedForShell(file("venv/pyvenv.cfg")), "1"),
