@@ -42,6 +42,7 @@ peer_packages=(
 ecosystem_packages=(
     python3-ipykernel python3-jupyter-client python3-nbclient jupyter-notebook  # notebooks
     chromium chromium-driver python3-selenium                                   # the page of a notebook
+    python3-pandas                                                              # frames, whose columns are completed
     python3-distributed                                                         # clusters
     python3-matplotlib
     tshark                                                                      # recordings of sessions

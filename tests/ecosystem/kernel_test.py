@@ -217,6 +217,26 @@ class CellsTest(WithKernel):
         self.assertEqual(error["ename"], "SyntaxError")
         self.assertRegex(error["evalue"], r"\Ainvalid syntax \(<eval-[0-9]+>, line 1\)\Z")
 
+    def test_commands_of_other_kernels(self):
+        percent = ["Lines are Python. There are no commands that begin with %."]
+        for code, hint in (("%matplotlib inline", percent), ("%%time\n1 + 1", percent),
+                           ('x = 1\n! ls -l "a b" \n', [
+                               "Lines are Python. This runs a command where the engine is:",
+                               '    import subprocess; subprocess.run("ls -l \\"a b\\"", shell=True)']),
+                           ("1 +\n'%'", []), ('"""\n%d\n""" % "x"', [])):
+            cell = self.run_cell(code)
+            error, = cell.of("error")
+            lines = [COLOURS.sub("", line) for line in error["traceback"]]
+            last = max(i for i, line in enumerate(lines) if re.match("(Syntax|Type)Error: ", line))
+            self.assertEqual((lines[last + 1:], cell.reply["traceback"]), (hint, error["traceback"]))
+
+    def test_columns_of_a_frame(self):
+        self.run_cell("import pandas\nframe = pandas.DataFrame({'depth': [1], 'two words': [2], 7: [3]})")
+        for code, word, matches in (("frame.dep", "dep", ["depth"]), ("frame.descr", "descr", ["describe"]),
+                                    ("frame['", "'", ["'depth'", "'two words'"]), ("frame['t", "'t", ["'two words'"])):
+            answer = self.answer(self.client.complete(code, len(code)))
+            self.assertEqual((answer["matches"], answer["cursor_start"]), (matches, len(code) - len(word)), code)
+
     def test_warnings(self):
         cell = self.run_cell("import warnings\nwarnings.warn('careful', FutureWarning)")
         self.assertRegex(cell.text("stderr"), r"\A<eval-[0-9]+>:2: FutureWarning: careful\n\Z")

@@ -27,6 +27,10 @@ _IGNORE, _OPTIONAL, _REQUIRED = 0, 1, 3
 _NUMBER = struct.Struct("<I")
 
 
+class _Silence(Exception):
+    """The stream has ended with nothing on it."""
+
+
 class Settled(NamedTuple):
     """What a handshake has come to."""
 
@@ -61,6 +65,8 @@ def shake_hands(connection: socket.socket, process: "Optional[subprocess.Popen[b
         raise Aborted(f"the engine broke the protocol: {violation}") from None
     except EndOfStream as end:
         raise Lost(f"the engine has gone{how_it_ended(process)} during the handshake: {end}") from None
+    except _Silence:
+        raise Lost(f"the engine has gone{how_it_ended(process)} before it said anything") from None
     except TimeoutError:
         raise Lost(f"the engine did not finish the handshake within {timeout:g} seconds") from None
     if not shares:
@@ -126,12 +132,17 @@ def _hello(limits: Limits, capabilities: list[int]) -> Any:
 
 def _read_hello(reader: Reader) -> tuple[int, Any]:
     for place, expected in enumerate(MAGIC):
-        got = bytes(reader.read(1, "the engine's first message"))
+        try:
+            got = bytes(reader.read(1, "the engine's first message"))
+        except EndOfStream:
+            if place == 0:
+                raise _Silence from None
+            raise EndOfStream("the beginning of the engine's first message", place, len(MAGIC)) from None
         if got[0] != expected:
             said = (MAGIC[:place] + got + reader.buffered())[:1000].decode("ascii", "backslashreplace").rstrip()
             raise Violation('the peer does not speak this protocol: expected a first message that begins with '
                             f'"\\x89KRUTIL\\n", got "{said}"')
-    layout = _NUMBER.unpack(reader.read(4, "the engine's first message"))[0]
+    layout = _NUMBER.unpack(reader.read(4, "the layout of the engine's first message"))[0]
     hello = _read_body(reader, SessionHello, "hello")
     if not hello.HasField("limits"):
         raise Violation("the peer's hello: expected the limits of the peer, got none")

@@ -5,6 +5,7 @@ cells, one after another; the control thread interrupts and ends; a third one pu
 """
 
 import base64
+import json
 import platform
 import re
 import sys
@@ -28,6 +29,7 @@ _SHUTDOWN = 3.0
 
 _RED, _GREEN, _CYAN, _PLAIN = "\x1b[0;31m", "\x1b[0;32m", "\x1b[0;36m", "\x1b[0m"
 _FRAME = re.compile(r'^(\s*File )(".*")(, line )(\d+)((?:, in )?)(.*)$')
+_SYNTAX_LINE = re.compile(r", line ([0-9]+)\)$")
 _ERROR_LINE = re.compile(r"^[\s|+-]*([A-Za-z_][\w.]*)(:\s.*)?$")
 
 
@@ -68,6 +70,7 @@ class EngineKernel(Kernel):
                     "user_expressions": expressions}
         except (Error, OSError) as error:
             content = self._error(error)
+            content["traceback"] += _hint(code, error)
             if not silent:
                 self._publish("error", content)
             return {"status": "error", "execution_count": self.execution_count, **content}
@@ -250,6 +253,18 @@ def coloured(text: str) -> list[str]:
             line = f"{line[:at]}{_RED}{error[1]}{_PLAIN}{error[2] or ''}"
         lines.append(line)
     return lines
+
+
+def _hint(code: str, error: Exception) -> list[str]:
+    """What to type for a line that other kernels take as a command."""
+    place = _SYNTAX_LINE.search(error.message) if isinstance(error, RemoteError) else None
+    line = next(iter(code.split("\n")[int(place[1]) - 1:]), "").strip() if place else ""
+    if line.startswith("%"):
+        return ["Lines are Python. There are no commands that begin with %."]
+    if line.startswith("!"):
+        return ["Lines are Python. This runs a command where the engine is:",
+                f"    import subprocess; subprocess.run({json.dumps(line[1:].strip(), ensure_ascii=False)}, shell=True)"]
+    return []
 
 
 def _bundle(display: Display) -> dict[str, str]:

@@ -75,6 +75,13 @@ class HandshakeTest(unittest.TestCase):
         self.violation(first(), struct.pack("<I", 1), b"\x08",
                        text="the peer's verdict: its 1 bytes are not a message of its type")
 
+    def test_stream_that_ends_in_the_first_message(self):
+        self.begin(error=krutil.Lost, text="the engine has gone before it said anything")
+        self.begin(MAGIC[:3], error=krutil.Lost, text="the engine has gone during the handshake: the stream ended after 3 "
+                                                      "of the 8 bytes of the beginning of the engine's first message")
+        self.begin(MAGIC, error=krutil.Lost, text="the engine has gone during the handshake: the stream ended after 0 of "
+                                                  "the 4 bytes of the layout of the engine's first message")
+
     def test_stream_that_ends_in_the_hello(self):
         self.begin(MAGIC, struct.pack("<II", 1, 10), b"abc", error=krutil.Lost,
                    text="the engine has gone during the handshake: the stream ended after 3 of the 10 bytes of the "
