@@ -11,7 +11,8 @@
 //     narrow                sockets and pipes take as little as the kernel lets them, so that they are full most of the
 //     time
 //
-// With KRUTIL_FAULTS_UNFORKED in the environment, processes that the program has forked work normally.
+// KRUTIL_FAULTS_IN says which processes: "first" are those that began with the program, "forked" those that it has
+// forked. Without it, both. Each process that is forked counts its own calls.
 //
 // A call site is the address to which the call returns, counted from the start of its module.
 #include <dlfcn.h>
@@ -22,10 +23,14 @@
 #include <sys/epoll.h>
 #include <sys/file.h>
 #include <sys/mman.h>
+#include <sys/resource.h>
 #include <sys/signalfd.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/uio.h>
+#include <sys/wait.h>
+#include <termios.h>
 #include <time.h>
 #include <unistd.h>
 
@@ -59,7 +64,7 @@ class Rule {
     // 0, or the error with which a call has to fail.
     int errorOf(std::string_view call, const void* returnsTo) {
         if ((kind_ != "list" && kind_ != "once" && kind_ != "later" && kind_ != "always") ||
-            (unforked_ && ::getpid() != first_)) {
+            (in_ == "first" && ::getpid() != first_) || (in_ == "forked" && ::getpid() == first_)) {
             return 0;
         }
         const std::optional<Dl_info> module = ownModule(returnsTo);
@@ -90,6 +95,9 @@ class Rule {
         if (program == program_invocation_short_name) {
             words >> kind_ >> argument_ >> error_;
         }
+        if (const char* const in = std::getenv("KRUTIL_FAULTS_IN"); in != nullptr) {
+            in_ = in;
+        }
     }
 
     // Where the call returns to, in this project's own code or in the streams of the standard library by which it
@@ -100,7 +108,9 @@ class Rule {
             return std::nullopt;
         }
         const std::string_view name = nameOf(info);
-        const bool ours = name.starts_with("krutil") || name.starts_with("libkrutil") || name.starts_with("libstdc++");
+        const bool ours =
+            (name.starts_with("krutil") || name.starts_with("libkrutil") || name.starts_with("libstdc++")) &&
+            name != "libkrutil_faults.so";
         return ours ? std::optional(info) : std::nullopt;
     }
 
@@ -134,7 +144,7 @@ class Rule {
     std::string kind_;
     std::string argument_;
     int error_ = 0;
-    const bool unforked_ = std::getenv("KRUTIL_FAULTS_UNFORKED") != nullptr;
+    std::string in_;
     // The first call comes before any fork: a program opens files when it begins.
     const pid_t first_ = ::getpid();
     std::atomic<unsigned> calls_{0};
@@ -147,8 +157,10 @@ Result callUnlessFailing(const char* call, const void* returnsTo, Result (*funct
                          Arguments... arguments) {
     if (const int error = Rule::get().errorOf(call, returnsTo); error != 0) {
         errno = error;
-        if constexpr (std::is_pointer_v<Result>) {
-            return static_cast<Result>(MAP_FAILED);
+        if constexpr (std::is_same_v<Result, void*>) {
+            return MAP_FAILED;
+        } else if constexpr (std::is_pointer_v<Result>) {
+            return nullptr;
         } else {
             return -1;
         }
@@ -295,6 +307,61 @@ extern "C" int signalfd(int descriptor, const sigset_t* signals, int flags) {
 KRUTIL_ORIGINAL(int, flock, int, int)
 extern "C" int flock(int descriptor, int operation) {
     return KRUTIL_CALL(flock, descriptor, operation);
+}
+
+KRUTIL_ORIGINAL(int, fchmod, int, mode_t)
+extern "C" int fchmod(int descriptor, mode_t mode) {
+    return KRUTIL_CALL(fchmod, descriptor, mode);
+}
+
+KRUTIL_ORIGINAL(int, setrlimit, __rlimit_resource_t, const rlimit*)
+extern "C" int setrlimit(__rlimit_resource_t resource, const rlimit* limit) noexcept {
+    return KRUTIL_CALL(setrlimit, resource, limit);
+}
+
+KRUTIL_ORIGINAL(int, madvise, void*, std::size_t, int)
+extern "C" int madvise(void* memory, std::size_t size, int advice) {
+    return KRUTIL_CALL(madvise, memory, size, advice);
+}
+
+KRUTIL_ORIGINAL(std::FILE*, fopen, const char*, const char*)
+extern "C" std::FILE* fopen(const char* path, const char* mode) {
+    return KRUTIL_CALL(fopen, path, mode);
+}
+
+KRUTIL_ORIGINAL(std::FILE*, fdopen, int, const char*)
+extern "C" std::FILE* fdopen(int descriptor, const char* mode) {
+    return KRUTIL_CALL(fdopen, descriptor, mode);
+}
+
+KRUTIL_ORIGINAL(int, mkostemp, char*, int)
+extern "C" int mkostemp(char* name, int flags) {
+    return KRUTIL_CALL(mkostemp, name, flags);
+}
+
+KRUTIL_ORIGINAL(int, tcsetattr, int, int, const termios*)
+extern "C" int tcsetattr(int descriptor, int actions, const termios* settings) {
+    return KRUTIL_CALL(tcsetattr, descriptor, actions, settings);
+}
+
+// What makes the descriptor of a process, which has no function of its own. The others are of the standard library.
+KRUTIL_ORIGINAL(long, syscall, long, long, long, long, long, long, long)
+extern "C" long syscall(long number, ...) noexcept {
+    va_list list;
+    va_start(list, number);
+    long all[6];
+    std::generate(std::begin(all), std::end(all), [&list] { return va_arg(list, long); });
+    va_end(list);
+    return number == SYS_pidfd_open ? KRUTIL_CALL(syscall, number, all[0], all[1], all[2], all[3], all[4], all[5])
+                                    : originalOfsyscall()(number, all[0], all[1], all[2], all[3], all[4], all[5]);
+}
+
+// A process's own children can be waited for; only the waiting may be interrupted.
+KRUTIL_ORIGINAL(pid_t, waitpid, pid_t, int*, int)
+extern "C" pid_t waitpid(pid_t child, int* status, int options) {
+    return (options & WNOHANG) == 0 && isInterrupted("waitpid", KRUTIL_RETURNS_TO)
+               ? -1
+               : originalOfwaitpid()(child, status, options);
 }
 
 KRUTIL_ORIGINAL(int, rename, const char*, const char*)

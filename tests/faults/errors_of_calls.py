@@ -15,6 +15,9 @@ ERRORS = {
     "signalfd": [errno.EMFILE], "flock": [errno.ENOLCK], "mkdir": [errno.ENOSPC],
     "connect": [errno.EAGAIN], "fcntl": [errno.EMFILE], "epoll_ctl": [errno.ENOMEM], "timer_create": [errno.EAGAIN],
     "lstat": [errno.EACCES], "rename": [errno.ENOSPC],
+    "fchmod": [errno.EPERM], "setrlimit": [errno.EPERM], "madvise": [errno.ENOMEM], "fopen": [errno.EMFILE],
+    "fdopen": [errno.ENOMEM], "mkostemp": [errno.EACCES, errno.ENOSPC], "tcsetattr": [errno.EIO],
+    "syscall": [errno.EMFILE],
 }
 
 

@@ -9,9 +9,13 @@ PROGRAM, krutil or krutil-qvm, is the one whose calls go wrong. LIBRARY makes th
 """
 
 import concurrent.futures
+import contextlib
 import os
 import pathlib
+import pty
 import re
+import select
+import shutil
 import subprocess
 import sys
 import tempfile
@@ -53,10 +57,9 @@ class Session:
         with tempfile.TemporaryDirectory() as directory:
             path = pathlib.Path(directory)
             command = self.command(path, code)
-            environment = dict(os.environ, LD_PRELOAD=LIBRARY, KRUTIL_FAULTS=f"{PROGRAM} {rule}")
+            environment = dict(os.environ, LD_PRELOAD=LIBRARY, KRUTIL_FAULTS=f"{PROGRAM} {rule}", XDG_STATE_HOME=directory)
             try:
-                ended = subprocess.run(command, stdin=subprocess.DEVNULL, capture_output=True, env=environment, text=True,
-                                       errors="backslashreplace", timeout=PATIENCE)
+                ended = self.run(command, environment)
             except subprocess.TimeoutExpired as expired:
                 self.code, self.output, self.errors = None, str(expired.stdout), str(expired.stderr)
             else:
@@ -68,6 +71,10 @@ class Session:
         return [CLIENT, "eval", "--record", path / "client.pcapng", "--trace-to", path / "trace", "--diary", "--log",
                 "--engine", f"{ENGINE} --stdio --isolated --diary {path}/diary --log {path}/log "
                             f"--record {path}/engine.pcapng", code]
+
+    def run(self, command: list, environment: dict) -> subprocess.CompletedProcess:
+        return subprocess.run(command, stdin=subprocess.DEVNULL, capture_output=True, env=environment, text=True,
+                              errors="backslashreplace", timeout=PATIENCE)
 
     def look(self, path: pathlib.Path) -> None:
         """At what it has left."""
@@ -127,6 +134,133 @@ class Call(Session):
         return super().fault() or (f"left {self.cut}, which are not whole" if self.cut else "")
 
 
+class WithRecording(Session):
+    """What is done with the recording of a session, and what it prints and writes when nothing goes wrong."""
+
+    recording: pathlib.Path
+    #: Lines that some of the faults bring about.
+    SAID: set = set()
+    OUTPUT = ""
+    WRITES = None
+    FILES = {"session.pcapng"}
+
+    @classmethod
+    def begin(cls, recording: pathlib.Path) -> None:
+        cls.recording = recording
+        whole = cls("nothing")
+        if (whole.code, whole.errors) != (0, ""):
+            raise AssertionError(str(whole))
+        cls.OUTPUT, cls.WRITES = whole.output, whole.written
+
+    def command(self, path: pathlib.Path, code: str) -> list:
+        shutil.copy(self.recording, path / "session.pcapng")
+        return [CLIENT, *self.words(path, path / "session.pcapng")]
+
+    def words(self, path: pathlib.Path, recording: pathlib.Path) -> list:
+        raise NotImplementedError
+
+    def look(self, path: pathlib.Path) -> None:
+        # A page names its recording.
+        name = str(path).encode()
+        self.written = (path / "written").read_bytes().replace(name, b"") if "written" in self.files else None
+
+    def is_whole(self) -> bool:
+        return self.output == self.OUTPUT and self.written == self.WRITES
+
+    def fault(self) -> str:
+        left = self.written not in (None, self.WRITES)
+        return super().fault() or ("left a part of what it writes" if left else "")
+
+
+class Inspection(WithRecording):
+    def words(self, path: pathlib.Path, recording: pathlib.Path) -> list:
+        return ["inspect", "--fields", recording]
+
+
+class Page(WithRecording):
+    FILES = {"session.pcapng", "written"}
+
+    def words(self, path: pathlib.Path, recording: pathlib.Path) -> list:
+        return ["inspect", "--html", path / "written", recording]
+
+
+class Redaction(Page):
+    def words(self, path: pathlib.Path, recording: pathlib.Path) -> list:
+        return ["inspect", "--redact", path / "written", recording]
+
+
+class Replay(WithRecording):
+    SAID = {"krutil: no descriptor to write to the engine: Too many open files",
+            "krutil: cannot write to the engine: No space left on device"}
+
+    def words(self, path: pathlib.Path, recording: pathlib.Path) -> list:
+        return ["replay", "--patience", "3", "--engine", f"{ENGINE} --stdio --isolated", recording]
+
+
+class ServedReplay(WithRecording):
+    """Calls go wrong at the end that plays the engine alone."""
+
+    SAID = {"krutil: cannot write to the client: No space left on device"}
+
+    def words(self, path: pathlib.Path, recording: pathlib.Path) -> list:
+        return ["eval", "--engine", f'KRUTIL_FAULTS="$OF_REPLAY" exec {CLIENT} replay --patience 3 --serve {recording}', CODE]
+
+    def run(self, command: list, environment: dict) -> subprocess.CompletedProcess:
+        ended = super().run(command, dict(environment, OF_REPLAY=environment["KRUTIL_FAULTS"], KRUTIL_FAULTS=""))
+        # How far the client has come is told in any case.
+        ended.stderr = re.sub(r"(?m)^\d of 2 messages of the client as in the recording\n", "", ended.stderr)
+        return ended
+
+
+class Typed(Session):
+    """The line editor at a terminal, with a history."""
+
+    KEYS = "6 * 7\r", "print('after')\r", "\x04"
+    FILES = {"krutil"}
+
+    def command(self, path: pathlib.Path, code: str) -> list:
+        return [CLIENT, "--color", "never", "--engine", f"{ENGINE} --stdio --isolated"]
+
+    def run(self, command: list, environment: dict) -> subprocess.CompletedProcess:
+        """Types the keys, each when the prompt is there again."""
+        ours, theirs = pty.openpty()
+        said = b""
+        keys = list(self.KEYS)
+        with tempfile.TemporaryFile() as errors:
+            process = subprocess.Popen(command, stdin=theirs, stdout=theirs, stderr=errors, start_new_session=True,
+                                       env=dict(environment, TERM="xterm"))
+            os.close(theirs)
+            with contextlib.closing(os.fdopen(ours, "r+b", buffering=0)) as terminal:
+                seen = 0
+                while select.select([terminal], [], [], PATIENCE)[0]:
+                    try:
+                        said += terminal.read(10_000)
+                    except OSError:
+                        break
+                    if keys and said.find(b">>> ", seen) >= 0:
+                        seen = len(said)
+                        terminal.write(keys.pop(0).encode())
+                else:
+                    process.kill()
+            code = process.wait()
+            if code == -9:
+                raise subprocess.TimeoutExpired(command, PATIENCE, said, os.pread(errors.fileno(), 10_000, 0))
+            return subprocess.CompletedProcess(command, code, said.decode(errors="backslashreplace"),
+                                               os.pread(errors.fileno(), 10_000, 0).decode(errors="backslashreplace"))
+
+    def look(self, path: pathlib.Path) -> None:
+        self.kept = sorted(os.listdir(path / "krutil")) if "krutil" in self.files else []
+
+    def is_whole(self) -> bool:
+        return "\n42\r\n" in self.output and "\nafter\r\n" in self.output
+
+    def fault(self) -> str:
+        return super().fault() or (f"left {self.kept}" if self.kept not in ([], ["history"]) else "")
+
+
+OF_THE_CLIENT = unittest.skipUnless(PROGRAM == "krutil", "the engine does the same for each client")
+
+
 class FaultsTest(unittest.TestCase):
     def test_bytes_one_at_a_time_change_nothing(self):
         session = Session("short")
@@ -140,24 +274,64 @@ class FaultsTest(unittest.TestCase):
         session = Session("narrow", MANY_LINES)
         self.assertEqual((session.code, session.output, session.errors), (0, ("long " * 20 + "\n") * 5000, ""))
 
-    def expect_each_call_site_may_fail(self, kind):
+    def expect_each_call_site_may_fail(self, kind, fewest=20):
         with tempfile.NamedTemporaryFile("r") as listed:
             session = kind(f"list {listed.name}")
             self.assertEqual((session.code, session.fault(), session.errors), (0, "", ""), str(session))
             sites = sorted(set(listed.read().split()))
-        self.assertGreater(len(sites), 20)
+        self.assertGreater(len(sites), fewest)
         tried = rules(sites, WAITING)
-        with concurrent.futures.ThreadPoolExecutor(len(os.sched_getaffinity(0))) as workers:
-            faults = [f"{rule}: {session.fault()}\n{session}" for rule, session in zip(tried, workers.map(kind, tried))
-                      if session.fault()]
+        with concurrent.futures.ThreadPoolExecutor(4 * len(os.sched_getaffinity(0))) as workers:
+            sessions = list(workers.map(kind, tried))
+        faults = [f"{rule}: {session.fault()}\n{session}" for rule, session in zip(tried, sessions) if session.fault()]
         self.assertEqual(faults, [], "\n\n".join(faults))
         eventually(all_have_ended, "the end of each process")
+        return {line for session in sessions for line in session.errors.splitlines()}
 
     def test_each_call_site_of_an_evaluation_may_fail(self):
         self.expect_each_call_site_may_fail(Session)
 
     def test_each_call_site_of_a_call_may_fail(self):
         self.expect_each_call_site_may_fail(Call)
+
+    @OF_THE_CLIENT
+    def test_each_call_site_with_a_recording_may_fail(self):
+        with tempfile.TemporaryDirectory() as directory:
+            recording = pathlib.Path(directory) / "session.pcapng"
+            subprocess.run([CLIENT, "eval", "--record", recording, "--engine", f"{ENGINE} --stdio --isolated", CODE],
+                           stdout=subprocess.DEVNULL, check=True)
+            for kind in Inspection, Page, Redaction, Replay, ServedReplay:
+                with self.subTest(kind.__name__):
+                    kind.begin(recording)
+                    said = self.expect_each_call_site_may_fail(kind, fewest=1)
+                    self.assertLessEqual(kind.SAID, said)
+
+    @OF_THE_CLIENT
+    def test_each_call_site_of_the_line_editor_may_fail(self):
+        said = self.expect_each_call_site_may_fail(Typed)
+        self.assertIn("krutil: cannot read standard input: Input/output error", said)
+
+    @OF_THE_CLIENT
+    def test_input_that_cannot_be_read_is_not_the_end_of_input(self):
+        directory = os.open("/", os.O_RDONLY)
+        self.addCleanup(os.close, directory)
+        ended = subprocess.run([CLIENT, "repl", "--engine", f"{ENGINE} --stdio --isolated"], stdin=directory,
+                               capture_output=True, text=True, timeout=PATIENCE)
+        self.assertEqual((ended.returncode, ended.stdout, ended.stderr),
+                         (2, "", "krutil: cannot read standard input: Is a directory\n"))
+
+    def test_whoever_ignores_the_ends_of_processes_does_not_hide_them(self):
+        ignoring = ["env", "--ignore-signal=CHLD"]
+        ends = "import subprocess; subprocess.run(['sh', '-c', 'exit 3']).returncode"
+        engine = f"{ENGINE} --stdio --isolated"
+        if PROGRAM == "krutil":
+            command = [*ignoring, CLIENT, "eval", "--engine", engine, "import os; os._exit(5)"]
+            expected = 3, "", "krutil: the engine exited with code 5 before it answered\n"
+        else:
+            command = [CLIENT, "eval", "--engine", f"{' '.join(ignoring)} {engine}", ends]
+            expected = 0, "3\n", ""
+        ended = subprocess.run(command, stdin=subprocess.DEVNULL, capture_output=True, text=True, timeout=PATIENCE)
+        self.assertEqual((ended.returncode, ended.stdout, ended.stderr), expected)
 
 
 if __name__ == "__main__":

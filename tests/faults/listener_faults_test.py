@@ -1,7 +1,11 @@
-"""An engine that listens, with system calls that go wrong at each of the listener's own call sites in turn.
+"""An engine that listens, with system calls that go wrong at each of the listener's own call sites in turn, and at each
+of those of the sessions that it has forked.
 
-Whatever goes wrong: either the listener ends with exit code 3 and one sentence, or it goes on, serves the next client,
-and SIGTERM ends it. It leaves neither its socket nor a process behind, and no descriptor of a session stays open.
+Whatever goes wrong in the listener: either it ends with exit code 3 and one sentence, or it goes on, serves the next
+client, and SIGTERM ends it. It leaves neither its socket nor a process behind, and no descriptor of a session stays open.
+
+Whatever goes wrong in a session: its client has all that it has asked for, or says what has happened; and the listener
+goes on as if nothing had been.
 
     listener_faults_test.py LIBRARY
 
@@ -11,10 +15,13 @@ LIBRARY makes calls go wrong (Faults.cpp). krutil and krutil-qvm are found in th
 import concurrent.futures
 import errno
 import os
+import re
 import subprocess
 import sys
 import tempfile
 import unittest
+
+import numpy
 
 from errors_of_calls import rules
 from eventually import PATIENCE, eventually
@@ -26,18 +33,19 @@ LIBRARY = sys.argv[1]
 WAITING = ("read@", "send@krutil-qvm")
 
 # What a session says whose client goes when its listener has.
-LEFT_SESSION = "krutil-qvm: the stream ended between two messages, without the client's goodbye"
+LEFT_SESSION = re.compile("krutil-qvm: (the stream ended between two messages, without the client's goodbye$"
+                          "|.* during the handshake\\b)")
 
 
 class FaultyListener(Listener):
     """It may fail to begin, or to say on standard error that it has begun: its log says it as well."""
 
-    def __init__(self, directory, rule):
+    def __init__(self, directory, rule, where="first", *options):
         self.log = os.path.join(directory, "log")
-        super().__init__(directory, "listener", "--isolated", "--max-sessions", "1", "--handshake-timeout", "3",
-                         "--log", self.log, "--diary", os.path.join(directory, "diary"),
+        super().__init__(directory, "listener", "--isolated", "--handshake-timeout", "3",
+                         "--log", self.log, "--diary", os.path.join(directory, "diary"), *options,
                          env=dict(os.environ, LD_PRELOAD=LIBRARY, KRUTIL_FAULTS=f"krutil-qvm {rule}",
-                                  KRUTIL_FAULTS_UNFORKED="1"))
+                                  KRUTIL_FAULTS_IN=where))
 
     def logged(self):
         """What its own lines in the log say."""
@@ -51,7 +59,7 @@ class FaultyListener(Listener):
     def told(self):
         """What it has told in either place, without that it serves, and without what its sessions say."""
         return [line for line in dict.fromkeys(self.said() + self.logged())
-                if line not in (self.first_words(), LEFT_SESSION)]
+                if line != self.first_words() and not LEFT_SESSION.match(line)]
 
     def first_words(self):
         return f"krutil-qvm: serving {self.path}"
@@ -77,12 +85,12 @@ class FaultyListener(Listener):
 
 
 class Client:
-    """One that evaluates code at a listener."""
+    """One that evaluates code at a listener, or calls a function there."""
 
-    def __init__(self, path, code):
+    def __init__(self, path, command, *arguments):
         self._output = tempfile.TemporaryFile()
         self._errors = tempfile.TemporaryFile()
-        self.process = subprocess.Popen(["krutil", "eval", "--connect", path, code], stdin=subprocess.DEVNULL,
+        self.process = subprocess.Popen(["krutil", command, "--connect", path, *arguments], stdin=subprocess.DEVNULL,
                                         stdout=self._output, stderr=self._errors)
 
     def output(self):
@@ -115,7 +123,7 @@ class Run:
             self.fault = str(error)
 
     def run(self, directory, rule):
-        listener = FaultyListener(directory, rule)
+        listener = FaultyListener(directory, rule, "first", "--max-sessions", "1")
         self.clients = []
         try:
             descriptors = listener.descriptors()
@@ -181,12 +189,70 @@ class Run:
         return ""
 
     def client(self, listener, code):
-        client = Client(listener.path, code)
+        client = Client(listener.path, "eval", code)
         self.clients.append(client)
         return client
 
     def __str__(self):
         return "\n".join([f"exit code {self.code}", "--- listener", *self.said, "--- clients",
+                          *(f"{client.process.returncode}: {client.output()!r} {client.errors()!r}"
+                            for client in self.clients)])
+
+
+class SessionRun:
+    """A listener whose sessions fail: one with an evaluation, and one with a call of a large array."""
+
+    CODE = "import os\nprint('by Python')\nb = os.write(1, b'past Python\\n')\nb"
+    OUTPUTS = [{"by Python", "past Python", "12"}, {"int64: 300000"}]
+
+    def __init__(self, rule):
+        self.said = self.clients = []
+        try:
+            with tempfile.TemporaryDirectory() as directory:
+                self.fault = self.run(directory, rule)
+        except (AssertionError, OSError, subprocess.TimeoutExpired) as error:
+            self.fault = str(error)
+
+    def run(self, directory, rule):
+        listener = FaultyListener(directory, rule, "forked", "--record", os.path.join(directory, "recording"))
+        try:
+            descriptors = listener.descriptors()
+            array = os.path.join(directory, "array.npy")
+            numpy.save(array, numpy.arange(300_000) / 8)
+            self.clients = [Client(listener.path, "eval", "--diary", "--log", self.CODE),
+                            Client(listener.path, "call", "numpy.size", array)]
+            for client in self.clients:
+                eventually(client.has_ended, "the end of a client")
+            eventually(lambda: listener.descriptors() <= descriptors,
+                       f"the number of descriptors before any session, {descriptors},")
+            self.code = listener.stop()
+        finally:
+            for client in self.clients:
+                client.end()
+            self.said = listener.said() + listener.logged()
+            if not listener.has_ended():
+                listener.process.kill()
+                listener.process.wait()
+        if self.code not in (0, 3):
+            return f"ended with {self.code}, expected 0 or 3"
+        if any(not line.startswith("krutil-qvm: ") for line in self.said):
+            return "said something that is no sentence"
+        if os.path.lexists(listener.path):
+            return "left its socket"
+        return next(filter(None, map(self.fault_of, self.clients, self.OUTPUTS)), "")
+
+    @staticmethod
+    def fault_of(client, output):
+        code, errors = client.process.returncode, client.errors().splitlines()
+        whole = set(client.output().splitlines()) == output
+        if not 0 <= code <= 6:
+            return f"a client ended with {code}"
+        if not whole and (code == 0 or not any(line.startswith("krutil: ") for line in errors)):
+            return "a client lost output without a word"
+        return ""
+
+    def __str__(self):
+        return "\n".join(["--- listener", *self.said, "--- clients",
                           *(f"{client.process.returncode}: {client.output()!r} {client.errors()!r}"
                             for client in self.clients)])
 
@@ -202,8 +268,21 @@ class ListenerFaultsTest(unittest.TestCase):
         self.assertLessEqual({"bind", "listen", "accept4", "fork", "send", "poll"}, {site.split("@")[0] for site in sites})
         # It waits with sessions open, too.
         tried = rules(sites, WAITING) + [f"later {site} {errno.ENOMEM}" for site in sites if site.startswith("poll@")]
-        with concurrent.futures.ThreadPoolExecutor(len(os.sched_getaffinity(0))) as workers:
-            faults = [f"{rule}: {run.fault}\n{run}" for rule, run in zip(tried, workers.map(Run, tried)) if run.fault]
+        self.expect_no_faults(Run, tried)
+
+    def test_each_call_site_of_a_session_may_fail(self):
+        with tempfile.NamedTemporaryFile("r") as listed:
+            run = SessionRun(f"list {listed.name}")
+            self.assertEqual((run.fault, [client.process.returncode for client in run.clients]), ("", [0, 0]), str(run))
+            sites = sorted(set(listed.read().split()))
+        # Its own beginning, its files, what its code writes, and memory that both ends see.
+        self.assertLessEqual({"setrlimit", "open", "pipe2", "mmap", "writev"}, {site.split("@")[0] for site in sites})
+        # For ever they fail in engines of one session, which do the same.
+        self.expect_no_faults(SessionRun, rules(sites, waiting=""))
+
+    def expect_no_faults(self, kind, tried):
+        with concurrent.futures.ThreadPoolExecutor(2 * len(os.sched_getaffinity(0))) as workers:
+            faults = [f"{rule}: {run.fault}\n{run}" for rule, run in zip(tried, workers.map(kind, tried)) if run.fault]
         self.assertEqual(faults, [], "\n\n".join(faults))
         eventually(all_have_ended, "the end of each process")
 
