@@ -242,7 +242,8 @@ TEST_F(TerminalEditingTest, TheTerminalIsItsOldSelfAfterALostEngine) {
 TEST_F(TerminalEditingTest, AnEngineWhoseStreamSomebodyElseHoldsIsLostToo) {
     // What holds it ends when the test does.
     const Happening end(directory / "end");
-    begin({"repl", "--engine", "cat '" + (directory / "end").string() + "' & exec '" KRUTIL_ENGINE "' --stdio"});
+    begin({"repl", "--engine",
+           "cat '" + (directory / "end").string() + "' 2>/dev/null & exec '" KRUTIL_ENGINE "' --stdio"});
     waitIn("os.kill(os.getpid(), signal.SIGKILL)");
     terminal->type("half typed");
     terminal->expectBottom({">>> half typed" + at});
