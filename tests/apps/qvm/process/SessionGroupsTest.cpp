@@ -72,7 +72,7 @@ class SessionGroupsTest : public testing::Test {
             std::string said = error.what();
             EXPECT_THAT(said, testing::EndsWith(advice));
             said.resize(said.size() - std::min(said.size(), advice.size()));
-            for (std::size_t at = 0; (at = said.find(directory_.path() + "/")) != said.npos;) {
+            for (std::size_t at = 0; (at = said.find(directory_.path() + "/")) != std::string::npos;) {
                 said.erase(at, directory_.path().size() + 1);
             }
             return said;
