@@ -389,7 +389,8 @@ class Worker:
         except (krutil.Lost, krutil.Aborted) as error:
             if session is None:
                 expect_like("there is no session",
-                            r"the engine has gone( \(killed by signal 9\))? during the handshake: .*", str(error))
+                            r"the engine has gone( \(killed by signal 9\))? (during the handshake: .*|before it said anything)",
+                            str(error))
                 outcome = "before it began"
             else:
                 expect_like("the end of the session", lost, str(error))

@@ -55,25 +55,34 @@ class Copy {
     std::string block_;
 };
 
+void copyUnits(apps::RecordingReader& reader, Copy& copy) {
+    std::size_t sessions = 0;
+    while (auto unit = reader.next()) {
+        if (unit->session + 1 < sessions) {
+            throw Failure(ExitCode::Usage, "cannot redact " + reader.name() + ": byte " + std::to_string(unit->offset) +
+                                               ": expected the sessions one behind the other, got them mixed; redact "
+                                               "recordings before they are merged");
+        }
+        for (; sessions <= unit->session; ++sessions) {
+            copy.add(reader.sessions()[sessions]);
+        }
+        redact(*unit);
+        copy.add(*unit);
+    }
+}
+
 }  // namespace
 
 std::optional<std::string> redactRecording(const std::string& file, const std::string& out, Interrupt& interrupt) {
     try {
         apps::RecordingReader reader(file, [&interrupt](int fd) { interrupt.waitForInput(fd); });
         Copy copy(out);
-        std::size_t sessions = 0;
-        while (auto unit = reader.next()) {
-            if (unit->session + 1 < sessions) {
-                throw Failure(ExitCode::Usage,
-                              "cannot redact " + reader.name() + ": byte " + std::to_string(unit->offset) +
-                                  ": expected the sessions one behind the other, got them mixed; redact "
-                                  "recordings before they are merged");
-            }
-            for (; sessions <= unit->session; ++sessions) {
-                copy.add(reader.sessions()[sessions]);
-            }
-            redact(*unit);
-            copy.add(*unit);
+        try {
+            copyUnits(reader, copy);
+        } catch (const Cancelled&) {
+            // Who follows a recording and ends that wants what has come.
+            copy.keep();
+            throw;
         }
         copy.keep();
         return reader.unfinished();
