@@ -146,23 +146,39 @@ class ServiceTest(RemoteTest):
                               stderr=subprocess.STDOUT, text=True, cwd=self.directory)
 
     def activate(self, *arguments):
-        self.start("systemd-socket-activate", "-l", self.path("socket"), *arguments, stderr=subprocess.DEVNULL)
-        self.await_file(self.path("socket"))
+        """Starts a service manager in miniature; returns the path of its socket."""
+        path = self.path("socket")
+        manager = self.start("systemd-socket-activate", "-l", path, *arguments, stderr=subprocess.PIPE, text=True)
+        self.addCleanup(manager.stderr.close)
+        self.assertEqual(manager.stderr.readline(), f"Listening on {path} as 3.\n")
+        return path
 
     def test_listening_socket_is_handed_over(self):
-        self.activate(shutil.which("krutil-qvm"), "--listen-fds")
+        path = self.activate(shutil.which("krutil-qvm"), "--listen-fds")
         for _ in range(2):
-            self.assert_runs(f"krutil eval --connect {self.path('socket')} '6 * 7'", "42\n")
+            self.assert_runs(f"krutil eval --connect {path} '6 * 7'", "42\n")
 
     def test_connection_is_handed_over(self):
-        self.activate("--accept", shutil.which("krutil-qvm"), "--listen-fds")
+        path = self.activate("--accept", shutil.which("krutil-qvm"), "--listen-fds")
         for _ in range(2):
-            self.assert_runs(f"krutil eval --connect {self.path('socket')} '6 * 7'", "42\n")
+            self.assert_runs(f"krutil eval --connect {path} '6 * 7'", "42\n")
 
     def test_connection_is_standard_input_and_output(self):
-        self.activate("--accept", "--inetd", shutil.which("krutil-qvm"), "--stdio")
+        path = self.activate("--accept", "--inetd", shutil.which("krutil-qvm"), "--stdio")
         for _ in range(2):
-            self.assert_runs(f"krutil eval --connect {self.path('socket')} '6 * 7'", "42\n")
+            self.assert_runs(f"krutil eval --connect {path} '6 * 7'", "42\n")
+
+    def test_service_manager_listens_as_root(self):
+        # The kernel names root for such a socket, whoever the engine and its clients are.
+        nobody = "setpriv --reuid=nobody --regid=nogroup --clear-groups"
+        if self.run_shell(f"{nobody} krutil --version").returncode != 0:
+            self.skipTest("needs to become another user, who may run these programs")
+        path = self.activate(*nobody.split(), shutil.which("krutil-qvm"), "--listen-fds")
+        os.chmod(self.directory, 0o711)
+        os.chmod(path, 0o666)
+        # The first client is there before the engine.
+        for _ in range(2):
+            self.assert_runs(f"{nobody} krutil eval --connect {path} 'import os; os.getuid()'", "65534\n")
 
 
 if __name__ == "__main__":

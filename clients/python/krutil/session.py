@@ -301,7 +301,7 @@ def connect(path: "str | os.PathLike[str]", *, on_input: Optional[OnInput] = Non
             raise OSError(error.errno or errno.ENAMETOOLONG,
                           f"no engine can be reached there: {error.strerror or error}", os.fspath(path)) from None
         _, user, _ = _PEER.unpack(connection.getsockopt(socket.SOL_SOCKET, socket.SO_PEERCRED, _PEER.size))
-        if user != os.geteuid():
+        if user not in (os.geteuid(), 0):  # root, where the system's service manager listens for the engine
             raise Refused(f"cannot connect to '{os.fspath(path)}': the engine there runs as user {user}, not as user "
                           f"{os.geteuid()} as this program does")
         return Session(connection, on_input=on_input, on_debug=on_debug, on_text=on_text,

@@ -618,6 +618,23 @@ class StartTest(unittest.TestCase):
             with accepted:
                 self.assertEqual(accepted.recv(1), b"")
 
+    @unittest.skipUnless(os.geteuid() == 0, "needs to become another user")
+    def test_a_socket_of_the_service_manager(self):
+        with tempfile.TemporaryDirectory() as directory, socket.socket(socket.AF_UNIX) as listening:
+            path = os.path.join(directory, "engine")
+            listening.bind(path)
+            listening.listen()
+            os.chmod(path, 0o666)
+            os.chmod(directory, 0o711)
+            os.seteuid(65534)
+            try:
+                # So it was connected to: nobody answers.
+                with self.assertRaises(krutil.Lost) as caught:
+                    krutil.connect(path, timeout=0.1)
+            finally:
+                os.seteuid(0)
+            self.assertEqual(str(caught.exception), "the engine did not finish the handshake within 0.1 seconds")
+
     def test_ends_that_do_not_agree_on_zero_copy(self):
         set_zero_copy(self, False)
         command = "env --unset=QX_DISABLE_ZEROCOPY krutil-qvm --stdio"

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
 #include <unistd.h>
 
@@ -150,6 +151,21 @@ TEST(EngineProcessTest, AnEngineOfAnotherUserIsRefusedBeforeAByteIsSent) {
     const foundation::core::posix::OwnedDescriptor accepted(::accept(listener.get(), nullptr, nullptr));
     char byte = 0;
     EXPECT_EQ(::read(accepted.get(), &byte, 1), 0);
+}
+
+// The system's service manager listens as root, and starts the engine as this program's user.
+TEST(EngineProcessTest, ASocketOfTheServiceManagerIsThoughtTheUsersOwn) {
+    if (!test_support::AnotherUser::isPossible()) {
+        GTEST_SKIP() << "needs to become another user";
+    }
+    const test_support::TemporaryDirectory directory;
+    const std::string path = directory.file("s");
+    const auto listener = socketAt(path);
+    ASSERT_EQ(::listen(listener.get(), 1), 0);
+    ASSERT_EQ(::chmod(path.c_str(), 0666), 0);
+    ASSERT_EQ(::chmod(directory.path().c_str(), 0711), 0);
+    const test_support::AnotherUser nobody;
+    EXPECT_GE(EngineProcess::connect(path).stream(), 0);
 }
 
 TEST(EngineProcessTest, AConnectionIsNoChild) {
