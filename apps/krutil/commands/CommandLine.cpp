@@ -146,6 +146,15 @@ void addSparingly(CLI::App& app, bool& sparingly) {
         ->group("Request");
 }
 
+std::string notExpected(const std::vector<std::string>& words) {
+    std::string text =
+        words.size() > 1 ? "The following arguments were not expected:" : "The following argument was not expected:";
+    for (const std::string& word : words) {
+        text += ' ' + word;
+    }
+    return text;
+}
+
 // Words of a file's code come after two dashes, so that code beside a file is found to be one too many.
 void addEval(CLI::App& app, Options& options, EvalOptions& eval, bool twoDashes) {
     auto* command = app.add_subcommand("eval", "Evaluate code and show what it prints");
@@ -189,7 +198,7 @@ void addEval(CLI::App& app, Options& options, EvalOptions& eval, bool twoDashes)
             throw CLI::ExcludesError("CODE", "--file");
         }
         if (!eval.fromFile && !words->empty()) {
-            throw CLI::ExtrasError(*words);
+            throw CLI::ParseError(notExpected(*words), CLI::ExitCodes::ExtrasError);
         }
         std::vector<std::string> arguments = code->results();
         arguments.insert(arguments.end(), words->begin(), words->end());
@@ -455,6 +464,24 @@ OptionTable::OptionTable(const std::vector<std::string>& words) {
     addInspect(app, options, inspect);
 }
 
+// Why nothing takes these words. Options that come first are those of the repl.
+std::string describeExtras(const CLI::App& app, const std::vector<std::string>& extras, bool optionsFirst) {
+    std::string names;
+    for (const CLI::App* const command : app.get_subcommands(nullptr)) {
+        const std::string name = command->get_name();
+        if (optionsFirst && std::find(extras.begin(), extras.end(), name) != extras.end()) {
+            return "expected the command before its options, got \"" + name + "\" behind them; write: krutil " + name +
+                   " [OPTION...] ...";
+        }
+        names += (names.empty() ? "" : ", ") + name;
+    }
+    if (!optionsFirst && app.get_subcommands().empty()) {
+        return "expected a command (" + names + "), got \"" + extras.front() +
+               "\"; code is evaluated by: krutil eval CODE";
+    }
+    return notExpected(extras);
+}
+
 }  // namespace
 
 void describeCommandLine(const std::function<void(const CLI::App&)>& describe) {
@@ -464,13 +491,19 @@ void describeCommandLine(const std::function<void(const CLI::App&)>& describe) {
 std::variant<Options, Finished> parseCommandLine(int argc, const char* const* argv) {
     OptionTable table(std::vector<std::string>(argv, argv + argc));
     CLI::App& app = table.app;
+    auto arguments = withLiteralsKept(app, argc, argv);
+    const bool optionsFirst = !arguments.empty() && beginsOptionsOfRepl(arguments.front());
+    if (optionsFirst) {
+        arguments.insert(arguments.begin(), "repl");
+    }
+    const auto refused = [](const std::string& why) {
+        return Finished{ExitCode::Usage, {}, "krutil: " + why + "\nRun krutil --help for help.\n"};
+    };
     try {
-        auto arguments = withLiteralsKept(app, argc, argv);
-        if (!arguments.empty() && beginsOptionsOfRepl(arguments.front())) {
-            arguments.insert(arguments.begin(), "repl");
-        }
         std::reverse(arguments.begin(), arguments.end());
         app.parse(std::move(arguments));
+    } catch (const CLI::ExtrasError&) {
+        return refused(describeExtras(app, app.remaining(true), optionsFirst));
     } catch (const CLI::ParseError& error) {
         std::ostringstream out;
         std::ostringstream err;
@@ -479,8 +512,7 @@ std::variant<Options, Finished> parseCommandLine(int argc, const char* const* ar
         if (error.get_exit_code() == static_cast<int>(CLI::ExitCodes::Success)) {
             return Finished{ExitCode::Ok, out.str(), {}};
         }
-        return Finished{
-            ExitCode::Usage, {}, std::string("krutil: ") + error.what() + "\nRun krutil --help for help.\n"};
+        return refused(error.what());
     }
     return table.options;
 }

@@ -140,6 +140,27 @@ TEST(CommandLineTest, ErrorsSayWhatIsWrongAndWhereHelpIs) {
     }
 }
 
+TEST(CommandLineTest, WordsThatNothingTakesAreNamed) {
+    const std::vector<std::pair<std::vector<const char*>, std::string>> cases{
+        {{"--connect", "engine", "eval", "x"},
+         "expected the command before its options, got \"eval\" behind them; write: krutil eval [OPTION...] ..."},
+        {{"--json", "more", "words"}, "The following arguments were not expected: more words"},
+        {{"1+1"},
+         "expected a command (eval, call, run, repl, replay, inspect), got \"1+1\"; code is evaluated by: krutil eval "
+         "CODE"},
+        {{"evla", "x"},
+         "expected a command (eval, call, run, repl, replay, inspect), got \"evla\"; code is evaluated by: krutil eval "
+         "CODE"},
+        {{"eval", "x", "y"}, "The following argument was not expected: y"},
+        {{"eval", "x", "y", "z"}, "The following arguments were not expected: y z"},
+        {{"inspect", "--fast", "--small", "file"}, "The following arguments were not expected: --fast --small"}};
+    for (const auto& [arguments, sentence] : cases) {
+        const Finished finished = parseFinished(arguments);
+        EXPECT_EQ(finished.code, ExitCode::Usage);
+        EXPECT_EQ(finished.err, "krutil: " + sentence + "\nRun krutil --help for help.\n");
+    }
+}
+
 TEST(CommandLineTest, WithoutACommandLinesAreRead) {
     EXPECT_FALSE(std::get<ReplOptions>(std::get<Options>(parse({})).command).noHistory);
     EXPECT_FALSE(std::get<ReplOptions>(std::get<Options>(parse({"repl"})).command).noHistory);
