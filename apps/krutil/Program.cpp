@@ -70,6 +70,7 @@ struct Terminal {
     bool edits = false;                          ///< a session has begun whose lines are edited
     std::optional<LineEditor> editor{};          ///< outlives a session, and with it what it remembers
     std::optional<apps::Recording> recording{};  ///< of all sessions
+    std::optional<Tracer> tracer{};              ///< of all sessions
     bool engineFilesComplete = true;             ///< those that the engines of all sessions have written
 };
 
@@ -88,7 +89,8 @@ class AskingClient {
     AskingClient(const Options& options, Printer& printer, Terminal& terminal, bool interactive,
                  std::string history = {})
         : client_(options.connection, options.display, printer, terminal.out, terminal.err, terminal.interrupt,
-                  interactive, terminal.recording ? &*terminal.recording : nullptr),
+                  interactive,
+                  {terminal.recording ? &*terminal.recording : nullptr, terminal.tracer ? &*terminal.tracer : nullptr}),
           help_(client_),
           terminal_(terminal),
           history_(std::move(history)),
@@ -230,10 +232,9 @@ bool wantsAnother(Terminal& terminal) {
 }
 
 ExitCode runCommand(const Options& options, const ReplOptions& repl, Printer& printer, Terminal& terminal) {
-    Options next = options;
     for (;;) {
         try {
-            const ReplEnd end = runSession(next, repl, printer, terminal);
+            const ReplEnd end = runSession(options, repl, printer, terminal);
             if (!end.restart) {
                 return end.code;
             }
@@ -249,7 +250,6 @@ ExitCode runCommand(const Options& options, const ReplOptions& repl, Printer& pr
                 return failure.code();
             }
         }
-        next.display.traceGoesOn = true;
     }
 }
 
@@ -304,12 +304,16 @@ ExitCode runReporting(const Options& options) {
     };
     try {
         startRecording(options.display.record, terminal);
+        if (options.display.trace || options.display.traceFile) {
+            terminal.tracer.emplace(options.display.trace, options.display.traceFile);
+        }
         const ExitCode code = std::visit(
             [&](const auto& command) { return runCommand(options, command, *printer, terminal); }, options.command);
         if (code != ExitCode::Ok) {
             return code;
         }
-        const bool recorded = !terminal.recording || terminal.recording->isComplete();
+        const bool recorded = (!terminal.recording || terminal.recording->isComplete()) &&
+                              (!terminal.tracer || terminal.tracer->isComplete());
         return !recorded ? ExitCode::Usage : !terminal.engineFilesComplete ? ExitCode::Stream : ExitCode::Ok;
     } catch (const Failure& failure) {
         return report(failure.code(), failure.what());

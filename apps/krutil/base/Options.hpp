@@ -38,7 +38,6 @@ struct DisplayOptions {
     bool json = false;
     bool trace = false;                    ///< each frame goes to standard error
     std::optional<std::string> traceFile;  ///< each frame goes to this file
-    bool traceGoesOn = false;              ///< after those of a session before
     apps::RecordOptions record;
     bool timing = false;
     bool warningStack = false;  ///< warnings tell where they were issued

@@ -22,8 +22,8 @@ namespace {
 constexpr const char* exitCodes = R"(Exit codes:
   0  ok
   1  the code or the function raised an error
-  2  the command line, the code text or a file cannot be used, a recording is not complete, or an
-     argument is larger than the engine accepts
+  2  the command line, the code text or a file cannot be used, a recording or a trace is not
+     complete, or an argument is larger than the engine accepts
   3  no engine could be started or reached, its stream was lost, or its diary, log or recording is
      not complete
   4  the engine broke the protocol, or a recording that is checked does

@@ -80,7 +80,7 @@ EngineProcess findEngine(const ConnectionOptions& options) {
 }
 
 Client::Client(const ConnectionOptions& connection, const DisplayOptions& display, Printer& printer, const Output& out,
-               Output& err, Interrupt& interrupt, bool interactive, apps::Recording* recording)
+               Output& err, Interrupt& interrupt, bool interactive, const Watchers& watchers)
     : printer_(printer),
       interrupt_(interrupt),
       err_(err),
@@ -88,9 +88,6 @@ Client::Client(const ConnectionOptions& connection, const DisplayOptions& displa
       timing_(display.timing),
       throughShell_(connection.engine.has_value()),
       begin_(Conversation::Clock::now()),
-      tracer_(display.trace || display.traceFile
-                  ? std::make_unique<Tracer>(display.trace, display.traceFile, display.traceGoesOn)
-                  : nullptr),
       engine_(findEngine(connection)) {
     const auto noteTime = [this](const auto&) {
         if (!firstText_) {
@@ -107,7 +104,7 @@ Client::Client(const ConnectionOptions& connection, const DisplayOptions& displa
             engineCapabilities_ = event.getQvmCapabilities();
         });
     printer_.subscribe(events_);
-    conversation_ = openConversation(connection, interactive, recording);
+    conversation_ = openConversation(connection, interactive, watchers);
     engine_.takeTerminalBack();
     conversation_->watch(engine_.watch(), [this] {
         // The end of the stream follows, and is what ends a request; unless another process holds the stream.
@@ -135,7 +132,7 @@ Client::~Client() {
 }
 
 std::unique_ptr<Conversation> Client::openConversation(const ConnectionOptions& connection, bool interactive,
-                                                       apps::Recording* recording) {
+                                                       const Watchers& watchers) {
     session::SessionConfig config = apps::krutilSession(session::Role::Client);
     config.build = apps::buildString("krutil");
     config.limits = connection.limits;
@@ -147,12 +144,12 @@ std::unique_ptr<Conversation> Client::openConversation(const ConnectionOptions& 
     if (connection.engine || isTls(connection)) {
         config.keepAlive = connection.keepAlive;
     }
-    if (tracer_) {
-        config.trace = std::ref(*tracer_);
+    if (watchers.tracer != nullptr) {
+        config.trace = std::ref(*watchers.tracer);
     }
-    if (recording != nullptr) {
-        recording->beginSession(config.role, config.build);
-        config.recorder = recording;
+    if (watchers.recording != nullptr) {
+        watchers.recording->beginSession(config.role, config.build);
+        config.recorder = watchers.recording;
     }
     try {
         return std::make_unique<Conversation>(engine_.takeStream(), std::move(config), events_, interrupt_);

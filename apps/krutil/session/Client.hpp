@@ -42,15 +42,20 @@ enum class Leave {
 /// The engine that the options name, started or connected to. Throws Failure.
 EngineProcess findEngine(const ConnectionOptions& options);
 
+/// What sees all that a session sends and receives; null where nobody wants it. They must outlive the session.
+struct Watchers {
+    apps::Recording* recording = nullptr;
+    Tracer* tracer = nullptr;
+};
+
 /// Starts or reaches the engine, sends requests, and ends in good order. Failures of the engine or the session come out
 /// as Failure, with a sentence that says which. Main thread only.
 class Client {
   public:
     /// `interactive` tells the engine that there is a person who can be asked and who can use a debugger. `printer`,
-    /// `err`, `interrupt` and `recording` must outlive the object; the last is null for none. Blocks until the
-    /// handshake is done. Throws Failure, Cancelled.
+    /// `err` and `interrupt` must outlive the object. Blocks until the handshake is done. Throws Failure, Cancelled.
     Client(const ConnectionOptions& connection, const DisplayOptions& display, Printer& printer, const Output& out,
-           Output& err, Interrupt& interrupt, bool interactive, apps::Recording* recording = nullptr);
+           Output& err, Interrupt& interrupt, bool interactive, const Watchers& watchers = {});
     ~Client();
     Client(const Client&) = delete;
     Client& operator=(const Client&) = delete;
@@ -136,7 +141,7 @@ class Client {
 
   private:
     std::unique_ptr<Conversation> openConversation(const ConnectionOptions& connection, bool interactive,
-                                                   apps::Recording* recording);
+                                                   const Watchers& watchers);
     void answered(SentRequest& request, const Conversation::Reply& answer);
     void awaitAnswers(Leave leave, Conversation::Clock::time_point deadline);
     [[noreturn]] void fail(const Conversation::SessionEnd& end, const std::string& when);
@@ -158,7 +163,6 @@ class Client {
     bool picturesAnnounced_ = false;
     capabilities::CapabilityList capabilities_;
     capabilities::CapabilityList engineCapabilities_;
-    std::unique_ptr<Tracer> tracer_;
     EngineProcess engine_;
     std::unique_ptr<Conversation> conversation_;
 };

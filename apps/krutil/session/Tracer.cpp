@@ -90,14 +90,13 @@ std::string traceLine(const foundation::msg_svc::transport::layers::session::Fra
     return content.empty() ? text : text + ": " + content;
 }
 
-Tracer::Tracer(bool toStandardError, const std::optional<std::string>& file, bool goesOn)
+Tracer::Tracer(bool toStandardError, const std::optional<std::string>& file)
     : toStandardError_(toStandardError), fileName_(file.value_or(std::string())) {
     if (!file) {
         return;
     }
     try {
-        file_ = apps::openOwnFile(fileName_, goesOn ? apps::Begin::AtEnd : apps::Begin::Empty,
-                                  "cannot open '" + fileName_ + "' for the trace")
+        file_ = apps::openOwnFile(fileName_, apps::Begin::Empty, "cannot open '" + fileName_ + "' for the trace")
                     .descriptor;
     } catch (const std::runtime_error& error) {
         throw Failure(ExitCode::Usage, error.what());
@@ -114,8 +113,14 @@ void Tracer::operator()(const foundation::msg_svc::transport::layers::session::F
     if (file_.get() >= 0 && !posix::writeFully(file_.get(), line)) {
         const std::string reason = std::strerror(errno);
         file_.reset();
+        complete_ = false;
         std::cerr << "krutil: cannot write to '" + fileName_ + "': " + reason + "; the trace ends here\n" << std::flush;
     }
+}
+
+bool Tracer::isComplete() {
+    const std::lock_guard lock(mutex_);
+    return complete_;
 }
 
 }  // namespace krutil_client

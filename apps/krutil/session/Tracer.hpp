@@ -22,20 +22,24 @@ std::string traceLine(const foundation::msg_svc::transport::layers::session::Fra
 
 /// Writes these lines to standard error, to a file or to both, as soon as a frame is there: what ends the program ends
 /// no trace early. Lines of several threads are not mixed. When a line cannot be written to the file, one sentence on
-/// standard error says so, and the file gets no more of them. May be called from any thread.
+/// standard error says so, and the file gets no more of them. Thread-safe.
 class Tracer {
   public:
-    /// `file` is emptied, unless the trace of a session before goes on there (`goesOn`), or created for this user
-    /// alone; see apps::openOwnFile(). Throws Failure (Usage) when it cannot be opened or is not this user's.
-    Tracer(bool toStandardError, const std::optional<std::string>& file, bool goesOn = false);
+    /// `file` is emptied, or created for this user alone; see apps::openOwnFile(). Throws Failure (Usage) when it
+    /// cannot be opened or is not this user's.
+    Tracer(bool toStandardError, const std::optional<std::string>& file);
 
     void operator()(const foundation::msg_svc::transport::layers::session::FrameTrace& trace);
+
+    /// Whether the file has every line.
+    bool isComplete();
 
   private:
     const bool toStandardError_;
     const std::string fileName_;
     std::mutex mutex_;
     posix::OwnedDescriptor file_;
+    bool complete_ = true;
 };
 
 }  // namespace krutil_client

@@ -280,7 +280,7 @@ TEST(EvalTest, ATraceThatFindsNoRoomEndsAndTheSessionGoesOn) {
     const Ran ran = runClient({"eval", "--trace-to", "/dev/full", "print('on')"});
     EXPECT_EQ(ran.out, "on\n");
     EXPECT_EQ(ran.err, "krutil: cannot write to '/dev/full': No space left on device; the trace ends here\n");
-    EXPECT_EQ(ran.exitCode, 0);
+    EXPECT_EQ(ran.exitCode, 2);
 }
 
 TEST(EvalTest, ADiaryThatFindsNoRoomIsInTheExitCode) {
