@@ -7,6 +7,10 @@ import sys
 SKIPPED = {".git", ".cache", "__pycache__", "build", "node_modules"}
 
 
+# What programs have said to a person who kept it beside the sources.
+KEPT = ".log"
+
+
 def files(root, *suffixes):
     """Paths of the files below root that end in one of the suffixes (all files without any), relative and sorted."""
     found = []
@@ -14,7 +18,7 @@ def files(root, *suffixes):
         subdirectories[:] = [name for name in subdirectories if name not in SKIPPED]
         for name in names:
             path = os.path.relpath(os.path.join(directory, name), root)
-            if not suffixes or path.endswith(suffixes):
+            if not path.endswith(KEPT) and (not suffixes or path.endswith(suffixes)):
                 found.append(path)
     return sorted(found)
 
