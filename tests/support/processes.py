@@ -19,14 +19,14 @@ class Usage:
 
 
 def usage(pid):
-    """None when the process is gone."""
+    """None when the process is gone. Nobody but root may look into one that nobody has waited for."""
     try:
         with open(f"/proc/{pid}/smaps_rollup", encoding="ascii") as file:
             memory = sum(int(line.split()[1]) for line in file if line.startswith("Private_"))
         with open(f"/proc/{pid}/status", encoding="ascii") as file:
             threads = next(int(line.split()[1]) for line in file if line.startswith("Threads:"))
         return Usage(memory, len(os.listdir(f"/proc/{pid}/fd")), threads)
-    except (FileNotFoundError, ProcessLookupError, StopIteration):
+    except (FileNotFoundError, PermissionError, ProcessLookupError, StopIteration):
         return None
 
 
