@@ -193,6 +193,28 @@ class CellsTest(WithKernel):
         self.assertEqual([self.answer(self.client.is_complete(code)) for code in ("1 + 1", "for n in x:", "1 +* 1")],
                          [{"status": "complete"}, {"status": "incomplete", "indent": "    "}, {"status": "invalid"}])
 
+    def test_display_shows_values_where_the_code_is(self):
+        cell = self.run_cell("class Red:\n"
+                             "    def __init__(self, text): self.text = text\n"
+                             "    def _repr_html_(self): return f'<b>{self.text}</b>'\n"
+                             "for each in 'one', 'two':\n"
+                             "    display(Red(each), each)\n"
+                             "6 * 7")
+        kinds = [kind for kind, _ in cell.published if kind not in ("status", "execute_input")]
+        self.assertEqual(kinds[:4], ["display_data", "stream", "display_data", "stream"])
+        self.assertEqual(cell.text("stdout"), "'one'\n'two'\n")
+        self.assertEqual([content["data"] for content in cell.of("update_display_data")],
+                         [{"text/html": "<b>one</b>"}, {"text/html": "<b>two</b>"}])
+        self.assertEqual(cell.value, "42")
+
+    def test_display_shows_a_figure_as_it_is_now(self):
+        cell = self.run_cell("import matplotlib.pyplot as plt\nfigure, axes = plt.subplots()\n"
+                             "display(figure)\naxes.plot([1, 4, 9])\ndisplay(figure)\nplt.close(figure)")
+        before, after = (content["data"]["image/png"] for content in cell.of("update_display_data"))
+        self.assertNotEqual(before, after)
+        self.assertEqual(matplotlib.image.imread(io.BytesIO(base64.b64decode(after))).shape, (480, 640, 4))
+        self.assertEqual((cell.text("stdout"), cell.text("stderr")), ("", ""))
+
     def test_names_that_hide_the_module_of_the_engine(self):
         self.run_cell("qvm = 5; answer_of_all = 42")
         self.assertEqual(self.answer(self.client.complete("answer_of_a", 11))["matches"], ["answer_of_all"])

@@ -63,12 +63,13 @@ _PLAIN_TYPES = frozenset(map(id, (bool, int, float, complex, str, bytes, list, t
 
 
 def _offer_forms(value):
+    """Whether the client has been offered any."""
     for kind in type(value).__mro__:
         names = kind.__dict__
         if "_repr_png_" in names or "_repr_svg_" in names or "_repr_html_" in names:
             import qvm_displays
-            qvm_displays.offer(value)
-            break
+            return qvm_displays.offer(value)
+    return False
 
 
 # As many elements of each container are shown; 0 for all.
@@ -113,6 +114,31 @@ def full():
     value = _builtins.__dict__.get("_")
     if value is not None:
         _qvm.show(_text_of(value, 0) + "\n")
+
+
+def bind_display():
+    """Binds display() among the built-in names, as code in notebooks expects it."""
+    _builtins.display = _display
+
+
+def _display(*values):
+    """Shows values where the code is: as pictures or tables where they are such, otherwise as text.
+
+    >>> for frame in frames:
+    ...     display(frame)
+    """
+    for value in values:
+        figures = _sys.modules.get("matplotlib.figure")
+        if figures is not None and isinstance(value, figures.Figure):
+            import qvm_pictures
+            shown = qvm_pictures.offer(value)
+        else:
+            shown = _offer_forms(value)
+        if not shown:
+            print(_text_of(value, _shown_elements))
+
+
+_display.__name__ = _display.__qualname__ = "display"
 
 
 def take_displays():

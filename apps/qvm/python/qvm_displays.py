@@ -55,9 +55,9 @@ def can_show():
 
 
 def offer(value):
-    """Keeps the forms of a value for the client. A form that fails is a warning."""
+    """Keeps the forms of a value for the client, and returns whether it has any. A form that fails is a warning."""
     if not can_show():
-        return
+        return False
     kind = type(value)
     formats = []
     for name, content_type, check in _FORMATS:
@@ -72,17 +72,16 @@ def offer(value):
         except Exception as error:
             warn_about(f"{kind.__qualname__}.{name}() has failed, so this form is not shown: "
                         f"{type(error).__qualname__}: {error}")
-    if formats:
-        keep(formats)
+    return bool(formats) and keep(formats)
 
 
 def keep(formats):
-    """Keeps a display, and shows its line. `formats` holds pairs of type and bytes."""
+    """Keeps a display, and shows its line. `formats` holds pairs of type and bytes. Returns False when it is too large."""
     global _kept_bytes, _last_number, _dropped
     size = sum(len(content) for _, content in formats)
     if size > _MAX_BYTES:
         warn_about(f"A picture of {size} bytes is not shown: at most {_MAX_BYTES} are kept for the client")
-        return
+        return False
     _last_number += 1
     _kept[_last_number] = formats
     _kept_bytes += size
@@ -101,6 +100,7 @@ def keep(formats):
     _qvm.flush()
     _qvm.show(line + "]\n")
     _qvm.flush()
+    return True
 
 
 def _png_size(content):

@@ -29,18 +29,28 @@ def _ours():
     return [each for each in _Gcf.get_all_fig_managers() if isinstance(each, FigureManager)]
 
 
+def offer(figure):
+    """Shows a figure as it is now, and leaves it open. Returns False where it cannot be shown."""
+    return _displays.can_show() and _displays.keep([("image/png", _drawn(figure))])
+
+
+def _drawn(figure):
+    file = _io.BytesIO()
+    figure.savefig(file, format="png")
+    return file.getvalue()
+
+
 def _show(managers):
     if not _displays.can_show():
         _displays.warn_cannot_show()
         return
     for each in managers:
-        file = _io.BytesIO()
         try:
-            each.canvas.figure.savefig(file, format="png")
+            picture = _drawn(each.canvas.figure)
         finally:
             # Shown once, also when it cannot be drawn.
             _Gcf.destroy(each)
-        _displays.keep([("image/png", file.getvalue())])
+        _displays.keep([("image/png", picture)])
 
 
 def show(*, block=None):

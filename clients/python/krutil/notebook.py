@@ -127,6 +127,7 @@ class EngineKernel(Kernel):
         if self._engine is None:
             self._engine = start(self.command, on_input=self._answer, on_text=self._background,
                                  on_display=lambda display: None, timeout=60)
+            self._ask("qvm.bind_display", outputs=0)
         return self._engine
 
     def _run(self, code: str, silent: bool) -> dict[str, str]:

@@ -415,9 +415,10 @@ TEST_F(EvaluationTest, WhatTheEngineOffersIsInOneModule) {
         "print(*offered)\n"
         "{getattr(qvm, name).__module__ for name in offered}";
     const Evaluation result = client().eval(code);
-    EXPECT_EQ(result.output(),
-              "DebuggerQuit complete dbcont dbquit debugger down full inspect is_complete keyboard link list next "
-              "pause shorten step take_displays up warning where\n");
+    EXPECT_EQ(
+        result.output(),
+        "DebuggerQuit bind_display complete dbcont dbquit debugger down full inspect is_complete keyboard link list "
+        "next pause shorten step take_displays up warning where\n");
     EXPECT_EQ(result.shown(), "{'qvm'}\n");
 }
 

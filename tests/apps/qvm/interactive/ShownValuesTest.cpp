@@ -55,6 +55,19 @@ TEST_F(ShownValuesTest, ValuesInLinesAreCutAlike) {
     EXPECT_EQ(inLines("[1, 2, 3, 4, 5]"), "[1, 2, 3, ... 2 more]\n");
 }
 
+TEST_F(ShownValuesTest, DisplayIsThereWhereItIsWanted) {
+    EXPECT_EQ(engine_.client.eval("display(1)").errorText(), "name 'display' is not defined");
+    const Evaluation done = engine_.client.eval(
+        "import qvm; qvm.bind_display()\n"
+        "class Red:\n    def _repr_html_(self): return '<b>red</b>'\n    def __repr__(self): return 'red'\n"
+        "print('before')\ndisplay(1, Red(), None)\n'a value'");
+    // The client shows no pictures.
+    EXPECT_EQ(done.output(), "before\n1\nred\nNone\n");
+    EXPECT_EQ(done.shown(), "'a value'\n");
+    shown("qvm.shorten(2)");
+    EXPECT_EQ(engine_.client.eval("display([1, 2, 3])").output(), "[1, 2, ... 1 more]\n");
+}
+
 TEST_F(ShownValuesTest, SubclassesShowThemselves) {
     shown("import qvm; qvm.shorten(1)\nclass Mine(list):\n    def __repr__(self): return f'{len(self)} of mine'");
     EXPECT_EQ(shown("Mine([1, 2, 3])"), "3 of mine\n");
