@@ -4,6 +4,7 @@ import os
 import socket
 import struct
 import subprocess
+import sys
 import time
 from typing import Any, NamedTuple, Optional
 
@@ -75,7 +76,8 @@ def shake_hands(connection: socket.socket, process: "Optional[subprocess.Popen[b
     connection.settimeout(None)
     peer = theirs.limits
     return Settled(features.get("ZEROCOPY") == "enable",
-                   Limits(peer.tag, peer.taggedFrame, peer.arrayMessage, peer.message, peer.frames), shares)
+                   Limits(peer.tag, peer.taggedFrame, peer.arrayMessage, peer.message, peer.frames,
+                          peer.parts or sys.maxsize), shares)
 
 
 def how_it_ended(process: "Optional[subprocess.Popen[bytes]]") -> str:

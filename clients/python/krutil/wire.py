@@ -14,6 +14,7 @@ from typing import TYPE_CHECKING, Any, Callable, Optional, Sequence, Union
 
 from .memory import memory_for
 from .parts import first_beyond
+from .schema import Array, EvalIIP, FEvalIIP, IIPCancelMessage, IIPEnqueueMessage
 
 if TYPE_CHECKING:
     from .shared import Borrower, Lender, Place
@@ -25,6 +26,10 @@ LAST = 0x80
 HEADER = struct.Struct("<BBHIQQ")
 
 ARRAY_TAG = "krutil:QDA"
+
+# What this end sends, by tag.
+_SENT = {"krutil:IIPEnqueueMessage": IIPEnqueueMessage, "krutil:IIPCancelMessage": IIPCancelMessage,
+         "krutil:EvalIIP": EvalIIP, "krutil:FEvalIIP": FEvalIIP, ARRAY_TAG: Array}
 
 # Numbers: the socket module's own take as long to combine with another as a system call.
 _CUT, _CLOSE_ON_EXEC, _WAIT_FOR_ALL = int(socket.MSG_CTRUNC), int(socket.MSG_CMSG_CLOEXEC), int(socket.MSG_WAITALL)
@@ -413,6 +418,11 @@ def message_bytes(stream: int, frames: Sequence[Frame], peer: Limits,
             if len(tag) > peer.tag:
                 raise ValueError(f'the tag "{frame.tag}" is longer than the engine accepts ({peer.tag} bytes, its '
                                  'limit "tag")')
+            # As in Message._parsed().
+            if size // 2 > peer.parts and \
+                    first_beyond(_SENT[frame.tag].DESCRIPTOR, memoryview(frame.content), peer.parts) is not None:
+                raise ValueError(f'a part of the request ("{frame.tag}") has more than {peer.parts} fields, which is what '
+                                 'the engine accepts (its limit "parts")')
         total += len(tag) + size
         kind = (DATA if frame.tag is None else TAGGED) | (LAST if index == len(frames) else 0)
         if frame.place is not None and lender is not None:

@@ -655,6 +655,12 @@ class StartTest(unittest.TestCase):
                 with self.assertRaisesRegex(ValueError, text):
                     refused()
             self.assertEqual(session.eval("1", timeout=PATIENCE).value, "1")
+        with krutil.start("krutil-qvm --stdio --limit-parts 8", timeout=PATIENCE) as session:
+            with self.assertRaises(ValueError) as caught:
+                session.submit_call("max", 1, 2)
+            self.assertEqual(str(caught.exception), 'a part of the request ("krutil:FEvalIIP") has more than 8 fields, which is '
+                                                    'what the engine accepts (its limit "parts")')
+            self.assertEqual(session.eval("1", timeout=PATIENCE).value, "1")
 
     def test_a_recording_is_an_engine(self):
         numbers = numpy.arange(1000.0)
