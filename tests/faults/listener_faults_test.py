@@ -110,46 +110,23 @@ class Client:
 
 
 class Run:
-    """A listener with a rule for its faults, and its clients."""
+    """A listener with a rule for its faults, and its clients. `start()` starts it; `drive()` has clients there until all
+    have ended, the listener too, and returns which exit codes may be and what was wrong."""
 
     def __init__(self, rule):
         self.once = not rule.startswith("always")
-        self.said = self.clients = []
+        self.said = []
+        self.clients = []
         self.code = None
         try:
             with tempfile.TemporaryDirectory() as directory:
-                self.fault = self.run(directory, rule)
+                self.fault = self.run(self.start(directory, rule), directory)
         except (AssertionError, OSError, subprocess.TimeoutExpired) as error:
             self.fault = str(error)
 
-    def __str__(self):
-        return "\n".join([f"exit code {self.code}", "--- listener", *self.said, "--- clients",
-                          *(f"{client.process.returncode}: {client.output()!r} {client.errors()!r}"
-                            for client in self.clients)])
-
-
-class ListenerRun(Run):
-    """A listener that fails itself."""
-
-    def run(self, directory, rule):
-        listener = FaultyListener(directory, rule, "first", "--max-sessions", "1")
-        self.clients = []
+    def run(self, listener, directory):
         try:
-            descriptors = listener.descriptors()
-            if listener.first_words() in listener.said() + listener.logged():
-                fault = self.visit(listener, directory, descriptors)
-            else:
-                listener.process.wait(PATIENCE)
-                fault = ""
-            if listener.has_ended():
-                self.code = listener.process.wait()
-                expected = [3]
-                if len(listener.told()) != 1:
-                    fault = f"ended with {len(listener.told())} sentences, expected one"
-            else:
-                self.code = listener.stop()
-                # What the log lacks is in the exit code, and said.
-                expected = [0, 3] if listener.told() else [0]
+            expected, fault = self.drive(listener, directory)
         finally:
             for client in self.clients:
                 client.end()
@@ -162,6 +139,34 @@ class ListenerRun(Run):
         if any(not line.startswith("krutil-qvm: ") for line in self.said):
             return "said something that is no sentence"
         return "left its socket" if os.path.lexists(listener.path) else fault
+
+    def __str__(self):
+        return "\n".join([f"exit code {self.code}", "--- listener", *self.said, "--- clients",
+                          *(f"{client.process.returncode}: {client.output()!r} {client.errors()!r}"
+                            for client in self.clients)])
+
+
+class ListenerRun(Run):
+    """A listener that fails itself."""
+
+    @staticmethod
+    def start(directory, rule):
+        return FaultyListener(directory, rule, "first", "--max-sessions", "1")
+
+    def drive(self, listener, directory):
+        descriptors = listener.descriptors()
+        if listener.first_words() in listener.said() + listener.logged():
+            fault = self.visit(listener, directory, descriptors)
+        else:
+            listener.process.wait(PATIENCE)
+            fault = ""
+        if listener.has_ended():
+            self.code = listener.process.wait()
+            told = len(listener.told())
+            return [3], fault if told == 1 else f"ended with {told} sentences, expected one"
+        self.code = listener.stop()
+        # What the log lacks is in the exit code, and said.
+        return [0, 3] if listener.told() else [0], fault
 
     def visit(self, listener, directory, descriptors):
         """A client, a second one while it is there, and one after it; what is wrong."""
@@ -209,33 +214,22 @@ class SessionRun(Run):
     CODE = "import os\nprint('by Python')\nb = os.write(1, b'past Python\\n')\nb"
     OUTPUTS = [{"by Python", "past Python", "12"}, {"int64: 300000"}]
 
-    def run(self, directory, rule):
-        listener = FaultyListener(directory, rule, "forked", "--record", os.path.join(directory, "recording"))
-        try:
-            descriptors = listener.descriptors()
-            array = os.path.join(directory, "array.npy")
-            numpy.save(array, numpy.arange(300_000) / 8)
-            self.clients = [Client(listener.path, "eval", "--diary", "--log", self.CODE),
-                            Client(listener.path, "call", "numpy.size", array)]
-            for client in self.clients:
-                eventually(client.has_ended, "the end of a client")
-            eventually(lambda: listener.descriptors() <= descriptors,
-                       f"the number of descriptors before any session, {descriptors},")
-            self.code = listener.stop()
-        finally:
-            for client in self.clients:
-                client.end()
-            self.said = listener.said() + listener.logged()
-            if not listener.has_ended():
-                listener.process.kill()
-                listener.process.wait()
-        if self.code not in (0, 3):
-            return f"ended with {self.code}, expected 0 or 3"
-        if any(not line.startswith("krutil-qvm: ") for line in self.said):
-            return "said something that is no sentence"
-        if os.path.lexists(listener.path):
-            return "left its socket"
-        return next(filter(None, map(self.fault_of, self.clients, self.OUTPUTS)), "")
+    @staticmethod
+    def start(directory, rule):
+        return FaultyListener(directory, rule, "forked", "--record", os.path.join(directory, "recording"))
+
+    def drive(self, listener, directory):
+        descriptors = listener.descriptors()
+        array = os.path.join(directory, "array.npy")
+        numpy.save(array, numpy.arange(300_000) / 8)
+        self.clients = [Client(listener.path, "eval", "--diary", "--log", self.CODE),
+                        Client(listener.path, "call", "numpy.size", array)]
+        for client in self.clients:
+            eventually(client.has_ended, "the end of a client")
+        eventually(lambda: listener.descriptors() <= descriptors,
+                   f"the number of descriptors before any session, {descriptors},")
+        self.code = listener.stop()
+        return [0, 3], next(filter(None, map(self.fault_of, self.clients, self.OUTPUTS)), "")
 
     @staticmethod
     def fault_of(client, output):

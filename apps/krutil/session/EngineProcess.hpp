@@ -44,8 +44,7 @@ class EngineProcess {
     /// until takeTerminalBack(), and may ask a person for a password there. Throws Failure.
     static EngineProcess startCommand(const std::string& command);
 
-    /// Connects to the Unix socket `path`. Whoever listens there must be this user, or root. Throws
-    /// Failure.
+    /// Connects to the Unix socket `path`. Who listens there must be this user, or root. Throws Failure.
     static EngineProcess connect(const std::string& path);
 
     /// Connects to the engine behind a TLS proxy. Returns at once: what is wrong shows as the end of the stream, and in

@@ -27,9 +27,8 @@ constexpr std::string_view thisProcess = "0";
     throw std::runtime_error(
         why +
         ". --limit-processes needs a control group (version 2) that is delegated to the engine, and in which there is "
-        "no other process: put \"Delegate=pids\" and \"ProtectControlGroups=no\" into the unit of its service, or "
-        "start "
-        "it with \"systemd-run --user --scope -p Delegate=yes krutil-qvm ...\".");
+        "no other process: put \"Delegate=pids\" and \"ProtectControlGroups=no\" into the unit of its service, "
+        "or start it with \"systemd-run --user --scope -p Delegate=yes krutil-qvm ...\".");
 }
 
 std::ifstream openForReading(const std::string& path) {

@@ -82,9 +82,8 @@ class SessionGroupsTest : public testing::Test {
 
     const std::string advice =
         ". --limit-processes needs a control group (version 2) that is delegated to the engine, and in which there is "
-        "no other process: put \"Delegate=pids\" and \"ProtectControlGroups=no\" into the unit of its service, or "
-        "start "
-        "it with \"systemd-run --user --scope -p Delegate=yes krutil-qvm ...\".";
+        "no other process: put \"Delegate=pids\" and \"ProtectControlGroups=no\" into the unit of its service, "
+        "or start it with \"systemd-run --user --scope -p Delegate=yes krutil-qvm ...\".";
     const test_support::TemporaryDirectory directory_;
 };
 
