@@ -466,16 +466,22 @@ OptionTable::OptionTable(const std::vector<std::string>& words) {
 
 // Why nothing takes these words. Options that come first are those of the repl.
 std::string describeExtras(const CLI::App& app, const std::vector<std::string>& extras, bool optionsFirst) {
-    std::string names;
-    for (const CLI::App* const command : app.get_subcommands(nullptr)) {
-        const std::string name = command->get_name();
-        if (optionsFirst && std::find(extras.begin(), extras.end(), name) != extras.end()) {
+    const auto commands = app.get_subcommands(nullptr);
+    if (optionsFirst) {
+        const auto isExtra = [&extras](const CLI::App* command) {
+            return std::find(extras.begin(), extras.end(), command->get_name()) != extras.end();
+        };
+        if (const auto found = std::find_if(commands.begin(), commands.end(), isExtra); found != commands.end()) {
+            const std::string name = (*found)->get_name();
             return "expected the command before its options, got \"" + name + "\" behind them; write: krutil " + name +
                    " [OPTION...] ...";
         }
-        names += (names.empty() ? "" : ", ") + name;
-    }
-    if (!optionsFirst && app.get_subcommands().empty()) {
+    } else if (app.get_subcommands().empty()) {
+        std::string names;
+        for (const CLI::App* const command : commands) {
+            names += names.empty() ? "" : ", ";
+            names += command->get_name();
+        }
         return "expected a command (" + names + "), got \"" + extras.front() +
                "\"; code is evaluated by: krutil eval CODE";
     }
