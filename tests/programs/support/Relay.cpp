@@ -210,8 +210,12 @@ void Relay::pass(Way way, int from, int to) {
                 direction(way).recorded.append(buffer.data(), static_cast<std::size_t>(got));
             }
         }
-        if (got <= 0 || !sendAll(to, buffer.data(), static_cast<std::size_t>(got))) {
+        if (got <= 0) {
             cut();
+            return;
+        }
+        if (!sendAll(to, buffer.data(), static_cast<std::size_t>(got))) {
+            // That end has gone. What it has said before passes yet, and then the other direction cuts.
             return;
         }
         const std::lock_guard lock(mutex_);

@@ -13,7 +13,8 @@
 namespace programs_test {
 
 /// Listens at one Unix socket and passes what its one client says on to another one, and back. When one of the two ends
-/// has gone, it closes the stream to the other. All members are for the test's thread.
+/// has gone, what it has said passes yet, and then the stream to the other is closed. All members are for the test's
+/// thread.
 class Relay {
   public:
     enum class Way { ToEngine, ToClient };
